@@ -1,0 +1,223 @@
+#include "Daemon/QRTRequestDispatcher.h"
+
+#include "Daemon/QRTContentClass.h"
+#include "Daemon/QRTError.h"
+#include "Daemon/QRTGlobalConfiguration.h"
+#include "platform/Identity.h"
+#include "platform/Log.h"
+
+using platform::kLogError;
+
+void QRTReply::send(uint64_t code) {
+  dictionary["ReplyError"] = code;
+  connection_->send(messageId_, dictionary);
+}
+
+namespace {
+
+// Rows whose operation is not built yet answer 49, so a client can tell an
+// unserved command from a failed one.
+void QRTHandleNotServed(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection&,
+                        uint64_t* result) {
+  uint64_t command = QRTMessageU64(request, "Command");
+  QRTLog(kLogError, "Command %llu (%s) is not served yet", command, QRTCommandTable[command].name);
+  *result = QRTErrorInvalidRequest;
+}
+
+}  // namespace
+
+#define ROW(n, name, entitlement, flag) {n, name, QRTHandleNotServed, entitlement, flag}
+const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
+    ROW(0, "createOrLookupContainer", QRTEntitlementNone, 1),
+    ROW(1, "containersForUser", QRTEntitlementAllowed, 1),
+    ROW(2, "replaceContainer", QRTEntitlementAllowed, 1),
+    ROW(3, "stageContainerForDelete", QRTEntitlementAllowed, 1),
+    ROW(4, "deleteContainersOnDeathRow", QRTEntitlementAllowed, 0),
+    ROW(5, "setInfoValue", QRTEntitlementAllowed, 1),
+    ROW(6, "infoValueForKey", QRTEntitlementAllowed, 1),
+    ROW(7, "metadataForContainer", QRTEntitlementAllowed, 1),
+    ROW(8, "recreateDefaultStructure", QRTEntitlementAllowed, 1),
+    ROW(9, "regenerateDirectoryUUID", QRTEntitlementAllowed, 1),
+    ROW(10, "deleteContainer", QRTEntitlementAllowed, 1),
+    ROW(11, "wipeAddonDataContainer", QRTEntitlementWipeContainer, 1),
+    ROW(12, "deleteDataContainerContent", QRTEntitlementAllowed, 1),
+    ROW(13, "groupContainerPaths", QRTEntitlementNone, 1),
+    ROW(14, "groupContainerIdentifiers", QRTEntitlementAllowed, 1),
+    ROW(15, "systemContainerPath", QRTEntitlementNone, 1),
+    ROW(16, "systemGroupContainerPaths", QRTEntitlementNone, 1),
+    ROW(17, "systemGroupContainerPath", QRTEntitlementNone, 1),
+    ROW(18, "processCodeSigningInfo", QRTEntitlementAllowed, 1),
+    ROW(19, "codeSigningInfoForIdentifier", QRTEntitlementAllowed, 1),
+    ROW(20, "invalidateCodeSigningInfoForAppsWithoutBundleContainer", QRTEntitlementAllowed, 1),
+    ROW(21, "setDataProtection", QRTEntitlementAllowed, 0),
+    ROW(22, "recreateContainerStructure", QRTEntitlementAllowed, 1),
+    ROW(23, "diskUsage", QRTEntitlementAllowed, 1),
+    ROW(24, "performDataMigration", QRTEntitlementDataMigration, 1),
+    ROW(25, "retryTest", QRTEntitlementAllowed, 1),
+    ROW(26, "stageSharedContent", QRTEntitlementStageSharedContent, 1),
+    ROW(27, "setNetworkExtension", QRTEntitlementNetworkExtension, 1),
+    ROW(28, "userManagedAssetsPath", QRTEntitlementUserManagedAssets, 1),
+    ROW(29, "deleteUserManagedAsset", QRTEntitlementUserManagedAssets, 1),
+};
+#undef ROW
+
+void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::RequestEvent& event) {
+  if (!event.message) {
+    QRTLog(kLogError, "Dictionary does not have reply context");
+    QRTLog(platform::kLogDebug, "Unreadable frame: %s", event.failure.c_str());
+    connection->cancel();
+    return;
+  }
+  const plist::Dictionary& request = *event.message;
+  uint64_t command = QRTMessageU64(request, "Command");
+  auto reply = std::make_shared<QRTReply>(connection, event.messageId);
+  uint64_t result = QRTErrorNone;
+  bool handled = false;
+  if (command >= QRTCommandCount) {
+    QRTLog(kLogError, "Invalid command index: %lld", static_cast<long long>(command));
+    result = QRTErrorInvalidRequest;
+  } else {
+    const QRTCommandRow& row = QRTCommandTable[command];
+    std::optional<QRTClientConnection> client = checkEntitlementsAndInitClientObject(*connection, row.entitlement);
+    if (!client) {
+      result = QRTErrorNotEntitled;
+    } else {
+      handled = true;
+      QRTErrorRef failure = QRT_GUARD([&] { row.handler(request, reply, *client, &result); });
+      if (failure) result = failure->resultCode();
+    }
+  }
+  if (!handled || QRTCommandTable[command].replyOnReturn == 1 || result != QRTErrorNone) reply->send(result);
+}
+
+namespace {
+
+bool entitlementTrue(const plist::Dictionary& entitlements, const char* name) {
+  const plist::Value* v = plist::find(entitlements, name);
+  const bool* b = v ? v->booleanIf() : nullptr;
+  return b && *b;
+}
+
+std::optional<std::vector<std::string>> stringArray(const plist::Value& value) {
+  const plist::Array* array = value.arrayIf();
+  if (!array) return std::nullopt;
+  std::vector<std::string> strings;
+  for (const plist::Value& item : *array) {
+    if (const std::string* s = item.stringIf()) strings.push_back(*s);
+  }
+  return strings;
+}
+
+}  // namespace
+
+std::optional<QRTClientConnection> checkEntitlementsAndInitClientObject(const platform::RequestConnection& connection,
+                                                                        const char* entitlement) {
+  const auto& peer = connection.peer();
+  int pid = peer ? static_cast<int>(peer->pid) : 0;
+  platform::CodeIdentity identity;
+  if (peer && !peer->executable.empty()) {
+    identity = platform::identityForExecutable(peer->executable);
+  } else {
+    QRTLog(kLogError, "Failed to copy signing ID for pid %d : %@", pid,
+           std::string(peer ? "process executable unreadable" : "peer credentials unreadable"));
+  }
+  const std::string requirement = entitlement;
+  const bool requiresNone = requirement == QRTEntitlementNone;
+  const uint32_t userId = peer ? peer->uid : UINT32_MAX;
+  auto refuse = [&]() -> std::optional<QRTClientConnection> {
+    QRTLog(kLogError, "connection attempt from pid %d (%@) missing required entitlement: %s", pid,
+           identity.signingIdentifier, entitlement);
+    return std::nullopt;
+  };
+  if (!identity.entitlements || identity.entitlements->empty()) {
+    if (!requiresNone) return refuse();
+    return QRTClientConnection(identity.signingIdentifier, userId, false, std::nullopt);
+  }
+  const plist::Dictionary& entitlements = *identity.entitlements;
+  const bool allowed = entitlementTrue(entitlements, QRTEntitlementAllowed);
+  const bool otherIdLookup = allowed || entitlementTrue(entitlements, QRTEntitlementOtherIdLookup);
+  std::optional<std::vector<std::string>> wipeIdentifiers;
+  if (requirement == QRTEntitlementWipeContainer) {
+    const plist::Value* value = plist::find(entitlements, QRTEntitlementWipeContainer);
+    wipeIdentifiers = value ? stringArray(*value) : std::nullopt;
+    if (!wipeIdentifiers) {
+      QRTLog(kLogError, "No entitled containers to wipe");
+      if (!allowed) return refuse();
+    }
+  } else if (!requiresNone && !allowed && !entitlementTrue(entitlements, entitlement)) {
+    return refuse();
+  }
+  // Registration of caller-held entitlements with the code-signing mapping
+  // joins here once that service exists.
+  return QRTClientConnection(identity.signingIdentifier, userId, otherIdLookup, std::move(wipeIdentifiers));
+}
+
+bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, uint32_t callerUserId,
+                    uint32_t* effectiveUserId, uint64_t* result) {
+  bool valid;
+  uint32_t effective = requestedUserId;
+  if (QRTIsBundleClass(containerClass)) {
+    valid = requestedUserId == QRTInstallerUserId;
+    effective = QRTInstallerUserId;
+  } else if (QRTIsSystemClass(containerClass)) {
+    valid = requestedUserId == QRTSystemContainerUserId;
+  } else if (callerUserId > 500) {
+    valid = requestedUserId == callerUserId || requestedUserId == 1;
+    effective = callerUserId;
+  } else if (requestedUserId == 1) {
+    valid = true;
+    effective = QRTGlobalConfiguration::sharedInstance().currentMobileUserId();
+  } else {
+    valid = user_id_valid_for_class(containerClass, requestedUserId);
+  }
+  if (!valid) {
+    if (result) {
+      QRTLog(kLogError, "Invalid userId %u for class %llu from client %u", requestedUserId,
+             static_cast<unsigned long long>(containerClass), callerUserId);
+      *result = QRTErrorInvalidArgument;
+    }
+    return false;
+  }
+  if (effectiveUserId) *effectiveUserId = effective;
+  return true;
+}
+
+uint64_t QRTMessageU64(const plist::Dictionary& message, std::string_view key) {
+  const plist::Value* v = plist::find(message, key);
+  const plist::Integer* i = v ? v->integerIf() : nullptr;
+  return i ? i->asUnsigned() : 0;
+}
+
+int64_t QRTMessageI64(const plist::Dictionary& message, std::string_view key) {
+  const plist::Value* v = plist::find(message, key);
+  const plist::Integer* i = v ? v->integerIf() : nullptr;
+  return i ? i->asSigned() : 0;
+}
+
+bool QRTMessageBool(const plist::Dictionary& message, std::string_view key) {
+  const plist::Value* v = plist::find(message, key);
+  const bool* b = v ? v->booleanIf() : nullptr;
+  return b && *b;
+}
+
+std::optional<std::string> QRTMessageString(const plist::Dictionary& message, std::string_view key) {
+  const plist::Value* v = plist::find(message, key);
+  const std::string* s = v ? v->stringIf() : nullptr;
+  return s ? std::optional<std::string>(*s) : std::nullopt;
+}
+
+std::optional<QRTUUID> QRTMessageUUID(const plist::Dictionary& message, std::string_view key) {
+  const plist::Value* v = plist::find(message, key);
+  const plist::Data* d = v ? v->dataIf() : nullptr;
+  return d ? QRTUUID::fromBytes(d->data(), d->size()) : std::nullopt;
+}
+
+const plist::Value* QRTMessageObject(const plist::Dictionary& message, std::string_view key) {
+  return plist::find(message, key);
+}
+
+std::optional<std::string> QRTMessageIdentifier(const plist::Dictionary& message,
+                                                const std::optional<std::string>& clientIdentifier) {
+  if (plist::find(message, "Identifier")) return QRTMessageString(message, "Identifier");
+  return clientIdentifier;
+}

@@ -1,0 +1,78 @@
+// The request layer: turns each message on the request socket into one call
+// of a command handler, after checking the caller's entitlements, and sends
+// the reply with its "ReplyError".
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "base/PlistValue.h"
+#include "base/QRTUUID.h"
+#include "Daemon/QRTClientConnection.h"
+#include "platform/RequestSocket.h"
+
+inline constexpr const char* QRTEntitlementNone = "com.norvane.private.QuarterKit.none";
+inline constexpr const char* QRTEntitlementAllowed = "com.norvane.private.QuarterKit.allowed";
+inline constexpr const char* QRTEntitlementOtherIdLookup = "com.norvane.private.QuarterKit.otherIdLookup";
+inline constexpr const char* QRTEntitlementWipeContainer = "com.norvane.private.QuarterKit.wipeContainer";
+inline constexpr const char* QRTEntitlementDataMigration = "com.norvane.private.QuarterKit.dataMigration";
+inline constexpr const char* QRTEntitlementStageSharedContent = "com.norvane.private.QuarterKit.stageSharedContent";
+inline constexpr const char* QRTEntitlementNetworkExtension = "com.norvane.private.QuarterKit.networkExtension";
+inline constexpr const char* QRTEntitlementUserManagedAssets = "com.norvane.private.QuarterKit.userManagedAssets";
+
+// The reply of one request. Handlers fill dictionary; the commands that finish
+// later keep the reply and call send() themselves.
+class QRTReply {
+ public:
+  QRTReply(platform::ConnectionRef connection, uint64_t messageId)
+      : connection_(std::move(connection)), messageId_(messageId) {}
+  plist::Dictionary dictionary;
+  // Stores code under "ReplyError" and sends the reply.
+  void send(uint64_t code);
+
+ private:
+  platform::ConnectionRef connection_;
+  uint64_t messageId_;
+};
+using QRTReplyRef = std::shared_ptr<QRTReply>;
+
+using QRTRequestHandler = void (*)(const plist::Dictionary& request, const QRTReplyRef& reply,
+                                   QRTClientConnection& client, uint64_t* result);
+
+struct QRTCommandRow {
+  uint64_t command;
+  const char* name;
+  QRTRequestHandler handler;
+  const char* entitlement;
+  uint32_t replyOnReturn;
+};
+
+inline constexpr uint64_t QRTCommandCount = 30;
+extern const QRTCommandRow QRTCommandTable[QRTCommandCount];
+
+// The handler of every event on a client connection.
+void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::RequestEvent& event);
+
+// The caller's client object when it holds the entitlement, else nothing.
+std::optional<QRTClientConnection> checkEntitlementsAndInitClientObject(const platform::RequestConnection& connection,
+                                                                        const char* entitlement);
+
+// Checks a requested user id against the class and the caller; on success
+// stores the user id the operation must use.
+bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, uint32_t callerUserId,
+                    uint32_t* effectiveUserId, uint64_t* result);
+
+// Message readers: a missing key, or a value of another type, reads as 0,
+// false or nothing.
+uint64_t QRTMessageU64(const plist::Dictionary& message, std::string_view key);
+int64_t QRTMessageI64(const plist::Dictionary& message, std::string_view key);
+bool QRTMessageBool(const plist::Dictionary& message, std::string_view key);
+std::optional<std::string> QRTMessageString(const plist::Dictionary& message, std::string_view key);
+std::optional<QRTUUID> QRTMessageUUID(const plist::Dictionary& message, std::string_view key);
+const plist::Value* QRTMessageObject(const plist::Dictionary& message, std::string_view key);
+// "Identifier", or the caller's own identifier when the key is missing.
+std::optional<std::string> QRTMessageIdentifier(const plist::Dictionary& message,
+                                                const std::optional<std::string>& clientIdentifier);

@@ -1,0 +1,3 @@
+#include "Daemon/QRTDaemon.h"
+
+int main(int argc, char** argv) { return QRTDaemonMain(argc, argv); }

@@ -1,0 +1,76 @@
+#include "base/Frame.h"
+
+#include <cstring>
+
+#include "base/PlistCodec.h"
+
+namespace frame {
+namespace {
+
+void putLE(std::vector<uint8_t>& out, uint64_t v, int bytes) {
+  for (int i = 0; i < bytes; ++i) out.push_back(static_cast<uint8_t>(v >> (8 * i)));
+}
+
+uint64_t getLE(const uint8_t* p, int bytes) {
+  uint64_t v = 0;
+  for (int i = bytes - 1; i >= 0; --i) v = (v << 8) | p[i];
+  return v;
+}
+
+}  // namespace
+
+std::vector<uint8_t> encode(uint64_t messageId, const plist::Dictionary& message) {
+  plist::Data body = plist::writeBinary(plist::Value(message));
+  std::vector<uint8_t> out;
+  out.reserve(kHeaderSize + body.size());
+  putLE(out, body.size() + 8, 4);
+  putLE(out, messageId, 8);
+  out.insert(out.end(), body.begin(), body.end());
+  return out;
+}
+
+void Decoder::append(const void* bytes, size_t length) {
+  if (failed_ || length == 0) return;
+  // Drop consumed bytes before growing, so a long-lived connection's buffer
+  // stays the size of the frames in flight.
+  if (start_ > 0 && start_ == buffer_.size()) {
+    buffer_.clear();
+    start_ = 0;
+  } else if (start_ > 65536 && start_ * 2 > buffer_.size()) {
+    buffer_.erase(buffer_.begin(), buffer_.begin() + static_cast<std::ptrdiff_t>(start_));
+    start_ = 0;
+  }
+  const auto* p = static_cast<const uint8_t*>(bytes);
+  buffer_.insert(buffer_.end(), p, p + length);
+}
+
+std::optional<RawFrame> Decoder::next() {
+  if (failed_) return std::nullopt;
+  size_t avail = buffer_.size() - start_;
+  if (avail < 4) return std::nullopt;
+  const uint8_t* p = buffer_.data() + start_;
+  uint64_t n = getLE(p, 4);
+  if (n < kMinLength || n > kMaxLength) {
+    failed_ = true;
+    failure_ = "frame length " + std::to_string(n) + " out of range";
+    return std::nullopt;
+  }
+  if (avail < 4 + n) return std::nullopt;
+  RawFrame f;
+  f.messageId = getLE(p + 4, 8);
+  f.payload.assign(p + kHeaderSize, p + 4 + n);
+  start_ += 4 + n;
+  return f;
+}
+
+std::optional<plist::Dictionary> decodeMessage(const std::vector<uint8_t>& payload, std::string* error) {
+  auto value = plist::parseBinary(payload.data(), payload.size(), error);
+  if (!value) return std::nullopt;
+  if (!value->isDictionary()) {
+    if (error) *error = "top level is not a dictionary";
+    return std::nullopt;
+  }
+  return std::move(value->dictionary());
+}
+
+}  // namespace frame

@@ -1,0 +1,51 @@
+// The request socket's framing: a 4-byte little-endian length N (8 to 16 MiB),
+// an 8-byte little-endian message id, then N - 8 bytes of a binary property
+// list whose top level is a dictionary. Shared by the daemon and its clients.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "base/PlistValue.h"
+
+namespace frame {
+
+constexpr uint32_t kMinLength = 8;
+constexpr uint32_t kMaxLength = 16u * 1024 * 1024;
+constexpr size_t kHeaderSize = 12;
+
+// The bytes of one frame.
+std::vector<uint8_t> encode(uint64_t messageId, const plist::Dictionary& message);
+
+struct RawFrame {
+  uint64_t messageId = 0;
+  std::vector<uint8_t> payload;
+};
+
+// Splits a byte stream into frames. Bytes are appended as they arrive; next()
+// hands out whole frames. A length out of range poisons the decoder: the
+// stream cannot be resynchronised and the connection must be closed.
+class Decoder {
+ public:
+  void append(const void* bytes, size_t length);
+  // A whole frame, or nothing when more bytes are needed (or on error).
+  std::optional<RawFrame> next();
+  bool failed() const { return failed_; }
+  const std::string& failure() const { return failure_; }
+  size_t buffered() const { return buffer_.size() - start_; }
+
+ private:
+  std::vector<uint8_t> buffer_;
+  size_t start_ = 0;
+  bool failed_ = false;
+  std::string failure_;
+};
+
+// The payload as a message dictionary; nothing when it is not a property list
+// or its top level is not a dictionary.
+std::optional<plist::Dictionary> decodeMessage(const std::vector<uint8_t>& payload, std::string* error = nullptr);
+
+}  // namespace frame

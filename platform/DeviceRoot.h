@@ -1,0 +1,21 @@
+// The device root: every fixed device path of the daemon lives under it.
+#pragma once
+
+#include <cstddef>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace platform {
+
+// Set once at start from --root (already resolved with realpath). "/" by default.
+void setDeviceRoot(const std::string& root);
+const std::string& deviceRoot();
+// Host path of a device path: the root prefixed, "/" root leaves it as is.
+std::string hostPath(std::string_view devicePath);
+
+// The whole content of a small file at a host path; nothing when it is
+// missing, unreadable or longer than limit (errno tells which).
+std::optional<std::string> readHostFile(const std::string& path, size_t limit = 16u << 20);
+
+}  // namespace platform

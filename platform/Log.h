@@ -1,0 +1,45 @@
+// The daemon's log: a plain text file rotated at a size limit, with syslog as
+// the fallback when the file cannot be opened.
+#pragma once
+
+#include <cstdint>
+#include <string>
+
+#include "base/QRTFormat.h"
+
+namespace platform {
+
+enum LogLevel : int { kLogError = 3, kLogNotice = 5, kLogDebug = 7 };
+
+// Opens (creating) the log file at path. The name is the log's identity (the
+// system log's ident); each line carries the program's short name and pid.
+// False when the file cannot be opened; lines then go to syslog.
+bool logOpen(const std::string& path, const std::string& name, int level);
+// Rotation: at sizeLimit bytes quarterd.log becomes quarterd.log.0, older
+// files shift up by one and those beyond fileCount are deleted.
+void logSetRotation(uint32_t fileCount, uint64_t sizeLimit);
+void logSetLevel(int level);
+int logLevel();
+bool logEnabled(int level);
+// Every line is copied to standard error as well.
+void logSetStderr(bool on);
+void logWrite(int level, const char* function, const std::string& message);
+// Straight to the system log, for lines about the log itself.
+void syslogWrite(int priority, const std::string& message);
+// Closes the file (tests reopen the log on another path).
+void logClose();
+
+}  // namespace platform
+
+// QRTLog(level, format, args...): one line under the calling function's name;
+// formatting is skipped when the level is off.
+#define QRTLog(level, ...)                                                   \
+  do {                                                                       \
+    if (::platform::logEnabled(level))                                       \
+      ::platform::logWrite((level), __func__, QRTFormat(__VA_ARGS__));       \
+  } while (0)
+#define QRTLogAs(level, function, ...)                                       \
+  do {                                                                       \
+    if (::platform::logEnabled(level))                                       \
+      ::platform::logWrite((level), (function), QRTFormat(__VA_ARGS__));     \
+  } while (0)

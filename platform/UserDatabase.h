@@ -1,0 +1,28 @@
+// Users and groups: R/etc/passwd and R/etc/group under a device root other
+// than "/" (read on every look-up, so tests can edit them live), else the
+// system's own database. Home directories are host paths.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+
+namespace platform {
+
+struct UserAccount {
+  std::string name;
+  uint32_t uid = 0;
+  uint32_t gid = 0;
+  std::string homeDirectory;  // host path
+};
+
+struct GroupAccount {
+  std::string name;
+  uint32_t gid = 0;
+};
+
+std::optional<UserAccount> userByName(const std::string& name);
+std::optional<UserAccount> userById(uint32_t uid);
+std::optional<GroupAccount> groupByName(const std::string& name);
+
+}  // namespace platform
