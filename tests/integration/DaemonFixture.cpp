@@ -1,0 +1,126 @@
+#include "DaemonFixture.h"
+
+#include <signal.h>
+#include <stdlib.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <fstream>
+#include <sstream>
+#include <thread>
+
+#include "base/PlistCodec.h"
+
+namespace {
+
+void writeFile(const std::string& path, const std::string& text) {
+  std::ofstream out(path, std::ios::binary | std::ios::trunc);
+  out << text;
+}
+
+std::string ownExecutable() {
+  char buffer[4096];
+  ssize_t n = readlink("/proc/self/exe", buffer, sizeof buffer - 1);
+  return n > 0 ? std::string(buffer, static_cast<size_t>(n)) : std::string();
+}
+
+}  // namespace
+
+plist::Dictionary request(uint64_t command, plist::Dictionary keys) {
+  keys["Command"] = command;
+  return keys;
+}
+
+void DaemonFixture::SetUp() {
+  char tmpl[] = "/tmp/quarterd-test.XXXXXX";
+  ASSERT_NE(mkdtemp(tmpl), nullptr);
+  root = tmpl;
+  std::string script = std::string(QRT_TEST_SOURCE_DIR) + "/../scripts/make-device-root";
+  ASSERT_EQ(system((script + " " + root).c_str()), 0);
+  startDaemon();
+}
+
+void DaemonFixture::TearDown() {
+  if (daemon > 0) {
+    int status = stopDaemon();
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "daemon exit status " << status;
+  }
+  if (!root.empty() && !HasFailure()) system(("rm -rf " + root).c_str());
+}
+
+void DaemonFixture::startDaemon() {
+  std::string socketPath = qk::requestSocketPath(root);
+  unlink(socketPath.c_str());
+  daemon = fork();
+  ASSERT_GE(daemon, 0);
+  if (daemon == 0) {
+    execl(QRT_DAEMON_PATH, QRT_DAEMON_PATH, "--root", root.c_str(), "--log-level", "7", nullptr);
+    _exit(127);
+  }
+  for (int i = 0; i < 400; ++i) {
+    struct stat st;
+    if (stat(socketPath.c_str(), &st) == 0) return;
+    std::this_thread::sleep_for(std::chrono::milliseconds(25));
+  }
+  FAIL() << "daemon socket never appeared at " << socketPath;
+}
+
+int DaemonFixture::stopDaemon() {
+  int status = -1;
+  kill(daemon, SIGTERM);
+  waitpid(daemon, &status, 0);
+  daemon = -1;
+  return status;
+}
+
+void DaemonFixture::killDaemon() {
+  kill(daemon, SIGKILL);
+  waitpid(daemon, nullptr, 0);
+  daemon = -1;
+}
+
+std::unique_ptr<qk::Connection> DaemonFixture::connect() {
+  std::string error;
+  auto connection = qk::Connection::connect(qk::requestSocketPath(root), &error);
+  EXPECT_TRUE(connection) << error;
+  return connection;
+}
+
+uint64_t DaemonFixture::replyError(const plist::Dictionary& req) {
+  auto connection = connect();
+  if (!connection) return 0;
+  auto reply = connection->call(req, std::chrono::seconds(30));
+  if (!reply) return 0;
+  const plist::Value* code = plist::find(*reply, "ReplyError");
+  return code && code->isInteger() ? code->integer().asUnsigned() : 0;
+}
+
+void DaemonFixture::setOwnIdentity(const std::string& signingIdentifier, const plist::Dictionary& entitlements) {
+  plist::Dictionary identity{{"Executable", ownExecutable()},
+                             {"SigningIdentifier", signingIdentifier},
+                             {"Entitlements", entitlements}};
+  plist::Data bytes = plist::writeBinary(identity);
+  std::string dir = root + "/etc/quarterd/identities";
+  std::string tmp = dir + "/.self.tmp";
+  writeFile(tmp, std::string(bytes.begin(), bytes.end()));
+  rename(tmp.c_str(), (dir + "/self.plist").c_str());
+}
+
+void DaemonFixture::clearOwnIdentity() { unlink((root + "/etc/quarterd/identities/self.plist").c_str()); }
+
+std::string DaemonFixture::logText() const {
+  std::ifstream in(root + "/private/var/root/Library/Logs/QuarterKit/quarterd.log");
+  std::stringstream text;
+  text << in.rdbuf();
+  return text.str();
+}
+
+bool DaemonFixture::logContains(const std::string& text) const {
+  for (int i = 0; i < 200; ++i) {
+    if (logText().find(text) != std::string::npos) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(25));
+  }
+  return false;
+}

@@ -1,0 +1,157 @@
+// The request layer of the real daemon: command table, entitlements, framing
+// faults, concurrency and shutdown.
+#include <sys/socket.h>
+#include <sys/wait.h>
+
+#include <atomic>
+#include <future>
+#include <thread>
+#include <vector>
+
+#include "DaemonFixture.h"
+#include "base/Frame.h"
+
+namespace {
+
+constexpr uint64_t kNotServed = 49;
+constexpr uint64_t kNotEntitled = 55;
+const char* kAllowed = "com.norvane.private.QuarterKit.allowed";
+
+bool isNoneCommand(uint64_t c) { return c == 0 || c == 13 || c == 15 || c == 16 || c == 17; }
+
+using DispatcherTest = DaemonFixture;
+
+TEST_F(DispatcherTest, CommandsOutsideTheTableAnswer49) {
+  for (uint64_t command : {uint64_t{30}, uint64_t{1} << 32, UINT64_MAX}) {
+    EXPECT_EQ(replyError(request(command)), kNotServed) << command;
+  }
+  EXPECT_TRUE(logContains("Invalid command index: 30"));
+  EXPECT_TRUE(logContains("Invalid command index: 4294967296"));
+}
+
+TEST_F(DispatcherTest, CallerWithoutEntitlementsReachesOnlyTheOpenCommands) {
+  for (uint64_t command = 0; command < 30; ++command) {
+    EXPECT_EQ(replyError(request(command)), isNoneCommand(command) ? kNotServed : kNotEntitled) << command;
+  }
+  EXPECT_TRUE(logContains("missing required entitlement: com.norvane.private.QuarterKit.allowed"));
+  EXPECT_TRUE(logContains("missing required entitlement: com.norvane.private.QuarterKit.wipeContainer"));
+}
+
+TEST_F(DispatcherTest, MessageWithoutCommandIsCommandZero) {
+  EXPECT_EQ(replyError(plist::Dictionary{{"Identifier", "com.example.app"}}), kNotServed);
+  EXPECT_TRUE(logContains("createOrLookupContainer"));
+}
+
+TEST_F(DispatcherTest, AllowedEntitlementPassesEveryRow) {
+  setOwnIdentity("com.example.installer", {{kAllowed, true}});
+  for (uint64_t command = 0; command < 30; ++command) {
+    EXPECT_EQ(replyError(request(command)), kNotServed) << command;
+  }
+  // The wipe row logs that the entitlement is not an array, yet lets the
+  // master entitlement through.
+  EXPECT_TRUE(logContains("No entitled containers to wipe"));
+}
+
+TEST_F(DispatcherTest, NamedEntitlementsOpenTheirOwnRowsOnly) {
+  setOwnIdentity("com.example.migrator", {{"com.norvane.private.QuarterKit.dataMigration", true},
+                                          {"com.norvane.private.QuarterKit.userManagedAssets", false},
+                                          {"com.norvane.private.QuarterKit.wipeContainer",
+                                           plist::Array{"com.example.addon"}}});
+  EXPECT_EQ(replyError(request(24)), kNotServed);
+  EXPECT_EQ(replyError(request(11)), kNotServed);
+  EXPECT_EQ(replyError(request(28)), kNotEntitled);
+  EXPECT_EQ(replyError(request(1)), kNotEntitled);
+  EXPECT_TRUE(logContains("connection attempt from pid"));
+  EXPECT_TRUE(logContains("(com.example.migrator) missing required entitlement: "
+                          "com.norvane.private.QuarterKit.userManagedAssets"));
+
+  // A wipe entitlement that is not an array refuses without the master one.
+  setOwnIdentity("com.example.wiper", {{"com.norvane.private.QuarterKit.wipeContainer", true}});
+  EXPECT_EQ(replyError(request(11)), kNotEntitled);
+}
+
+TEST_F(DispatcherTest, UnreadableFrameClosesOnlyItsConnection) {
+  auto healthy = connect();
+  auto bad = connect();
+  ASSERT_TRUE(healthy && bad);
+  // A well-framed payload that is not a property list.
+  std::vector<uint8_t> garbage = {12, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0, 'n', 'o', 'p', 'e'};
+  ASSERT_TRUE(bad->sendRaw(garbage.data(), garbage.size()));
+  auto lost = bad->send(request(30));
+  EXPECT_EQ(lost.get(), std::nullopt);
+  EXPECT_TRUE(bad->closed());
+  EXPECT_TRUE(logContains("Dictionary does not have reply context"));
+
+  // A property list whose top level is not a dictionary, and a length out of range.
+  for (std::vector<uint8_t> frameBytes :
+       {frame::encode(7, {}), std::vector<uint8_t>{3, 0, 0, 0}, std::vector<uint8_t>{0, 0, 0, 2}}) {
+    if (frameBytes.size() > 12) frameBytes[12 + 8] = 0xA0;  // the dictionary marker becomes an array
+    auto conn = connect();
+    ASSERT_TRUE(conn->sendRaw(frameBytes.data(), frameBytes.size()));
+    EXPECT_EQ(conn->send(request(30)).get(), std::nullopt);
+  }
+
+  auto reply = healthy->call(request(30));
+  ASSERT_TRUE(reply);
+  EXPECT_EQ(plist::find(*reply, "ReplyError")->integer().asUnsigned(), kNotServed);
+}
+
+TEST_F(DispatcherTest, SixtyFourClientsAtOnceAllGetTheirReplies) {
+  std::atomic<int> answered{0};
+  std::vector<std::thread> clients;
+  for (int i = 0; i < 64; ++i) {
+    clients.emplace_back([&, i] {
+      auto connection = connect();
+      if (!connection) return;
+      for (int j = 0; j < 10; ++j) {
+        uint64_t command = (i + j) % 2 ? 1 : 30;
+        auto reply = connection->call(request(command));
+        if (reply && plist::find(*reply, "ReplyError")->integer().asUnsigned() ==
+                         (command == 1 ? kNotEntitled : kNotServed)) {
+          ++answered;
+        }
+      }
+    });
+  }
+  for (auto& t : clients) t.join();
+  EXPECT_EQ(answered.load(), 640);
+}
+
+TEST_F(DispatcherTest, PipelinedRequestsAreMatchedByMessageId) {
+  auto connection = connect();
+  ASSERT_TRUE(connection);
+  std::vector<std::pair<uint64_t, std::future<std::optional<plist::Dictionary>>>> inFlight;
+  for (int i = 0; i < 1000; ++i) {
+    uint64_t command = i % 3 == 0 ? 1 : (i % 3 == 1 ? 30 : 13);
+    inFlight.emplace_back(command, connection->send(request(command)));
+  }
+  for (auto& [command, future] : inFlight) {
+    auto reply = future.get();
+    ASSERT_TRUE(reply);
+    EXPECT_EQ(plist::find(*reply, "ReplyError")->integer().asUnsigned(),
+              command == 1 ? kNotEntitled : kNotServed);
+  }
+}
+
+TEST_F(DispatcherTest, SigtermEndsTheDaemonWithStatusZero) {
+  auto connection = connect();
+  ASSERT_TRUE(connection->call(request(30)));
+  int status = stopDaemon();
+  EXPECT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0);
+}
+
+TEST_F(DispatcherTest, StartsInOrderAndMarksTheFirstBoot) {
+  EXPECT_TRUE(logContains("quarterd performing first boot initialization"));
+  EXPECT_TRUE(logContains("quarterd first boot cleanup complete"));
+  // A restart in the same boot skips the first-boot work.
+  stopDaemon();
+  std::string before = logText();
+  startDaemon();
+  ASSERT_EQ(replyError(request(30)), kNotServed);
+  std::string after = logText().substr(before.size());
+  EXPECT_EQ(after.find("first boot"), std::string::npos);
+  EXPECT_NE(after.find("started"), std::string::npos);
+}
+
+}  // namespace
