@@ -31,21 +31,30 @@ TEST_F(DispatcherTest, CommandsOutsideTheTableAnswer49) {
 
 TEST_F(DispatcherTest, CallerWithoutEntitlementsReachesOnlyTheOpenCommands) {
   for (uint64_t command = 0; command < 30; ++command) {
-    EXPECT_EQ(replyError(request(command)), isNoneCommand(command) ? kNotServed : kNotEntitled) << command;
+    uint64_t code = replyError(request(command));
+    if (isNoneCommand(command)) {
+      EXPECT_NE(code, kNotEntitled) << command;
+      EXPECT_NE(code, 0u) << command;
+    } else {
+      EXPECT_EQ(code, kNotEntitled) << command;
+    }
   }
   EXPECT_TRUE(logContains("missing required entitlement: com.norvane.private.QuarterKit.allowed"));
   EXPECT_TRUE(logContains("missing required entitlement: com.norvane.private.QuarterKit.wipeContainer"));
 }
 
 TEST_F(DispatcherTest, MessageWithoutCommandIsCommandZero) {
-  EXPECT_EQ(replyError(plist::Dictionary{{"Identifier", "com.example.app"}}), kNotServed);
-  EXPECT_TRUE(logContains("createOrLookupContainer"));
+  // Command 0 checks the user against the class first: class 0 fits nobody.
+  EXPECT_EQ(replyError(plist::Dictionary{{"Identifier", "com.example.app"}}), 38u);
+  EXPECT_TRUE(logContains("Invalid userId 0 for class 0 from client 0"));
 }
 
 TEST_F(DispatcherTest, AllowedEntitlementPassesEveryRow) {
   setOwnIdentity("com.example.installer", {{kAllowed, true}});
   for (uint64_t command = 0; command < 30; ++command) {
-    EXPECT_EQ(replyError(request(command)), kNotServed) << command;
+    uint64_t code = replyError(request(command));
+    EXPECT_NE(code, kNotEntitled) << command;
+    EXPECT_NE(code, 0u) << command;
   }
   // The wipe row logs that the entitlement is not an array, yet lets the
   // master entitlement through.
@@ -57,8 +66,8 @@ TEST_F(DispatcherTest, NamedEntitlementsOpenTheirOwnRowsOnly) {
                                           {"com.norvane.private.QuarterKit.userManagedAssets", false},
                                           {"com.norvane.private.QuarterKit.wipeContainer",
                                            plist::Array{"com.example.addon"}}});
-  EXPECT_EQ(replyError(request(24)), kNotServed);
-  EXPECT_EQ(replyError(request(11)), kNotServed);
+  EXPECT_NE(replyError(request(24)), kNotEntitled);
+  EXPECT_NE(replyError(request(11)), kNotEntitled);
   EXPECT_EQ(replyError(request(28)), kNotEntitled);
   EXPECT_EQ(replyError(request(1)), kNotEntitled);
   EXPECT_TRUE(logContains("connection attempt from pid"));
@@ -122,14 +131,15 @@ TEST_F(DispatcherTest, PipelinedRequestsAreMatchedByMessageId) {
   ASSERT_TRUE(connection);
   std::vector<std::pair<uint64_t, std::future<std::optional<plist::Dictionary>>>> inFlight;
   for (int i = 0; i < 1000; ++i) {
-    uint64_t command = i % 3 == 0 ? 1 : (i % 3 == 1 ? 30 : 13);
+    // 1: refused for its entitlement; 30: unknown; 0 with class 0: bad user.
+    uint64_t command = i % 3 == 0 ? 1 : (i % 3 == 1 ? 30 : 0);
     inFlight.emplace_back(command, connection->send(request(command)));
   }
   for (auto& [command, future] : inFlight) {
     auto reply = future.get();
     ASSERT_TRUE(reply);
     EXPECT_EQ(plist::find(*reply, "ReplyError")->integer().asUnsigned(),
-              command == 1 ? kNotEntitled : kNotServed);
+              command == 1 ? kNotEntitled : (command == 30 ? kNotServed : 38u));
   }
 }
 

@@ -1,0 +1,289 @@
+#include "Daemon/QRTContainerCache.h"
+
+#include "Daemon/QRTContentClass.h"
+#include "Daemon/QRTFileManager.h"
+#include "Daemon/QRTGlobalConfiguration.h"
+#include "platform/Log.h"
+#include "platform/SandboxMappings.h"
+
+using platform::kLogDebug;
+using platform::kLogError;
+
+namespace {
+
+const char* suffix(bool transient) { return transient ? "(transient)" : ""; }
+
+bool validClass(uint64_t contentClass) { return contentClass >= 1 && contentClass <= 13; }
+
+std::string cacheKey(uint32_t userId, uint64_t contentClass) {
+  return std::to_string(userId) + "-" + QRTContentClassPathName(contentClass);
+}
+
+// Error 47 for a class outside 1 to 13 or a missing identifier.
+bool validInput(uint64_t contentClass, const std::optional<std::string>& identifier, const char* identifierMessage,
+                const char* function, int line, QRTErrorRef* error) {
+  if (!validClass(contentClass)) {
+    QRTSetError(error, QRTCreateError(function, line, QRTErrorDomain, QRTErrorCacheInvalidInput, nullptr, nullptr,
+                                      true, "Invalid Content Class: %ld", static_cast<long>(contentClass)));
+    return false;
+  }
+  if (!identifier) {
+    QRTSetError(error, QRTCreateError(function, line, QRTErrorDomain, QRTErrorCacheInvalidInput, nullptr, nullptr,
+                                      true, identifierMessage, identifier));
+    return false;
+  }
+  return true;
+}
+
+}  // namespace
+
+QRTContainerCache& QRTContainerCache::sharedInstance() {
+  static QRTContainerCache* instance = new QRTContainerCache();
+  return *instance;
+}
+
+QRTContainerCache::ClassMap* QRTContainerCache::_getCacheForUserId(uint32_t userId, uint64_t contentClass,
+                                                                   bool transient, bool populateSandboxCache,
+                                                                   QRTErrorRef* error) {
+  if (!user_id_valid_for_class(contentClass, userId)) {
+    QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Invalid cache get-userId %u for class %ld",
+                                 userId, static_cast<long>(contentClass)));
+    return nullptr;
+  }
+  std::string key = cacheKey(userId, contentClass);
+  auto& caches = transient ? transientContainerCache : liveContainerCache;
+  if (auto it = caches.find(key); it != caches.end()) return &it->second;
+
+  QRTLog(kLogDebug, "Rebuilding container class cache: %@%@", key, suffix(transient));
+  std::optional<QRTURL> classDirectory =
+      QRTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(userId, contentClass, transient);
+  if (!classDirectory) {
+    QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Invalid cache get-userId %u for class %ld",
+                                 userId, static_cast<long>(contentClass)));
+    return nullptr;
+  }
+  auto items = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(*classDirectory, error);
+  if (!items) return nullptr;
+
+  ClassMap map;
+  const bool pushMappings = populateSandboxCache && !transient &&
+                            (contentClass == 10 || contentClass == 12 || contentClass == 13);
+  for (const QRTURL& item : *items) {
+    QRTErrorRef readError;
+    QRTMetadataRef metadata = QRTMetadata::readAndValidateMetadataAtUrl(item, userId, true, &readError);
+    if (!metadata) continue;
+    metadata->setTransient(transient);
+    if (pushMappings &&
+        !setSandboxContainerMappingForUser(userId, metadata->identifier(), contentClass, metadata->url())) {
+      QRTLog(kLogError, "Failed to set container mapping during create/lookup operation of %@, %llu",
+             metadata->identifier(), static_cast<unsigned long long>(contentClass));
+    }
+    map[metadata->identifier()] = std::move(metadata);
+  }
+  return &(caches[key] = std::move(map));
+}
+
+QRTContainerCache::ClassMap* QRTContainerCache::lockedClassMap(uint32_t userId, uint64_t contentClass, bool transient,
+                                                               bool populateSandboxCache, QRTErrorRef* error) {
+  QRTErrorRef buildError;
+  ClassMap* map = _getCacheForUserId(userId, contentClass, transient, populateSandboxCache, &buildError);
+  if (!map) {
+    QRTSetError(error, QRT_ERROR(QRTErrorCacheRebuildFailed, buildError, true, "Cache: %u-%@%@: Failed to rebuild",
+                                 userId, QRTContentClassPathName(contentClass), suffix(transient)));
+  }
+  return map;
+}
+
+bool QRTContainerCache::checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_t userId, uint64_t contentClass,
+                                         bool transient, QRTErrorRef* error) {
+  const char* className = QRTContentClassPathName(contentClass);
+  if (metadata->url().empty()) {
+    QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Cache: %@%@: nil URL from %@", className,
+                                 suffix(transient), metadata));
+    return false;
+  }
+  QRTURL file = metadata->url().URLByAppendingPathComponent(QRTMetadataFileName);
+  if (!QRTFileManager::defaultManager().itemDoesNotExistAtURL(file)) return true;
+  QRTSetError(error, QRT_ERROR(QRTErrorCacheInconsistent, nullptr, true,
+                               "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", className,
+                               suffix(transient), file, metadata->identifier(),
+                               static_cast<unsigned long long>(contentClass)));
+  QRTErrorRef removeError;
+  if (!removeContainerForUser(userId, contentClass, metadata->identifier(), transient, &removeError)) {
+    QRTLog(kLogError, "Failed to remove from cache user: %u, id: %@, class: %llu, transient: %d : %@", userId,
+           metadata->identifier(), static_cast<unsigned long long>(contentClass), transient, removeError);
+  }
+  return false;
+}
+
+QRTMetadataRef QRTContainerCache::containerForUser(uint32_t userId, uint64_t contentClass,
+                                                   const std::optional<std::string>& identifier, bool transient,
+                                                   QRTErrorRef* error) {
+  if (!validInput(contentClass, identifier, "Invalid identifier: %@", __func__, __LINE__, error)) return nullptr;
+  QRTMetadataRef found;
+  QRTErrorRef failure = QRT_GUARD([&] {
+    {
+      std::lock_guard<std::mutex> hold(cacheLock);
+      ClassMap* map = lockedClassMap(userId, contentClass, transient, true, error);
+      if (!map) return;
+      auto it = map->find(*identifier);
+      if (it == map->end()) {
+        QRTSetError(error, QRT_ERROR(QRTErrorNotFound, nullptr, false, "Cache: %@%@: Container Not Found with ID: %@",
+                                     QRTContentClassPathName(contentClass), suffix(transient), identifier));
+        return;
+      }
+      found = it->second;
+    }
+    if (!checkEntryOnDisk(found, userId, contentClass, transient, error)) {
+      found = nullptr;
+      return;
+    }
+    QRTLog(kLogDebug, "Cache: %@%@: Found Identifier: %@", QRTContentClassPathName(contentClass), suffix(transient),
+           identifier);
+  });
+  if (failure) {
+    QRTSetError(error, failure);
+    return nullptr;
+  }
+  return found;
+}
+
+QRTMetadataRef QRTContainerCache::containerForUser(uint32_t userId, uint64_t contentClass,
+                                                   const std::optional<std::string>& identifier,
+                                                   const std::string& uuidString) {
+  for (bool transient : {false, true}) {
+    QRTMetadataRef metadata = containerForUser(userId, contentClass, identifier, transient, nullptr);
+    if (metadata && metadata->uuid().UUIDString() == uuidString) {
+      metadata->setTransient(transient);
+      return metadata;
+    }
+  }
+  return nullptr;
+}
+
+std::optional<std::vector<QRTMetadataRef>> QRTContainerCache::allContainersForUser(uint32_t userId,
+                                                                                   uint64_t contentClass,
+                                                                                   bool transient,
+                                                                                   bool populateSandboxCache,
+                                                                                   QRTErrorRef* error) {
+  if (!validClass(contentClass)) {
+    QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Invalid Content Class: %ld",
+                                 static_cast<long>(contentClass)));
+    return std::nullopt;
+  }
+  std::optional<std::vector<QRTMetadataRef>> result;
+  QRTErrorRef failure = QRT_GUARD([&] {
+    std::vector<QRTMetadataRef> snapshot;
+    {
+      std::lock_guard<std::mutex> hold(cacheLock);
+      ClassMap* map = lockedClassMap(userId, contentClass, transient, populateSandboxCache, error);
+      if (!map) return;
+      snapshot.reserve(map->size());
+      for (const auto& entry : *map) snapshot.push_back(entry.second);
+    }
+    std::vector<QRTMetadataRef> live;
+    live.reserve(snapshot.size());
+    for (QRTMetadataRef& metadata : snapshot) {
+      QRTErrorRef entryError;
+      if (!checkEntryOnDisk(metadata, userId, contentClass, transient, &entryError)) continue;
+      QRTLog(kLogDebug, "Cache: %@%@: ALL Found Identifier: %@", QRTContentClassPathName(contentClass),
+             suffix(transient), metadata->identifier());
+      live.push_back(std::move(metadata));
+    }
+    result = std::move(live);
+  });
+  if (failure) {
+    QRTSetError(error, failure);
+    return std::nullopt;
+  }
+  return result;
+}
+
+bool QRTContainerCache::addContainerMetadata(const QRTMetadataRef& metadata, uint32_t forUser, const QRTURL& url,
+                                             bool transient, bool updateSandbox, QRTErrorRef* error) {
+  if (!metadata || !validClass(metadata->containerClass())) {
+    QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Invalid Metadata Content Class: %lld",
+                                 metadata ? static_cast<long long>(metadata->containerClass()) : 0LL));
+    return false;
+  }
+  if (url.empty()) {
+    QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Invalid input: URL: %@", nullptr));
+    return false;
+  }
+  const uint64_t contentClass = metadata->containerClass();
+  bool added = false;
+  QRTErrorRef failure = QRT_GUARD([&] {
+    {
+      std::lock_guard<std::mutex> hold(cacheLock);
+      ClassMap* map = lockedClassMap(forUser, contentClass, transient, true, error);
+      if (!map) return;
+      metadata->setUrl(url);
+      (*map)[metadata->identifier()] = metadata;
+    }
+    if (!transient && updateSandbox &&
+        !setSandboxContainerMappingForUser(forUser, metadata->identifier(), contentClass, url)) {
+      QRTLog(kLogError, "Failed to set container mapping of %@, %llu", metadata->identifier(),
+             static_cast<unsigned long long>(contentClass));
+    }
+    QRTLog(kLogDebug, "Cache: %@%@: Added Identifier: %@", QRTContentClassPathName(contentClass), suffix(transient),
+           metadata->identifier());
+    added = true;
+  });
+  if (failure) QRTSetError(error, failure);
+  return added;
+}
+
+bool QRTContainerCache::removeContainerForUser(uint32_t userId, uint64_t contentClass,
+                                               const std::optional<std::string>& identifier, bool transient,
+                                               QRTErrorRef* error) {
+  if (!validInput(contentClass, identifier, "Invalid Identifier: %@", __func__, __LINE__, error)) return false;
+  bool removed = false;
+  QRTErrorRef failure = QRT_GUARD([&] {
+    {
+      std::lock_guard<std::mutex> hold(cacheLock);
+      ClassMap* map = lockedClassMap(userId, contentClass, transient, true, error);
+      if (!map) return;
+      map->erase(*identifier);
+    }
+    if (!transient && !setSandboxContainerMappingForUser(userId, *identifier, contentClass, std::nullopt)) {
+      QRTLog(kLogError, "Failed to remove container mapping of %@, %llu", identifier,
+             static_cast<unsigned long long>(contentClass));
+    }
+    QRTLog(kLogDebug, "Cache: %@%@: Removed Identifier: %@", QRTContentClassPathName(contentClass), suffix(transient),
+           identifier);
+    removed = true;
+  });
+  if (failure) QRTSetError(error, failure);
+  return removed;
+}
+
+bool QRTContainerCache::setSandboxContainerMappingForUser(uint32_t userId, const std::string& identifier,
+                                                          uint64_t containerClass, const std::optional<QRTURL>& url) {
+  if (QRTIsBundleClass(containerClass)) return true;
+  uint64_t itemType;
+  uint32_t mappingUser = userId;
+  switch (containerClass) {
+    case 2: case 4: case 6: case 9: case 10: case 11: itemType = 1; break;
+    case 7: itemType = 2; break;
+    case 12: itemType = 4; mappingUser = 0; break;
+    case 13: itemType = 8; mappingUser = 0; break;
+    default:
+      QRTLog(kLogError, "Unsupported class for setting sandbox container mapping: %llu",
+             static_cast<unsigned long long>(containerClass));
+      return false;
+  }
+  const unsigned long long cls = containerClass;
+  const unsigned long long type = itemType;
+  if (int status = platform::sandboxSetStateItem(mappingUser, itemType, identifier, nullptr)) {
+    QRTLog(kLogError, "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d",
+           mappingUser, type, identifier.c_str(), cls, static_cast<const char*>(nullptr), status);
+    return false;
+  }
+  if (!url) return true;
+  if (int status = platform::sandboxSetStateItem(mappingUser, itemType, identifier, url->fileSystemRepresentation())) {
+    QRTLog(kLogError, "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: %llu, path: %s : %d",
+           mappingUser, type, identifier.c_str(), cls, url->fileSystemRepresentation(), status);
+    return false;
+  }
+  return true;
+}

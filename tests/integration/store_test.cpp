@@ -1,0 +1,227 @@
+// Creating and finding containers through the real daemon: what lands on
+// disk, what the cache remembers across restarts, and crash safety.
+#include <dirent.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <set>
+#include <sstream>
+#include <thread>
+
+#include "DaemonFixture.h"
+#include "base/PlistCodec.h"
+#include "base/QRTUUID.h"
+
+namespace {
+
+const char* kMetadataFile = ".com.norvane.quarter_kit.metadata.plist";
+
+struct Created {
+  uint64_t error = 0;
+  std::string path;
+  std::string identifier;
+  std::optional<QRTUUID> uuid;
+  bool existed = false;
+};
+
+std::vector<std::string> listDirectory(const std::string& path) {
+  std::vector<std::string> names;
+  if (DIR* dir = opendir(path.c_str())) {
+    while (dirent* entry = readdir(dir)) {
+      std::string name = entry->d_name;
+      if (name != "." && name != "..") names.push_back(name);
+    }
+    closedir(dir);
+  }
+  return names;
+}
+
+std::optional<plist::Dictionary> readPlist(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::stringstream bytes;
+  bytes << in.rdbuf();
+  std::string data = bytes.str();
+  auto value = plist::parse(data.data(), data.size());
+  if (!value || !value->isDictionary()) return std::nullopt;
+  return value->dictionary();
+}
+
+class StoreTest : public DaemonFixture {
+ protected:
+  Created createOrLookup(uint64_t userId, const std::string& identifier, uint64_t cls, bool create = true,
+                         bool transient = false, uint64_t command = 0) {
+    plist::Dictionary keys{{"UserID", userId}, {"ContainerClass", cls}, {"CreateIfNecessary", create},
+                           {"Transient", transient}, {"Identifier", identifier}};
+    // Not the fixture's connect(): the crash test calls this while the daemon dies.
+    auto connection = qk::Connection::connect(qk::requestSocketPath(root));
+    Created result;
+    if (!connection) return result;
+    auto reply = connection->call(request(command, keys));
+    if (!reply) return result;
+    result.error = plist::find(*reply, "ReplyError")->integer().asUnsigned();
+    if (auto* v = plist::find(*reply, "ReplyPath")) result.path = v->string();
+    if (auto* v = plist::find(*reply, "ReplyIdentifier")) result.identifier = v->string();
+    if (auto* v = plist::find(*reply, "ReplyExisted")) result.existed = v->boolean();
+    if (auto* v = plist::find(*reply, "ReplyUUID")) result.uuid = QRTUUID::fromBytes(v->data().data(), v->data().size());
+    return result;
+  }
+
+};
+
+TEST_F(StoreTest, NewDataContainerIsCompleteOnDiskAndMapped) {
+  Created made = createOrLookup(501, "com.example.app", 2);
+  ASSERT_EQ(made.error, 1u);
+  EXPECT_FALSE(made.existed);
+  EXPECT_EQ(made.identifier, "com.example.app");
+  std::string classDir = root + "/private/var/mobile/Containers/Data/Application";
+  ASSERT_EQ(made.path.rfind(classDir + "/", 0), 0u) << made.path;
+  // The directory is named by a fresh upper-case UUID of its own.
+  std::string name = made.path.substr(classDir.size() + 1);
+  auto directoryUUID = QRTUUID::fromString(name);
+  ASSERT_TRUE(directoryUUID);
+  EXPECT_EQ(directoryUUID->UUIDString(), name);
+  ASSERT_TRUE(made.uuid);
+  EXPECT_NE(*made.uuid, *directoryUUID);
+
+  auto metadata = readPlist(made.path + "/" + kMetadataFile);
+  ASSERT_TRUE(metadata);
+  EXPECT_EQ(metadata->size(), 4u);
+  EXPECT_EQ(plist::find(*metadata, "QRTMetadataIdentifier")->string(), "com.example.app");
+  EXPECT_EQ(plist::find(*metadata, "QRTMetadataUUID")->string(), made.uuid->UUIDString());
+  EXPECT_EQ(plist::find(*metadata, "QRTMetadataContentClass")->integer().asUnsigned(), 2u);
+  EXPECT_EQ(plist::find(*metadata, "QRTMetadataPersona")->integer().asUnsigned(), 501u);
+
+  std::set<std::string> expected{kMetadataFile, "Documents", "Library", "tmp"};
+  auto entries = listDirectory(made.path);
+  EXPECT_EQ(std::set<std::string>(entries.begin(), entries.end()), expected);
+  for (const char* sub : {"", "/Documents", "/Library", "/Library/Caches", "/Library/Preferences", "/tmp"}) {
+    struct stat st {};
+    ASSERT_EQ(stat((made.path + sub).c_str(), &st), 0) << sub;
+    EXPECT_EQ(st.st_uid, 501u) << sub;
+    EXPECT_EQ(st.st_mode & 07777, 0755u) << sub;
+  }
+
+  char target[4096] = {0};
+  ssize_t n = readlink((root + "/run/sandbox/mappings/501/1/com.example.app").c_str(), target, sizeof target - 1);
+  ASSERT_GT(n, 0);
+  EXPECT_EQ(std::string(target, static_cast<size_t>(n)), made.path);
+
+  Created again = createOrLookup(501, "com.example.app", 2);
+  EXPECT_EQ(again.error, 1u);
+  EXPECT_TRUE(again.existed);
+  EXPECT_EQ(again.path, made.path);
+  EXPECT_EQ(again.uuid, made.uuid);
+}
+
+TEST_F(StoreTest, TransientContainerIsReplacedOnEveryCall) {
+  Created first = createOrLookup(501, "com.example.tmp", 2, true, true);
+  ASSERT_EQ(first.error, 1u);
+  EXPECT_NE(first.path.find("/Library/Caches/com.norvane.quarterd/Temp/Data/Application/"), std::string::npos);
+  Created second = createOrLookup(501, "com.example.tmp", 2, true, true);
+  ASSERT_EQ(second.error, 1u);
+  EXPECT_FALSE(second.existed);
+  EXPECT_NE(second.path, first.path);
+  EXPECT_NE(second.uuid, first.uuid);
+  EXPECT_NE(access(first.path.c_str(), F_OK), 0);
+  EXPECT_EQ(access(second.path.c_str(), F_OK), 0);
+}
+
+TEST_F(StoreTest, RefusalsLeaveNothingOnDisk) {
+  Created missing = createOrLookup(501, "com.example.none", 2, false);
+  EXPECT_EQ(missing.error, 21u);
+  EXPECT_TRUE(missing.path.empty());
+  EXPECT_TRUE(listDirectory(root + "/private/var/mobile/Containers/Data/Application").empty());
+  EXPECT_TRUE(listDirectory(root + "/private/var/root/Library/Caches/com.norvane.quarterd/Staging").empty());
+
+  EXPECT_EQ(createOrLookup(501, "com.example.app", 1).error, 38u);
+  // A system container of another program needs look-up rights.
+  setOwnIdentity("com.example.me", {{"com.norvane.private.QuarterKit.otherIdLookup", false}});
+  EXPECT_EQ(createOrLookup(499, "com.example.other", 12).error, 55u);
+  EXPECT_EQ(createOrLookup(499, "com.example.other", 12, true, false, 15).error, 55u);
+  EXPECT_TRUE(listDirectory(root + "/private/var/containers/Data/System").empty());
+}
+
+TEST_F(StoreTest, BundleAndWellKnownSystemContainers) {
+  Created bundle = createOrLookup(33, "com.example.app", 1);
+  ASSERT_EQ(bundle.error, 1u);
+  EXPECT_EQ(bundle.path.rfind(root + "/private/var/containers/Bundle/Application/", 0), 0u);
+  EXPECT_EQ(listDirectory(bundle.path), std::vector<std::string>{kMetadataFile});
+  struct stat st {};
+  ASSERT_EQ(stat(bundle.path.c_str(), &st), 0);
+  EXPECT_EQ(st.st_uid, 33u);
+
+  // Any caller reaches a well-known system container, under its own name.
+  Created system = createOrLookup(0, "com.norvane.mapsd", 12, true, false, 15);
+  ASSERT_EQ(system.error, 1u);
+  EXPECT_EQ(system.path, root + "/private/var/containers/Data/System/com.norvane.mapsd");
+  EXPECT_GT(getxattr(system.path.c_str(), "system.posix_acl_access", nullptr, 0), 0);
+  EXPECT_GT(getxattr(system.path.c_str(), "system.posix_acl_default", nullptr, 0), 0);
+  ASSERT_EQ(stat((system.path + "/Library").c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0u);
+  EXPECT_EQ(st.st_uid, 4294967294u);
+}
+
+TEST_F(StoreTest, ContainerDeletedByHandIsForgotten) {
+  Created made = createOrLookup(501, "com.example.gone", 2);
+  ASSERT_EQ(made.error, 1u);
+  ASSERT_EQ(system(("rm -rf " + made.path).c_str()), 0);
+  EXPECT_EQ(createOrLookup(501, "com.example.gone", 2, false).error, 44u);
+  EXPECT_EQ(createOrLookup(501, "com.example.gone", 2, false).error, 21u);
+  EXPECT_EQ(createOrLookup(501, "com.example.gone", 2, true).error, 1u);
+}
+
+TEST_F(StoreTest, RestartFindsEveryContainerAgain) {
+  std::map<std::string, Created> made;
+  for (int i = 0; i < 5; ++i) {
+    std::string id = "com.example.app" + std::to_string(i);
+    made[id] = createOrLookup(501, id, i % 2 ? 2 : 4);
+    ASSERT_EQ(made[id].error, 1u);
+  }
+  // A container whose metadata names class 2 but lies among class 4 is ignored.
+  std::string stray = root + "/private/var/mobile/Containers/Data/AddonPlugin/" + QRTUUID::random().UUIDString();
+  ASSERT_EQ(system(("cp -a " + made["com.example.app1"].path + " " + stray).c_str()), 0);
+
+  killDaemon();
+  startDaemon();
+  for (int i = 0; i < 5; ++i) {
+    std::string id = "com.example.app" + std::to_string(i);
+    Created found = createOrLookup(501, id, i % 2 ? 2 : 4, false);
+    EXPECT_EQ(found.error, 1u) << id;
+    EXPECT_TRUE(found.existed);
+    EXPECT_EQ(found.path, made[id].path);
+    EXPECT_EQ(found.uuid, made[id].uuid);
+  }
+  EXPECT_EQ(createOrLookup(501, "com.example.app1", 4, false).error, 21u);
+}
+
+TEST_F(StoreTest, KillDuringCreationsLeavesNoIncompleteContainer) {
+  std::atomic<bool> stop{false};
+  std::vector<std::thread> clients;
+  for (int t = 0; t < 4; ++t) {
+    clients.emplace_back([&, t] {
+      for (int i = 0; !stop && i < 1000; ++i) createOrLookup(501, "com.example.burst" + std::to_string(t * 1000 + i), 2);
+    });
+  }
+  std::this_thread::sleep_for(std::chrono::milliseconds(400));
+  killDaemon();
+  stop = true;
+  for (auto& t : clients) t.join();
+
+  std::string classDir = root + "/private/var/mobile/Containers/Data/Application";
+  auto containers = listDirectory(classDir);
+  EXPECT_FALSE(containers.empty());
+  for (const std::string& name : containers) {
+    std::string path = classDir + "/" + name;
+    EXPECT_TRUE(readPlist(path + "/" + kMetadataFile)) << path;
+    for (const char* sub : {"/Documents", "/Library/Caches", "/Library/Preferences", "/tmp"}) {
+      EXPECT_EQ(access((path + sub).c_str(), F_OK), 0) << path << sub;
+    }
+  }
+  startDaemon();  // the fixture's tear-down checks a clean exit
+}
+
+}  // namespace

@@ -1,0 +1,124 @@
+#include <gtest/gtest.h>
+
+#include <cstdint>
+#include <set>
+
+#include "base/QRTFormat.h"
+#include "base/QRTURL.h"
+#include "base/QRTUUID.h"
+
+namespace {
+
+TEST(QRTFormatTest, IntegerConversions) {
+  EXPECT_EQ(QRTFormat("%d|%i|%3d|%-3d|%03d|%+d|% d", -42, 7, 7, 7, 7, 7, 7), "-42|7|  7|7  |007|+7| 7");
+  EXPECT_EQ(QRTFormat("%05d", -42), "-0042");
+  EXPECT_EQ(QRTFormat("%llu", UINT64_MAX), "18446744073709551615");
+  EXPECT_EQ(QRTFormat("%lld", INT64_MIN), "-9223372036854775808");
+  EXPECT_EQ(QRTFormat("%zu %zd", sizeof(int64_t), static_cast<ssize_t>(-3)), "8 -3");
+  EXPECT_EQ(QRTFormat("%x %X %#x %08x %o", 255, 255, 255, 0xbeef, 8), "ff FF 0xff 0000beef 10");
+  EXPECT_EQ(QRTFormat("%.5d", 42), "00042");
+  // The conversion decides how the bits are read, as printf would.
+  EXPECT_EQ(QRTFormat("%u %x", -1, -1), "4294967295 ffffffff");
+  EXPECT_EQ(QRTFormat("%lld", UINT64_MAX), "-1");
+  EXPECT_EQ(QRTFormat("%hhd %hu", 300, 70000), "44 4464");
+  EXPECT_EQ(QRTFormat("%d %lld %llu", 3.9, -1e300, 1e300), "3 -9223372036854775808 18446744073709551615");
+  EXPECT_EQ(QRTFormat("%d", true), "1");
+}
+
+TEST(QRTFormatTest, RealCharStringPointerConversions) {
+  EXPECT_EQ(QRTFormat("%f %05.2f %.3e %g %G", 3.14159, 3.14159, 1234.5, 0.0001, 1e-10),
+            "3.141590 03.14 1.234e+03 0.0001 1E-10");
+  EXPECT_EQ(QRTFormat("%a %Lf %.1f", 1.0, 0.5, 2), "0x1p+0 0.500000 2.0");
+  EXPECT_EQ(QRTFormat("%c%c%3c|%-2c|", 'o', 'k', 'x', 'y'), "ok  x|y |");
+  EXPECT_EQ(QRTFormat("%s|%-5s|%5s|%.2s", "abc", "ab", "ab", "abcdef"), "abc|ab   |   ab|ab");
+  EXPECT_EQ(QRTFormat("%s", static_cast<const char*>(nullptr)), "(null)");
+  EXPECT_EQ(QRTFormat("%s %d", std::string("text"), std::string("obj")), "text obj");
+  EXPECT_EQ(QRTFormat("%p %p", reinterpret_cast<const void*>(0x1234), static_cast<const void*>(nullptr)),
+            "0x1234 0x0");
+  EXPECT_EQ(QRTFormat("100%% sure, %5%"), "100% sure, %");
+  EXPECT_EQ(QRTFormat("%*d|%-*d|%.*s", 4, 1, 3, 2, 2, "abcdef"), "   1|2  |ab");
+  EXPECT_EQ(QRTFormat("%*d|", -3, 5), "5  |");
+  // Width and precision are bounded whatever the format asks for.
+  EXPECT_EQ(QRTFormat("%999999999d", 1).size(), 4096u);
+  EXPECT_LT(QRTFormat("%.999999999f", 1e308).size(), 5000u);
+}
+
+struct Described {
+  std::string description() const { return "described"; }
+};
+
+TEST(QRTFormatTest, ObjectConversions) {
+  EXPECT_EQ(QRTFormat("%@ %@ %@", std::string("s"), "c", nullptr), "s c (null)");
+  EXPECT_EQ(QRTFormat("%@ %@ %@ %@", 42, UINT64_MAX, 0.5, -3), "42 18446744073709551615 0.5 -3");
+  EXPECT_EQ(QRTFormat("%@", plist::Value(plist::Array{"a", "b"})), "( a, b )");
+  EXPECT_EQ(QRTFormat("%@", plist::Value(plist::Dictionary{{"key", plist::Value("value")}})),
+            "{ key = value; }");
+  EXPECT_EQ(QRTFormat("[%10@] [%-4@]", std::string("right"), std::string("l")), "[     right] [l   ]");
+  std::optional<std::string> none, some = "here";
+  EXPECT_EQ(QRTFormat("%@ %@", none, some), "(null) here");
+  auto shared = std::make_shared<Described>();
+  EXPECT_EQ(QRTFormat("%@ %s %@ %@", Described(), Described(), shared, std::shared_ptr<Described>()),
+            "described described described (null)");
+}
+
+TEST(QRTFormatTest, BadFormatsAndMissingArguments) {
+  EXPECT_EQ(QRTFormat("%d %s %@ %f %x|%c|%p"), "0 (null) (null) 0.000000 0||0x0");
+  EXPECT_EQ(QRTFormat("%*d", 5), "    0");
+  EXPECT_EQ(QRTFormat("%n %k %1$s", 1), "%n %k %1$s");
+  EXPECT_EQ(QRTFormat("tail %-5"), "tail %-5");
+  EXPECT_EQ(QRTFormat("50%"), "50%");
+  EXPECT_EQ(QRTFormatArgs(nullptr, {1}), "");
+  EXPECT_EQ(QRTFormat("only %d", 1, 2, 3), "only 1");
+}
+
+TEST(QRTURLTest, PathHandling) {
+  EXPECT_EQ(QRTURL::fileURL("//var///mobile/").path(), "/var/mobile");
+  EXPECT_EQ(QRTURL::fileURL("///").path(), "/");
+  QRTURL base = QRTURL::fileURL("/var/mobile", true);
+  EXPECT_TRUE(base.isDirectory());
+  QRTURL caches = base.URLByAppendingPathComponent("Library//Caches/", true);
+  EXPECT_EQ(caches.path(), "/var/mobile/Library/Caches");
+  EXPECT_STREQ(caches.fileSystemRepresentation(), "/var/mobile/Library/Caches");
+  EXPECT_EQ(QRTURL::fileURL("/").URLByAppendingPathComponent("/tmp").path(), "/tmp");
+  EXPECT_FALSE(base.URLByAppendingPathComponent("file").isDirectory());
+
+  QRTURL parent = caches.URLByDeletingLastPathComponent();
+  EXPECT_EQ(parent.path(), "/var/mobile/Library");
+  EXPECT_TRUE(parent.isDirectory());
+  EXPECT_EQ(QRTURL::fileURL("/a").URLByDeletingLastPathComponent().path(), "/");
+  EXPECT_EQ(QRTURL::fileURL("/").URLByDeletingLastPathComponent().path(), "/");
+  EXPECT_EQ(caches.lastPathComponent(), "Caches");
+  EXPECT_EQ(QRTURL::fileURL("/").lastPathComponent(), "/");
+  EXPECT_EQ(QRTFormat("at %@", caches), "at /var/mobile/Library/Caches");
+}
+
+TEST(QRTUUIDTest, RandomTextAndBytes) {
+  std::set<QRTUUID> seen;
+  for (int i = 0; i < 100; ++i) {
+    QRTUUID u = QRTUUID::random();
+    EXPECT_EQ(u.bytes()[6] >> 4, 4);
+    EXPECT_EQ(u.bytes()[8] & 0xC0, 0x80);
+    seen.insert(u);
+    EXPECT_EQ(QRTUUID::fromString(u.UUIDString()), u);
+  }
+  EXPECT_EQ(seen.size(), 100u);
+
+  auto parsed = QRTUUID::fromString("0a1b2c3d-4e5f-6789-abcd-ef0123456789");
+  ASSERT_TRUE(parsed);
+  EXPECT_EQ(parsed->UUIDString(), "0A1B2C3D-4E5F-6789-ABCD-EF0123456789");
+  EXPECT_EQ(QRTFormat("%@", *parsed), "0A1B2C3D-4E5F-6789-ABCD-EF0123456789");
+  EXPECT_EQ(parsed->bytes()[0], 0x0a);
+  EXPECT_EQ(parsed->bytes()[15], 0x89);
+  for (const char* bad : {"0A1B2C3D-4E5F-6789-ABCD-EF012345678", "0A1B2C3D-4E5F-6789-ABCD-EF01234567890",
+                          "0A1B2C3D4E5F-6789-ABCD-EF0123456789-", "0A1B2C3D-4E5F-6789-ABCD-EF012345678G",
+                          "{0A1B2C3D-4E5F-6789-ABCD-EF01234567}", ""})
+    EXPECT_FALSE(QRTUUID::fromString(bad)) << bad;
+
+  const uint8_t raw[17] = {1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 14, 15, 16, 17};
+  EXPECT_EQ(QRTUUID::fromBytes(raw, 16)->UUIDString(), "01020304-0506-0708-090A-0B0C0D0E0F10");
+  EXPECT_FALSE(QRTUUID::fromBytes(raw, 15));
+  EXPECT_FALSE(QRTUUID::fromBytes(raw, 17));
+  EXPECT_FALSE(QRTUUID::fromBytes(nullptr, 16));
+}
+
+}  // namespace
