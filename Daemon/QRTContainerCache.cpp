@@ -83,13 +83,15 @@ QRTContainerCache::ClassMap* QRTContainerCache::_getCacheForUserId(uint32_t user
   return &(caches[key] = std::move(map));
 }
 
-QRTContainerCache::ClassMap* QRTContainerCache::lockedClassMap(uint32_t userId, uint64_t contentClass, bool transient,
+QRTContainerCache::ClassMap* QRTContainerCache::lockedClassMap(const char* function, uint32_t userId,
+                                                               uint64_t contentClass, bool transient,
                                                                bool populateSandboxCache, QRTErrorRef* error) {
   QRTErrorRef buildError;
   ClassMap* map = _getCacheForUserId(userId, contentClass, transient, populateSandboxCache, &buildError);
   if (!map) {
-    QRTSetError(error, QRT_ERROR(QRTErrorCacheRebuildFailed, buildError, true, "Cache: %u-%@%@: Failed to rebuild",
-                                 userId, QRTContentClassPathName(contentClass), suffix(transient)));
+    QRTSetError(error, QRTCreateError(function, __LINE__, QRTErrorDomain, QRTErrorCacheRebuildFailed, buildError,
+                                      nullptr, true, "Cache: %u-%@%@: Failed to rebuild", userId,
+                                      QRTContentClassPathName(contentClass), suffix(transient)));
   }
   return map;
 }
@@ -120,32 +122,28 @@ QRTMetadataRef QRTContainerCache::containerForUser(uint32_t userId, uint64_t con
                                                    const std::optional<std::string>& identifier, bool transient,
                                                    QRTErrorRef* error) {
   if (!validInput(contentClass, identifier, "Invalid identifier: %@", __func__, __LINE__, error)) return nullptr;
-  QRTMetadataRef found;
-  QRTErrorRef failure = QRT_GUARD([&] {
+  try {
+    QRTMetadataRef found;
     {
       std::lock_guard<std::mutex> hold(cacheLock);
-      ClassMap* map = lockedClassMap(userId, contentClass, transient, true, error);
-      if (!map) return;
+      ClassMap* map = lockedClassMap(__func__, userId, contentClass, transient, true, error);
+      if (!map) return nullptr;
       auto it = map->find(*identifier);
       if (it == map->end()) {
         QRTSetError(error, QRT_ERROR(QRTErrorNotFound, nullptr, false, "Cache: %@%@: Container Not Found with ID: %@",
                                      QRTContentClassPathName(contentClass), suffix(transient), identifier));
-        return;
+        return nullptr;
       }
       found = it->second;
     }
-    if (!checkEntryOnDisk(found, userId, contentClass, transient, error)) {
-      found = nullptr;
-      return;
-    }
+    if (!checkEntryOnDisk(found, userId, contentClass, transient, error)) return nullptr;
     QRTLog(kLogDebug, "Cache: %@%@: Found Identifier: %@", QRTContentClassPathName(contentClass), suffix(transient),
            identifier);
-  });
-  if (failure) {
-    QRTSetError(error, failure);
+    return found;
+  } catch (...) {
+    QRTSetError(error, QRT_EXCEPTION_ERROR());
     return nullptr;
   }
-  return found;
 }
 
 QRTMetadataRef QRTContainerCache::containerForUser(uint32_t userId, uint64_t contentClass,
@@ -171,13 +169,12 @@ std::optional<std::vector<QRTMetadataRef>> QRTContainerCache::allContainersForUs
                                  static_cast<long>(contentClass)));
     return std::nullopt;
   }
-  std::optional<std::vector<QRTMetadataRef>> result;
-  QRTErrorRef failure = QRT_GUARD([&] {
+  try {
     std::vector<QRTMetadataRef> snapshot;
     {
       std::lock_guard<std::mutex> hold(cacheLock);
-      ClassMap* map = lockedClassMap(userId, contentClass, transient, populateSandboxCache, error);
-      if (!map) return;
+      ClassMap* map = lockedClassMap(__func__, userId, contentClass, transient, populateSandboxCache, error);
+      if (!map) return std::nullopt;
       snapshot.reserve(map->size());
       for (const auto& entry : *map) snapshot.push_back(entry.second);
     }
@@ -190,13 +187,11 @@ std::optional<std::vector<QRTMetadataRef>> QRTContainerCache::allContainersForUs
              suffix(transient), metadata->identifier());
       live.push_back(std::move(metadata));
     }
-    result = std::move(live);
-  });
-  if (failure) {
-    QRTSetError(error, failure);
+    return live;
+  } catch (...) {
+    QRTSetError(error, QRT_EXCEPTION_ERROR());
     return std::nullopt;
   }
-  return result;
 }
 
 bool QRTContainerCache::addContainerMetadata(const QRTMetadataRef& metadata, uint32_t forUser, const QRTURL& url,
@@ -211,12 +206,11 @@ bool QRTContainerCache::addContainerMetadata(const QRTMetadataRef& metadata, uin
     return false;
   }
   const uint64_t contentClass = metadata->containerClass();
-  bool added = false;
-  QRTErrorRef failure = QRT_GUARD([&] {
+  try {
     {
       std::lock_guard<std::mutex> hold(cacheLock);
-      ClassMap* map = lockedClassMap(forUser, contentClass, transient, true, error);
-      if (!map) return;
+      ClassMap* map = lockedClassMap(__func__, forUser, contentClass, transient, true, error);
+      if (!map) return false;
       metadata->setUrl(url);
       (*map)[metadata->identifier()] = metadata;
     }
@@ -227,22 +221,22 @@ bool QRTContainerCache::addContainerMetadata(const QRTMetadataRef& metadata, uin
     }
     QRTLog(kLogDebug, "Cache: %@%@: Added Identifier: %@", QRTContentClassPathName(contentClass), suffix(transient),
            metadata->identifier());
-    added = true;
-  });
-  if (failure) QRTSetError(error, failure);
-  return added;
+    return true;
+  } catch (...) {
+    QRTSetError(error, QRT_EXCEPTION_ERROR());
+    return false;
+  }
 }
 
 bool QRTContainerCache::removeContainerForUser(uint32_t userId, uint64_t contentClass,
                                                const std::optional<std::string>& identifier, bool transient,
                                                QRTErrorRef* error) {
   if (!validInput(contentClass, identifier, "Invalid Identifier: %@", __func__, __LINE__, error)) return false;
-  bool removed = false;
-  QRTErrorRef failure = QRT_GUARD([&] {
+  try {
     {
       std::lock_guard<std::mutex> hold(cacheLock);
-      ClassMap* map = lockedClassMap(userId, contentClass, transient, true, error);
-      if (!map) return;
+      ClassMap* map = lockedClassMap(__func__, userId, contentClass, transient, true, error);
+      if (!map) return false;
       map->erase(*identifier);
     }
     if (!transient && !setSandboxContainerMappingForUser(userId, *identifier, contentClass, std::nullopt)) {
@@ -251,10 +245,11 @@ bool QRTContainerCache::removeContainerForUser(uint32_t userId, uint64_t content
     }
     QRTLog(kLogDebug, "Cache: %@%@: Removed Identifier: %@", QRTContentClassPathName(contentClass), suffix(transient),
            identifier);
-    removed = true;
-  });
-  if (failure) QRTSetError(error, failure);
-  return removed;
+    return true;
+  } catch (...) {
+    QRTSetError(error, QRT_EXCEPTION_ERROR());
+    return false;
+  }
 }
 
 bool QRTContainerCache::setSandboxContainerMappingForUser(uint32_t userId, const std::string& identifier,

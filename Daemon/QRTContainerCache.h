@@ -47,8 +47,9 @@ class QRTContainerCache {
   QRTContainerCache() = default;
   ClassMap* _getCacheForUserId(uint32_t userId, uint64_t contentClass, bool transient, bool populateSandboxCache,
                                QRTErrorRef* error);
-  ClassMap* lockedClassMap(uint32_t userId, uint64_t contentClass, bool transient, bool populateSandboxCache,
-                           QRTErrorRef* error);
+  // _getCacheForUserId with its failure wrapped in error 43 for the named operation.
+  ClassMap* lockedClassMap(const char* function, uint32_t userId, uint64_t contentClass, bool transient,
+                           bool populateSandboxCache, QRTErrorRef* error);
   // The metadata file is gone: forget the container. False with error 44
   // (or 47 when the entry has no usable URL).
   bool checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_t userId, uint64_t contentClass, bool transient,

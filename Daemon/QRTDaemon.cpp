@@ -24,9 +24,18 @@ using platform::kLogDebug;
 using platform::kLogError;
 using platform::kLogNotice;
 
-std::shared_ptr<platform::Queue> gQRTDeathRowQueue;
-std::shared_ptr<platform::Queue> gQRTLockStateQueue;
 uint32_t gQRTLogFileCount = 1;
+
+platform::Queue& QRTDeathRowQueue() {
+  static std::shared_ptr<platform::Queue> queue =
+      platform::makeSerialQueue("com.norvane.quarterd.deathrow", platform::QueuePriority::Background);
+  return *queue;
+}
+
+platform::Queue& QRTLockStateQueue() {
+  static std::shared_ptr<platform::Queue> queue = platform::makeSerialQueue("com.norvane.quarterd.lockstate");
+  return *queue;
+}
 
 namespace {
 
@@ -113,10 +122,10 @@ void lock_state_notification_callback() {
   int state = platform::deviceLockState();
   QRTLog(kLogDebug, "LockState=%d", state);
   if (state == 1) {
-    if (gLastAppliedLockState != 1) gQRTLockStateQueue->suspend();
+    if (gLastAppliedLockState != 1) QRTLockStateQueue().suspend();
     gLastAppliedLockState = 1;
   } else if (state == 0) {
-    if (gLastAppliedLockState == 1) gQRTLockStateQueue->resume();
+    if (gLastAppliedLockState == 1) QRTLockStateQueue().resume();
     gLastAppliedLockState = 0;
   }
 }
@@ -147,12 +156,10 @@ int QRTDaemonMain(int argc, char** argv) {
   openLog(options);
   QRTLog(kLogDebug, "quarterd built at %s %s started", __DATE__, __TIME__);
 
-  gQRTDeathRowQueue = platform::makeSerialQueue("com.norvane.quarterd.deathrow", platform::QueuePriority::Background);
-  gQRTLockStateQueue = platform::makeSerialQueue("com.norvane.quarterd.lockstate");
-  if (!gQRTDeathRowQueue || !gQRTLockStateQueue) {
-    QRTLog(kLogError, "Can't create dispatch queues. Exiting.");
-    return -1;
-  }
+  // Queue creation cannot fail here short of running out of memory, which
+  // ends the process anyway; they are made now so that start-up work finds them.
+  QRTDeathRowQueue();
+  QRTLockStateQueue();
 
   QRTClientConnection& internal = QRTClientConnection::sharedClientConnection();
   const bool firstBoot = !platform::firstBootMarkerExists();

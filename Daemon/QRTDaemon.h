@@ -5,10 +5,10 @@
 
 #include "platform/Queue.h"
 
-// Serial, background priority: destruction of death-row items.
-extern std::shared_ptr<platform::Queue> gQRTDeathRowQueue;
+// Serial, background priority: destruction of death-row items. Made on first use.
+platform::Queue& QRTDeathRowQueue();
 // Serial, suspended while the device is locked: protection changes.
-extern std::shared_ptr<platform::Queue> gQRTLockStateQueue;
+platform::Queue& QRTLockStateQueue();
 // The log file count (1, or 4 on an internal build).
 extern uint32_t gQRTLogFileCount;
 

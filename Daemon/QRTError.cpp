@@ -88,20 +88,26 @@ void QRTReportUncaughtException(const std::string& name, const std::string& reas
 
 void QRTReportUncaughtException(const std::exception& e) { QRTReportUncaughtException(exceptionName(e), e.what()); }
 
-QRTErrorRef QRTGuardedCall(const char* function, int line, const std::function<void()>& body) {
-  std::string name, reason;
+QRTErrorRef QRTErrorForCurrentException(const char* function, int line) {
+  std::string name = "unknown", reason = "non-standard exception";
   try {
-    body();
-    return nullptr;
+    throw;
   } catch (const std::exception& e) {
     name = exceptionName(e);
     reason = e.what();
   } catch (...) {
-    name = "unknown";
-    reason = "non-standard exception";
   }
   QRTErrorRef error = QRTCreateError(function, line, QRTErrorDomain, QRTErrorException, nullptr, nullptr, true,
                                      "Got exception: %@ : %@", name, reason);
   if (platform::deviceIsInternalBuild()) QRTReportUncaughtException(name, reason);
   return error;
+}
+
+QRTErrorRef QRTGuardedCall(const char* function, int line, const std::function<void()>& body) {
+  try {
+    body();
+    return nullptr;
+  } catch (...) {
+    return QRTErrorForCurrentException(function, line);
+  }
 }

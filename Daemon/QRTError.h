@@ -129,8 +129,12 @@ inline void QRTSetError(QRTErrorRef* slot, QRTErrorRef error) {
 [[noreturn]] void QRTReportUncaughtException(const std::exception& e);
 [[noreturn]] void QRTReportUncaughtException(const std::string& name, const std::string& reason);
 
-// The exception guard of every public operation: runs body; an escaping
-// exception becomes error 40 ("Got exception: %@ : %@"), or on an internal
-// build the fatal report. Returns the error, or nullptr when body did not throw.
+// The exception guard of every public operation. Called inside a catch
+// block: the exception in flight becomes error 40 ("Got exception: %@ : %@"),
+// or on an internal build the fatal report.
+QRTErrorRef QRTErrorForCurrentException(const char* function, int line);
+#define QRT_EXCEPTION_ERROR() QRTErrorForCurrentException(__func__, __LINE__)
+
+// Runs body under the guard; the error, or nullptr when body did not throw.
 QRTErrorRef QRTGuardedCall(const char* function, int line, const std::function<void()>& body);
 #define QRT_GUARD(body) QRTGuardedCall(__func__, __LINE__, (body))

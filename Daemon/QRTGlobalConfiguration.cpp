@@ -1,9 +1,20 @@
 #include "Daemon/QRTGlobalConfiguration.h"
 
+#include "Daemon/QRTContentClass.h"
 #include "Daemon/QRTFileManager.h"
+#include "Daemon/QRTPerUserConfiguration.h"
 #include "platform/DeviceRoot.h"
 #include "platform/Log.h"
 #include "platform/UserDatabase.h"
+
+namespace {
+
+constexpr mode_t kDirectoryMode = 0755;
+constexpr int32_t kLibraryProtectionClass = 4;
+
+using Config = QRTGlobalConfiguration;
+
+}  // namespace
 
 QRTGlobalConfiguration& QRTGlobalConfiguration::sharedInstance() {
   static QRTGlobalConfiguration* instance = new QRTGlobalConfiguration();
@@ -21,12 +32,161 @@ QRTGlobalConfiguration::QRTGlobalConfiguration()
   }
 }
 
+QRTURL QRTGlobalConfiguration::cachedDirectory(std::optional<QRTURL>& slot, const char* getter,
+                                               QRTURL (*compute)(QRTGlobalConfiguration&), int32_t protectionClass,
+                                               const char* failureMessage) {
+  std::lock_guard<std::recursive_mutex> hold(lock_);
+  if (!slot) slot = compute(*this);
+  QRTErrorRef error;
+  if (!QRTFileManager::defaultManager().createDirectoryAtURL(*slot, true, kDirectoryMode, 0u, protectionClass,
+                                                             &error)) {
+    QRTLogAs(platform::kLogError, getter, failureMessage, *slot, error);
+  }
+  return *slot;
+}
+
+QRTURL QRTGlobalConfiguration::sharedContainersDirectory() {
+  return cachedDirectory(
+      sharedContainersDirectory_, __func__,
+      [](Config&) { return QRTURL::fileURL(platform::hostPath("/private/var/containers"), true); }, -1,
+      "Failed to create shared container dir at \"%@\": %@");
+}
+
+QRTURL QRTGlobalConfiguration::bundleDirectory() {
+  return cachedDirectory(
+      bundleDirectory_, __func__,
+      [](Config& c) { return c.sharedContainersDirectory().URLByAppendingPathComponent("Bundle", true); }, -1,
+      "Failed to create bundle dir at \"%@\": %@");
+}
+
 QRTURL QRTGlobalConfiguration::logDirectory() {
   std::lock_guard<std::recursive_mutex> hold(lock_);
   QRTURL url = homeDirectory_.URLByAppendingPathComponent("Library/Logs/QuarterKit", true);
   QRTErrorRef error;
-  if (!QRTFileManager::defaultManager().createDirectoryAtURL(url, true, 0755, 0, 4, &error)) {
+  if (!QRTFileManager::defaultManager().createDirectoryAtURL(url, true, kDirectoryMode, 0u, kLibraryProtectionClass,
+                                                             &error)) {
     QRTLog(platform::kLogError, "Failed to create log directory at \"%@\": %@", url, error);
   }
   return url;
+}
+
+QRTURL QRTGlobalConfiguration::cachesDirectory() {
+  return cachedDirectory(
+      cachesDirectory_, __func__,
+      [](Config& c) {
+        return c.homeDirectory().URLByAppendingPathComponent("Library/Caches/com.norvane.quarterd", true);
+      },
+      kLibraryProtectionClass, "Failed to create cache dir at \"%@\": %@");
+}
+
+QRTURL QRTGlobalConfiguration::libraryDirectory() {
+  return cachedDirectory(
+      libraryDirectory_, __func__,
+      [](Config& c) { return c.homeDirectory().URLByAppendingPathComponent("Library/QuarterKit", true); },
+      kLibraryProtectionClass, "Failed to create library dir at \"%@\": %@");
+}
+
+QRTURL QRTGlobalConfiguration::transientDirectory() {
+  return cachedDirectory(
+      transientDirectory_, __func__,
+      [](Config& c) { return c.cachesDirectory().URLByAppendingPathComponent("Temp", true); }, -1,
+      "Failed to create transient dir at \"%@\": %@");
+}
+
+QRTURL QRTGlobalConfiguration::stagingDirectory() {
+  return cachedDirectory(
+      stagingDirectory_, __func__,
+      [](Config& c) { return c.cachesDirectory().URLByAppendingPathComponent("Staging", true); }, -1,
+      "Failed to create staging dir at \"%@\": %@");
+}
+
+QRTURL QRTGlobalConfiguration::deathrowDirectory() {
+  return cachedDirectory(
+      deathrowDirectory_, __func__,
+      [](Config& c) { return c.cachesDirectory().URLByAppendingPathComponent("Dead", true); }, -1,
+      "Failed to create deathrow dir at \"%@\": %@");
+}
+
+QRTURL QRTGlobalConfiguration::replaceDirectory() {
+  return cachedDirectory(
+      replaceDirectory_, __func__,
+      [](Config& c) { return c.libraryDirectory().URLByAppendingPathComponent("Replace", true); }, -1,
+      "Failed to create replace dir at \"%@\": %@");
+}
+
+QRTURL QRTGlobalConfiguration::pendingUpdatesDirectory() {
+  return cachedDirectory(
+      pendingUpdatesDirectory_, __func__,
+      [](Config& c) { return c.libraryDirectory().URLByAppendingPathComponent("PendingUpdates", true); }, -1,
+      "Failed to create updates dir at \"%@\": %@");
+}
+
+// The installer's home may lack any of the three levels, and each must end
+// up owned by the installer, so each is made by itself rather than with parents.
+QRTURL QRTGlobalConfiguration::transientBundleDirectory() {
+  std::lock_guard<std::recursive_mutex> hold(lock_);
+  static const char* const kLevels[] = {"Library", "Caches", "com.norvane.quarterd"};
+  QRTURL url = emplacerdHomeDirectory_;
+  for (const char* level : kLevels) {
+    url = url.URLByAppendingPathComponent(level, true);
+    QRTErrorRef error;
+    if (!QRTFileManager::defaultManager().createDirectoryAtURL(url, false, kDirectoryMode, QRTInstallerUserId, -1,
+                                                               &error)) {
+      QRTLog(platform::kLogError, "Failed to create transient bundle dir at \"%@\": %@", url, error);
+    }
+  }
+  return url;
+}
+
+std::optional<QRTURL> QRTGlobalConfiguration::globalContainerBaseURLWithContentClass(uint64_t contentClass,
+                                                                                     bool transient) {
+  if (!QRTIsGlobalClass(contentClass)) return std::nullopt;
+  QRTURL base;
+  if (!transient)
+    base = sharedContainersDirectory();
+  else if (QRTIsBundleClass(contentClass))
+    base = transientBundleDirectory();
+  else
+    base = transientDirectory();
+  return base.URLByAppendingPathComponent(QRTContentClassPathName(contentClass), true);
+}
+
+std::optional<QRTURL> QRTGlobalConfiguration::containerDirectoryURLForUser(uint32_t userId, uint64_t contentClass,
+                                                                           bool transient) {
+  std::lock_guard<std::recursive_mutex> hold(lock_);
+  if (!QRTIsGlobalClass(contentClass))
+    return getPerUserConfigurationForUserId(userId)->containerDirectoryURLForContentClass(contentClass, transient);
+  std::optional<QRTURL> url = globalContainerBaseURLWithContentClass(contentClass, transient);
+  const uint32_t owner = QRTIsBundleClass(contentClass) ? QRTInstallerUserId : 0u;
+  QRTErrorRef error;
+  if (!QRTFileManager::defaultManager().createDirectoryAtURL(*url, true, kDirectoryMode, owner, -1, &error)) {
+    QRTLog(platform::kLogError, "Failed to create container dir at \"%@\": %@", *url, error);
+  }
+  return url;
+}
+
+std::shared_ptr<QRTPerUserConfiguration> QRTGlobalConfiguration::getPerUserConfigurationForUserId(uint32_t userId) {
+  std::lock_guard<std::recursive_mutex> hold(lock_);
+  auto found = perUserConfigurations_.find(userId);
+  if (found != perUserConfigurations_.end()) return found->second;
+  auto configuration = std::make_shared<QRTPerUserConfiguration>(userId);
+  if (configuration->userHomeDirectory()) perUserConfigurations_.emplace(userId, configuration);
+  return configuration;
+}
+
+std::shared_ptr<QRTPerUserConfiguration> QRTGlobalConfiguration::getPerUserConfigurationForCurrentMobileUser() {
+  return getPerUserConfigurationForUserId(currentMobileUserId_);
+}
+
+const std::vector<std::string>& QRTGlobalConfiguration::appUserDataItemNames() {
+  static const std::vector<std::string> names{"Documents", "Library", "tmp", "Purchases"};
+  return names;
+}
+
+bool QRTGlobalConfiguration::migrationFileExistsWithName(const std::string& name) {
+  // Only a plain name can lie directly in the library directory.
+  if (name.empty() || name == "." || name == ".." || name.find('/') != std::string::npos ||
+      name.find('\0') != std::string::npos)
+    return false;
+  return QRTFileManager::defaultManager().itemExistsAtURL(libraryDirectory().URLByAppendingPathComponent(name));
 }

@@ -1,12 +1,20 @@
-// The paths of the daemon that do not depend on a user, and the current
-// mobile user. Getters create their directory on every call, so a directory
-// removed from under the daemon comes back at its next use.
+// The paths of the container store that do not depend on a user, the class
+// directories, and the current mobile user. Getters create their directory on
+// every call, so a directory removed from under the daemon comes back at its
+// next use.
 #pragma once
 
 #include <cstdint>
+#include <map>
+#include <memory>
 #include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
 
 #include "base/QRTURL.h"
+
+class QRTPerUserConfiguration;
 
 class QRTGlobalConfiguration {
  public:
@@ -14,16 +22,60 @@ class QRTGlobalConfiguration {
 
   // "/private/var/root/" under the device root.
   const QRTURL& homeDirectory() const { return homeDirectory_; }
+  // "/private/var/emplacerd/" under the device root.
   const QRTURL& emplacerdHomeDirectory() const { return emplacerdHomeDirectory_; }
-  // home + "Library/Logs/QuarterKit", created (protection class 4).
-  QRTURL logDirectory();
   uint32_t currentMobileUserId() const { return currentMobileUserId_; }
+
+  QRTURL sharedContainersDirectory();
+  QRTURL bundleDirectory();
+  // Not cached: computed on every call.
+  QRTURL logDirectory();
+  QRTURL cachesDirectory();
+  QRTURL libraryDirectory();
+  QRTURL transientDirectory();
+  QRTURL stagingDirectory();
+  QRTURL deathrowDirectory();
+  QRTURL replaceDirectory();
+  QRTURL pendingUpdatesDirectory();
+  QRTURL transientBundleDirectory();
+
+  // The class directory of a global class, not itself created; nothing for
+  // any other class.
+  std::optional<QRTURL> globalContainerBaseURLWithContentClass(uint64_t contentClass, bool transient);
+  // The class directory, created; nothing for an invalid class or a per-user
+  // class of a user without an account.
+  std::optional<QRTURL> containerDirectoryURLForUser(uint32_t userId, uint64_t contentClass, bool transient);
+
+  // Never null. Users without an account are not kept, so that made-up user
+  // ids cannot grow the map and an account added later is found.
+  std::shared_ptr<QRTPerUserConfiguration> getPerUserConfigurationForUserId(uint32_t userId);
+  std::shared_ptr<QRTPerUserConfiguration> getPerUserConfigurationForCurrentMobileUser();
+
+  // The top-level items of an application data container.
+  static const std::vector<std::string>& appUserDataItemNames();
+  // Whether an item of that name lies directly in libraryDirectory.
+  bool migrationFileExistsWithName(const std::string& name);
 
  private:
   QRTGlobalConfiguration();
+
+  // Computes the URL into slot on first use, then creates the directory.
+  QRTURL cachedDirectory(std::optional<QRTURL>& slot, const char* getter, QRTURL (*compute)(QRTGlobalConfiguration&),
+                         int32_t protectionClass, const char* failureMessage);
 
   std::recursive_mutex lock_;
   QRTURL homeDirectory_;
   QRTURL emplacerdHomeDirectory_;
   uint32_t currentMobileUserId_ = 0;
+  std::map<uint32_t, std::shared_ptr<QRTPerUserConfiguration>> perUserConfigurations_;
+
+  std::optional<QRTURL> sharedContainersDirectory_;
+  std::optional<QRTURL> cachesDirectory_;
+  std::optional<QRTURL> libraryDirectory_;
+  std::optional<QRTURL> stagingDirectory_;
+  std::optional<QRTURL> deathrowDirectory_;
+  std::optional<QRTURL> replaceDirectory_;
+  std::optional<QRTURL> pendingUpdatesDirectory_;
+  std::optional<QRTURL> bundleDirectory_;
+  std::optional<QRTURL> transientDirectory_;
 };

@@ -1,5 +1,6 @@
 #include "Daemon/QRTRequestDispatcher.h"
 
+#include "Daemon/QRTContainerCommands.h"
 #include "Daemon/QRTContentClass.h"
 #include "Daemon/QRTError.h"
 #include "Daemon/QRTGlobalConfiguration.h"
@@ -27,8 +28,9 @@ void QRTHandleNotServed(const plist::Dictionary& request, const QRTReplyRef&, QR
 }  // namespace
 
 #define ROW(n, name, entitlement, flag) {n, name, QRTHandleNotServed, entitlement, flag}
+#define SERVED(n, name, handler, entitlement, flag) {n, name, handler, entitlement, flag}
 const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
-    ROW(0, "createOrLookupContainer", QRTEntitlementNone, 1),
+    SERVED(0, "createOrLookupContainer", QRTHandleCreateOrLookupContainer, QRTEntitlementNone, 1),
     ROW(1, "containersForUser", QRTEntitlementAllowed, 1),
     ROW(2, "replaceContainer", QRTEntitlementAllowed, 1),
     ROW(3, "stageContainerForDelete", QRTEntitlementAllowed, 1),
@@ -43,7 +45,7 @@ const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
     ROW(12, "deleteDataContainerContent", QRTEntitlementAllowed, 1),
     ROW(13, "groupContainerPaths", QRTEntitlementNone, 1),
     ROW(14, "groupContainerIdentifiers", QRTEntitlementAllowed, 1),
-    ROW(15, "systemContainerPath", QRTEntitlementNone, 1),
+    SERVED(15, "systemContainerPath", QRTHandleSystemContainerPath, QRTEntitlementNone, 1),
     ROW(16, "systemGroupContainerPaths", QRTEntitlementNone, 1),
     ROW(17, "systemGroupContainerPath", QRTEntitlementNone, 1),
     ROW(18, "processCodeSigningInfo", QRTEntitlementAllowed, 1),
@@ -60,6 +62,7 @@ const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
     ROW(29, "deleteUserManagedAsset", QRTEntitlementUserManagedAssets, 1),
 };
 #undef ROW
+#undef SERVED
 
 void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::RequestEvent& event) {
   if (!event.message) {

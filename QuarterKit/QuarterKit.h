@@ -30,6 +30,9 @@ class Connection {
   // send() and wait; nothing on close or timeout.
   std::optional<plist::Dictionary> call(const plist::Dictionary& request,
                                         std::chrono::milliseconds timeout = std::chrono::seconds(60));
+  // How long the typed calls of Requests.h wait for a reply (default 60 s).
+  void setReplyTimeout(std::chrono::milliseconds timeout);
+  std::chrono::milliseconds replyTimeout() const;
   // Arbitrary bytes on the socket (tests of the daemon's framing).
   bool sendRaw(const void* bytes, size_t length);
   // Whether the daemon has closed the connection.

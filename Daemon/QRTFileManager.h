@@ -1,0 +1,140 @@
+// The one door through which the daemon changes the file system. Each operation
+// has a single meaning (already there, already gone count as success), reports
+// failures as POSIX-domain errors with fixed messages and never follows
+// symbolic links inside the trees it walks.
+#pragma once
+
+#include <sys/stat.h>
+#include <sys/types.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "Daemon/QRTError.h"
+#include "base/PlistValue.h"
+#include "base/QRTURL.h"
+
+// One entry of _traverseDirectory. Valid only during the visitor's call.
+struct QRTTraversalEntry {
+  enum class Kind { DirectoryPre, DirectoryPost, File, Symlink, Other };
+  const char* path = nullptr;
+  int level = 0;  // 0 for the root
+  Kind kind = Kind::Other;
+  struct stat st {};
+  int error = 0;  // errno of a directory that could not be read (kind Other)
+  // Set by the visitor on a DirectoryPre entry to pass over its contents.
+  bool skipDescendants = false;
+};
+
+// Returns false to stop the walk, after storing an error in the slot if it has one.
+using QRTTraversalVisitor = std::function<bool(QRTTraversalEntry& entry, QRTErrorRef* error)>;
+
+class QRTFileManager {
+ public:
+  static QRTFileManager& defaultManager();
+
+  bool removeItemAtURL(const QRTURL& url, QRTErrorRef* error);
+
+  // owner 0 leaves the owner alone, protectionClass -1 the class. Of the two
+  // overloads that take only one of them, an int argument picks the class
+  // form and a uint32_t the owner form.
+  bool createDirectoryAtURL(const QRTURL& url, bool withIntermediateDirectories, mode_t mode, uint32_t owner,
+                            int32_t protectionClass, QRTErrorRef* error);
+  bool createDirectoryAtURL(const QRTURL& url, bool withIntermediateDirectories, mode_t mode, uint32_t owner,
+                            QRTErrorRef* error);
+  bool createDirectoryAtURL(const QRTURL& url, bool withIntermediateDirectories, mode_t mode,
+                            int32_t protectionClass, QRTErrorRef* error);
+  bool createDirectoryAtURL(const QRTURL& url, bool withIntermediateDirectories, mode_t mode, QRTErrorRef* error);
+
+  bool _copyItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing, QRTErrorRef* error);
+  bool copyItemAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
+  bool copyItemIfExistsAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
+
+  bool _moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing, QRTErrorRef* error);
+  bool moveItemAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
+  bool moveItemIfExistsAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
+
+  std::optional<QRTURL> createTemporaryDirectoryInDirectoryURL(const QRTURL& parent, std::string_view withNamePrefix,
+                                                               QRTErrorRef* error);
+  std::optional<QRTURL> createTemporaryDirectoryInDirectoryURL(const QRTURL& parent, QRTErrorRef* error);
+
+  // Physical walk on the root's device; directories are seen before and after
+  // their contents.
+  bool _traverseDirectory(const QRTURL& root, QRTErrorRef* error, const QRTTraversalVisitor& withBlock);
+
+  // Items of the directory in directory order, hidden names left out.
+  std::optional<std::vector<QRTURL>> urlsForItemsInDirectoryAtURL(const QRTURL& url, QRTErrorRef* error);
+
+  // Both answer false when the question cannot be settled.
+  bool itemExistsAtURL(const QRTURL& url);
+  bool itemDoesNotExistAtURL(const QRTURL& url);
+
+  // ---- ACLs and ownership of system containers (QRTFileManagerACL.cpp) ----
+  // Access lists grant the group "systemusers" its rights; the inherited
+  // list, which directories carry, is what new items inside receive.
+  struct SystemContainerACL;
+  struct SystemContainerACLDeleter {
+    void operator()(SystemContainerACL* acl) const;
+  };
+  using SystemContainerACLPtr = std::unique_ptr<SystemContainerACL, SystemContainerACLDeleter>;
+
+  // Adds the group's entry with the given rights (ACL_READ, ACL_WRITE,
+  // ACL_EXECUTE) to the lists the inheritance flags pick. Error 63.
+  bool _CreateSystemUserACEInACL(SystemContainerACL* acl, uint32_t withPermissions, uint32_t andFlags,
+                                 QRTErrorRef* withError);
+  SystemContainerACLPtr _CopySystemContainerACLWithNumACEs(int numACEs, bool isDir, bool inheritOnly,
+                                                           QRTErrorRef* withError);
+  SystemContainerACLPtr _CopyTopLevelSystemContainerACLWithError(QRTErrorRef* error);
+  // The top directory keeps its owner and mode bits; error 63.
+  bool setTopLevelSystemContainerACLAtURL(const QRTURL& url, QRTErrorRef* error);
+  // Stamps the tree; single entries that cannot be changed are only logged.
+  bool standardizeACLsAtURL(const QRTURL& url, bool isSystemContainer, QRTErrorRef* error);
+  bool standardizeACLsForSystemContainerAtURL(const QRTURL& url, QRTErrorRef* error);
+  // Every container directory of a system class directory.
+  bool standardizeAllSystemContainerACLsAtURL(const QRTURL& url, QRTErrorRef* error);
+  // Owner and group as given, mode 0755 or 0644; symbolic links are changed
+  // themselves, never their targets.
+  bool standardizeOwnershipAtURL(const QRTURL& url, uid_t toUID, gid_t GID, QRTErrorRef* error);
+
+ private:
+  QRTFileManager() = default;
+};
+
+enum QRTWriteOptions : uint32_t {
+  QRTWriteOptionsNone = 0,
+  // Temporary file in the same directory, flushed, renamed into place, the
+  // directory flushed.
+  QRTWriteAtomic = 1u << 0,
+  // The written file carries no protection class.
+  QRTWriteFileProtectionNone = 1u << 1,
+};
+constexpr QRTWriteOptions operator|(QRTWriteOptions a, QRTWriteOptions b) {
+  return static_cast<QRTWriteOptions>(static_cast<uint32_t>(a) | static_cast<uint32_t>(b));
+}
+
+// Writes the dictionary as a binary property list.
+bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTWriteOptions withOptions,
+                    QRTErrorRef* error);
+// Reads a property list of any supported format whose top level is a
+// dictionary. Unparsable bytes fail in QRTCocoaErrorDomain with 3840, another
+// top-level type with 2048, a read failure with a POSIX error.
+std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& url, QRTErrorRef* error);
+
+inline constexpr int32_t QRTPropertyListReadCorruptError = 3840;
+inline constexpr int32_t QRTFormattingError = 2048;
+
+// True when a component of the path is exactly "..".
+bool containsDotDotPathComponents(std::string_view path);
+std::string stringWithFileSystemRepresentation(const char* bytes, size_t length);
+std::string stringWithFileSystemRepresentation(const char* bytes);
+
+// Protection class of an open file (an item without the attribute has class
+// 0). Both return 0 or an errno value; while the device is locked, setting
+// fails with EPERM when the current or the new class is 1.
+int QRTGetProtectionClass(int fd, int32_t* cls);
+int QRTSetProtectionClass(int fd, int32_t cls);

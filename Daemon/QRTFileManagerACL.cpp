@@ -1,0 +1,443 @@
+// System-container rights as POSIX ACLs: every item carries an access list with
+// empty owner, group and other entries, a "systemusers" group entry with full
+// rights and a mask that leaves it whole; directories add a default list with
+// the same entries so that new items inherit them.
+
+#include <acl/libacl.h>
+#include <fcntl.h>
+#include <linux/openat2.h>
+#include <sys/acl.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <memory>
+#include <string>
+#include <type_traits>
+#include <utility>
+
+#include "Daemon/QRTFileManager.h"
+#include "platform/Log.h"
+#include "platform/UserDatabase.h"
+
+using platform::kLogError;
+using platform::kLogNotice;
+
+namespace {
+
+struct AclFree {
+  void operator()(void* acl) const { acl_free(acl); }
+};
+using UniqueAcl = std::unique_ptr<std::remove_pointer_t<acl_t>, AclFree>;
+
+// libacl may move a list when it grows (acl_create_entry, acl_calc_mask take
+// acl_t*): the owner gets whatever the calls left behind.
+struct ListSlot {
+  explicit ListSlot(UniqueAcl& list) : owner(list), raw(list.release()) {}
+  ~ListSlot() { owner.reset(raw); }
+  ListSlot(const ListSlot&) = delete;
+  ListSlot& operator=(const ListSlot&) = delete;
+  UniqueAcl& owner;
+  acl_t raw;
+};
+
+}  // namespace
+
+struct QRTFileManager::SystemContainerACL {
+  UniqueAcl access;
+  // The default list; only directories have one.
+  UniqueAcl inherited;
+};
+
+void QRTFileManager::SystemContainerACLDeleter::operator()(SystemContainerACL* acl) const { delete acl; }
+
+namespace {
+
+constexpr const char* kSystemUsersGroupName = "systemusers";
+constexpr const char* kMetadataFileName = ".com.norvane.quarter_kit.metadata.plist";
+constexpr uid_t kNobodyId = static_cast<uid_t>(-2);
+
+constexpr uint32_t kAllPermissions = ACL_READ | ACL_WRITE | ACL_EXECUTE;
+constexpr uint32_t kFullDirectoryPermissions = kAllPermissions;
+constexpr uint32_t kFullFilePermissions = kAllPermissions;
+// Write and search: the group may add items to the top directory, nothing more.
+constexpr uint32_t kTopLevelPermissions = ACL_WRITE | ACL_EXECUTE;
+
+// File or directory inheritance puts an entry into the default list;
+// inherit-only keeps it out of the item's own list.
+enum : uint32_t {
+  kFlagInherited = 0x10,
+  kFlagFileInherit = 0x20,
+  kFlagDirectoryInherit = 0x40,
+  kFlagInheritOnly = 0x100,
+};
+constexpr uint32_t kAllFlags = kFlagInherited | kFlagFileInherit | kFlagDirectoryInherit | kFlagInheritOnly;
+constexpr uint32_t kDirectoryFlags = kFlagFileInherit | kFlagDirectoryInherit;
+constexpr uint32_t kDirectoryInheritOnlyFlags = kDirectoryFlags | kFlagInheritOnly;
+constexpr uint32_t kFileFlags = kFlagInherited;
+constexpr uint32_t kNoFlags = 0;
+
+// Owner, group and other entries.
+constexpr int kBaseEntryCount = 3;
+
+const char* errorText(int err) { return strerror(err); }
+
+// Error 63; the message ends with the text of err, taken before anything
+// else can touch errno.
+template <typename... Args>
+QRTErrorRef aclError(const char* function, int line, int err, const char* format, const Args&... args) {
+  return QRTCreateError(function, line, QRTErrorDomain, QRTErrorACLFailed, nullptr, nullptr, false, format, args...,
+                        errorText(err));
+}
+#define QRT_ACL_ERROR(err, ...) aclError(__func__, __LINE__, (err), __VA_ARGS__)
+
+bool setPermissions(acl_entry_t entry, uint32_t permissions, QRTErrorRef* error) {
+  acl_permset_t permset;
+  if (acl_get_permset(entry, &permset) != 0) {
+    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_get_permset() failed: %s"));
+    return false;
+  }
+  acl_clear_perms(permset);
+  for (acl_perm_t perm : {ACL_READ, ACL_WRITE, ACL_EXECUTE}) {
+    if ((permissions & perm) && acl_add_perm(permset, perm) != 0) {
+      QRTSetError(error, QRT_ACL_ERROR(errno, "acl_add_perm() failed to set perms %x: %s", permissions));
+      return false;
+    }
+  }
+  if (acl_set_permset(entry, permset) != 0) {
+    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_set_permset() failed: %s"));
+    return false;
+  }
+  return true;
+}
+
+bool createEntry(acl_t* list, acl_tag_t tag, acl_entry_t* entry, QRTErrorRef* error) {
+  if (acl_create_entry(list, entry) != 0) {
+    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_create_entry() failed: %s"));
+    return false;
+  }
+  if (acl_set_tag_type(*entry, tag) != 0) {
+    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_set_tag_type() failed: %s"));
+    return false;
+  }
+  return true;
+}
+
+// A list with owner, group and other entries that grant nothing.
+UniqueAcl newList(int numACEs, QRTErrorRef* error) {
+  UniqueAcl list(acl_init(numACEs + kBaseEntryCount));
+  if (!list) {
+    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_init() failed: %s"));
+    return nullptr;
+  }
+  for (acl_tag_t tag : {ACL_USER_OBJ, ACL_GROUP_OBJ, ACL_OTHER}) {
+    ListSlot slot(list);
+    acl_entry_t entry;
+    if (!createEntry(&slot.raw, tag, &entry, error)) return nullptr;
+  }
+  return list;
+}
+
+bool addGroupEntry(UniqueAcl& list, gid_t gid, uint32_t permissions, QRTErrorRef* error) {
+  ListSlot slot(list);
+  acl_entry_t entry;
+  if (!createEntry(&slot.raw, ACL_GROUP, &entry, error)) return false;
+  if (permissions != 0 && !setPermissions(entry, permissions, error)) return false;
+  if (acl_set_qualifier(entry, &gid) != 0) {
+    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_set_qualifier() failed: %s"));
+    return false;
+  }
+  // The mask must not cut the group's entry down.
+  if (acl_calc_mask(&slot.raw) != 0) {
+    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_calc_mask() failed: %s"));
+    return false;
+  }
+  return true;
+}
+
+// Gives the owner, group and other entries the item's own mode bits (the top
+// directory keeps its mode), and widens the mask to cover them.
+int adoptModeBits(UniqueAcl& list, mode_t mode) {
+  ListSlot slot(list);
+  acl_entry_t entry;
+  for (int which = ACL_FIRST_ENTRY; acl_get_entry(slot.raw, which, &entry) == 1; which = ACL_NEXT_ENTRY) {
+    acl_tag_t tag;
+    if (acl_get_tag_type(entry, &tag) != 0) return errno;
+    int shift = tag == ACL_USER_OBJ ? 6 : tag == ACL_GROUP_OBJ ? 3 : tag == ACL_OTHER ? 0 : -1;
+    if (shift < 0) continue;
+    if (!setPermissions(entry, (mode >> shift) & kAllPermissions, nullptr)) return errno;
+  }
+  return acl_calc_mask(&slot.raw) == 0 ? 0 : errno;
+}
+
+// An O_PATH handle on one item.
+class ItemHandle {
+ public:
+  explicit ItemHandle(int fd = -1) : fd_(fd) {}
+  ItemHandle(ItemHandle&& o) noexcept : fd_(std::exchange(o.fd_, -1)) {}
+  ItemHandle(const ItemHandle&) = delete;
+  ItemHandle& operator=(const ItemHandle&) = delete;
+  ~ItemHandle() {
+    if (fd_ >= 0) close(fd_);
+  }
+  bool valid() const { return fd_ >= 0; }
+  int fd() const { return fd_; }
+  // Path-based calls (ACLs, chmod) reach the item itself through it.
+  std::string procPath() const { return "/proc/self/fd/" + std::to_string(fd_); }
+
+ private:
+  int fd_;
+};
+
+// Opens the items of a walk without following a symbolic link at any
+// component below the root, so that an entry swapped for a link during the
+// walk cannot redirect a change to something outside the tree.
+class TreeItems {
+ public:
+  explicit TreeItems(const QRTURL& root)
+      : rootPath_(root.path()), rootFd_(open(rootPath_.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC)),
+        rootError_(rootFd_.valid() ? 0 : errno) {}
+
+  // The root item itself (a link at the root is the link, not its target).
+  ItemHandle openRoot() const { return ItemHandle(open(rootPath_.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC)); }
+
+  // On failure the handle is invalid and errno tells why.
+  ItemHandle openEntry(const QRTTraversalEntry& entry) const {
+    if (entry.level == 0) return openRoot();
+    if (!rootFd_.valid()) {
+      errno = rootError_;
+      return ItemHandle();
+    }
+    const char* relative = relativePath(entry.path);
+    if (!relative) {
+      errno = EINVAL;
+      return ItemHandle();
+    }
+    struct open_how how {};
+    how.flags = O_PATH | O_NOFOLLOW | O_CLOEXEC;
+    how.resolve = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS;
+    long fd = syscall(SYS_openat2, rootFd_.fd(), relative, &how, sizeof how);
+    // Kernels without openat2 still get a final component that is not followed.
+    if (fd < 0 && errno == ENOSYS) fd = openat(rootFd_.fd(), relative, O_PATH | O_NOFOLLOW | O_CLOEXEC);
+    return ItemHandle(static_cast<int>(fd));
+  }
+
+ private:
+  const char* relativePath(const char* path) const {
+    if (strncmp(path, rootPath_.c_str(), rootPath_.size()) != 0) return nullptr;
+    path += rootPath_.size();
+    while (*path == '/') ++path;
+    return *path ? path : nullptr;
+  }
+
+  std::string rootPath_;
+  ItemHandle rootFd_;
+  int rootError_;
+};
+
+// 0 or an errno value. keepModeOf, when given, supplies the owner, group and
+// other rights in place of the list's empty ones.
+int applyList(const ItemHandle& item, const QRTFileManager::SystemContainerACL& list,
+              const struct stat* keepModeOf) {
+  std::string path = item.procPath();
+  acl_t access = list.access.get();
+  UniqueAcl merged;
+  if (keepModeOf) {
+    merged.reset(acl_dup(access));
+    if (!merged) return errno;
+    if (int err = adoptModeBits(merged, keepModeOf->st_mode)) return err;
+    access = merged.get();
+  }
+  if (list.inherited && acl_set_file(path.c_str(), ACL_TYPE_DEFAULT, list.inherited.get()) != 0) return errno;
+  if (acl_set_file(path.c_str(), ACL_TYPE_ACCESS, access) != 0) return errno;
+  return 0;
+}
+
+bool isMetadataPath(const char* path) { return strstr(path, kMetadataFileName) != nullptr; }
+
+struct StampLists {
+  QRTFileManager::SystemContainerACLPtr topLevel, directory, file;
+};
+
+// One entry of a stamping walk; failures are logged and the walk goes on.
+void stampItem(const TreeItems& items, const QRTTraversalEntry& entry, const StampLists& lists,
+               bool isContainerRoot) {
+  ItemHandle item = items.openEntry(entry);
+  struct stat st;
+  if (!item.valid() || fstat(item.fd(), &st) != 0) {
+    QRTLogAs(kLogError, "standardizeACLsAtURL", "Failed to set ACL on dir %s: %s", entry.path, errorText(errno));
+    return;
+  }
+  // Links carry no ACL, and their targets may lie outside the tree.
+  if (S_ISLNK(st.st_mode)) return;
+  bool isDirectory = S_ISDIR(st.st_mode);
+  std::string path = item.procPath();
+  // chmod rewrites an access ACL, so the mode goes before the list is set.
+  if (!isContainerRoot && chmod(path.c_str(), 0) != 0)
+    QRTLogAs(kLogError, "standardizeACLsAtURL", "Could not chmod %s: %s", entry.path, errorText(errno));
+  const auto& list = isDirectory ? (isContainerRoot ? lists.topLevel : lists.directory) : lists.file;
+  if (int err = applyList(item, *list, isContainerRoot ? &st : nullptr)) {
+    if (isDirectory && isContainerRoot)
+      QRTLogAs(kLogError, "standardizeACLsAtURL", "Failed to set top level ACL on dir %s: %s", entry.path,
+               errorText(err));
+    else
+      QRTLogAs(kLogError, "standardizeACLsAtURL", "Failed to set ACL on dir %s: %s", entry.path, errorText(err));
+  }
+  if (!isContainerRoot && fchownat(item.fd(), "", kNobodyId, kNobodyId, AT_EMPTY_PATH) != 0)
+    QRTLogAs(kLogError, "standardizeACLsAtURL", "Could not chown %s: %s", entry.path, errorText(errno));
+}
+
+mode_t ownershipMode(mode_t mode) {
+  return S_ISDIR(mode) || (mode & (S_IXUSR | S_IXGRP | S_IXOTH)) ? 0755 : 0644;
+}
+
+// Sets owner and mode of one item; changeOwner decides whether chown runs.
+void resetOwnership(const ItemHandle& item, const struct stat& st, bool changeOwner, uid_t uid, gid_t gid,
+                    const char* displayPath) {
+  if (changeOwner && fchownat(item.fd(), "", uid, gid, AT_EMPTY_PATH) != 0)
+    QRTLogAs(kLogError, "standardizeOwnershipAtURL", "Could not chown %s: %s", displayPath, errorText(errno));
+  // A link's own mode means nothing on Linux and cannot be changed.
+  if (S_ISLNK(st.st_mode)) return;
+  std::string path = item.procPath();
+  if (chmod(path.c_str(), ownershipMode(st.st_mode)) != 0)
+    QRTLogAs(kLogError, "standardizeOwnershipAtURL", "Could not chmod %s: %s", displayPath, errorText(errno));
+}
+
+}  // namespace
+
+bool QRTFileManager::_CreateSystemUserACEInACL(SystemContainerACL* acl, uint32_t withPermissions,
+                                               uint32_t andFlags, QRTErrorRef* withError) {
+  if (!acl || !acl->access) {
+    QRTSetError(withError, QRT_ACL_ERROR(EINVAL, "acl_create_entry() failed: %s"));
+    return false;
+  }
+  if (withPermissions & ~kAllPermissions) {
+    QRTSetError(withError, QRT_ACL_ERROR(EINVAL, "acl_add_perm() failed to set perms %x: %s", withPermissions));
+    return false;
+  }
+  if (andFlags & ~kAllFlags) {
+    QRTSetError(withError, QRT_ACL_ERROR(EINVAL, "acl_add_flag_np() failed to set flags %x: %s", andFlags));
+    return false;
+  }
+  std::optional<platform::GroupAccount> group = platform::groupByName(kSystemUsersGroupName);
+  if (!group) {
+    QRTSetError(withError, QRT_ACL_ERROR(ENOENT, "resolve_group_guid() failed: %s"));
+    return false;
+  }
+  if (!(andFlags & kFlagInheritOnly) && !addGroupEntry(acl->access, group->gid, withPermissions, withError))
+    return false;
+  if (andFlags & (kFlagFileInherit | kFlagDirectoryInherit)) {
+    if (!acl->inherited && !(acl->inherited = newList(1, withError))) return false;
+    if (!addGroupEntry(acl->inherited, group->gid, withPermissions, withError)) return false;
+  }
+  return true;
+}
+
+QRTFileManager::SystemContainerACLPtr QRTFileManager::_CopySystemContainerACLWithNumACEs(int numACEs, bool isDir,
+                                                                                        bool inheritOnly,
+                                                                                        QRTErrorRef* withError) {
+  SystemContainerACLPtr list(new SystemContainerACL);
+  list->access = newList(numACEs, withError);
+  if (!list->access) return nullptr;
+  uint32_t permissions = isDir ? kFullDirectoryPermissions : kFullFilePermissions;
+  uint32_t flags = !isDir ? kFileFlags : inheritOnly ? kDirectoryInheritOnlyFlags : kDirectoryFlags;
+  if (!_CreateSystemUserACEInACL(list.get(), permissions, flags, withError)) return nullptr;
+  return list;
+}
+
+QRTFileManager::SystemContainerACLPtr QRTFileManager::_CopyTopLevelSystemContainerACLWithError(QRTErrorRef* error) {
+  SystemContainerACLPtr list = _CopySystemContainerACLWithNumACEs(2, true, true, error);
+  if (!list || !_CreateSystemUserACEInACL(list.get(), kTopLevelPermissions, kNoFlags, error)) return nullptr;
+  return list;
+}
+
+bool QRTFileManager::setTopLevelSystemContainerACLAtURL(const QRTURL& url, QRTErrorRef* error) {
+  QRTErrorRef listError;
+  SystemContainerACLPtr list = _CopyTopLevelSystemContainerACLWithError(&listError);
+  int err = 0;
+  if (!list) {
+    err = EINVAL;
+  } else {
+    ItemHandle item(open(url.fileSystemRepresentation(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    struct stat st;
+    if (!item.valid() || fstat(item.fd(), &st) != 0)
+      err = errno;
+    else if (S_ISLNK(st.st_mode))
+      err = ELOOP;
+    else
+      err = applyList(item, *list, &st);
+  }
+  if (err == 0) return true;
+  QRTSetError(error, QRT_ERROR(QRTErrorACLFailed, listError, false, "Failed to set ACL on %@: %s", url,
+                               errorText(err)));
+  return false;
+}
+
+bool QRTFileManager::standardizeACLsAtURL(const QRTURL& url, bool isSystemContainer, QRTErrorRef* error) {
+  StampLists lists;
+  if (!(lists.topLevel = _CopyTopLevelSystemContainerACLWithError(error)) ||
+      !(lists.directory = _CopySystemContainerACLWithNumACEs(1, true, false, error)) ||
+      !(lists.file = _CopySystemContainerACLWithNumACEs(1, false, false, error)))
+    return false;
+  TreeItems items(url);
+  return _traverseDirectory(url, error, [&](QRTTraversalEntry& entry, QRTErrorRef*) {
+    if (entry.kind != QRTTraversalEntry::Kind::DirectoryPost && !isMetadataPath(entry.path))
+      stampItem(items, entry, lists, isSystemContainer && entry.level == 0);
+    return true;
+  });
+}
+
+bool QRTFileManager::standardizeACLsForSystemContainerAtURL(const QRTURL& url, QRTErrorRef* error) {
+  return standardizeACLsAtURL(url, true, error);
+}
+
+bool QRTFileManager::standardizeAllSystemContainerACLsAtURL(const QRTURL& url, QRTErrorRef* error) {
+  QRTErrorRef listError;
+  std::optional<std::vector<QRTURL>> containers = urlsForItemsInDirectoryAtURL(url, &listError);
+  if (!containers) {
+    if (listError && listError->domain() == QRTPOSIXErrorDomain && listError->code() == ENOENT) return true;
+    QRTLog(kLogError, "Failed to get items at URL%@ : %@", url, listError);
+    QRTSetError(error, listError);
+    return false;
+  }
+  if (containers->empty()) return true;
+  plist::Array paths;
+  for (const QRTURL& container : *containers) paths.emplace_back(container.path());
+  QRTLog(kLogNotice, "Potential containers requiring ACL migration: %@", plist::Value(std::move(paths)));
+  bool ok = true;
+  for (const QRTURL& container : *containers) {
+    QRTErrorRef containerError;
+    if (standardizeACLsForSystemContainerAtURL(container, &containerError)) continue;
+    QRTLog(kLogError, "Failed to set system container ACL at %@: %@", container, containerError);
+    QRTSetError(error, containerError);
+    ok = false;
+  }
+  return ok;
+}
+
+bool QRTFileManager::standardizeOwnershipAtURL(const QRTURL& url, uid_t toUID, gid_t GID, QRTErrorRef* error) {
+  TreeItems items(url);
+  bool walked = _traverseDirectory(url, error, [&](QRTTraversalEntry& entry, QRTErrorRef*) {
+    if (entry.kind == QRTTraversalEntry::Kind::DirectoryPost || isMetadataPath(entry.path)) return true;
+    ItemHandle item = items.openEntry(entry);
+    struct stat st;
+    if (!item.valid() || fstat(item.fd(), &st) != 0) {
+      QRTLogAs(kLogError, "standardizeOwnershipAtURL", "Could not chown %s: %s", entry.path, errorText(errno));
+      return true;
+    }
+    resetOwnership(item, st, st.st_uid != toUID || st.st_gid != GID, toUID, GID, entry.path);
+    return true;
+  });
+  // The root once more, in case the walk could not reach it.
+  ItemHandle root = items.openRoot();
+  struct stat st;
+  if (!root.valid() || fstat(root.fd(), &st) != 0) {
+    int err = errno;
+    QRTSetError(error, QRT_POSIX_ERROR(err, "Could not stat %s: %s", url.fileSystemRepresentation(), errorText(err)));
+    return false;
+  }
+  resetOwnership(root, st, st.st_uid != toUID, toUID, GID, url.fileSystemRepresentation());
+  return walked;
+}

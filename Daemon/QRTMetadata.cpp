@@ -1,0 +1,115 @@
+#include "Daemon/QRTMetadata.h"
+
+#include "Daemon/QRTContentClass.h"
+#include "Daemon/QRTFileManager.h"
+
+namespace {
+
+// The value found under a key as a message shows it; "(null)" when missing.
+std::string describeValue(const plist::Value* value) { return value ? plist::describe(*value) : "(null)"; }
+
+// The directory in which a container of the class must lie, derived from the
+// container's own path: the store root three levels up plus the class's path name.
+QRTURL expectedClassDirectory(const QRTURL& containerURL, uint64_t containerClass) {
+  QRTURL storeRoot = containerURL.URLByDeletingLastPathComponent()
+                         .URLByDeletingLastPathComponent()
+                         .URLByDeletingLastPathComponent();
+  return storeRoot.URLByAppendingPathComponent(QRTContentClassPathName(containerClass), true);
+}
+
+}  // namespace
+
+QRTMetadata::QRTMetadata(uint32_t uid, QRTUUID uuid, uint64_t containerClass, std::string identifier,
+                         std::optional<plist::Dictionary> info, QRTURL url,
+                         std::optional<std::string> userManagedAssetsDirName)
+    : uid_(uid), identifier_(std::move(identifier)), uuid_(uuid), url_(std::move(url)),
+      userManagedAssetsDirName_(std::move(userManagedAssetsDirName)), info_(std::move(info)),
+      containerClass_(containerClass) {}
+
+bool QRTMetadata::writeMetadataToDiskWithError(QRTErrorRef* error) const {
+  plist::Dictionary dictionary;
+  if (info_) dictionary[QRTMetadataInfoKey] = *info_;
+  dictionary[QRTMetadataContentClassKey] = plist::Value(containerClass_);
+  dictionary[QRTMetadataPersonaKey] = plist::Value(uid_);
+  dictionary[QRTMetadataIdentifierKey] = identifier_;
+  dictionary[QRTMetadataUUIDKey] = uuid_.UUIDString();
+  if (userManagedAssetsDirName_) dictionary[QRTMetadataUserManagedAssetsDirNameKey] = *userManagedAssetsDirName_;
+
+  QRTErrorRef writeError;
+  if (!QRT_writeToURL(dictionary, url_.URLByAppendingPathComponent(QRTMetadataFileName),
+                      QRTWriteAtomic | QRTWriteFileProtectionNone, &writeError)) {
+    QRTSetError(error, QRT_ERROR(QRTErrorWriteFailed, writeError, true,
+                                 "Failed to write metadata dictionary to URL %@", url_));
+    return false;
+  }
+  return true;
+}
+
+#define QRT_INVALID_METADATA(...)                                                          \
+  do {                                                                                     \
+    QRTSetError(error, QRT_ERROR(QRTErrorInvalidMetadata, nullptr, true, __VA_ARGS__)); \
+    return nullptr;                                                                        \
+  } while (0)
+
+std::shared_ptr<QRTMetadata> QRTMetadata::readAndValidateMetadataAtUrl(const QRTURL& url, uint32_t forUser,
+                                                                       bool checkClassPath, QRTErrorRef* error) {
+  QRTErrorRef readError;
+  std::optional<plist::Dictionary> dictionary =
+      QRT_dictionaryWithContentsOfURL(url.URLByAppendingPathComponent(QRTMetadataFileName), &readError);
+  if (!dictionary) {
+    QRTSetError(error, QRT_ERROR(QRTErrorReadFailed, readError, true, "Failed to read metadata at URL %@", url));
+    return nullptr;
+  }
+
+  const plist::Value* identifier = plist::find(*dictionary, QRTMetadataIdentifierKey);
+  if (!identifier || !identifier->isString())
+    QRT_INVALID_METADATA("Invalid metadata Identifier: %@ at %@", describeValue(identifier), url);
+
+  const plist::Value* uuidString = plist::find(*dictionary, QRTMetadataUUIDKey);
+  if (!uuidString || !uuidString->isString())
+    QRT_INVALID_METADATA("Invalid metadata UUID String: %@ at %@", describeValue(uuidString), url);
+  std::optional<QRTUUID> uuid = QRTUUID::fromString(uuidString->string());
+  if (!uuid) QRT_INVALID_METADATA("Invalid metadata UUID: %@ at %@", uuid, url);
+
+  const plist::Value* classValue = plist::find(*dictionary, QRTMetadataContentClassKey);
+  if (!classValue || !classValue->isInteger())
+    QRT_INVALID_METADATA("Invalid metadata Class: %@ at %@", describeValue(classValue), url);
+  const uint64_t containerClass = classValue->integer().asUnsigned();
+  if (containerClass < QRTClassAppBundle || containerClass > QRTClassSystemGroup)
+    QRT_INVALID_METADATA("Invalid metadata Content Class: %ld at %@", static_cast<long>(containerClass), url);
+
+  // Older files carry no owner. Their owner defaults to the expected user
+  // (501 for a per-user class, 33 for a bundle class) or stays unknown; either
+  // way nothing is left to compare, so only a recorded owner is checked.
+  const plist::Value* persona = plist::find(*dictionary, QRTMetadataPersonaKey);
+  if (persona && (!persona->isInteger() || persona->integer().asUnsigned() != forUser))
+    QRT_INVALID_METADATA("Incorrect UserId: %@, expecting: %u for %@ at %@", describeValue(persona), forUser,
+                         identifier->string(), url);
+
+  const plist::Value* info = plist::find(*dictionary, QRTMetadataInfoKey);
+  if (info && !info->isDictionary()) QRT_INVALID_METADATA("Invalid metadata Info: %@ at %@", describeValue(info), url);
+
+  const plist::Value* assetsDirName = plist::find(*dictionary, QRTMetadataUserManagedAssetsDirNameKey);
+  if (assetsDirName && !assetsDirName->isString())
+    QRT_INVALID_METADATA("Invalid metadata User Managed Dir Name String: %@ at %@", describeValue(assetsDirName),
+                         url);
+
+  if (checkClassPath) {
+    QRTURL expected = expectedClassDirectory(url, containerClass);
+    if (expected.path() != url.URLByDeletingLastPathComponent().path())
+      QRT_INVALID_METADATA("Invalid metadata-URLs should match: %@ : %@", url, expected);
+  }
+
+  return std::make_shared<QRTMetadata>(
+      forUser, *uuid, containerClass, identifier->string(),
+      info ? std::optional<plist::Dictionary>(info->dictionary()) : std::nullopt, url,
+      assetsDirName ? std::optional<std::string>(assetsDirName->string()) : std::nullopt);
+}
+
+#undef QRT_INVALID_METADATA
+
+std::string QRTMetadata::description() const {
+  return QRTFormat("<QRTMetadata identifier: %@, class: %llu, uid: %u, uuid: %@, url: %@, transient: %d, existed: %d>",
+                   identifier_, static_cast<unsigned long long>(containerClass_), uid_, uuid_, url_, transient_,
+                   existed_);
+}

@@ -1,0 +1,125 @@
+// The container cache over a real class directory: building, look-ups,
+// vanished containers and the sandbox mappings it pushes.
+#include <gtest/gtest.h>
+#include <stdlib.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <sys/stat.h>
+
+#include <fstream>
+#include <stdexcept>
+
+#include "Daemon/QRTClientConnection.h"
+#include "Daemon/QRTContainerCache.h"
+#include "Daemon/QRTGlobalConfiguration.h"
+#include "platform/DeviceRoot.h"
+#include "platform/SandboxMappings.h"
+
+namespace {
+
+std::string gRoot;
+
+class ContainerCacheTest : public ::testing::Test {
+ protected:
+  static void SetUpTestSuite() {
+    char tmpl[] = "/tmp/qrt-cache.XXXXXX";
+    ASSERT_NE(mkdtemp(tmpl), nullptr);
+    gRoot = tmpl;
+    std::string script = std::string(QRT_TEST_SOURCE_DIR) + "/../scripts/make-device-root";
+    ASSERT_EQ(system((script + " " + gRoot).c_str()), 0);
+    std::ofstream(gRoot + "/etc/passwd", std::ios::app) << "other:x:502:502::/private/var/other:/bin/sh\n";
+    ASSERT_EQ(mkdir((gRoot + "/private/var/other").c_str(), 0755), 0);
+    platform::setDeviceRoot(gRoot);
+  }
+  static void TearDownTestSuite() { system(("rm -rf " + gRoot).c_str()); }
+
+  // A container written to disk behind the cache's back.
+  static QRTURL writeContainer(uint32_t user, uint64_t cls, const std::string& identifier, bool transient = false) {
+    auto dir = QRTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(user, cls, transient);
+    if (!dir) throw std::runtime_error("no class directory");
+    QRTURL url = dir->URLByAppendingPathComponent(QRTUUID::random().UUIDString(), true);
+    EXPECT_EQ(mkdir(url.fileSystemRepresentation(), 0755), 0);
+    QRTMetadata metadata(user, QRTUUID::random(), cls, identifier, std::nullopt, url, std::nullopt);
+    EXPECT_TRUE(metadata.writeMetadataToDiskWithError(nullptr));
+    return url;
+  }
+
+  QRTContainerCache& cache = QRTContainerCache::sharedInstance();
+};
+
+TEST_F(ContainerCacheTest, RejectsBadInputBeforeTouchingAnything) {
+  QRTErrorRef error;
+  EXPECT_FALSE(cache.containerForUser(501, 0, std::string("a"), false, &error));
+  EXPECT_EQ(error->code(), 47);
+  EXPECT_FALSE(cache.containerForUser(501, 14, std::string("a"), false, &error));
+  EXPECT_EQ(error->code(), 47);
+  EXPECT_FALSE(cache.containerForUser(501, 2, std::nullopt, false, &error));
+  EXPECT_EQ(error->code(), 47);
+  // A user that cannot own the class: the build refuses, the look-up says rebuild failed.
+  EXPECT_FALSE(cache.containerForUser(501, 1, std::string("a"), false, &error));
+  EXPECT_EQ(error->code(), 43);
+  ASSERT_TRUE(error->underlying());
+  EXPECT_EQ(error->underlying()->code(), 47);
+  EXPECT_TRUE(cache.removeContainerForUser(501, 2, std::string("never.there"), false, &error));
+}
+
+TEST_F(ContainerCacheTest, BuildsFromDiskAndForgetsVanishedContainers) {
+  QRTURL kept = writeContainer(502, 2, "com.example.kept");
+  QRTURL gone = writeContainer(502, 2, "com.example.gone");
+  QRTErrorRef error;
+  auto found = cache.containerForUser(502, 2, std::string("com.example.kept"), false, &error);
+  ASSERT_TRUE(found);
+  EXPECT_EQ(found->url(), kept);
+  EXPECT_EQ(found->uid(), 502u);
+  // Lower case never matches the UUID's text form.
+  std::string lower = found->uuid().UUIDString();
+  std::transform(lower.begin(), lower.end(), lower.begin(), ::tolower);
+  EXPECT_FALSE(cache.containerForUser(502, 2, std::string("com.example.kept"), lower));
+  EXPECT_EQ(cache.containerForUser(502, 2, std::string("com.example.kept"), found->uuid().UUIDString()), found);
+
+  // Written after the build: unknown until a restart.
+  writeContainer(502, 2, "com.example.late");
+  EXPECT_FALSE(cache.containerForUser(502, 2, std::string("com.example.late"), false, &error));
+  EXPECT_EQ(error->code(), 21);
+
+  ASSERT_EQ(system(("rm -rf " + gone.path()).c_str()), 0);
+  auto all = cache.allContainersForUser(502, 2, false, &error);
+  ASSERT_TRUE(all);
+  ASSERT_EQ(all->size(), 1u);
+  EXPECT_EQ((*all)[0]->identifier(), "com.example.kept");
+  EXPECT_FALSE(cache.containerForUser(502, 2, std::string("com.example.gone"), false, &error));
+  EXPECT_EQ(error->code(), 21);
+}
+
+TEST_F(ContainerCacheTest, SystemClassBuildPushesSandboxMappings) {
+  QRTURL live = writeContainer(499, 12, "com.example.daemon");
+  writeContainer(499, 12, "com.example.transient", true);
+  QRTErrorRef error;
+  ASSERT_TRUE(cache.allContainersForUser(499, 12, false, &error));
+  ASSERT_TRUE(cache.allContainersForUser(499, 12, true, &error));
+  EXPECT_EQ(platform::sandboxStateItem(0, 4, "com.example.daemon"), live.path());
+  EXPECT_EQ(platform::sandboxStateItem(0, 4, "com.example.transient"), std::nullopt);
+
+  auto metadata = cache.containerForUser(499, 12, std::string("com.example.daemon"), false, &error);
+  ASSERT_TRUE(metadata);
+  EXPECT_TRUE(cache.removeContainerForUser(499, 12, std::string("com.example.daemon"), false, &error));
+  EXPECT_EQ(platform::sandboxStateItem(0, 4, "com.example.daemon"), std::nullopt);
+  EXPECT_TRUE(cache.addContainerMetadata(metadata, 499, live, false, true, &error));
+  EXPECT_EQ(platform::sandboxStateItem(0, 4, "com.example.daemon"), live.path());
+}
+
+TEST_F(ContainerCacheTest, SandboxMappingItemTypeAndUserFollowTheClass) {
+  QRTURL url = QRTURL::fileURL("/somewhere/else", true);
+  EXPECT_TRUE(cache.setSandboxContainerMappingForUser(501, "com.example.group", 7, url));
+  EXPECT_EQ(platform::sandboxStateItem(501, 2, "com.example.group"), url.path());
+  EXPECT_TRUE(cache.setSandboxContainerMappingForUser(501, "systemgroup.x", 13, url));
+  EXPECT_EQ(platform::sandboxStateItem(0, 8, "systemgroup.x"), url.path());
+  EXPECT_TRUE(cache.setSandboxContainerMappingForUser(501, "com.example.group", 7, std::nullopt));
+  EXPECT_EQ(platform::sandboxStateItem(501, 2, "com.example.group"), std::nullopt);
+  EXPECT_TRUE(cache.setSandboxContainerMappingForUser(33, "com.example.bundle", 1, url));
+  EXPECT_FALSE(cache.setSandboxContainerMappingForUser(501, "x", 0, url));
+  EXPECT_FALSE(cache.setSandboxContainerMappingForUser(501, "x", 14, url));
+}
+
+}  // namespace
