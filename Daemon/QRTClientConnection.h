@@ -11,7 +11,9 @@
 #include <string>
 #include <vector>
 
+#include "base/PlistValue.h"
 #include "base/QRTURL.h"
+#include "base/QRTUUID.h"
 #include "Daemon/QRTError.h"
 
 class QRTMetadata;
@@ -45,6 +47,53 @@ class QRTClientConnection {
   // Queues a death-row pass; the completion gets its result code.
   void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
 
+  // Removal: staging moves containers to death row at once; the parallel
+  // arrays describe one container per index.
+  void stageForDeleteContainersWithUsers(const std::vector<uint32_t>& users,
+                                         const std::vector<std::optional<QRTUUID>>& UUIDs,
+                                         const std::vector<std::optional<std::string>>& identifiers,
+                                         const std::vector<std::optional<uint64_t>>& classes, bool useLocking,
+                                         uint64_t* withError);
+  void deleteContainerForUser(uint32_t userId, const std::optional<std::string>& withIdentifier,
+                              uint64_t containerClass, bool transient, uint64_t* withError);
+  void deleteDataContainerContentForUser(uint32_t userId, const std::optional<std::string>& identifier,
+                                         uint64_t containerClass, uint64_t* withError);
+
+  // Queries and info values of existing containers.
+  std::optional<std::vector<std::shared_ptr<QRTMetadata>>> containersForUser(uint32_t userId, uint64_t withClass,
+                                                                              bool transient, uint64_t* withError);
+  std::shared_ptr<QRTMetadata> metadataForUser(uint32_t userId, const std::optional<QRTUUID>& withUUID,
+                                               const std::optional<std::string>& identifier,
+                                               uint64_t containerClass, uint64_t* withError);
+  // A nil value removes the key.
+  void setInfoValue(const std::optional<plist::Value>& value, const std::optional<std::string>& forKey,
+                    uint32_t userId, const std::optional<QRTUUID>& uuid, const std::optional<std::string>& identifier,
+                    uint64_t containerClass, bool useLocking, uint64_t* withError);
+  std::optional<plist::Value> infoValueForKey(const std::optional<std::string>& key, uint32_t userId,
+                                              const std::optional<QRTUUID>& uuid,
+                                              const std::optional<std::string>& identifier, uint64_t containerClass,
+                                              bool useLocking, uint64_t* withError);
+  void recreateDefaultStructureForUser(uint32_t userId, const std::optional<QRTUUID>& withUUID,
+                                       const std::optional<std::string>& identifier, uint64_t containerClass,
+                                       uint64_t* withError);
+  void regenerateDirectoryUUIDForUser(uint32_t userId, const std::optional<QRTUUID>& withInternalUUID,
+                                      const std::optional<std::string>& identifier, uint64_t containerClass,
+                                      uint64_t* withError);
+  void _regenerateAllSystemContainerPaths();
+  uint64_t diskUsageForUserId(uint32_t userId, const std::optional<QRTUUID>& uuid,
+                              const std::optional<std::string>& identifier, uint64_t containerClass,
+                              uint64_t* withError);
+
+  // Puts the new container in the old one's place (or, with no old one,
+  // makes a transient container permanent), through a journal that start-up
+  // recovery completes or undoes.
+  void replaceContainer(const std::optional<QRTUUID>& replaceContainer, const std::optional<QRTUUID>& withContainer,
+                        uint32_t userIdOld, uint32_t userIdNew, const std::optional<std::string>& identifierOld,
+                        const std::optional<std::string>& identifierNew, uint64_t containerClassOld,
+                        uint64_t containerClassNew, bool preserveOldUUID, bool startDeletionThread,
+                        uint64_t* withError);
+  bool _recoverFromReplaceOperationsWithError(QRTErrorRef* error);
+
   // Start-up work of the container store, run through the internal client.
   void rebootQuarterSetup();
   void quarterSetup();
@@ -72,6 +121,16 @@ class QRTClientConnection {
   std::shared_ptr<QRTMetadata> _buildInStaging(const QRTURL& staging, uint32_t userId, const std::string& identifier,
                                                uint64_t containerClass, QRTErrorRef* error);
   uint64_t _runDeathRowPass();
+  // The replace journal: the four directories of one replace, keyed by the
+  // journal's key names.
+  bool _writeToDiskReplaceAt(const QRTURL& replaceURL, const QRTURL& old, const QRTURL& withNew,
+                             const QRTURL& usingStaging, const QRTURL& toDestination, QRTErrorRef* error);
+  std::optional<std::map<std::string, QRTURL>> _readAndValidateReplaceFileAtUrl(const QRTURL& url,
+                                                                                QRTErrorRef* error);
+  // The containers a directory-UUID regeneration renames.
+  std::vector<std::shared_ptr<QRTMetadata>> _containersToRename(uint32_t userId, const QRTUUID& uuid,
+                                                                const std::optional<std::string>& identifier,
+                                                                uint64_t containerClass, QRTErrorRef* error);
 
   std::optional<std::string> clientBundleIdentifier_;
   uint32_t clientUserId_ = 0;

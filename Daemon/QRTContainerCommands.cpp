@@ -3,6 +3,7 @@
 #include "Daemon/QRTContentClass.h"
 #include "Daemon/QRTMetadata.h"
 #include "Daemon/QRTWhitelist.h"
+#include "platform/Log.h"
 
 namespace {
 
@@ -45,4 +46,194 @@ void QRTHandleSystemContainerPath(const plist::Dictionary& request, const QRTRep
   auto metadata = client.createOrLookupContainerForUser(QRTSystemContainerUserId, identifier, true, QRTClassSystemData,
                                                         false, true, result);
   if (metadata) reply->dictionary["ReplyPath"] = metadata->url().path();
+}
+
+namespace {
+
+std::optional<uint64_t> classAndUser(const plist::Dictionary& request, const QRTClientConnection& client,
+                                     uint64_t* result, uint32_t* userId) {
+  uint64_t containerClass = QRTMessageU64(request, "ContainerClass");
+  auto user = checkedUser(request, containerClass, client, result);
+  if (!user) return std::nullopt;
+  *userId = *user;
+  return containerClass;
+}
+
+}  // namespace
+
+void QRTHandleContainersForUser(const plist::Dictionary& request, const QRTReplyRef& reply,
+                                QRTClientConnection& client, uint64_t* result) {
+  uint32_t userId;
+  auto containerClass = classAndUser(request, client, result, &userId);
+  if (!containerClass) return;
+  auto list = client.containersForUser(userId, *containerClass, QRTMessageBool(request, "Transient"), result);
+  if (!list) return;
+  plist::Array identifiers, uuids;
+  identifiers.reserve(list->size());
+  uuids.reserve(list->size());
+  for (const auto& metadata : *list) {
+    identifiers.emplace_back(metadata->identifier());
+    uuids.emplace_back(uuidData(metadata->uuid()));
+  }
+  reply->dictionary["ReplyIdsArray"] = std::move(identifiers);
+  reply->dictionary["ReplyUUIDsArray"] = std::move(uuids);
+}
+
+void QRTHandleReplaceContainer(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
+                               uint64_t* result) {
+  std::optional<QRTUUID> oldUUID = QRTMessageUUID(request, "OldContainerUUID");
+  uint64_t oldClass = 0;
+  uint32_t oldUser = 0;
+  std::optional<std::string> oldIdentifier;
+  if (oldUUID) {
+    oldClass = QRTMessageU64(request, "OldContainerClass");
+    oldIdentifier = QRTMessageString(request, "OldIdentifier");
+    auto requested = static_cast<uint32_t>(QRTMessageU64(request, "OldContainerUserID"));
+    if (!validateUserId(requested, oldClass, client.clientUserId(), &oldUser, result)) return;
+  }
+  uint64_t newClass = QRTMessageU64(request, "NewContainerClass");
+  uint32_t newUser = 0;
+  auto requested = static_cast<uint32_t>(QRTMessageU64(request, "NewContainerUserID"));
+  if (!validateUserId(requested, newClass, client.clientUserId(), &newUser, result)) return;
+  client.replaceContainer(oldUUID, QRTMessageUUID(request, "NewContainerUUID"), oldUser, newUser, oldIdentifier,
+                          QRTMessageString(request, "NewIdentifier"), oldClass, newClass, false, false, result);
+}
+
+void QRTHandleStageContainerForDelete(const plist::Dictionary& request, const QRTReplyRef&,
+                                      QRTClientConnection& client, uint64_t* result) {
+  std::vector<std::optional<uint64_t>> classes;
+  std::vector<std::optional<QRTUUID>> uuids;
+  if (const plist::Value* v = QRTMessageObject(request, "ContainerClassesArray"); v && v->arrayIf()) {
+    for (const plist::Value& item : v->array()) {
+      const plist::Integer* i = item.integerIf();
+      classes.push_back(i ? std::optional<uint64_t>(i->asUnsigned()) : std::nullopt);
+    }
+  }
+  if (const plist::Value* v = QRTMessageObject(request, "UUIDsArray"); v && v->arrayIf()) {
+    for (const plist::Value& item : v->array()) {
+      const plist::Data* d = item.dataIf();
+      uuids.push_back(d ? QRTUUID::fromBytes(d->data(), d->size()) : std::nullopt);
+    }
+  }
+  // Each user id is checked against the class at its position; positions
+  // past the class list have no class to check against and are not read.
+  std::vector<uint32_t> users;
+  if (const plist::Value* v = QRTMessageObject(request, "UserIDsArray"); v && v->arrayIf()) {
+    const plist::Array& requested = v->array();
+    for (size_t i = 0; i < requested.size() && i < classes.size(); ++i) {
+      const plist::Integer* n = requested[i].integerIf();
+      uint32_t effective = 0;
+      if (!validateUserId(static_cast<uint32_t>(n ? n->asUnsigned() : 0), classes[i].value_or(0),
+                          client.clientUserId(), &effective, result)) {
+        return;
+      }
+      users.push_back(effective);
+    }
+  }
+  std::vector<std::optional<std::string>> identifiers;
+  const plist::Value* ids = QRTMessageObject(request, "IdentifiersArray");
+  if (ids && ids->arrayIf()) {
+    for (const plist::Value& item : ids->array()) {
+      identifiers.push_back(item.stringIf() ? std::optional<std::string>(item.string()) : std::nullopt);
+    }
+  } else {
+    QRTLogAs(platform::kLogError, "stageContainerForDelete", "Got non-Array input for the identifiers array");
+  }
+  client.stageForDeleteContainersWithUsers(users, uuids, identifiers, classes, true, result);
+}
+
+void QRTHandleDeleteContainersOnDeathRow(const plist::Dictionary&, const QRTReplyRef& reply,
+                                         QRTClientConnection& client, uint64_t*) {
+  client.deleteContainersOnDeathRowWithCompletion([reply](uint64_t code) { reply->send(code); });
+}
+
+void QRTHandleSetInfoValue(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
+                           uint64_t* result) {
+  uint32_t userId;
+  auto containerClass = classAndUser(request, client, result, &userId);
+  if (!containerClass) return;
+  const plist::Value* value = QRTMessageObject(request, "Value");
+  client.setInfoValue(value ? std::optional<plist::Value>(*value) : std::nullopt, QRTMessageString(request, "Key"),
+                      userId, QRTMessageUUID(request, "UUID"), QRTMessageString(request, "Identifier"),
+                      *containerClass, true, result);
+}
+
+void QRTHandleInfoValueForKey(const plist::Dictionary& request, const QRTReplyRef& reply,
+                              QRTClientConnection& client, uint64_t* result) {
+  uint32_t userId;
+  auto containerClass = classAndUser(request, client, result, &userId);
+  if (!containerClass) return;
+  auto value = client.infoValueForKey(QRTMessageString(request, "Key"), userId, QRTMessageUUID(request, "UUID"),
+                                      QRTMessageString(request, "Identifier"), *containerClass, true, result);
+  if (value) reply->dictionary["ReplyInfoValue"] = std::move(*value);
+}
+
+void QRTHandleMetadataForContainer(const plist::Dictionary& request, const QRTReplyRef& reply,
+                                   QRTClientConnection& client, uint64_t* result) {
+  uint32_t userId;
+  auto containerClass = classAndUser(request, client, result, &userId);
+  if (!containerClass) return;
+  auto metadata = client.metadataForUser(userId, QRTMessageUUID(request, "UUID"),
+                                         QRTMessageString(request, "Identifier"), *containerClass, result);
+  if (!metadata) return;
+  reply->dictionary["ReplyPath"] = metadata->url().path();
+  reply->dictionary["ReplyTransient"] = metadata->transient();
+  if (QRTMessageBool(request, "InfoDictRequested") && metadata->info()) {
+    reply->dictionary["ReplyInfoDictionary"] = *metadata->info();
+  }
+}
+
+void QRTHandleRecreateDefaultStructure(const plist::Dictionary& request, const QRTReplyRef&,
+                                       QRTClientConnection& client, uint64_t* result) {
+  uint32_t userId;
+  auto containerClass = classAndUser(request, client, result, &userId);
+  if (!containerClass) return;
+  client.recreateDefaultStructureForUser(userId, QRTMessageUUID(request, "UUID"),
+                                         QRTMessageString(request, "Identifier"), *containerClass, result);
+}
+
+void QRTHandleRegenerateDirectoryUUID(const plist::Dictionary& request, const QRTReplyRef&,
+                                      QRTClientConnection& client, uint64_t* result) {
+  uint32_t userId;
+  auto containerClass = classAndUser(request, client, result, &userId);
+  if (!containerClass) return;
+  client.regenerateDirectoryUUIDForUser(userId, QRTMessageUUID(request, "UUID"),
+                                        QRTMessageString(request, "Identifier"), *containerClass, result);
+}
+
+void QRTHandleDeleteContainer(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
+                              uint64_t* result) {
+  uint32_t userId;
+  auto containerClass = classAndUser(request, client, result, &userId);
+  if (!containerClass) return;
+  client.deleteContainerForUser(userId, QRTMessageString(request, "Identifier"), *containerClass,
+                                QRTMessageBool(request, "Transient"), result);
+}
+
+void QRTHandleWipeAddonDataContainer(const plist::Dictionary& request, const QRTReplyRef&,
+                                     QRTClientConnection& client, uint64_t* result) {
+  // Only the wipe list decides, whatever else the caller may look up.
+  client.setAllowOtherIdLookup(false);
+  uint32_t userId = 0;
+  auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));
+  if (!validateUserId(requested, QRTClassAddonData, client.clientUserId(), &userId, result)) return;
+  client.deleteDataContainerContentForUser(userId, QRTMessageString(request, "Identifier"), QRTClassAddonData, result);
+}
+
+void QRTHandleDeleteDataContainerContent(const plist::Dictionary& request, const QRTReplyRef&,
+                                         QRTClientConnection& client, uint64_t* result) {
+  uint32_t userId;
+  auto containerClass = classAndUser(request, client, result, &userId);
+  if (!containerClass) return;
+  client.deleteDataContainerContentForUser(userId, QRTMessageString(request, "Identifier"), *containerClass, result);
+}
+
+void QRTHandleDiskUsage(const plist::Dictionary& request, const QRTReplyRef& reply, QRTClientConnection& client,
+                        uint64_t* result) {
+  uint32_t userId;
+  auto containerClass = classAndUser(request, client, result, &userId);
+  if (!containerClass) return;
+  reply->dictionary["ReplyDiskUsage"] =
+      client.diskUsageForUserId(userId, QRTMessageUUID(request, "UUID"), QRTMessageString(request, "Identifier"),
+                                *containerClass, result);
 }

@@ -10,11 +10,13 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <climits>
 #include <cstring>
 #include <memory>
 #include <new>
+#include <thread>
 #include <utility>
 
 #include "base/PlistCodec.h"
@@ -30,6 +32,8 @@ constexpr const char* kProtectionClassAttribute = "trusted.com.norvane.protectio
 constexpr const char* kAccessAclAttribute = "system.posix_acl_access";
 constexpr const char* kDefaultAclAttribute = "system.posix_acl_default";
 constexpr size_t kDirentBufferSize = 32 * 1024;
+constexpr size_t kParallelUnlinkThreshold = 64;
+constexpr unsigned kUnlinkThreads = 4;
 // Deeper trees than this are walked with only this many directories open;
 // the rest are reopened through ".." on the way back up.
 constexpr size_t kMaxOpenDirectories = 64;
@@ -86,13 +90,14 @@ int openDirectoryAt(int dirfd, const char* name) { return openNoFollow(dirfd, na
 
 // Removes a tree depth first without following links or leaving the root's
 // device. Entries that cannot be removed are reported to entryFailed and the
-// walk goes on; the first such errno is kept.
+// walk goes on; the first such errno is kept. The files of a large directory
+// are unlinked by a few threads at once.
 class TreePruner {
  public:
   explicit TreePruner(const char* root) : path_(root) {}
   // 0 when the walk reached its end, else the errno that stopped it.
   int run();
-  int firstError() const { return firstError_; }
+  int firstError() const { return firstError_.load(); }
 
  private:
   struct Frame {
@@ -104,6 +109,10 @@ class TreePruner {
     std::vector<std::string> subdirectories;
     size_t next = 0;
   };
+  struct Victim {
+    ino64_t inode;
+    size_t nameOffset;  // into names_
+  };
 
   void scan(Frame& frame);
   void enter(const std::string& name);
@@ -113,12 +122,12 @@ class TreePruner {
   void entryFailed(int dirfd, const char* name, const std::string& path, int err);
   bool unsetImmutable(int dirfd, const char* name, const std::string& path);
   void record(const std::string& path, int err);
+  void unlinkVictims(Frame& frame);
+  void keepFirst(int err) {
+    int expected = 0;
+    firstError_.compare_exchange_strong(expected, err);
+  }
   std::string childPath(const char* name) const { return path_ + "/" + name; }
-
-  struct Victim {
-    ino64_t inode;
-    size_t nameOffset;
-  };
 
   std::string path_;  // the path of the directory on top of the stack
   std::vector<Frame> stack_;
@@ -126,7 +135,7 @@ class TreePruner {
   std::vector<Victim> victims_;  // scratch of scan()
   std::string names_;
   dev_t rootDevice_ = 0;
-  int firstError_ = 0;
+  std::atomic<int> firstError_{0};  // entryFailed runs on several threads
 };
 
 int TreePruner::run() {
@@ -156,9 +165,9 @@ int TreePruner::run() {
 }
 
 // Reads the whole directory, then unlinks everything but directories in
-// inode order: on ext4 that frees inodes and blocks in the order they were
-// allocated, so neighbouring frees merge in the journal and in discards.
-// Directories wait in the frame.
+// inode order, which on ext4 is about the order of allocation and keeps the
+// inode table and bitmap updates close together. Directories wait in the
+// frame.
 void TreePruner::scan(Frame& frame) {
   victims_.clear();
   names_.clear();
@@ -181,16 +190,45 @@ void TreePruner::scan(Frame& frame) {
     }
   }
   std::sort(victims_.begin(), victims_.end(), [](const Victim& a, const Victim& b) { return a.inode < b.inode; });
-  for (const Victim& victim : victims_) {
-    const char* name = names_.data() + victim.nameOffset;
-    if (unlinkat(frame.fd.get(), name, 0) == 0) continue;
-    int err = errno;
-    if (err == EISDIR) {  // the file system gave no type
-      frame.subdirectories.emplace_back(name);
-    } else {
-      entryFailed(frame.fd.get(), name, childPath(name), err);
+  unlinkVictims(frame);
+}
+
+// An unlink spends most of its time after the directory lock is dropped
+// (freeing the inode, and on a disk with online discard waiting for the
+// discard), so several threads on one directory overlap that wait. Threads
+// take interleaved shares to keep the overall order by inode.
+void TreePruner::unlinkVictims(Frame& frame) {
+  const size_t count = victims_.size();
+  const unsigned threads = count >= kParallelUnlinkThreshold ? kUnlinkThreads : 1;
+  std::vector<std::vector<std::string>> directories(threads);
+  auto share = [&](unsigned t) {
+    try {
+      for (size_t i = t; i < count; i += threads) {
+        const char* name = names_.data() + victims_[i].nameOffset;
+        if (unlinkat(frame.fd.get(), name, 0) == 0) continue;
+        int err = errno;
+        if (err == EISDIR) {  // the file system gave no type
+          directories[t].emplace_back(name);
+        } else {
+          entryFailed(frame.fd.get(), name, childPath(name), err);
+        }
+      }
+    } catch (const std::exception&) {
+      keepFirst(ENOMEM);
     }
+  };
+  std::vector<std::thread> helpers;
+  unsigned started = 1;
+  try {
+    for (; started < threads; ++started) helpers.emplace_back(share, started);
+  } catch (const std::exception&) {
+    // No thread to be had: the rest of the shares run here.
   }
+  share(0);
+  for (unsigned t = started; t < threads; ++t) share(t);
+  for (std::thread& helper : helpers) helper.join();
+  for (auto& found : directories)
+    for (std::string& name : found) frame.subdirectories.push_back(std::move(name));
 }
 
 void TreePruner::enter(const std::string& name) {
@@ -269,12 +307,12 @@ void TreePruner::entryFailed(int dirfd, const char* name, const std::string& pat
     if (unlinkat(dirfd, name, 0) == 0) return;
     QRTLog(kLogError, "unlink of %s failed: %s", path.c_str(), errorText(errno));
   }
-  if (firstError_ == 0) firstError_ = err;
+  keepFirst(err);
 }
 
 void TreePruner::record(const std::string& path, int err) {
   QRTLog(kLogError, "prunetree hit error for %s : %s", path.c_str(), errorText(err));
-  if (firstError_ == 0) firstError_ = err;
+  keepFirst(err);
 }
 
 // The flags live behind an open file; links and special files never carry

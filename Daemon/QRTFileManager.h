@@ -101,6 +101,19 @@ class QRTFileManager {
   // themselves, never their targets.
   bool standardizeOwnershipAtURL(const QRTURL& url, uid_t toUID, gid_t GID, QRTErrorRef* error);
 
+  // Disk usage and protection classes (QRTFileManagerUsage.cpp)
+  // Allocated bytes of every non-directory below the directory, each
+  // multiply-linked file once; unreadable parts are logged and left out.
+  uint64_t diskUsageForURL(const QRTURL& url);
+  // Neither follows a final symbolic link. An empty predicate means always;
+  // one that answers false (given the current class) leaves the item alone
+  // and still succeeds.
+  bool dataProtectionClassOfItemAtURL(const QRTURL& url, int32_t* cls, QRTErrorRef* error);
+  bool setDataProtectionClassOfItemAtURL(const QRTURL& url, int32_t toClass,
+                                         const std::function<bool(int32_t)>& ifPredicate, QRTErrorRef* error);
+  // Logs every item of the tree, for diagnosing orphaned containers.
+  void printDirectoryStructureAtURL(const QRTURL& url);
+
  private:
   QRTFileManager() = default;
 };

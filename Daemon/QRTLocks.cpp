@@ -3,7 +3,6 @@
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
-#include <exception>
 #include <functional>
 
 #include "platform/Log.h"
@@ -21,25 +20,21 @@ namespace {
   abort();
 }
 
-}  // namespace
-
 // A broken invariant means a lock was paired wrongly: stop rather than go on
 // with bookkeeping that no longer matches the locks.
-#define QRTLocksAssert(expression)                                         \
-  do {                                                                     \
-    if (!(expression)) lockAssertionFailed(#expression, __func__, __LINE__); \
+#define QRTLocksAssert(expression)                                            \
+  do {                                                                        \
+    if (!(expression)) lockAssertionFailed(#expression, __func__, __LINE__);  \
   } while (0)
 
 // Debug lines must not turn a lock or unlock into a throwing call.
-#define QRTLocksDebug(...)                                \
-  do {                                                    \
-    try {                                                 \
-      QRTLog(platform::kLogDebug, __VA_ARGS__);           \
-    } catch (...) {                                       \
-    }                                                     \
+#define QRTLocksDebug(...)                        \
+  do {                                            \
+    try {                                         \
+      QRTLog(platform::kLogDebug, __VA_ARGS__);   \
+    } catch (...) {                               \
+    }                                             \
   } while (0)
-
-namespace {
 
 const char* modeName(bool writing) { return writing ? "writing" : "reading"; }
 

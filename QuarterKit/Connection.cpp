@@ -16,7 +16,9 @@
 
 namespace qk {
 
-using Reply = std::optional<plist::Dictionary>;
+namespace {
+using MaybeReply = std::optional<plist::Dictionary>;
+}  // namespace
 
 struct Connection::Impl {
   explicit Impl(int socketFd) : fd(socketFd) { reader = std::thread([this] { readLoop(); }); }
@@ -26,7 +28,7 @@ struct Connection::Impl {
     ::close(fd);
   }
 
-  std::pair<uint64_t, std::future<Reply>> submit(const plist::Dictionary& request);
+  std::pair<uint64_t, std::future<MaybeReply>> submit(const plist::Dictionary& request);
   void forget(uint64_t id);
   bool writeAll(const uint8_t* p, size_t length);
   void readLoop();
@@ -39,14 +41,14 @@ struct Connection::Impl {
   std::atomic<int64_t> replyTimeoutMs{60'000};
   std::mutex writeMutex;
   std::mutex pendingMutex;
-  std::unordered_map<uint64_t, std::promise<Reply>> pending;
+  std::unordered_map<uint64_t, std::promise<MaybeReply>> pending;
   std::thread reader;
 };
 
-std::pair<uint64_t, std::future<Reply>> Connection::Impl::submit(const plist::Dictionary& request) {
+std::pair<uint64_t, std::future<MaybeReply>> Connection::Impl::submit(const plist::Dictionary& request) {
   const uint64_t id = nextId.fetch_add(1, std::memory_order_relaxed);
-  std::promise<Reply> promise;
-  std::future<Reply> future = promise.get_future();
+  std::promise<MaybeReply> promise;
+  std::future<MaybeReply> future = promise.get_future();
   {
     std::lock_guard<std::mutex> lock(pendingMutex);
     if (isClosed.load()) {
@@ -58,6 +60,11 @@ std::pair<uint64_t, std::future<Reply>> Connection::Impl::submit(const plist::Di
   bool written = false;
   try {
     const std::vector<uint8_t> bytes = frame::encode(id, request);
+    if (bytes.size() - 4 > frame::kMaxLength) {
+      // The daemon would drop the connection over it; fail it alone.
+      forget(id);
+      return {id, std::move(future)};
+    }
     std::lock_guard<std::mutex> lock(writeMutex);
     written = writeAll(bytes.data(), bytes.size());
   } catch (const std::exception&) {
@@ -75,7 +82,7 @@ std::pair<uint64_t, std::future<Reply>> Connection::Impl::submit(const plist::Di
 
 // Drops a pending request, answering nothing if it was still waiting.
 void Connection::Impl::forget(uint64_t id) {
-  std::promise<Reply> promise;
+  std::promise<MaybeReply> promise;
   {
     std::lock_guard<std::mutex> lock(pendingMutex);
     auto it = pending.find(id);
@@ -118,7 +125,7 @@ void Connection::Impl::readLoop() {
 }
 
 void Connection::Impl::deliver(frame::RawFrame&& f) {
-  std::promise<Reply> promise;
+  std::promise<MaybeReply> promise;
   {
     std::lock_guard<std::mutex> lock(pendingMutex);
     auto it = pending.find(f.messageId);
@@ -127,11 +134,16 @@ void Connection::Impl::deliver(frame::RawFrame&& f) {
     pending.erase(it);
   }
   // An undecodable payload still has intact framing: only its request fails.
-  promise.set_value(frame::decodeMessage(f.payload));
+  MaybeReply reply;
+  try {
+    reply = frame::decodeMessage(f.payload);
+  } catch (const std::exception&) {
+  }
+  promise.set_value(std::move(reply));
 }
 
 void Connection::Impl::failAll() {
-  std::unordered_map<uint64_t, std::promise<Reply>> orphans;
+  std::unordered_map<uint64_t, std::promise<MaybeReply>> orphans;
   {
     std::lock_guard<std::mutex> lock(pendingMutex);
     isClosed.store(true);
@@ -186,11 +198,11 @@ std::unique_ptr<Connection> Connection::adopt(int fd) {
   }
 }
 
-std::future<Reply> Connection::send(const plist::Dictionary& request) {
+std::future<MaybeReply> Connection::send(const plist::Dictionary& request) {
   return impl_->submit(request).second;
 }
 
-Reply Connection::call(const plist::Dictionary& request, std::chrono::milliseconds timeout) {
+MaybeReply Connection::call(const plist::Dictionary& request, std::chrono::milliseconds timeout) {
   auto [id, future] = impl_->submit(request);
   if (future.wait_for(timeout) != std::future_status::ready) {
     impl_->forget(id);

@@ -148,9 +148,12 @@ Result stageContainerForDelete(Connection& c, const std::vector<uint64_t>& userI
 
 Result deleteContainersOnDeathRow(Connection& c) { return perform(c, Request(Command::deleteContainersOnDeathRow)); }
 
-Result setInfoValue(Connection& c, const ContainerRef& container, const std::string& key, const plist::Value& value) {
+Result setInfoValue(Connection& c, const ContainerRef& container, const std::string& key,
+                    const std::optional<plist::Value>& value) {
   Request r(Command::setInfoValue);
-  return perform(c, addContainer(r, container).string("Key", key).value("Value", value));
+  addContainer(r, container).string("Key", key);
+  if (value) r.value("Value", *value);
+  return perform(c, r);
 }
 
 Result infoValueForKey(Connection& c, const ContainerRef& container, const std::string& key) {

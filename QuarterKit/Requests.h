@@ -64,6 +64,7 @@ class Request {
   Request& i64(std::string_view key, int64_t v);
   Request& boolean(std::string_view key, bool v);
   Request& string(std::string_view key, std::string v);
+  Request& string(std::string_view key, const char* v) { return string(key, std::string(v)); }
   Request& string(std::string_view key, const std::optional<std::string>& v);
   Request& uuid(std::string_view key, const QRTUUID& v);
   Request& uuid(std::string_view key, const std::optional<QRTUUID>& v);
@@ -132,7 +133,9 @@ Result replaceContainer(Connection& c, const std::optional<ContainerRef>& old, c
 Result stageContainerForDelete(Connection& c, const std::vector<uint64_t>& userIds, const std::vector<QRTUUID>& uuids,
                                const std::vector<std::string>& identifiers, const std::vector<uint64_t>& classes);
 Result deleteContainersOnDeathRow(Connection& c);
-Result setInfoValue(Connection& c, const ContainerRef& container, const std::string& key, const plist::Value& value);
+// An absent value leaves "Value" out, which removes the key.
+Result setInfoValue(Connection& c, const ContainerRef& container, const std::string& key,
+                    const std::optional<plist::Value>& value);
 Result infoValueForKey(Connection& c, const ContainerRef& container, const std::string& key);
 Result metadataForContainer(Connection& c, const ContainerRef& container, bool infoDictRequested);
 Result recreateDefaultStructure(Connection& c, const ContainerRef& container);

@@ -14,6 +14,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -29,15 +30,15 @@ constexpr int kExitReplyError = 1;
 constexpr int kExitUsage = 2;
 constexpr size_t kMaxPlistFile = 64u * 1024 * 1024;
 
-const char kUsage[] = R"(usage: quarterctl [--root DIR | --socket PATH] [--json] [--timeout SECONDS] COMMAND ...
+const char kUsageHead[] = R"(usage: quarterctl [--root DIR | --socket PATH] [--json] [--timeout SECONDS] COMMAND ...
 
 Sends one request to quarterd and prints its reply.
 
 Options:
   --root DIR         talk to the daemon of device root DIR (socket DIR/run/com.norvane.quarterd)
   --socket PATH      talk to the request socket at PATH (default /run/com.norvane.quarterd)
-  --json             print the reply as a JSON object: integers as numbers, 16-byte data as
-                     UUID strings, other data as base64 strings, dates as ISO 8601 strings
+  --json             print the whole reply as a JSON object: integers as numbers, 16-byte data
+                     as UUID strings, other data as base64 strings, dates as ISO 8601 strings
   --timeout SECONDS  how long to wait for the reply (default 60)
   -h, --help         this text
 
@@ -54,16 +55,18 @@ Commands:
         plist   path of a property-list file, whose value is sent
       Without a "Command" key the daemon takes command 0. Example:
         quarterctl raw Command=u64:1 UserID=u64:501 ContainerClass=u64:2
-  create --class N [--user N] [--identifier ID] [--transient]
-  lookup --class N [--user N] [--identifier ID] [--transient]
-      Creates or looks up (command 0) the container of class N for user N (default 1, the
-      current mobile user) and identifier ID (default: the caller's own).
-  system-path [--identifier ID]
-      Creates or looks up a system container (command 15).
+)";
 
-Output: one "Key: value" line per reply key, sorted; 16-byte data is shown as a UUID and
-nested values in the old-style property-list text form. create, lookup and system-path
-print Path, UUID, Existed and Identifier where the reply has them.
+const char kUsageTail[] = R"(
+--user defaults to the owner the class demands: 33 for the bundle classes 1, 3, 5 and 8,
+499 for classes 12 and 13, otherwise 1 (the current mobile user). --uuid is the container's
+internal UUID, as create and lookup print it. create, lookup and system-path take the
+caller's own identifier when --identifier is missing.
+
+Output: create, lookup, system-path and metadata print "Key: value" lines for the reply keys
+they are about; list prints "IDENTIFIER UUID" per container; info get and du print the value
+alone; the others, and raw, print every reply key, sorted. 16-byte data is shown as a UUID and
+nested values in the old-style property-list text form.
 
 Exit status: 0 when the reply's ReplyError is 1, 1 when it is another value, 2 on usage
 errors, connection failures and when no reply came.
@@ -312,16 +315,44 @@ void json(const plist::Value& v, std::string& out) {
   }
 }
 
-void printReply(const qk::Reply& reply, const Options& options, const std::vector<std::string>& only = {}) {
+// How a subcommand shows a reply when --json is not given.
+enum class Output {
+  Whole,  // every key, sorted
+  Keys,   // only the listed keys the reply has
+  List,   // "IDENTIFIER UUID" per container
+  Value,  // the first listed key's value alone, on success
+};
+
+void printList(const qk::Reply& reply) {
+  const plist::Array* ids = reply.array("ReplyIdsArray");
+  const plist::Array* uuids = reply.array("ReplyUUIDsArray");
+  if (!ids || !uuids) return;
+  for (size_t i = 0; i < std::min(ids->size(), uuids->size()); ++i)
+    std::cout << plainText((*ids)[i]) << ' ' << plainText((*uuids)[i]) << '\n';
+}
+
+void printReply(const qk::Reply& reply, const Options& options, Output output,
+                const std::vector<std::string>& keys) {
   if (options.json) {
     std::string out;
     json(plist::Value(reply.dictionary()), out);
     std::cout << out << '\n';
     return;
   }
-  for (const auto& [key, value] : reply.dictionary()) {
-    bool wanted = only.empty() || std::find(only.begin(), only.end(), key) != only.end();
-    if (wanted) std::cout << key << ": " << plainText(value) << '\n';
+  switch (output) {
+    case Output::Whole:
+    case Output::Keys:
+      for (const auto& [key, value] : reply.dictionary()) {
+        bool wanted = output == Output::Whole || std::find(keys.begin(), keys.end(), key) != keys.end();
+        if (wanted) std::cout << key << ": " << plainText(value) << '\n';
+      }
+      return;
+    case Output::List:
+      if (reply.ok()) printList(reply);
+      return;
+    case Output::Value:
+      if (const plist::Value* v = reply.value(keys.front()); v && reply.ok()) std::cout << plainText(*v) << '\n';
+      return;
   }
 }
 
@@ -339,15 +370,17 @@ std::unique_ptr<qk::Connection> connectOrExplain(const Options& options) {
 }
 
 int finish(const qk::Connection& connection, const std::optional<qk::Reply>& reply, const Options& options,
-           const std::vector<std::string>& only = {}) {
+           Output output = Output::Whole, const std::vector<std::string>& keys = {}) {
   if (!reply) {
     std::cerr << (connection.closed() ? "quarterctl: the daemon closed the connection without a reply\n"
                                       : "quarterctl: no reply in time, or a reply that is not a dictionary\n");
     return kExitUsage;
   }
-  printReply(*reply, options, only);
+  printReply(*reply, options, output, keys);
   if (reply->ok()) return kExitOK;
-  if (!options.json && !only.empty()) std::cerr << "quarterctl: request failed: ReplyError " << reply->error() << '\n';
+  // Whole output already showed ReplyError.
+  if (!options.json && output != Output::Whole)
+    std::cerr << "quarterctl: request failed: ReplyError " << reply->error() << '\n';
   return kExitReplyError;
 }
 
@@ -369,48 +402,279 @@ int runRaw(const Options& options) {
   return finish(*connection, qk::perform(*connection, qk::Request(std::move(request))), options);
 }
 
-const std::vector<std::string> kContainerKeys = {"ReplyPath", "ReplyUUID", "ReplyExisted", "ReplyIdentifier"};
+// ---- container subcommands --------------------------------------------------
 
-// create, lookup and system-path share their flags.
-struct ContainerArgs {
-  std::optional<uint64_t> containerClass;
-  uint64_t userId = 1;
-  std::optional<std::string> identifier;
-  bool transient = false;
+enum OptionBit : unsigned {
+  kClass = 1u << 0,
+  kUser = 1u << 1,
+  kIdentifier = 1u << 2,
+  kUUID = 1u << 3,
+  kTransient = 1u << 4,
+  kKey = 1u << 5,
+  kValue = 1u << 6,
+  kInfo = 1u << 7,
+  kAddon = 1u << 8,
+  kEntry = 1u << 9,
+  kReplace = 1u << 10,   // the old-/new- options of replace, but --new-class
+  kNewClass = 1u << 11,
+  kOne = kClass | kUser | kIdentifier | kUUID,  // one existing container
+  kOneRequired = kClass | kIdentifier | kUUID,
 };
 
-ContainerArgs parseContainerArgs(const std::vector<std::string>& args, bool classAndUser) {
-  ContainerArgs out;
-  for (size_t i = 1; i < args.size(); ++i) {
-    const std::string& a = args[i];
-    auto next = [&]() -> const std::string& {
-      if (i + 1 == args.size()) throw UsageError{a + " needs a value"};
-      return args[++i];
-    };
-    if (a == "--identifier") out.identifier = next();
-    else if (classAndUser && a == "--class") out.containerClass = parseUnsigned(next(), a);
-    else if (classAndUser && a == "--user") out.userId = parseUnsigned(next(), a);
-    else if (classAndUser && a == "--transient") out.transient = true;
-    else throw UsageError{"unknown argument to " + args[0] + ": " + a};
+// What names one container; the user id defaults by class (ownerFor).
+struct Side {
+  std::optional<uint64_t> containerClass;
+  std::optional<uint64_t> userId;
+  std::optional<std::string> identifier;
+  std::optional<QRTUUID> uuid;
+};
+
+struct StageEntry {
+  uint64_t userId = 0;
+  uint64_t containerClass = 0;
+  QRTUUID uuid;
+  std::string identifier;
+};
+
+struct Args {
+  unsigned given = 0;
+  Side self, old, replacement;
+  std::optional<std::string> key;
+  std::optional<plist::Value> value;
+  bool transient = false;
+  bool info = false;
+  bool addon = false;
+  std::vector<StageEntry> entries;
+};
+
+// The only user id the daemon accepts for bundle and system classes; for
+// the others 1, which it reads as the current mobile user.
+uint64_t ownerFor(uint64_t containerClass) {
+  switch (containerClass) {
+    case 1: case 3: case 5: case 8: return 33;
+    case 12: case 13: return 499;
+    default: return 1;
   }
-  if (classAndUser && !out.containerClass) throw UsageError{args[0] + " needs --class"};
-  return out;
 }
 
-int runCreateOrLookup(const Options& options, bool create) {
-  ContainerArgs a = parseContainerArgs(options.args, true);
-  auto connection = connectOrExplain(options);
-  if (!connection) return kExitUsage;
-  auto reply =
-      qk::createOrLookupContainer(*connection, a.userId, a.identifier, *a.containerClass, create, a.transient);
-  return finish(*connection, reply, options, kContainerKeys);
+qk::ContainerRef ref(const Side& side) {
+  uint64_t containerClass = side.containerClass.value_or(0);
+  return {side.userId.value_or(ownerFor(containerClass)), containerClass, side.identifier, side.uuid};
 }
 
-int runSystemPath(const Options& options) {
-  ContainerArgs a = parseContainerArgs(options.args, false);
+QRTUUID parseUUID(const std::string& text, const std::string& what) {
+  auto uuid = QRTUUID::fromString(text);
+  if (!uuid) throw UsageError{"not a UUID for " + what + ": " + text};
+  return *uuid;
+}
+
+// USER:CLASS:UUID:IDENTIFIER; the identifier is the rest, colons and all.
+StageEntry parseEntry(const std::string& text) {
+  size_t a = text.find(':');
+  size_t b = a == std::string::npos ? a : text.find(':', a + 1);
+  size_t c = b == std::string::npos ? b : text.find(':', b + 1);
+  if (c == std::string::npos) throw UsageError{"expected USER:CLASS:UUID:IDENTIFIER, got: " + text};
+  return {parseUnsigned(text.substr(0, a), "--entry user"), parseUnsigned(text.substr(a + 1, b - a - 1), "--entry class"),
+          parseUUID(text.substr(b + 1, c - b - 1), "--entry"), text.substr(c + 1)};
+}
+
+plist::Value parseTypedValue(const std::string& text) {
+  size_t colon = text.find(':');
+  if (colon == std::string::npos) throw UsageError{"expected --value TYPE:VALUE, got: " + text};
+  return parseTyped(text.substr(0, colon), text.substr(colon + 1), "--value");
+}
+
+struct OptionSpec {
+  const char* flag;
+  const char* valueName;  // nullptr: a switch
+  unsigned bit;
+  void (*set)(Args&, const std::string& value);
+};
+
+using F = const std::string&;
+const OptionSpec kOptionSpecs[] = {
+    {"--class", "N", kClass, [](Args& a, F v) { a.self.containerClass = parseUnsigned(v, "--class"); }},
+    {"--user", "N", kUser, [](Args& a, F v) { a.self.userId = parseUnsigned(v, "--user"); }},
+    {"--identifier", "ID", kIdentifier, [](Args& a, F v) { a.self.identifier = v; }},
+    {"--uuid", "UUID", kUUID, [](Args& a, F v) { a.self.uuid = parseUUID(v, "--uuid"); }},
+    {"--transient", nullptr, kTransient, [](Args& a, F) { a.transient = true; }},
+    {"--key", "K", kKey, [](Args& a, F v) { a.key = v; }},
+    {"--value", "TYPE:VALUE", kValue, [](Args& a, F v) { a.value = parseTypedValue(v); }},
+    {"--info", nullptr, kInfo, [](Args& a, F) { a.info = true; }},
+    {"--addon", nullptr, kAddon, [](Args& a, F) { a.addon = true; }},
+    {"--entry", "USER:CLASS:UUID:IDENTIFIER", kEntry, [](Args& a, F v) { a.entries.push_back(parseEntry(v)); }},
+    {"--old-uuid", "UUID", kReplace, [](Args& a, F v) { a.old.uuid = parseUUID(v, "--old-uuid"); }},
+    {"--old-class", "N", kReplace, [](Args& a, F v) { a.old.containerClass = parseUnsigned(v, "--old-class"); }},
+    {"--old-user", "N", kReplace, [](Args& a, F v) { a.old.userId = parseUnsigned(v, "--old-user"); }},
+    {"--old-identifier", "ID", kReplace, [](Args& a, F v) { a.old.identifier = v; }},
+    {"--new-uuid", "UUID", kReplace, [](Args& a, F v) { a.replacement.uuid = parseUUID(v, "--new-uuid"); }},
+    {"--new-class", "N", kNewClass,
+     [](Args& a, F v) { a.replacement.containerClass = parseUnsigned(v, "--new-class"); }},
+    {"--new-user", "N", kReplace, [](Args& a, F v) { a.replacement.userId = parseUnsigned(v, "--new-user"); }},
+    {"--new-identifier", "ID", kReplace, [](Args& a, F v) { a.replacement.identifier = v; }},
+};
+
+qk::Result createOrLookup(qk::Connection& c, const Args& a, bool create) {
+  qk::ContainerRef r = ref(a.self);
+  return qk::createOrLookupContainer(c, r.userId, r.identifier, r.containerClass, create, a.transient);
+}
+
+qk::Result stage(qk::Connection& c, const Args& a) {
+  std::vector<uint64_t> users, classes;
+  std::vector<QRTUUID> uuids;
+  std::vector<std::string> identifiers;
+  for (const StageEntry& e : a.entries) {
+    users.push_back(e.userId);
+    classes.push_back(e.containerClass);
+    uuids.push_back(e.uuid);
+    identifiers.push_back(e.identifier);
+  }
+  return qk::stageContainerForDelete(c, users, uuids, identifiers, classes);
+}
+
+qk::Result wipe(qk::Connection& c, const Args& a) {
+  if (a.addon) return qk::wipeAddonDataContainer(c, a.self.userId.value_or(ownerFor(4)), a.self.identifier);
+  qk::ContainerRef r = ref(a.self);
+  return qk::deleteDataContainerContent(c, r.userId, r.identifier, r.containerClass);
+}
+
+qk::Result replace(qk::Connection& c, const Args& a) {
+  bool hasOld = a.old.uuid || a.old.containerClass || a.old.userId || a.old.identifier;
+  return qk::replaceContainer(c, hasOld ? std::optional<qk::ContainerRef>(ref(a.old)) : std::nullopt,
+                              ref(a.replacement));
+}
+
+struct Subcommand {
+  const char* name;  // one word, or two ("info get")
+  uint64_t command;
+  unsigned options;
+  unsigned required;
+  qk::Result (*send)(qk::Connection&, const Args&);
+  Output output;
+  std::vector<std::string> keys;
+  const char* help;
+};
+
+using C = qk::Connection&;
+using A = const Args&;
+const std::vector<std::string> kContainerKeys = {"ReplyPath", "ReplyUUID", "ReplyExisted", "ReplyIdentifier"};
+
+const Subcommand kSubcommands[] = {
+    {"create", 0, kClass | kUser | kIdentifier | kTransient, kClass,
+     [](C c, A a) { return createOrLookup(c, a, true); }, Output::Keys, kContainerKeys,
+     "Creates the container, or finds it when it exists."},
+    {"lookup", 0, kClass | kUser | kIdentifier | kTransient, kClass,
+     [](C c, A a) { return createOrLookup(c, a, false); }, Output::Keys, kContainerKeys,
+     "Finds an existing container; creates nothing."},
+    {"list", 1, kClass | kUser | kTransient, kClass,
+     [](C c, A a) { return qk::containersForUser(c, ref(a.self).userId, ref(a.self).containerClass, a.transient); },
+     Output::List, {}, "Lists the containers of a class and user."},
+    {"info get", 6, kOne | kKey, kOneRequired | kKey,
+     [](C c, A a) { return qk::infoValueForKey(c, ref(a.self), *a.key); }, Output::Value, {"ReplyInfoValue"},
+     "Prints one info value of a container."},
+    {"info set", 5, kOne | kKey | kValue, kOneRequired | kKey,
+     [](C c, A a) { return qk::setInfoValue(c, ref(a.self), *a.key, a.value); }, Output::Whole, {},
+     "Sets an info value (TYPE:VALUE as for raw); without --value removes the key."},
+    {"metadata", 7, kOne | kInfo, kOneRequired,
+     [](C c, A a) { return qk::metadataForContainer(c, ref(a.self), a.info); }, Output::Keys,
+     {"ReplyPath", "ReplyTransient", "ReplyInfoDictionary"},
+     "Prints a container's path and transient flag; --info adds its info dictionary."},
+    {"recreate", 8, kOne, kOneRequired, [](C c, A a) { return qk::recreateDefaultStructure(c, ref(a.self)); },
+     Output::Whole, {}, "Creates the container's default sub-directories again."},
+    {"recreate-structure", 22, kOne, kOneRequired,
+     [](C c, A a) { return qk::recreateContainerStructure(c, ref(a.self)); }, Output::Whole, {},
+     "The same as recreate, through its second command number."},
+    {"regenerate-uuid", 9, kOne, kOneRequired, [](C c, A a) { return qk::regenerateDirectoryUUID(c, ref(a.self)); },
+     Output::Whole, {}, "Gives the container's directory a new name; the internal UUID stays."},
+    {"delete", 10, kClass | kUser | kIdentifier | kTransient, kClass | kIdentifier,
+     [](C c, A a) {
+       qk::ContainerRef r = ref(a.self);
+       return qk::deleteContainer(c, r.userId, r.identifier, r.containerClass, a.transient);
+     },
+     Output::Whole, {}, "Stages a container for deletion (see deathrow)."},
+    {"stage", 3, kEntry, kEntry, stage, Output::Whole, {},
+     "Stages containers for deletion, one --entry per container (repeat it)."},
+    {"wipe", 12, kClass | kUser | kIdentifier | kAddon, kClass | kIdentifier, wipe, Output::Whole, {},
+     "Replaces a data container's content by fresh content; --addon wipes a\n"
+     "      class 4 container under the wipeContainer entitlement (command 11), with no --class."},
+    {"replace", 2, kReplace | kNewClass, kNewClass, replace, Output::Whole, {},
+     "Puts the new container in the old one's place; without --old-uuid it\n"
+     "      makes a transient container permanent."},
+    {"deathrow", 4, 0, 0, [](C c, A) { return qk::deleteContainersOnDeathRow(c); }, Output::Whole, {},
+     "Destroys everything staged for deletion; answers when the pass is done."},
+    {"du", 23, kOne, kOneRequired, [](C c, A a) { return qk::diskUsage(c, ref(a.self)); }, Output::Value,
+     {"ReplyDiskUsage"}, "Prints the bytes a container uses."},
+    {"system-path", 15, kIdentifier, 0, [](C c, A a) { return qk::systemContainerPath(c, a.self.identifier); },
+     Output::Keys, kContainerKeys, "Creates or looks up a system container (class 12, user 499)."},
+};
+
+const OptionSpec* findOption(const std::string& flag) {
+  for (const OptionSpec& spec : kOptionSpecs)
+    if (flag == spec.flag) return &spec;
+  return nullptr;
+}
+
+// The subcommand named by the first one or two words; *words says how many.
+const Subcommand* findSubcommand(const std::vector<std::string>& args, size_t* words) {
+  for (const Subcommand& row : kSubcommands) {
+    std::string_view name = row.name;
+    size_t space = name.find(' ');
+    if (space == std::string_view::npos ? args[0] == name
+                                        : args.size() > 1 && args[0] == name.substr(0, space) &&
+                                              args[1] == name.substr(space + 1)) {
+      *words = space == std::string_view::npos ? 1 : 2;
+      return &row;
+    }
+  }
+  return nullptr;
+}
+
+Args parseArgs(const Subcommand& row, const std::vector<std::string>& args, size_t first) {
+  Args a;
+  for (size_t i = first; i < args.size(); ++i) {
+    const OptionSpec* spec = findOption(args[i]);
+    if (!spec || !(spec->bit & row.options))
+      throw UsageError{"unknown argument to " + std::string(row.name) + ": " + args[i]};
+    std::string value;
+    if (spec->valueName) {
+      if (i + 1 == args.size()) throw UsageError{args[i] + " needs a value"};
+      value = args[++i];
+    }
+    spec->set(a, value);
+    a.given |= spec->bit;
+  }
+  unsigned missing = row.required & ~a.given;
+  if (a.addon) missing &= ~kClass;  // the addon wipe always works on class 4
+  for (const OptionSpec& spec : kOptionSpecs)
+    if (spec.bit & missing) throw UsageError{std::string(row.name) + " needs " + spec.flag};
+  return a;
+}
+
+int runSubcommand(const Subcommand& row, size_t words, const Options& options) {
+  Args a = parseArgs(row, options.args, words);
   auto connection = connectOrExplain(options);
   if (!connection) return kExitUsage;
-  return finish(*connection, qk::systemContainerPath(*connection, a.identifier), options, kContainerKeys);
+  return finish(*connection, row.send(*connection, a), options, row.output, row.keys);
+}
+
+std::string usageText() {
+  std::string out = kUsageHead;
+  for (const Subcommand& row : kSubcommands) {
+    std::string line = "  " + std::string(row.name);
+    for (const OptionSpec& spec : kOptionSpecs) {
+      if (!(spec.bit & row.options)) continue;
+      std::string option = spec.flag;
+      if (spec.valueName) option += std::string(" ") + spec.valueName;
+      option = (spec.bit & row.required) ? " " + option : " [" + option + "]";
+      if (line.size() + option.size() > 92) {
+        out += line + '\n';
+        line = "       ";
+      }
+      line += option;
+    }
+    out += line + "\n      (command " + std::to_string(row.command) + ") " + row.help + '\n';
+  }
+  return out + kUsageTail;
 }
 
 // Global options stop at the first word that is not one.
@@ -438,20 +702,18 @@ int run(int argc, char** argv) {
   Options options = parseOptions(argc, argv);
   if (options.args.empty()) throw UsageError{"no command given"};
   const std::string& command = options.args[0];
-  for (const std::string& a : options.args) {
-    if (a == "-h" || a == "--help") {
-      std::cout << kUsage;
-      return kExitOK;
-    }
-  }
-  if (command == "help") {
-    std::cout << kUsage;
+  bool help = command == "help" ||
+              std::any_of(options.args.begin(), options.args.end(), [](const std::string& a) {
+                return a == "-h" || a == "--help";
+              });
+  if (help) {
+    std::cout << usageText();
     return kExitOK;
   }
   if (command == "raw") return runRaw(options);
-  if (command == "create") return runCreateOrLookup(options, true);
-  if (command == "lookup") return runCreateOrLookup(options, false);
-  if (command == "system-path") return runSystemPath(options);
+  size_t words = 0;
+  if (const Subcommand* row = findSubcommand(options.args, &words)) return runSubcommand(*row, words, options);
+  if (command == "info") throw UsageError{"info needs get or set"};
   throw UsageError{"unknown command " + command};
 }
 

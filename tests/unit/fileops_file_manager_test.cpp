@@ -97,6 +97,7 @@ class FileManagerTest : public ::testing::Test {
 
 TEST_F(FileManagerTest, RemovalRepairsImmutableFilesAndLeavesNothing) {
   makeFile("a/one");
+  for (int i = 0; i < 100; ++i) makeFile("a/b/f" + std::to_string(i));  // enough for several threads
   makeFile("a/b/locked");
   makeFile("a/b/c/two");
   setImmutable(path("a/b/locked"), true);
@@ -107,7 +108,7 @@ TEST_F(FileManagerTest, RemovalRepairsImmutableFilesAndLeavesNothing) {
 
 TEST_F(FileManagerTest, ImmutableDirectoryFailsWithEPERMAfterTheRestIsGone) {
   makeFile("a/first");
-  makeFile("a/held/child");
+  for (int i = 0; i < 100; ++i) makeFile("a/held/child" + std::to_string(i));
   makeFile("a/z/last");
   setImmutable(path("a/held"), true);
   EXPECT_FALSE(fm_.removeItemAtURL(url("a"), &error_));
@@ -116,10 +117,11 @@ TEST_F(FileManagerTest, ImmutableDirectoryFailsWithEPERMAfterTheRestIsGone) {
   EXPECT_EQ(error_->domain(), QRTPOSIXErrorDomain);
   EXPECT_EQ(error_->code(), EPERM);
   EXPECT_EQ(error_->localizedDescription(), "prunetree of " + path("a") + " failed: Operation not permitted");
-  EXPECT_TRUE(exists("a/held/child"));
+  EXPECT_TRUE(exists("a/held/child0"));
+  EXPECT_TRUE(exists("a/held/child99"));
   EXPECT_FALSE(exists("a/first"));
   EXPECT_FALSE(exists("a/z"));
-  EXPECT_NE(logText().find("prunetree hit error for " + path("a/held/child") + " : "), std::string::npos);
+  EXPECT_NE(logText().find("prunetree hit error for " + path("a/held/child7") + " : "), std::string::npos);
 }
 
 TEST_F(FileManagerTest, RemovalStopsAtOtherFileSystemsAndReportsTheirErrno) {

@@ -4,7 +4,9 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cstdlib>
+#include <cstring>
 #include <random>
 #include <thread>
 
@@ -187,6 +189,19 @@ TEST(KitConnection, TimedOutCallIgnoresItsLateReply) {
   answer.join();
   ASSERT_TRUE(reply);
   EXPECT_EQ(2u, numberOf(*reply));
+}
+
+TEST(KitConnection, OversizedRequestFailsAloneAndTheStreamGoesOn) {
+  FakeServer server;
+  EXPECT_FALSE(server.client->call({{"Blob", plist::Data(frame::kMaxLength, 0)}}));
+  std::thread answer([&] {
+    auto m = server.read();
+    if (m) server.reply(m->first, {{"N", numberOf(m->second)}});
+  });
+  auto reply = server.client->call(numbered(3));
+  answer.join();
+  ASSERT_TRUE(reply);
+  EXPECT_EQ(3u, numberOf(*reply));
 }
 
 TEST(KitConnection, ConnectsByPathAndReportsFailure) {

@@ -8,12 +8,12 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 #include <functional>
 #include <memory>
 #include <mutex>
 #include <random>
 #include <set>
+#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -28,20 +28,15 @@ using namespace std::chrono_literals;
 namespace {
 
 // An unopened log sends every line, debug included, to syslog; the tests want
-// the daemon's default: a file at the notice level.
-class LogInTemporaryFile : public ::testing::Environment {
+// the daemon's default level, with the lines going nowhere.
+void quietLog() { platform::logOpen("/dev/null", "locks_test", platform::kLogNotice); }
+
+class QuietLog : public ::testing::Environment {
  public:
-  static std::filesystem::path path() {
-    return std::filesystem::temp_directory_path() / ("locks_test-" + std::to_string(getpid()) + ".log");
-  }
-  void SetUp() override { ASSERT_TRUE(platform::logOpen(path(), "locks_test", platform::kLogNotice)); }
-  void TearDown() override {
-    platform::logClose();
-    std::filesystem::remove(path());
-  }
+  void SetUp() override { quietLog(); }
 };
 
-const auto* const gLogEnvironment = ::testing::AddGlobalTestEnvironment(new LogInTemporaryFile);
+const auto* const gQuietLog = ::testing::AddGlobalTestEnvironment(new QuietLog);
 
 // A thread that takes a lock, reports it, holds it until released, then lets
 // it go. The long bounds only turn a hang into a failure.
@@ -117,6 +112,25 @@ bool eventually(const std::function<bool(const QRTLocksSnapshot&)>& condition) {
     std::this_thread::sleep_for(1ms);
   }
   return false;
+}
+
+// Runs the bodies on threads of their own and joins them; a deadlock stops
+// the run with a message instead of hanging it.
+void runConcurrently(const std::vector<std::function<void()>>& bodies) {
+  std::atomic<size_t> finished{0};
+  std::vector<std::thread> threads;
+  for (const auto& body : bodies) {
+    threads.emplace_back([&] {
+      body();
+      ++finished;
+    });
+  }
+  for (int i = 0; i < 12000 && finished < bodies.size(); ++i) std::this_thread::sleep_for(10ms);
+  if (finished < bodies.size()) {
+    fprintf(stderr, "Lock users deadlocked\n");
+    abort();
+  }
+  for (auto& thread : threads) thread.join();
 }
 
 void expectIdle() {
@@ -211,10 +225,7 @@ TEST_F(IdentifierLockTest, OppositeOrderListsDoNotDeadlock) {
       }
     }
   };
-  std::thread forward(worker, std::vector<std::string>{"a", "b"}, false);
-  std::thread backward(worker, std::vector<std::string>{"b", "a"}, true);
-  forward.join();
-  backward.join();
+  runConcurrently({[&] { worker({"a", "b"}, false); }, [&] { worker({"b", "a"}, true); }});
   EXPECT_EQ(counter, 2000);
 }
 
@@ -349,16 +360,17 @@ TEST_F(IdentifierLockTest, ScopedLocksTakeOnlyWhenEnabled) {
 }
 
 TEST_F(IdentifierLockTest, DebugLinesTellEachStep) {
-  platform::logSetLevel(platform::kLogDebug);
+  auto path = std::filesystem::temp_directory_path() / ("locks_test-" + std::to_string(getpid()) + ".log");
+  ASSERT_TRUE(platform::logOpen(path, "locks_test", platform::kLogDebug));
   _lock_all_identifiers(false);
   unlock_all_identifiers();
   _lock_identifier("com.example.logged", true);
   unlock_identifier("com.example.logged");
-  platform::logSetLevel(platform::kLogNotice);
+  quietLog();
 
-  std::ifstream file(LogInTemporaryFile::path());
   std::stringstream text;
-  text << file.rdbuf();
+  text << std::ifstream(path).rdbuf();
+  std::filesystem::remove(path);
   for (const char* line : {"_lock_all_identifiers: Waiting to lock all identifiers for reading",
                            "_lock_all_identifiers: Locked all identifiers for reading",
                            "unlock_all_identifiers: Unlocked all identifiers",
@@ -491,9 +503,9 @@ class LockStressTest : public ::testing::Test {
 };
 
 TEST_F(LockStressTest, MixedOperationsKeepMutualExclusion) {
-  std::vector<std::thread> threads;
-  for (unsigned t = 0; t < kThreads; ++t) threads.emplace_back([this, t] { run(1000 + t); });
-  for (auto& thread : threads) thread.join();
+  std::vector<std::function<void()>> bodies;
+  for (unsigned t = 0; t < kThreads; ++t) bodies.push_back([this, t] { run(1000 + t); });
+  runConcurrently(bodies);
 
   EXPECT_EQ(violations_, 0);
   for (int i = 0; i < kIdentifiers; ++i) EXPECT_EQ(values_[i], writesDone_[i]) << name(i);
