@@ -710,7 +710,6 @@ int readSmallFile(const char* path, plist::Data* out) {
     done += static_cast<size_t>(n);
   }
   out->resize(done);
-  posix_fadvise(fd.get(), 0, 0, POSIX_FADV_DONTNEED);
   return 0;
 }
 

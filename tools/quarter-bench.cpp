@@ -287,13 +287,13 @@ Stats measure(const std::string& socketPath, const Operation& op, int clients, d
 void createMany(const std::string& socketPath, int count, std::string (*name)(int)) {
   constexpr int kWorkers = 8;
   std::atomic<int> next{0}, failures{0};
+  std::vector<std::unique_ptr<qk::Connection>> connections;
+  for (int w = 0; w < kWorkers; ++w) connections.push_back(connectTo(socketPath));
   std::vector<std::thread> workers;
-  for (int w = 0; w < kWorkers; ++w) {
-    workers.emplace_back([&] {
-      auto connection = qk::Connection::connect(socketPath);
+  for (auto& connection : connections) {
+    workers.emplace_back([&, c = connection.get()] {
       for (int i = next++; i < count; i = next++)
-        if (!connection || !succeeded(qk::createOrLookupContainer(*connection, kUser, name(i), kClass, true, false)))
-          ++failures;
+        if (!succeeded(qk::createOrLookupContainer(*c, kUser, name(i), kClass, true, false))) ++failures;
     });
   }
   for (auto& t : workers) t.join();
@@ -308,6 +308,7 @@ void prefill(const std::string& socketPath, int count) {
   createMany(socketPath, count, prefillIdentifier);
   double elapsed = secondsSince(start);
   printf("prefill: %d containers in %.1f s (%.0f creates/s, 8 connections)\n", count, elapsed, count / elapsed);
+  fflush(stdout);
 }
 
 // ---- first look-up after a restart ---------------------------------------------
@@ -335,6 +336,7 @@ void lookupFirst(BenchDaemon& daemon, int containers, int rounds) {
     double first = timedLookupUs(*connection, prefillIdentifier(containers / 2));
     double second = timedLookupUs(*connection, prefillIdentifier(containers - 1));
     printf("%-6d %18.1f %18.1f %14.0f\n", round, first / 1e3, second, restartMs);
+    fflush(stdout);
   }
 }
 
@@ -420,21 +422,31 @@ void runOperations(const Options& options) {
   bool needsLookupSet = std::any_of(options.operations.begin(), options.operations.end(),
                                     [](const Operation* op) { return std::string(op->name) == "lookup"; });
   if (needsLookupSet) createMany(options.socketPath, kLookupSetSize, lookupIdentifier);
-  printf("%-9s %7s %10s %10s %10s %10s\n", "op", "clients", "ops/s", "p50 us", "p99 us", "errors");
+  printf("%-9s %7s %10s %10s %10s %10s %8s\n", "op", "clients", "ops/s", "p50 us", "p99 us", "requests", "errors");
   for (const Operation* op : options.operations) {
     for (int n : options.clients) {
       Stats s = measure(options.socketPath, *op, n, options.seconds);
-      printf("%-9s %7d %10.0f %10.1f %10.1f %10llu\n", op->name, n, s.opsPerSecond, s.p50us, s.p99us,
-             static_cast<unsigned long long>(s.errors));
+      printf("%-9s %7d %10.0f %10.1f %10.1f %10llu %8llu\n", op->name, n, s.opsPerSecond, s.p50us, s.p99us,
+             static_cast<unsigned long long>(s.requests), static_cast<unsigned long long>(s.errors));
       fflush(stdout);
     }
   }
+}
+
+// The machine may be shared; the load says how much to trust the numbers.
+void printLoad() {
+  std::ifstream in("/proc/loadavg");
+  std::string one, five, fifteen;
+  if (in >> one >> five >> fifteen)
+    printf("load average: %s %s %s on %u CPUs\n", one.c_str(), five.c_str(), fifteen.c_str(),
+           std::thread::hardware_concurrency());
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
   Options options = parseOptions(argc, argv);
+  printLoad();
   try {
     std::optional<BenchDaemon> daemon;
     if (!options.daemonBinary.empty()) {
@@ -442,7 +454,7 @@ int main(int argc, char** argv) {
       daemon->start();
       options.socketPath = daemon->socketPath();
     }
-    if (options.lookupFirst) lookupFirst(*daemon, options.prefill.value_or(10'000), 3);
+    if (options.lookupFirst) lookupFirst(*daemon, std::max(1, options.prefill.value_or(10'000)), 3);
     else runOperations(options);
   } catch (const std::exception& e) {
     fprintf(stderr, "quarter-bench: %s\n", e.what());

@@ -415,7 +415,7 @@ enum OptionBit : unsigned {
   kInfo = 1u << 7,
   kAddon = 1u << 8,
   kEntry = 1u << 9,
-  kReplace = 1u << 10,   // the old-/new- options of replace, but --new-class
+  kReplace = 1u << 10,  // every --old-* and --new-* option of replace but --new-class
   kNewClass = 1u << 11,
   kOne = kClass | kUser | kIdentifier | kUUID,  // one existing container
   kOneRequired = kClass | kIdentifier | kUUID,
@@ -474,7 +474,8 @@ StageEntry parseEntry(const std::string& text) {
   size_t b = a == std::string::npos ? a : text.find(':', a + 1);
   size_t c = b == std::string::npos ? b : text.find(':', b + 1);
   if (c == std::string::npos) throw UsageError{"expected USER:CLASS:UUID:IDENTIFIER, got: " + text};
-  return {parseUnsigned(text.substr(0, a), "--entry user"), parseUnsigned(text.substr(a + 1, b - a - 1), "--entry class"),
+  return {parseUnsigned(text.substr(0, a), "--entry user"),
+          parseUnsigned(text.substr(a + 1, b - a - 1), "--entry class"),
           parseUUID(text.substr(b + 1, c - b - 1), "--entry"), text.substr(c + 1)};
 }
 
@@ -491,27 +492,27 @@ struct OptionSpec {
   void (*set)(Args&, const std::string& value);
 };
 
-using F = const std::string&;
+using Text = const std::string&;
 const OptionSpec kOptionSpecs[] = {
-    {"--class", "N", kClass, [](Args& a, F v) { a.self.containerClass = parseUnsigned(v, "--class"); }},
-    {"--user", "N", kUser, [](Args& a, F v) { a.self.userId = parseUnsigned(v, "--user"); }},
-    {"--identifier", "ID", kIdentifier, [](Args& a, F v) { a.self.identifier = v; }},
-    {"--uuid", "UUID", kUUID, [](Args& a, F v) { a.self.uuid = parseUUID(v, "--uuid"); }},
-    {"--transient", nullptr, kTransient, [](Args& a, F) { a.transient = true; }},
-    {"--key", "K", kKey, [](Args& a, F v) { a.key = v; }},
-    {"--value", "TYPE:VALUE", kValue, [](Args& a, F v) { a.value = parseTypedValue(v); }},
-    {"--info", nullptr, kInfo, [](Args& a, F) { a.info = true; }},
-    {"--addon", nullptr, kAddon, [](Args& a, F) { a.addon = true; }},
-    {"--entry", "USER:CLASS:UUID:IDENTIFIER", kEntry, [](Args& a, F v) { a.entries.push_back(parseEntry(v)); }},
-    {"--old-uuid", "UUID", kReplace, [](Args& a, F v) { a.old.uuid = parseUUID(v, "--old-uuid"); }},
-    {"--old-class", "N", kReplace, [](Args& a, F v) { a.old.containerClass = parseUnsigned(v, "--old-class"); }},
-    {"--old-user", "N", kReplace, [](Args& a, F v) { a.old.userId = parseUnsigned(v, "--old-user"); }},
-    {"--old-identifier", "ID", kReplace, [](Args& a, F v) { a.old.identifier = v; }},
-    {"--new-uuid", "UUID", kReplace, [](Args& a, F v) { a.replacement.uuid = parseUUID(v, "--new-uuid"); }},
+    {"--class", "N", kClass, [](Args& a, Text v) { a.self.containerClass = parseUnsigned(v, "--class"); }},
+    {"--user", "N", kUser, [](Args& a, Text v) { a.self.userId = parseUnsigned(v, "--user"); }},
+    {"--identifier", "ID", kIdentifier, [](Args& a, Text v) { a.self.identifier = v; }},
+    {"--uuid", "UUID", kUUID, [](Args& a, Text v) { a.self.uuid = parseUUID(v, "--uuid"); }},
+    {"--transient", nullptr, kTransient, [](Args& a, Text) { a.transient = true; }},
+    {"--key", "K", kKey, [](Args& a, Text v) { a.key = v; }},
+    {"--value", "TYPE:VALUE", kValue, [](Args& a, Text v) { a.value = parseTypedValue(v); }},
+    {"--info", nullptr, kInfo, [](Args& a, Text) { a.info = true; }},
+    {"--addon", nullptr, kAddon, [](Args& a, Text) { a.addon = true; }},
+    {"--entry", "USER:CLASS:UUID:IDENTIFIER", kEntry, [](Args& a, Text v) { a.entries.push_back(parseEntry(v)); }},
+    {"--old-uuid", "UUID", kReplace, [](Args& a, Text v) { a.old.uuid = parseUUID(v, "--old-uuid"); }},
+    {"--old-class", "N", kReplace, [](Args& a, Text v) { a.old.containerClass = parseUnsigned(v, "--old-class"); }},
+    {"--old-user", "N", kReplace, [](Args& a, Text v) { a.old.userId = parseUnsigned(v, "--old-user"); }},
+    {"--old-identifier", "ID", kReplace, [](Args& a, Text v) { a.old.identifier = v; }},
+    {"--new-uuid", "UUID", kReplace, [](Args& a, Text v) { a.replacement.uuid = parseUUID(v, "--new-uuid"); }},
     {"--new-class", "N", kNewClass,
-     [](Args& a, F v) { a.replacement.containerClass = parseUnsigned(v, "--new-class"); }},
-    {"--new-user", "N", kReplace, [](Args& a, F v) { a.replacement.userId = parseUnsigned(v, "--new-user"); }},
-    {"--new-identifier", "ID", kReplace, [](Args& a, F v) { a.replacement.identifier = v; }},
+     [](Args& a, Text v) { a.replacement.containerClass = parseUnsigned(v, "--new-class"); }},
+    {"--new-user", "N", kReplace, [](Args& a, Text v) { a.replacement.userId = parseUnsigned(v, "--new-user"); }},
+    {"--new-identifier", "ID", kReplace, [](Args& a, Text v) { a.replacement.identifier = v; }},
 };
 
 qk::Result createOrLookup(qk::Connection& c, const Args& a, bool create) {

@@ -563,6 +563,9 @@ TEST_F(CommandTest, WipeDataContainerKeepsIdentityAndPath) {
   EXPECT_EQ(after.path, app.path);
   EXPECT_EQ(after.uuid, app.uuid);
   EXPECT_EQ(tree(after.path), kFreshDataContainer);
+  auto onDisk = readPlist(after.path + "/" + kMetadataFile);
+  ASSERT_TRUE(onDisk);
+  EXPECT_EQ(stringAt(*onDisk, "QRTMetadataUUID"), app.uuid.UUIDString()) << "the UUID must survive a restart";
   EXPECT_EQ(listDirectory(parentOf(app.path)).size(), 1u);
   EXPECT_EQ(readLink(mapping("com.example.app")), app.path);
 

@@ -97,7 +97,7 @@ class ReplaceTest : public DaemonFixture {
   Container make(const std::string& identifier, bool transient, const std::string& marker) {
     Container made = lookup(identifier, true, transient);
     EXPECT_EQ(made.error, 1u) << identifier;
-    writeFile(made.path + "/" + kMarkerFile, marker);
+    if (!made.path.empty()) writeFile(made.path + "/" + kMarkerFile, marker);
     return made;
   }
 
