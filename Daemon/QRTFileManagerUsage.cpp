@@ -32,6 +32,9 @@ namespace {
 
 constexpr size_t kBulkReadSize = 32768;
 constexpr unsigned kEntryAttributes = STATX_TYPE | STATX_BLOCKS | STATX_NLINK | STATX_INO;
+// A second thread costs about as much as this many entries; smaller trees
+// are walked by the calling thread alone.
+constexpr uint64_t kEntriesBeforeHelper = 256;
 
 const char* errorText(int err) { return strerror(err); }
 
@@ -66,7 +69,9 @@ struct FileId {
   bool operator==(const FileId&) const = default;
 };
 struct FileIdHash {
-  size_t operator()(const FileId& id) const { return std::hash<uint64_t>()(id.inode * 0x9E3779B97F4A7C15ull ^ id.device); }
+  size_t operator()(const FileId& id) const {
+    return std::hash<uint64_t>()(id.inode * 0x9E3779B97F4A7C15ull ^ id.device);
+  }
 };
 
 class DiskUsageWalk;
@@ -79,6 +84,7 @@ class DirectoryReader {
   void measureDirectory(const std::string& path);
   std::vector<std::string>& children() { return children_; }
   uint64_t total() const { return total_; }
+  uint64_t entriesSeen() const { return entriesSeen_; }
 
  private:
   void visitBatch(int dirfd, const std::string& path, size_t length, uint64_t& index);
@@ -90,11 +96,13 @@ class DirectoryReader {
   std::unique_ptr<uint64_t[]> buffer_{new uint64_t[kBulkReadSize / sizeof(uint64_t)]};
   std::vector<std::string> children_;
   uint64_t total_ = 0;
+  uint64_t entriesSeen_ = 0;
 };
 
 // One measurement: breadth first over a queue of directory paths, so that
 // depth costs no stack. The walk is bound by one system call per entry, not
-// by the disk, so once two directories wait a second thread takes part.
+// by the disk, so in a larger tree a second thread takes part once two
+// directories wait.
 class DiskUsageWalk {
  public:
   explicit DiskUsageWalk(std::string root) { queue_.push_back(std::move(root)); }
@@ -113,6 +121,7 @@ class DiskUsageWalk {
   size_t finishDirectory(std::vector<std::string>& children);
   void startHelper();
 
+  bool helperConsidered_ = false;  // by the calling thread, once
   std::mutex mutex_;
   std::condition_variable changed_;
   std::deque<std::string> queue_;
@@ -142,7 +151,10 @@ void DiskUsageWalk::work(bool mayStartHelper) {
     while (takeDirectory(&path)) {
       reader.measureDirectory(path);
       size_t waiting = finishDirectory(reader.children());
-      if (mayStartHelper && waiting >= 2 && !helper_.joinable()) startHelper();
+      if (mayStartHelper && !helperConsidered_ && waiting >= 2 && reader.entriesSeen() >= kEntriesBeforeHelper) {
+        helperConsidered_ = true;
+        startHelper();
+      }
     }
     std::lock_guard<std::mutex> hold(mutex_);
     total_ += reader.total();
@@ -213,6 +225,7 @@ void DirectoryReader::visitBatch(int dirfd, const std::string& path, size_t leng
     const size_t nameRoom = recordLength - kDirentHeaderSize;
     const size_t nameLength = strnlen(name, nameRoom);
     if (name[0] == '.' && (nameLength == 1 || (nameLength == 2 && name[1] == '.'))) continue;
+    ++entriesSeen_;
     // A name that fills its record unterminated is no name at all.
     visitEntry(dirfd, path, index++, entry->d_type, nameLength < nameRoom && nameLength > 0 ? name : nullptr);
   }

@@ -77,84 +77,71 @@ void RequestConnection::cancel() {
   ::shutdown(fd_, SHUT_RDWR);
 }
 
+// Several threads wait on one epoll set; each connection is armed one-shot,
+// so only one thread reads it at a time. The thread that read a request
+// serves it itself when another poller is free to take new events; other
+// requests (the rest of a pipelined batch, or all of them when every poller
+// is busy) go to the listener queue. Serving inline saves a thread hand-off
+// on every request.
 struct RequestListener::Impl {
+  static constexpr int kPollers = 4;
+
+  struct Client {
+    ConnectionRef connection;
+    frame::Decoder decoder;            // touched only by the thread that owns the armed event
+    std::atomic<int> inFlight{0};
+    std::mutex pauseLock;
+    bool paused = false;               // not armed until its load falls
+  };
+  using ClientRef = std::shared_ptr<Client>;
+
   std::string path;
   int listenFd = -1;
   int epollFd = -1;
   int wakeFd = -1;
   std::shared_ptr<Queue> queue;
   RequestHandler handler;
-  std::thread poller;
+  std::vector<std::thread> pollers;
   std::atomic<bool> stopping{false};
-
-  struct Client {
-    ConnectionRef connection;
-    frame::Decoder decoder;
-    std::shared_ptr<std::atomic<int>> inFlight = std::make_shared<std::atomic<int>>(0);
-    bool paused = false;
-  };
-  std::unordered_map<int, Client> clients;  // poller thread only
-  std::mutex resumeLock;
-  std::vector<ConnectionRef> toResume;  // paused clients whose load fell
+  std::atomic<int> idlePollers{0};
+  std::mutex clientsLock;
+  std::unordered_map<int, ClientRef> clients;
 
   ~Impl() {
-    if (poller.joinable()) {
-      stopping = true;
-      uint64_t one = 1;
-      (void)!::write(wakeFd, &one, sizeof one);
-      poller.join();
-    }
-    if (listenFd >= 0) ::close(listenFd);
+    stop();
     if (epollFd >= 0) ::close(epollFd);
     if (wakeFd >= 0) ::close(wakeFd);
   }
 
+  void stop() {
+    stopping = true;
+    uint64_t one = 1;
+    if (wakeFd >= 0) (void)!::write(wakeFd, &one, sizeof one);
+    for (std::thread& t : pollers) t.join();
+    pollers.clear();
+    // The epoll set stays open: requests still running may re-arm into it.
+    if (listenFd >= 0) ::close(listenFd);
+    listenFd = -1;
+  }
+
   void run();
+  void arm(int fd, bool listening = false);
   void acceptClients();
-  void readClient(int fd);
-  void dropClient(int fd);
-  void dispatch(Client& client, RequestEvent event);
-  void setReading(int fd, bool on);
-  void resumePaused();
+  ClientRef findClient(int fd);
+  void dropClient(const ClientRef& client);
+  // Reads what the socket holds and serves the whole frames.
+  void serveClient(const ClientRef& client, bool mayServeInline);
+  void dispatch(const ClientRef& client, std::vector<RequestEvent>& events, bool mayServeInline);
+  void runEvent(const ClientRef& client, RequestEvent& event);
+  void finishEvent(const ClientRef& client);
 };
 
-void RequestListener::Impl::dispatch(Client& client, RequestEvent event) {
-  transactionBegin();
-  client.inFlight->fetch_add(1);
-  queue->async([this, connection = client.connection, inFlight = client.inFlight,
-                event = std::move(event)]() mutable {
-    handler(connection, event);
-    if (inFlight->fetch_sub(1) == kMaxInFlight) {
-      std::lock_guard<std::mutex> hold(resumeLock);
-      toResume.push_back(connection);
-      uint64_t one = 1;
-      (void)!::write(wakeFd, &one, sizeof one);
-    }
-    transactionEnd();
-  });
-}
-
-void RequestListener::Impl::setReading(int fd, bool on) {
+void RequestListener::Impl::arm(int fd, bool listening) {
   epoll_event ev{};
-  ev.events = on ? (EPOLLIN | EPOLLRDHUP) : 0;
+  ev.events = EPOLLIN | EPOLLONESHOT | (listening ? 0u : static_cast<uint32_t>(EPOLLRDHUP));
   ev.data.fd = fd;
-  ::epoll_ctl(epollFd, EPOLL_CTL_MOD, fd, &ev);
-}
-
-void RequestListener::Impl::resumePaused() {
-  uint64_t count;
-  (void)!::read(wakeFd, &count, sizeof count);
-  std::vector<ConnectionRef> ready;
-  {
-    std::lock_guard<std::mutex> hold(resumeLock);
-    ready.swap(toResume);
-  }
-  for (const ConnectionRef& connection : ready) {
-    auto it = clients.find(connection->fd());
-    if (it == clients.end() || it->second.connection != connection || !it->second.paused) continue;
-    it->second.paused = false;
-    setReading(connection->fd(), true);
-    readClient(connection->fd());
+  if (::epoll_ctl(epollFd, EPOLL_CTL_MOD, fd, &ev) != 0 && errno == ENOENT) {
+    ::epoll_ctl(epollFd, EPOLL_CTL_ADD, fd, &ev);
   }
 }
 
@@ -166,33 +153,57 @@ void RequestListener::Impl::acceptClients() {
       if (errno != EAGAIN && errno != EWOULDBLOCK) QRTLog(kLogError, "accept failed: %s", strerror(errno));
       return;
     }
-    auto connection = std::make_shared<RequestConnection>(fd, peerCredentials(fd));
-    epoll_event ev{};
-    ev.events = EPOLLIN | EPOLLRDHUP;
-    ev.data.fd = fd;
-    if (::epoll_ctl(epollFd, EPOLL_CTL_ADD, fd, &ev) != 0) {
-      QRTLog(kLogError, "epoll_ctl failed for a new client: %s", strerror(errno));
-      continue;  // connection closes with its last reference
+    auto client = std::make_shared<Client>();
+    client->connection = std::make_shared<RequestConnection>(fd, peerCredentials(fd));
+    {
+      std::lock_guard<std::mutex> hold(clientsLock);
+      clients[fd] = client;
     }
-    clients.emplace(fd, Client{std::move(connection), frame::Decoder()});
+    arm(fd);
   }
 }
 
-void RequestListener::Impl::dropClient(int fd) {
-  ::epoll_ctl(epollFd, EPOLL_CTL_DEL, fd, nullptr);
-  clients.erase(fd);
+RequestListener::Impl::ClientRef RequestListener::Impl::findClient(int fd) {
+  std::lock_guard<std::mutex> hold(clientsLock);
+  auto it = clients.find(fd);
+  return it == clients.end() ? nullptr : it->second;
 }
 
-void RequestListener::Impl::readClient(int fd) {
+void RequestListener::Impl::dropClient(const ClientRef& client) {
+  int fd = client->connection->fd();
+  ::epoll_ctl(epollFd, EPOLL_CTL_DEL, fd, nullptr);
+  std::lock_guard<std::mutex> hold(clientsLock);
   auto it = clients.find(fd);
-  if (it == clients.end()) return;
-  Client& client = it->second;
+  if (it != clients.end() && it->second == client) clients.erase(it);
+}
+
+void RequestListener::Impl::runEvent(const ClientRef& client, RequestEvent& event) {
+  handler(client->connection, event);
+  finishEvent(client);
+}
+
+void RequestListener::Impl::finishEvent(const ClientRef& client) {
+  if (client->inFlight.fetch_sub(1) == kMaxInFlight) {
+    bool resume = false;
+    {
+      std::lock_guard<std::mutex> hold(client->pauseLock);
+      resume = client->paused;
+      client->paused = false;
+    }
+    // This thread now owns the connection's reading until it re-arms it.
+    if (resume) serveClient(client, false);
+  }
+  transactionEnd();
+}
+
+void RequestListener::Impl::serveClient(const ClientRef& client, bool mayServeInline) {
   uint8_t buffer[kReadChunk];
+  int fd = client->connection->fd();
   bool eof = false;
   for (;;) {
     ssize_t n = ::recv(fd, buffer, sizeof buffer, 0);
     if (n > 0) {
-      client.decoder.append(buffer, static_cast<size_t>(n));
+      client->decoder.append(buffer, static_cast<size_t>(n));
       if (static_cast<size_t>(n) < sizeof buffer) break;
       continue;
     }
@@ -201,55 +212,85 @@ void RequestListener::Impl::readClient(int fd) {
     eof = true;
     break;
   }
-  while (client.inFlight->load() < kMaxInFlight) {
-    auto raw = client.decoder.next();
-    if (!raw) break;
-    RequestEvent event;
-    event.messageId = raw->messageId;
-    event.message = frame::decodeMessage(raw->payload, &event.failure);
-    bool bad = !event.message;
-    dispatch(client, std::move(event));
-    if (bad) {
-      // Nothing after a frame without reply context is served.
-      dropClient(fd);
-      return;
+  for (;;) {
+    std::vector<RequestEvent> events;
+    bool closing = false;
+    bool capped = false;  // stopped at the load limit: more frames may be buffered
+    for (;;) {
+      if (client->inFlight.load() + static_cast<int>(events.size()) >= kMaxInFlight) {
+        capped = true;
+        break;
+      }
+      auto raw = client->decoder.next();
+      if (!raw) break;
+      RequestEvent event;
+      event.messageId = raw->messageId;
+      event.message = frame::decodeMessage(raw->payload, &event.failure);
+      closing = !event.message;
+      events.push_back(std::move(event));
+      if (closing) break;  // nothing after a frame without reply context is served
     }
-  }
-  if (client.decoder.failed()) {
-    RequestEvent event;
-    event.failure = client.decoder.failure();
-    dispatch(client, std::move(event));
-    dropClient(fd);
-    return;
-  }
-  if (eof || client.connection->cancelled()) {
-    dropClient(fd);
-  } else if (client.inFlight->load() >= kMaxInFlight && !client.paused) {
-    client.paused = true;
-    setReading(fd, false);
+    if (!closing && !capped && client->decoder.failed()) {
+      RequestEvent event;
+      event.failure = client->decoder.failure();
+      events.push_back(std::move(event));
+      closing = true;
+    }
+    client->inFlight.fetch_add(static_cast<int>(events.size()));
+    for (size_t i = 0; i < events.size(); ++i) transactionBegin();
+
+    if (closing || client->connection->cancelled() || (eof && !capped)) {
+      dropClient(client);
+      return dispatch(client, events, mayServeInline);
+    }
+    if (!capped) {
+      arm(fd);
+      return dispatch(client, events, mayServeInline);
+    }
+    {
+      // Checked under the lock that finishEvent takes, so a request finishing
+      // meanwhile either sees the pause or leaves a load this check sees fall.
+      std::lock_guard<std::mutex> hold(client->pauseLock);
+      if (client->inFlight.load() >= kMaxInFlight) {
+        client->paused = true;  // the request that brings the load down serves it again
+        return dispatch(client, events, mayServeInline);
+      }
+    }
+    dispatch(client, events, false);  // the load fell meanwhile: serve what is buffered
   }
 }
 
+// The last request is served on this thread if another poller is free; the
+// rest run on the queue, so that a pipelined batch is served concurrently.
+void RequestListener::Impl::dispatch(const ClientRef& client, std::vector<RequestEvent>& events,
+                                     bool mayServeInline) {
+  const bool inlineLast = mayServeInline && !events.empty() && idlePollers.load() > 0;
+  const size_t queued = inlineLast ? events.size() - 1 : events.size();
+  for (size_t i = 0; i < queued; ++i) {
+    queue->async([this, client, event = std::move(events[i])]() mutable { runEvent(client, event); });
+  }
+  if (inlineLast) runEvent(client, events.back());
+}
+
 void RequestListener::Impl::run() {
-  epoll_event events[64];
   while (!stopping) {
-    int n = ::epoll_wait(epollFd, events, 64, -1);
+    epoll_event event;
+    idlePollers.fetch_add(1);
+    int n = ::epoll_wait(epollFd, &event, 1, -1);
+    idlePollers.fetch_sub(1);
     if (n < 0) {
       if (errno == EINTR) continue;
       QRTLog(kLogError, "epoll_wait failed: %s", strerror(errno));
       return;
     }
-    for (int i = 0; i < n && !stopping; ++i) {
-      int fd = events[i].data.fd;
-      if (fd == wakeFd) {
-        resumePaused();
-        continue;
-      }
-      if (fd == listenFd) {
-        acceptClients();
-      } else {
-        readClient(fd);
-      }
+    if (n == 0 || stopping) continue;
+    int fd = event.data.fd;
+    if (fd == wakeFd) continue;
+    if (fd == listenFd) {
+      acceptClients();
+      arm(listenFd, true);
+    } else if (ClientRef client = findClient(fd)) {
+      serveClient(client, true);
     }
   }
 }
@@ -287,22 +328,14 @@ RequestListener::RequestListener(std::unique_ptr<Impl> impl) : impl_(std::move(i
 RequestListener::~RequestListener() = default;
 
 void RequestListener::resume() {
-  if (impl_->poller.joinable()) return;
-  epoll_event ev{};
-  ev.events = EPOLLIN;
-  ev.data.fd = impl_->listenFd;
-  ::epoll_ctl(impl_->epollFd, EPOLL_CTL_ADD, impl_->listenFd, &ev);
-  impl_->poller = std::thread([impl = impl_.get()] { impl->run(); });
+  if (!impl_->pollers.empty()) return;
+  impl_->arm(impl_->listenFd, true);
+  for (int i = 0; i < Impl::kPollers; ++i) impl_->pollers.emplace_back([impl = impl_.get()] { impl->run(); });
 }
 
 void RequestListener::stopAccepting() {
-  if (!impl_->poller.joinable()) return;
-  impl_->stopping = true;
-  uint64_t one = 1;
-  (void)!::write(impl_->wakeFd, &one, sizeof one);
-  impl_->poller.join();
-  ::close(impl_->listenFd);
-  impl_->listenFd = -1;
+  if (impl_->pollers.empty()) return;
+  impl_->stop();
   ::unlink(impl_->path.c_str());
 }
 

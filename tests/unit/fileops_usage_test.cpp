@@ -71,13 +71,12 @@ TEST_F(UsageTest, CountsAllocatedBytesOfEverythingButDirectories) {
   makeFile("c/a/large", 300000);
   ASSERT_EQ(symlink(std::string(200, 'y').c_str(), path("c/a/link").c_str()), 0);  // a link with its own block
   std::filesystem::create_directories(path("c/a/b/hollow/hollower"));
-  // Enough directories that the walk runs on more than one thread.
-  uint64_t expected = 0;
-  for (int i = 0; i < 40; ++i) {
-    makeFile("c/wide/d" + std::to_string(i) + "/f", 100 * i);
-    expected += allocated(path("c/wide/d" + std::to_string(i) + "/f"));
-  }
+  // Enough entries and directories that the walk runs on two threads.
+  auto wide = [](int i) { return "c/wide/d" + std::to_string(i % 40) + "/f" + std::to_string(i); };
+  for (int i = 0; i < 300; ++i) makeFile(wide(i), 50 * i);
   sync();
+  uint64_t expected = 0;
+  for (int i = 0; i < 300; ++i) expected += allocated(path(wide(i)));
   for (const char* rel : {"c/small", "c/a/b/medium", "c/a/large", "c/a/link"}) expected += allocated(path(rel));
   ASSERT_GT(allocated(path("c/a/link")), 0u);
   EXPECT_EQ(fm_.diskUsageForURL(url("c")), expected);
@@ -88,9 +87,10 @@ TEST_F(UsageTest, HardLinkedFileCountedOncePerWalk) {
   makeFile("c/d0/twin", 10000);
   makeFile("c/d1/solo", 3000);
   makeFile("shared", 20000);
-  for (int i = 1; i < 20; ++i) {
+  for (int i = 1; i < 30; ++i) {
     std::filesystem::create_directories(path("c/d" + std::to_string(i)));
     ASSERT_EQ(link(path("c/d0/twin").c_str(), path("c/d" + std::to_string(i) + "/twin").c_str()), 0);
+    for (int j = 0; j < 10; ++j) makeFile("c/d" + std::to_string(i) + "/empty" + std::to_string(j), 0);
   }
   ASSERT_EQ(link(path("shared").c_str(), path("c/d5/inside").c_str()), 0);  // its twin lies outside
   sync();
