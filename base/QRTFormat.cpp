@@ -1,5 +1,5 @@
-// Each conversion is handed to snprintf as one sanitised spec together with a
-// value of the exact C type that spec names, so no format string can make us
+// Each conversion is handed to snprintf as one sanitised directive together with a
+// value of the exact C type that directive names, so no format string can make us
 // read a missing argument or one of the wrong type.
 #include "base/QRTFormat.h"
 
@@ -19,7 +19,7 @@ constexpr int kMaxField = 4096;
 
 enum class Length { None, Char, Short, Long, LongDouble };
 
-struct Spec {
+struct Directive {
   std::string flags;
   int width = -1;
   int precision = -1;
@@ -138,24 +138,24 @@ std::string naturalText(const Arg* a) {
   return {};
 }
 
-void appendPadded(std::string& out, std::string_view text, const Spec& spec, bool usePrecision) {
-  if (usePrecision && spec.precision >= 0 && text.size() > static_cast<size_t>(spec.precision))
-    text = text.substr(0, static_cast<size_t>(spec.precision));
-  size_t fill = spec.width > 0 && static_cast<size_t>(spec.width) > text.size() ? spec.width - text.size() : 0;
-  if (!spec.has('-')) out.append(fill, ' ');
+void appendPadded(std::string& out, std::string_view text, const Directive& directive, bool usePrecision) {
+  if (usePrecision && directive.precision >= 0 && text.size() > static_cast<size_t>(directive.precision))
+    text = text.substr(0, static_cast<size_t>(directive.precision));
+  size_t fill = directive.width > 0 && static_cast<size_t>(directive.width) > text.size() ? directive.width - text.size() : 0;
+  if (!directive.has('-')) out.append(fill, ' ');
   out.append(text);
-  if (spec.has('-')) out.append(fill, ' ');
+  if (directive.has('-')) out.append(fill, ' ');
 }
 
 // "%" + the flags the conversion allows + width and precision + length + conversion.
-std::string printfSpec(const Spec& spec, const char* allowedFlags, const char* length) {
+std::string printfSpec(const Directive& directive, const char* allowedFlags, const char* length) {
   std::string fmt = "%";
-  for (char flag : spec.flags)
+  for (char flag : directive.flags)
     if (std::strchr(allowedFlags, flag)) fmt += flag;
-  if (spec.width >= 0) fmt += std::to_string(spec.width);
-  if (spec.precision >= 0) fmt += "." + std::to_string(spec.precision);
+  if (directive.width >= 0) fmt += std::to_string(directive.width);
+  if (directive.precision >= 0) fmt += "." + std::to_string(directive.precision);
   fmt += length;
-  fmt += spec.conversion;
+  fmt += directive.conversion;
   return fmt;
 }
 
@@ -174,58 +174,58 @@ void appendPrintf(std::string& out, const std::string& fmt, T value) {
   out.resize(old + static_cast<size_t>(n));
 }
 
-void appendInteger(std::string& out, const Spec& spec, const Arg* arg) {
-  if (auto text = ownText(arg)) return appendPadded(out, *text, spec, false);
-  const bool isSigned = spec.conversion == 'd' || spec.conversion == 'i';
+void appendInteger(std::string& out, const Directive& directive, const Arg* arg) {
+  if (auto text = ownText(arg)) return appendPadded(out, *text, directive, false);
+  const bool isSigned = directive.conversion == 'd' || directive.conversion == 'i';
   if (isSigned) {
-    int64_t v = arg ? narrowSigned(signedOf(*arg), spec.length) : 0;
-    appendPrintf(out, printfSpec(spec, "-+ 0", "ll"), static_cast<long long>(v));
+    int64_t v = arg ? narrowSigned(signedOf(*arg), directive.length) : 0;
+    appendPrintf(out, printfSpec(directive, "-+ 0", "ll"), static_cast<long long>(v));
   } else {
-    uint64_t v = arg ? narrowUnsigned(unsignedOf(*arg), spec.length) : 0;
-    appendPrintf(out, printfSpec(spec, "-#0", "ll"), static_cast<unsigned long long>(v));
+    uint64_t v = arg ? narrowUnsigned(unsignedOf(*arg), directive.length) : 0;
+    appendPrintf(out, printfSpec(directive, "-#0", "ll"), static_cast<unsigned long long>(v));
   }
 }
 
-void appendReal(std::string& out, const Spec& spec, const Arg* arg) {
-  if (auto text = ownText(arg)) return appendPadded(out, *text, spec, false);
+void appendReal(std::string& out, const Directive& directive, const Arg* arg) {
+  if (auto text = ownText(arg)) return appendPadded(out, *text, directive, false);
   double v = arg ? doubleOf(*arg) : 0;
-  if (spec.length == Length::LongDouble)
-    appendPrintf(out, printfSpec(spec, "-+ #0", "L"), static_cast<long double>(v));
+  if (directive.length == Length::LongDouble)
+    appendPrintf(out, printfSpec(directive, "-+ #0", "L"), static_cast<long double>(v));
   else
-    appendPrintf(out, printfSpec(spec, "-+ #0", ""), v);
+    appendPrintf(out, printfSpec(directive, "-+ #0", ""), v);
 }
 
-void appendChar(std::string& out, const Spec& spec, const Arg* arg) {
-  if (auto text = ownText(arg)) return appendPadded(out, *text, spec, false);
+void appendChar(std::string& out, const Directive& directive, const Arg* arg) {
+  if (auto text = ownText(arg)) return appendPadded(out, *text, directive, false);
   std::string c = arg ? std::string(1, static_cast<char>(unsignedOf(*arg))) : std::string();
-  appendPadded(out, c, spec, false);
+  appendPadded(out, c, directive, false);
 }
 
-void appendPointer(std::string& out, const Spec& spec, const Arg* arg) {
-  if (auto text = ownText(arg)) return appendPadded(out, *text, spec, false);
-  appendPadded(out, hexPointer(arg ? unsignedOf(*arg) : 0), spec, false);
+void appendPointer(std::string& out, const Directive& directive, const Arg* arg) {
+  if (auto text = ownText(arg)) return appendPadded(out, *text, directive, false);
+  appendPadded(out, hexPointer(arg ? unsignedOf(*arg) : 0), directive, false);
 }
 
 // Appends one conversion; false for a conversion we do not know (%n among them).
-bool appendConversion(std::string& out, const Spec& spec, ArgCursor& args) {
-  switch (spec.conversion) {
+bool appendConversion(std::string& out, const Directive& directive, ArgCursor& args) {
+  switch (directive.conversion) {
     case '%':
       out += '%';
       return true;
     case 'd': case 'i': case 'u': case 'x': case 'X': case 'o':
-      appendInteger(out, spec, args.take());
+      appendInteger(out, directive, args.take());
       return true;
     case 'f': case 'F': case 'e': case 'E': case 'g': case 'G': case 'a': case 'A':
-      appendReal(out, spec, args.take());
+      appendReal(out, directive, args.take());
       return true;
     case 's': case '@':
-      appendPadded(out, naturalText(args.take()), spec, true);
+      appendPadded(out, naturalText(args.take()), directive, true);
       return true;
     case 'c':
-      appendChar(out, spec, args.take());
+      appendChar(out, directive, args.take());
       return true;
     case 'p':
-      appendPointer(out, spec, args.take());
+      appendPointer(out, directive, args.take());
       return true;
     default:
       return false;
@@ -269,29 +269,29 @@ const char* readLength(const char* p, Length* length) {
 
 // Reads flags, width, precision and length after a '%'; returns where the
 // conversion character is (possibly the terminator).
-const char* parseSpec(const char* p, Spec& spec, ArgCursor& args) {
+const char* parseSpec(const char* p, Directive& directive, ArgCursor& args) {
   for (; *p && std::strchr("-+ #0", *p); ++p)
-    if (!spec.has(*p)) spec.flags += *p;
+    if (!directive.has(*p)) directive.flags += *p;
   if (*p == '*') {
     ++p;
     int w = starValue(args);
-    if (w < 0 && !spec.has('-')) spec.flags += '-';
-    spec.width = std::abs(w);
+    if (w < 0 && !directive.has('-')) directive.flags += '-';
+    directive.width = std::abs(w);
   } else {
-    p = readNumber(p, &spec.width);
+    p = readNumber(p, &directive.width);
   }
   if (*p == '.') {
     ++p;
     if (*p == '*') {
       ++p;
       int v = starValue(args);
-      spec.precision = v < 0 ? -1 : v;
+      directive.precision = v < 0 ? -1 : v;
     } else {
-      spec.precision = 0;
-      p = readNumber(p, &spec.precision);
+      directive.precision = 0;
+      p = readNumber(p, &directive.precision);
     }
   }
-  return readLength(p, &spec.length);
+  return readLength(p, &directive.length);
 }
 
 }  // namespace
@@ -310,14 +310,14 @@ std::string QRTFormatArgs(const char* format, std::initializer_list<QRTFormatArg
         p += n;
         continue;
       }
-      Spec spec;
-      const char* conversion = parseSpec(p + 1, spec, cursor);
+      Directive directive;
+      const char* conversion = parseSpec(p + 1, directive, cursor);
       if (!*conversion) {  // the format ends inside a conversion: keep it as text
         out.append(p);
         break;
       }
-      spec.conversion = *conversion;
-      if (!appendConversion(out, spec, cursor)) out.append(p, static_cast<size_t>(conversion + 1 - p));
+      directive.conversion = *conversion;
+      if (!appendConversion(out, directive, cursor)) out.append(p, static_cast<size_t>(conversion + 1 - p));
       p = conversion + 1;
     }
   } catch (const std::exception&) {

@@ -485,7 +485,7 @@ plist::Value parseTypedValue(const std::string& text) {
   return parseTyped(text.substr(0, colon), text.substr(colon + 1), "--value");
 }
 
-struct OptionSpec {
+struct OptionRow {
   const char* flag;
   const char* valueName;  // nullptr: a switch
   unsigned bit;
@@ -493,7 +493,7 @@ struct OptionSpec {
 };
 
 using Text = const std::string&;
-const OptionSpec kOptionSpecs[] = {
+const OptionRow kOptionTable[] = {
     {"--class", "N", kClass, [](Args& a, Text v) { a.self.containerClass = parseUnsigned(v, "--class"); }},
     {"--user", "N", kUser, [](Args& a, Text v) { a.self.userId = parseUnsigned(v, "--user"); }},
     {"--identifier", "ID", kIdentifier, [](Args& a, Text v) { a.self.identifier = v; }},
@@ -609,9 +609,9 @@ const Subcommand kSubcommands[] = {
      Output::Keys, kContainerKeys, "Creates or looks up a system container (class 12, user 499)."},
 };
 
-const OptionSpec* findOption(const std::string& flag) {
-  for (const OptionSpec& spec : kOptionSpecs)
-    if (flag == spec.flag) return &spec;
+const OptionRow* findOption(const std::string& flag) {
+  for (const OptionRow& option : kOptionTable)
+    if (flag == option.flag) return &option;
   return nullptr;
 }
 
@@ -633,21 +633,21 @@ const Subcommand* findSubcommand(const std::vector<std::string>& args, size_t* w
 Args parseArgs(const Subcommand& row, const std::vector<std::string>& args, size_t first) {
   Args a;
   for (size_t i = first; i < args.size(); ++i) {
-    const OptionSpec* spec = findOption(args[i]);
-    if (!spec || !(spec->bit & row.options))
+    const OptionRow* option = findOption(args[i]);
+    if (!option || !(option->bit & row.options))
       throw UsageError{"unknown argument to " + std::string(row.name) + ": " + args[i]};
     std::string value;
-    if (spec->valueName) {
+    if (option->valueName) {
       if (i + 1 == args.size()) throw UsageError{args[i] + " needs a value"};
       value = args[++i];
     }
-    spec->set(a, value);
-    a.given |= spec->bit;
+    option->set(a, value);
+    a.given |= option->bit;
   }
   unsigned missing = row.required & ~a.given;
   if (a.addon) missing &= ~kClass;  // the addon wipe always works on class 4
-  for (const OptionSpec& spec : kOptionSpecs)
-    if (spec.bit & missing) throw UsageError{std::string(row.name) + " needs " + spec.flag};
+  for (const OptionRow& option : kOptionTable)
+    if (option.bit & missing) throw UsageError{std::string(row.name) + " needs " + option.flag};
   return a;
 }
 
@@ -662,11 +662,11 @@ std::string usageText() {
   std::string out = kUsageHead;
   for (const Subcommand& row : kSubcommands) {
     std::string line = "  " + std::string(row.name);
-    for (const OptionSpec& spec : kOptionSpecs) {
-      if (!(spec.bit & row.options)) continue;
-      std::string option = spec.flag;
-      if (spec.valueName) option += std::string(" ") + spec.valueName;
-      option = (spec.bit & row.required) ? " " + option : " [" + option + "]";
+    for (const OptionRow& entry : kOptionTable) {
+      if (!(entry.bit & row.options)) continue;
+      std::string option = entry.flag;
+      if (entry.valueName) option += std::string(" ") + entry.valueName;
+      option = (entry.bit & row.required) ? " " + option : " [" + option + "]";
       if (line.size() + option.size() > 92) {
         out += line + '\n';
         line = "       ";
