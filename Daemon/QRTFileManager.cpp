@@ -810,9 +810,8 @@ bool QRTFileManager::createDirectoryAtURL(const QRTURL& url, bool withIntermedia
 bool QRTFileManager::_copyItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
                                     QRTErrorRef* error) {
   if (!failIfSrcMissing) {
-    int err = lstatError(src);
-    if (err == ENOENT) return true;
-    if (err) {
+    if (int err = lstatError(src)) {
+      if (err == ENOENT) return true;  // nothing to do
       QRTSetError(error, QRT_POSIX_ERROR(err, "stat of %@ failed: %s", src, errorText(err)));
       return false;
     }
@@ -836,9 +835,8 @@ bool QRTFileManager::copyItemIfExistsAtURL(const QRTURL& src, const QRTURL& toUR
 bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
                                     QRTErrorRef* error) {
   if (!failIfSrcMissing) {
-    int err = lstatError(src);
-    if (err == ENOENT) return true;
-    if (err) {
+    if (int err = lstatError(src)) {
+      if (err == ENOENT) return true;  // nothing to do
       QRTSetError(error, QRT_POSIX_ERROR(err, "stat of %@ failed: %s", src, errorText(err)));
       return false;
     }
