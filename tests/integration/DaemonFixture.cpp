@@ -1,5 +1,6 @@
 #include "DaemonFixture.h"
 
+#include <dirent.h>
 #include <signal.h>
 #include <stdlib.h>
 #include <sys/stat.h>
@@ -15,11 +16,6 @@
 
 namespace {
 
-void writeFile(const std::string& path, const std::string& text) {
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  out << text;
-}
-
 std::string ownExecutable() {
   char buffer[4096];
   ssize_t n = readlink("/proc/self/exe", buffer, sizeof buffer - 1);
@@ -31,6 +27,55 @@ std::string ownExecutable() {
 plist::Dictionary request(uint64_t command, plist::Dictionary keys) {
   keys["Command"] = command;
   return keys;
+}
+
+uint64_t codeOf(const std::optional<plist::Dictionary>& reply) {
+  const plist::Value* code = reply ? plist::find(*reply, "ReplyError") : nullptr;
+  return code && code->isInteger() ? code->integer().asUnsigned() : 0;
+}
+
+plist::Data uuidData(const QRTUUID& uuid) { return plist::Data(uuid.bytes().begin(), uuid.bytes().end()); }
+
+void writeFile(const std::string& path, const std::string& text) {
+  std::ofstream out(path, std::ios::binary | std::ios::trunc);
+  out << text;
+}
+
+std::string readFile(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::stringstream text;
+  text << in.rdbuf();
+  return text.str();
+}
+
+bool exists(const std::string& path) {
+  struct stat st;
+  return lstat(path.c_str(), &st) == 0;
+}
+
+std::vector<std::string> listDirectory(const std::string& path) {
+  std::vector<std::string> names;
+  if (DIR* dir = opendir(path.c_str())) {
+    while (dirent* entry = readdir(dir)) {
+      std::string name = entry->d_name;
+      if (name != "." && name != "..") names.push_back(name);
+    }
+    closedir(dir);
+  }
+  return names;
+}
+
+std::optional<plist::Dictionary> readPlist(const std::string& path) {
+  std::string data = readFile(path);
+  auto value = plist::parse(data.data(), data.size());
+  if (!value || !value->isDictionary()) return std::nullopt;
+  return value->dictionary();
+}
+
+std::string readLink(const std::string& path) {
+  char target[4096];
+  ssize_t n = readlink(path.c_str(), target, sizeof target);
+  return n > 0 ? std::string(target, static_cast<size_t>(n)) : std::string();
 }
 
 void DaemonFixture::SetUp() {
@@ -90,11 +135,31 @@ std::unique_ptr<qk::Connection> DaemonFixture::connect() {
 
 uint64_t DaemonFixture::replyError(const plist::Dictionary& req) {
   auto connection = connect();
-  if (!connection) return 0;
-  auto reply = connection->call(req, std::chrono::seconds(30));
-  if (!reply) return 0;
-  const plist::Value* code = plist::find(*reply, "ReplyError");
-  return code && code->isInteger() ? code->integer().asUnsigned() : 0;
+  return connection ? codeOf(connection->call(req, std::chrono::seconds(30))) : 0;
+}
+
+std::optional<plist::Dictionary> DaemonFixture::call(uint64_t command, plist::Dictionary keys) {
+  auto connection = qk::Connection::connect(qk::requestSocketPath(root));
+  if (!connection) return std::nullopt;
+  return connection->call(request(command, std::move(keys)), std::chrono::seconds(30));
+}
+
+Container DaemonFixture::createOrLookup(uint64_t user, const std::string& identifier, uint64_t cls, bool create,
+                                        bool transient, uint64_t command) {
+  auto reply = call(command, {{"UserID", user}, {"ContainerClass", cls}, {"Identifier", identifier},
+                              {"CreateIfNecessary", create}, {"Transient", transient}});
+  Container c;
+  c.user = user;
+  c.cls = cls;
+  c.error = codeOf(reply);
+  if (!reply) return c;
+  if (auto* v = plist::find(*reply, "ReplyIdentifier"); v && v->isString()) c.identifier = v->string();
+  if (auto* v = plist::find(*reply, "ReplyPath"); v && v->isString()) c.path = v->string();
+  if (auto* v = plist::find(*reply, "ReplyExisted"); v && v->isBoolean()) c.existed = v->boolean();
+  if (auto* v = plist::find(*reply, "ReplyUUID"); v && v->isData()) {
+    c.uuid = QRTUUID::fromBytes(v->data().data(), v->data().size()).value_or(QRTUUID());
+  }
+  return c;
 }
 
 void DaemonFixture::setOwnIdentity(const std::string& signingIdentifier, const plist::Dictionary& entitlements) {

@@ -5,12 +5,27 @@
 #include <sys/types.h>
 
 #include <memory>
+#include <optional>
 #include <string>
+#include <vector>
 
 #include <gtest/gtest.h>
 
 #include "QuarterKit/QuarterKit.h"
 #include "base/PlistValue.h"
+#include "base/QRTUUID.h"
+
+// A container as command 0 (or 15) answered for it; user and cls echo the
+// request, error is 0 when no reply came.
+struct Container {
+  uint64_t user = 0;
+  uint64_t cls = 0;
+  uint64_t error = 0;
+  std::string identifier;
+  std::string path;
+  QRTUUID uuid;
+  bool existed = false;
+};
 
 class DaemonFixture : public ::testing::Test {
  protected:
@@ -27,6 +42,11 @@ class DaemonFixture : public ::testing::Test {
   // One request on a fresh connection; the reply's "ReplyError", or 0 when
   // no reply came.
   uint64_t replyError(const plist::Dictionary& request);
+  // One request on a fresh connection; nothing when no reply came, which
+  // tests that kill the daemon rely on.
+  std::optional<plist::Dictionary> call(uint64_t command, plist::Dictionary keys = {});
+  Container createOrLookup(uint64_t user, const std::string& identifier, uint64_t cls, bool create = true,
+                           bool transient = false, uint64_t command = 0);
 
   // Registers an identity for this test program's own executable.
   void setOwnIdentity(const std::string& signingIdentifier, const plist::Dictionary& entitlements);
@@ -41,3 +61,13 @@ class DaemonFixture : public ::testing::Test {
 };
 
 plist::Dictionary request(uint64_t command, plist::Dictionary keys = {});
+// The reply's "ReplyError", or 0 when there is none.
+uint64_t codeOf(const std::optional<plist::Dictionary>& reply);
+plist::Data uuidData(const QRTUUID& uuid);
+
+void writeFile(const std::string& path, const std::string& text);
+std::string readFile(const std::string& path);
+bool exists(const std::string& path);
+std::vector<std::string> listDirectory(const std::string& path);
+std::optional<plist::Dictionary> readPlist(const std::string& path);
+std::string readLink(const std::string& path);

@@ -20,14 +20,6 @@ namespace {
 
 const char* kMetadataFile = ".com.norvane.quarter_kit.metadata.plist";
 
-struct Created {
-  uint64_t error = 0;
-  std::string path;
-  std::string identifier;
-  std::optional<QRTUUID> uuid;
-  bool existed = false;
-};
-
 std::vector<std::string> listDirectory(const std::string& path) {
   std::vector<std::string> names;
   if (DIR* dir = opendir(path.c_str())) {
@@ -50,30 +42,10 @@ std::optional<plist::Dictionary> readPlist(const std::string& path) {
   return value->dictionary();
 }
 
-class StoreTest : public DaemonFixture {
- protected:
-  Created createOrLookup(uint64_t userId, const std::string& identifier, uint64_t cls, bool create = true,
-                         bool transient = false, uint64_t command = 0) {
-    plist::Dictionary keys{{"UserID", userId}, {"ContainerClass", cls}, {"CreateIfNecessary", create},
-                           {"Transient", transient}, {"Identifier", identifier}};
-    // Not the fixture's connect(): the crash test calls this while the daemon dies.
-    auto connection = qk::Connection::connect(qk::requestSocketPath(root));
-    Created result;
-    if (!connection) return result;
-    auto reply = connection->call(request(command, keys));
-    if (!reply) return result;
-    result.error = plist::find(*reply, "ReplyError")->integer().asUnsigned();
-    if (auto* v = plist::find(*reply, "ReplyPath")) result.path = v->string();
-    if (auto* v = plist::find(*reply, "ReplyIdentifier")) result.identifier = v->string();
-    if (auto* v = plist::find(*reply, "ReplyExisted")) result.existed = v->boolean();
-    if (auto* v = plist::find(*reply, "ReplyUUID")) result.uuid = QRTUUID::fromBytes(v->data().data(), v->data().size());
-    return result;
-  }
-
-};
+using StoreTest = DaemonFixture;
 
 TEST_F(StoreTest, NewDataContainerIsCompleteOnDiskAndMapped) {
-  Created made = createOrLookup(501, "com.example.app", 2);
+  Container made = createOrLookup(501, "com.example.app", 2);
   ASSERT_EQ(made.error, 1u);
   EXPECT_FALSE(made.existed);
   EXPECT_EQ(made.identifier, "com.example.app");
@@ -84,14 +56,14 @@ TEST_F(StoreTest, NewDataContainerIsCompleteOnDiskAndMapped) {
   auto directoryUUID = QRTUUID::fromString(name);
   ASSERT_TRUE(directoryUUID);
   EXPECT_EQ(directoryUUID->UUIDString(), name);
-  ASSERT_TRUE(made.uuid);
-  EXPECT_NE(*made.uuid, *directoryUUID);
+  ASSERT_NE(made.uuid, QRTUUID());
+  EXPECT_NE(made.uuid, *directoryUUID);
 
   auto metadata = readPlist(made.path + "/" + kMetadataFile);
   ASSERT_TRUE(metadata);
   EXPECT_EQ(metadata->size(), 4u);
   EXPECT_EQ(plist::find(*metadata, "QRTMetadataIdentifier")->string(), "com.example.app");
-  EXPECT_EQ(plist::find(*metadata, "QRTMetadataUUID")->string(), made.uuid->UUIDString());
+  EXPECT_EQ(plist::find(*metadata, "QRTMetadataUUID")->string(), made.uuid.UUIDString());
   EXPECT_EQ(plist::find(*metadata, "QRTMetadataContentClass")->integer().asUnsigned(), 2u);
   EXPECT_EQ(plist::find(*metadata, "QRTMetadataPersona")->integer().asUnsigned(), 501u);
 
@@ -110,7 +82,7 @@ TEST_F(StoreTest, NewDataContainerIsCompleteOnDiskAndMapped) {
   ASSERT_GT(n, 0);
   EXPECT_EQ(std::string(target, static_cast<size_t>(n)), made.path);
 
-  Created again = createOrLookup(501, "com.example.app", 2);
+  Container again = createOrLookup(501, "com.example.app", 2);
   EXPECT_EQ(again.error, 1u);
   EXPECT_TRUE(again.existed);
   EXPECT_EQ(again.path, made.path);
@@ -118,10 +90,10 @@ TEST_F(StoreTest, NewDataContainerIsCompleteOnDiskAndMapped) {
 }
 
 TEST_F(StoreTest, TransientContainerIsReplacedOnEveryCall) {
-  Created first = createOrLookup(501, "com.example.tmp", 2, true, true);
+  Container first = createOrLookup(501, "com.example.tmp", 2, true, true);
   ASSERT_EQ(first.error, 1u);
   EXPECT_NE(first.path.find("/Library/Caches/com.norvane.quarterd/Temp/Data/Application/"), std::string::npos);
-  Created second = createOrLookup(501, "com.example.tmp", 2, true, true);
+  Container second = createOrLookup(501, "com.example.tmp", 2, true, true);
   ASSERT_EQ(second.error, 1u);
   EXPECT_FALSE(second.existed);
   EXPECT_NE(second.path, first.path);
@@ -131,7 +103,7 @@ TEST_F(StoreTest, TransientContainerIsReplacedOnEveryCall) {
 }
 
 TEST_F(StoreTest, RefusalsLeaveNothingOnDisk) {
-  Created missing = createOrLookup(501, "com.example.none", 2, false);
+  Container missing = createOrLookup(501, "com.example.none", 2, false);
   EXPECT_EQ(missing.error, 21u);
   EXPECT_TRUE(missing.path.empty());
   EXPECT_TRUE(listDirectory(root + "/private/var/mobile/Containers/Data/Application").empty());
@@ -146,7 +118,7 @@ TEST_F(StoreTest, RefusalsLeaveNothingOnDisk) {
 }
 
 TEST_F(StoreTest, BundleAndWellKnownSystemContainers) {
-  Created bundle = createOrLookup(33, "com.example.app", 1);
+  Container bundle = createOrLookup(33, "com.example.app", 1);
   ASSERT_EQ(bundle.error, 1u);
   EXPECT_EQ(bundle.path.rfind(root + "/private/var/containers/Bundle/Application/", 0), 0u);
   EXPECT_EQ(listDirectory(bundle.path), std::vector<std::string>{kMetadataFile});
@@ -155,7 +127,7 @@ TEST_F(StoreTest, BundleAndWellKnownSystemContainers) {
   EXPECT_EQ(st.st_uid, 33u);
 
   // Any caller reaches a well-known system container, under its own name.
-  Created system = createOrLookup(0, "com.norvane.mapsd", 12, true, false, 15);
+  Container system = createOrLookup(0, "com.norvane.mapsd", 12, true, false, 15);
   ASSERT_EQ(system.error, 1u);
   EXPECT_EQ(system.path, root + "/private/var/containers/Data/System/com.norvane.mapsd");
   EXPECT_GT(getxattr(system.path.c_str(), "system.posix_acl_access", nullptr, 0), 0);
@@ -166,7 +138,7 @@ TEST_F(StoreTest, BundleAndWellKnownSystemContainers) {
 }
 
 TEST_F(StoreTest, ContainerDeletedByHandIsForgotten) {
-  Created made = createOrLookup(501, "com.example.gone", 2);
+  Container made = createOrLookup(501, "com.example.gone", 2);
   ASSERT_EQ(made.error, 1u);
   ASSERT_EQ(system(("rm -rf " + made.path).c_str()), 0);
   EXPECT_EQ(createOrLookup(501, "com.example.gone", 2, false).error, 44u);
@@ -175,7 +147,7 @@ TEST_F(StoreTest, ContainerDeletedByHandIsForgotten) {
 }
 
 TEST_F(StoreTest, RestartFindsEveryContainerAgain) {
-  std::map<std::string, Created> made;
+  std::map<std::string, Container> made;
   for (int i = 0; i < 5; ++i) {
     std::string id = "com.example.app" + std::to_string(i);
     made[id] = createOrLookup(501, id, i % 2 ? 2 : 4);
@@ -189,7 +161,7 @@ TEST_F(StoreTest, RestartFindsEveryContainerAgain) {
   startDaemon();
   for (int i = 0; i < 5; ++i) {
     std::string id = "com.example.app" + std::to_string(i);
-    Created found = createOrLookup(501, id, i % 2 ? 2 : 4, false);
+    Container found = createOrLookup(501, id, i % 2 ? 2 : 4, false);
     EXPECT_EQ(found.error, 1u) << id;
     EXPECT_TRUE(found.existed);
     EXPECT_EQ(found.path, made[id].path);
