@@ -162,15 +162,19 @@ Container DaemonFixture::createOrLookup(uint64_t user, const std::string& identi
   return c;
 }
 
-void DaemonFixture::setOwnIdentity(const std::string& signingIdentifier, const plist::Dictionary& entitlements) {
-  plist::Dictionary identity{{"Executable", ownExecutable()},
-                             {"SigningIdentifier", signingIdentifier},
-                             {"Entitlements", entitlements}};
+void DaemonFixture::setIdentity(const std::string& name, const std::string& executable,
+                                const std::string& signingIdentifier, const plist::Dictionary& entitlements) {
+  plist::Dictionary identity{
+      {"Executable", executable}, {"SigningIdentifier", signingIdentifier}, {"Entitlements", entitlements}};
   plist::Data bytes = plist::writeBinary(identity);
   std::string dir = root + "/etc/quarterd/identities";
-  std::string tmp = dir + "/.self.tmp";
+  std::string tmp = dir + "/." + name + ".tmp";
   writeFile(tmp, std::string(bytes.begin(), bytes.end()));
-  rename(tmp.c_str(), (dir + "/self.plist").c_str());
+  rename(tmp.c_str(), (dir + "/" + name + ".plist").c_str());
+}
+
+void DaemonFixture::setOwnIdentity(const std::string& signingIdentifier, const plist::Dictionary& entitlements) {
+  setIdentity("self", ownExecutable(), signingIdentifier, entitlements);
 }
 
 void DaemonFixture::clearOwnIdentity() { unlink((root + "/etc/quarterd/identities/self.plist").c_str()); }

@@ -45,9 +45,13 @@ class DaemonFixture : public ::testing::Test {
   // One request on a fresh connection; nothing when no reply came, which
   // tests that kill the daemon rely on.
   std::optional<plist::Dictionary> call(uint64_t command, plist::Dictionary keys = {});
+  // Command 0, or 15 for a well-known system container.
   Container createOrLookup(uint64_t user, const std::string& identifier, uint64_t cls, bool create = true,
                            bool transient = false, uint64_t command = 0);
 
+  // Registers (or replaces) the identity file name.plist for an executable.
+  void setIdentity(const std::string& name, const std::string& executable, const std::string& signingIdentifier,
+                   const plist::Dictionary& entitlements);
   // Registers an identity for this test program's own executable.
   void setOwnIdentity(const std::string& signingIdentifier, const plist::Dictionary& entitlements);
   void clearOwnIdentity();
@@ -65,6 +69,7 @@ plist::Dictionary request(uint64_t command, plist::Dictionary keys = {});
 uint64_t codeOf(const std::optional<plist::Dictionary>& reply);
 plist::Data uuidData(const QRTUUID& uuid);
 
+// File helpers; a missing file reads as empty, a missing directory lists nothing.
 void writeFile(const std::string& path, const std::string& text);
 std::string readFile(const std::string& path);
 bool exists(const std::string& path);

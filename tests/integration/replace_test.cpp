@@ -6,7 +6,7 @@
 #include <unistd.h>
 
 #include <filesystem>
-#include <functional>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -37,6 +37,13 @@ plist::Dictionary replaceKeys(const Container* old, const Container& fresh) {
     keys["OldContainerUserID"] = 501;
     keys["OldIdentifier"] = old->identifier;
   }
+  return keys;
+}
+
+// The keys with one of them set to the value, or erased when there is none.
+plist::Dictionary changed(plist::Dictionary keys, const char* key, const std::optional<plist::Value>& value) {
+  keys.erase(key);
+  if (value) keys.emplace(key, *value);
   return keys;
 }
 
@@ -139,27 +146,22 @@ TEST_F(ReplaceTest, ReplaceAndWipeTakeOverAndSurviveRestart) {
 }
 
 TEST_F(ReplaceTest, RefusalsChangeNothing) {
-  struct Refusal {
-    const char* name;
-    std::function<void(plist::Dictionary&)> change;
-    uint64_t code;
-  };
-  const Refusal refusals[] = {
-      {"same container", [](plist::Dictionary& k) { k["NewContainerUUID"] = k["OldContainerUUID"]; }, 22},
-      {"class mismatch", [](plist::Dictionary& k) { k["NewContainerClass"] = 4; }, 23},
-      {"user mismatch", [](plist::Dictionary& k) { k["NewContainerUserID"] = 502; }, 56},
-      {"no new UUID", [](plist::Dictionary& k) { k.erase("NewContainerUUID"); }, 11},
-      {"unknown old UUID", [](plist::Dictionary& k) { k["OldContainerUUID"] = uuidData(QRTUUID::random()); }, 21},
-      {"unknown new UUID", [](plist::Dictionary& k) { k["NewContainerUUID"] = uuidData(QRTUUID::random()); }, 21},
-      {"old identifier differs", [](plist::Dictionary& k) { k["OldIdentifier"] = "com.example.other"; }, 21},
-  };
   Container old = make("com.example.keep", false, "keep-old");
   Container fresh = make("com.example.keep", true, "keep-new");
+  // Each refusal changes one key of a valid request.
+  struct Refusal { const char* name; const char* key; std::optional<plist::Value> value; uint64_t code; };
+  const Refusal refusals[] = {
+      {"same container", "NewContainerUUID", uuidData(old.uuid), 22},
+      {"class mismatch", "NewContainerClass", 4, 23},
+      {"user mismatch", "NewContainerUserID", 502, 56},
+      {"no new UUID", "NewContainerUUID", std::nullopt, 11},
+      {"unknown old UUID", "OldContainerUUID", uuidData(QRTUUID::random()), 21},
+      {"unknown new UUID", "NewContainerUUID", uuidData(QRTUUID::random()), 21},
+      {"old identifier differs", "OldIdentifier", "com.example.other", 21},
+  };
   for (const Refusal& refusal : refusals) {
     SCOPED_TRACE(refusal.name);
-    plist::Dictionary keys = replaceKeys(&old, fresh);
-    refusal.change(keys);
-    EXPECT_EQ(codeOf(call(2, keys)), refusal.code);
+    EXPECT_EQ(codeOf(call(2, changed(replaceKeys(&old, fresh), refusal.key, refusal.value))), refusal.code);
     EXPECT_EQ(markerAt(old.path), "keep-old");
     EXPECT_EQ(markerAt(fresh.path), "keep-new");
     Container live = lookup("com.example.keep");
@@ -247,28 +249,21 @@ TEST_F(ReplaceTest, KilledReplaceOrWipeLeavesExactlyOneContentLive) {
 }
 
 TEST_F(ReplaceTest, StartUpRecoveryActsOnlyOnValidJournals) {
-  auto binary = [](const plist::Value& value) {
-    plist::Data data = plist::writeBinary(value);
-    return std::string(data.begin(), data.end());
-  };
   const std::string filled = root + "/filled-destination";
   ASSERT_EQ(mkdir(filled.c_str(), 0755), 0);
   struct Journal {
     const char* name;
     bool movesBack;
-    // The journal's bytes for a container moved from old to staging.
-    std::function<std::string(const plist::Dictionary& valid)> bytes;
+    const char* raw;  // bytes written instead of the valid journal
+    const char* key;  // a key of the valid journal set to `to`, or erased
+    std::optional<plist::Value> to;
   };
   const Journal journals[] = {
-      {"valid", true, [&](const plist::Dictionary& valid) { return binary(valid); }},
-      {"garbage", false, [](const plist::Dictionary&) { return std::string("not a property list"); }},
-      {"array", false, [&](const plist::Dictionary&) { return binary(plist::Array{"/a", "/b", "/c", "/d"}); }},
-      {"missing key", false,
-       [&](plist::Dictionary journal) { return journal.erase("QRTReplaceOperationDestURL"), binary(journal); }},
-      {"number for a path", false,
-       [&](plist::Dictionary journal) { return journal["QRTReplaceOperationOldURL"] = 7, binary(journal); }},
-      {"new content already in place", false,
-       [&](plist::Dictionary journal) { return journal["QRTReplaceOperationDestURL"] = filled, binary(journal); }},
+      {"valid", true, nullptr, nullptr, std::nullopt},
+      {"garbage", false, "not a property list", nullptr, std::nullopt},
+      {"missing key", false, nullptr, "QRTReplaceOperationDestURL", std::nullopt},
+      {"number for a path", false, nullptr, "QRTReplaceOperationOldURL", 7},
+      {"new content already in place", false, nullptr, "QRTReplaceOperationDestURL", filled},
   };
   std::vector<Container> containers;
   for (const Journal& journal : journals) {
@@ -279,14 +274,16 @@ TEST_F(ReplaceTest, StartUpRecoveryActsOnlyOnValidJournals) {
   // What a replace killed between moving the old container aside and moving
   // the new one in leaves behind; old URL and destination are both free.
   for (size_t i = 0; i < std::size(journals); ++i) {
+    const Journal& j = journals[i];
     const std::string name = QRTUUID::random().UUIDString();
     const std::string staging = stagingDir() + "/" + name;
     ASSERT_EQ(rename(containers[i].path.c_str(), staging.c_str()), 0);
-    const plist::Dictionary valid{{"QRTReplaceOperationOldURL", containers[i].path},
-                                  {"QRTReplaceOperationNewURL", "/nonexistent/new"},
-                                  {"QRTReplaceOperationStagingURL", staging},
-                                  {"QRTReplaceOperationDestURL", classDir() + "/" + QRTUUID::random().UUIDString()}};
-    writeFile(replaceDir() + "/" + name + ".plist", journals[i].bytes(valid));
+    plist::Dictionary journal{{"QRTReplaceOperationOldURL", containers[i].path},
+                              {"QRTReplaceOperationNewURL", "/nonexistent/new"},
+                              {"QRTReplaceOperationStagingURL", staging},
+                              {"QRTReplaceOperationDestURL", classDir() + "/" + QRTUUID::random().UUIDString()}};
+    plist::Data bytes = plist::writeBinary(j.key ? changed(journal, j.key, j.to) : journal);
+    writeFile(replaceDir() + "/" + name + ".plist", j.raw ? j.raw : std::string(bytes.begin(), bytes.end()));
   }
   startDaemon();
 

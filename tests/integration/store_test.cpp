@@ -1,46 +1,20 @@
 // Creating and finding containers through the real daemon: what lands on
 // disk, what the cache remembers across restarts, and crash safety.
-#include <dirent.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
-#include <fstream>
 #include <set>
-#include <sstream>
 #include <thread>
 
 #include "DaemonFixture.h"
-#include "base/PlistCodec.h"
 #include "base/QRTUUID.h"
 
 namespace {
 
 const char* kMetadataFile = ".com.norvane.quarter_kit.metadata.plist";
-
-std::vector<std::string> listDirectory(const std::string& path) {
-  std::vector<std::string> names;
-  if (DIR* dir = opendir(path.c_str())) {
-    while (dirent* entry = readdir(dir)) {
-      std::string name = entry->d_name;
-      if (name != "." && name != "..") names.push_back(name);
-    }
-    closedir(dir);
-  }
-  return names;
-}
-
-std::optional<plist::Dictionary> readPlist(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::stringstream bytes;
-  bytes << in.rdbuf();
-  std::string data = bytes.str();
-  auto value = plist::parse(data.data(), data.size());
-  if (!value || !value->isDictionary()) return std::nullopt;
-  return value->dictionary();
-}
 
 using StoreTest = DaemonFixture;
 

@@ -114,10 +114,7 @@ TEST(PlistBinaryForeign, ReadsAnotherWritersFileExactly) {
   std::iota(uuid.begin(), uuid.end(), 0);
   const Value shared(Array{1, 2, "x"});
   const Value expected(Dictionary{
-      {"d", Date{611411696}},
-      {"f", false},
-      {"t", true},
-      {"u", uuid},
+      {"d", Date{611411696}}, {"f", false}, {"t", true}, {"u", uuid},
       {"r", Array{0.5, -1.25e300}},
       {"i", Array{0, 255, 256, 65536, int64_t{1} << 32, INT64_MAX, -1, INT64_MIN, UINT64_MAX}},
       {"s", Array{"", "h\xc3\xa9llo", "\xf0\x9f\x98\x80 astral", "fifteen letters"}},

@@ -1,9 +1,9 @@
 #include <gtest/gtest.h>
-#include <stdlib.h>
 
 #include <cerrno>
 #include <filesystem>
 
+#include "TempDir.h"
 #include "platform/DeviceRoot.h"
 #include "platform/SandboxMappings.h"
 
@@ -13,16 +13,8 @@ namespace {
 
 class SandboxMappingsTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    char templ[] = "/tmp/qrt-mappings-XXXXXX";
-    ASSERT_NE(mkdtemp(templ), nullptr);
-    root_ = templ;
-    platform::setDeviceRoot(root_);
-  }
-  void TearDown() override {
-    platform::setDeviceRoot("/");
-    fs::remove_all(root_);
-  }
+  void SetUp() override { platform::setDeviceRoot(root_); }
+  void TearDown() override { platform::setDeviceRoot("/"); }
 
   std::string linkPath(uint32_t user, uint64_t type, const std::string& identifier) const {
     return root_ + "/run/sandbox/mappings/" + std::to_string(user) + "/" + std::to_string(type) + "/" + identifier;
@@ -37,7 +29,8 @@ class SandboxMappingsTest : public ::testing::Test {
     return count;
   }
 
-  std::string root_;
+  TempDir tmp_{"/tmp/qrt-mappings"};
+  const std::string& root_ = tmp_.path();
 };
 
 TEST_F(SandboxMappingsTest, SetCreatesALinkToThePath) {

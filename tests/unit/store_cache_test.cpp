@@ -8,31 +8,32 @@
 #include <sys/stat.h>
 
 #include <fstream>
+#include <optional>
 #include <stdexcept>
 
 #include "Daemon/QRTClientConnection.h"
 #include "Daemon/QRTContainerCache.h"
 #include "Daemon/QRTGlobalConfiguration.h"
+#include "TempDir.h"
 #include "platform/DeviceRoot.h"
 #include "platform/SandboxMappings.h"
 
 namespace {
 
+std::optional<TempDir> gTmp;
 std::string gRoot;
 
 class ContainerCacheTest : public ::testing::Test {
  protected:
   static void SetUpTestSuite() {
-    char tmpl[] = "/tmp/qrt-cache.XXXXXX";
-    ASSERT_NE(mkdtemp(tmpl), nullptr);
-    gRoot = tmpl;
+    gRoot = gTmp.emplace("/tmp/qrt-cache").path();
     std::string script = std::string(QRT_TEST_SOURCE_DIR) + "/../scripts/make-device-root";
     ASSERT_EQ(system((script + " " + gRoot).c_str()), 0);
     std::ofstream(gRoot + "/etc/passwd", std::ios::app) << "other:x:502:502::/private/var/other:/bin/sh\n";
     ASSERT_EQ(mkdir((gRoot + "/private/var/other").c_str(), 0755), 0);
     platform::setDeviceRoot(gRoot);
   }
-  static void TearDownTestSuite() { system(("rm -rf " + gRoot).c_str()); }
+  static void TearDownTestSuite() { gTmp.reset(); }
 
   // A container written to disk behind the cache's back.
   static QRTURL writeContainer(uint32_t user, uint64_t cls, const std::string& identifier, bool transient = false) {

@@ -1,19 +1,20 @@
 // The configuration objects are process-wide, so the whole executable runs on
 // one temporary device root set up before the first sharedInstance() call.
 #include <gtest/gtest.h>
-#include <stdlib.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
+#include <optional>
 #include <thread>
 #include <vector>
 
 #include "Daemon/QRTContentClass.h"
 #include "Daemon/QRTGlobalConfiguration.h"
 #include "Daemon/QRTPerUserConfiguration.h"
+#include "TempDir.h"
 #include "platform/DeviceRoot.h"
 
 namespace fs = std::filesystem;
@@ -22,36 +23,28 @@ namespace {
 
 std::string gRoot;
 
-void writeFile(const std::string& path, const std::string& text) {
-  std::ofstream out(path, std::ios::app);
-  out << text;
-}
+void appendFile(const std::string& path, const std::string& text) { std::ofstream(path, std::ios::app) << text; }
 
 class LayoutEnvironment : public ::testing::Environment {
  public:
   void SetUp() override {
     umask(022);
-    char templ[] = "/tmp/qrt-layout-XXXXXX";
-    ASSERT_NE(mkdtemp(templ), nullptr);
-    char* resolved = realpath(templ, nullptr);
-    gRoot = resolved;
-    free(resolved);
-    fs::create_directories(gRoot + "/etc");
-    fs::create_directories(gRoot + "/private/var/emplacerd");
-    fs::create_directories(gRoot + "/private/var/mobile");
-    fs::create_directories(gRoot + "/private/var/real504");
+    gRoot = fs::canonical(tmp_.emplace("/tmp/qrt-layout").path());
+    for (const char* home : {"/etc", "/private/var/emplacerd", "/private/var/mobile", "/private/var/real504"})
+      fs::create_directories(gRoot + home);
     fs::create_directory_symlink(gRoot + "/private/var/real504", gRoot + "/private/var/link504");
-    writeFile(gRoot + "/etc/passwd",
-              "root:x:0:0::/private/var/root:/bin/sh\n"
-              "_installer:x:33:33::/private/var/emplacerd:/bin/false\n"
-              "_system:x:499:499::/private/var/empty:/bin/false\n"
-              "mobile:x:501:501::/private/var/mobile:/bin/sh\n"
-              "second:x:502:502::/private/var/users/second:/bin/sh\n"
-              "linked:x:504:504::/private/var/link504:/bin/sh\n"
-              "nohome:x:505:505:::/bin/sh\n");
+    appendFile(gRoot + "/etc/passwd",
+               "root:x:0:0::/private/var/root:/bin/sh\n"
+               "_installer:x:33:33::/private/var/emplacerd:/bin/false\n"
+               "_system:x:499:499::/private/var/empty:/bin/false\n"
+               "mobile:x:501:501::/private/var/mobile:/bin/sh\n"
+               "second:x:502:502::/private/var/users/second:/bin/sh\n"
+               "linked:x:504:504::/private/var/link504:/bin/sh\n"
+               "nohome:x:505:505:::/bin/sh\n");
     platform::setDeviceRoot(gRoot);
   }
-  void TearDown() override { fs::remove_all(gRoot); }
+  void TearDown() override { tmp_.reset(); }
+  std::optional<TempDir> tmp_;
 };
 
 const auto* const gEnvironment = ::testing::AddGlobalTestEnvironment(new LayoutEnvironment);
@@ -70,9 +63,9 @@ void expectDirectory(const std::string& path, uint32_t owner) {
   EXPECT_EQ(st.st_gid, owner) << path;
 }
 
-int32_t protectionClassOf(const std::string& path) {
+int32_t protectionClassOf(const QRTURL& url) {
   uint8_t b[4] = {};
-  if (getxattr(path.c_str(), "trusted.com.norvane.protection-class", b, sizeof b) != sizeof b) return 0;
+  if (getxattr(url.path().c_str(), "trusted.com.norvane.protection-class", b, sizeof b) != sizeof b) return 0;
   return static_cast<int32_t>(b[0] | b[1] << 8 | b[2] << 16 | static_cast<uint32_t>(b[3]) << 24);
 }
 
@@ -97,17 +90,15 @@ TEST(StoreLayoutGlobal, GettersCreateTheirDirectories) {
     EXPECT_EQ(url.path(), host(devicePath));
     expectDirectory(url.path(), 0);
   }
-  EXPECT_EQ(protectionClassOf(config().logDirectory().path()), 4);
-  EXPECT_EQ(protectionClassOf(config().cachesDirectory().path()), 4);
-  EXPECT_EQ(protectionClassOf(config().libraryDirectory().path()), 4);
-  EXPECT_EQ(protectionClassOf(config().stagingDirectory().path()), 0);
+  for (const QRTURL& url : {config().logDirectory(), config().cachesDirectory(), config().libraryDirectory()})
+    EXPECT_EQ(protectionClassOf(url), 4) << url.path();
+  EXPECT_EQ(protectionClassOf(config().stagingDirectory()), 0);
 
   // Each of the three levels belongs to the installer.
-  QRTURL transientBundle = config().transientBundleDirectory();
-  EXPECT_EQ(transientBundle.path(), host("/private/var/emplacerd/Library/Caches/com.norvane.quarterd"));
-  expectDirectory(host("/private/var/emplacerd/Library"), 33);
-  expectDirectory(host("/private/var/emplacerd/Library/Caches"), 33);
-  expectDirectory(transientBundle.path(), 33);
+  const std::string installer = host("/private/var/emplacerd");
+  EXPECT_EQ(config().transientBundleDirectory().path(), installer + "/Library/Caches/com.norvane.quarterd");
+  for (const char* level : {"/Library", "/Library/Caches", "/Library/Caches/com.norvane.quarterd"})
+    expectDirectory(installer + level, 33);
 }
 
 TEST(StoreLayoutGlobal, RemovedDirectoriesComeBack) {
@@ -116,25 +107,20 @@ TEST(StoreLayoutGlobal, RemovedDirectoriesComeBack) {
   EXPECT_EQ(config().stagingDirectory(), staging);
   expectDirectory(staging.path(), 0);
 
-  fs::remove_all(host("/private/var/emplacerd/Library"));
-  config().transientBundleDirectory();
-  expectDirectory(host("/private/var/emplacerd/Library/Caches/com.norvane.quarterd"), 33);
-
   fs::remove_all(host("/private/var/mobile/Containers"));
-  auto classDirectory = config().containerDirectoryURLForUser(501, 2, false);
-  ASSERT_TRUE(classDirectory);
+  ASSERT_TRUE(config().containerDirectoryURLForUser(501, 2, false));
   expectDirectory(host("/private/var/mobile/Containers"), 501);
-  expectDirectory(classDirectory->path(), 501);
+  expectDirectory(host("/private/var/mobile/Containers/Data/Application"), 501);
 }
 
 TEST(StoreLayoutGlobal, MigrationFileExistsOnlyDirectlyInTheLibrary) {
-  writeFile(config().libraryDirectory().path() + "/qrt_marker", "x");
+  appendFile(config().libraryDirectory().path() + "/qrt_marker", "x");
   EXPECT_TRUE(config().migrationFileExistsWithName("qrt_marker"));
   EXPECT_FALSE(config().migrationFileExistsWithName("qrt_absent"));
   EXPECT_FALSE(config().migrationFileExistsWithName("../QuarterKit/qrt_marker"));
 }
 
-TEST(StoreLayoutClasses, ClassDirectoriesAndOwners) {
+TEST(StoreLayoutClasses, ClassDirectoriesAndOwnersTransientOnesToo) {
   for (uint64_t cls = 1; cls <= 13; ++cls) {
     const bool global = cls == 1 || cls == 3 || cls == 5 || cls == 8 || cls >= 12;
     const uint32_t user = !global ? 502 : cls >= 12 ? 499 : 33;
@@ -144,27 +130,21 @@ TEST(StoreLayoutClasses, ClassDirectoriesAndOwners) {
     EXPECT_EQ(url->path(), base + QRTContentClassPathName(cls));
     expectDirectory(url->path(), cls >= 12 ? 0 : user);
   }
+  const std::string userCaches = "/private/var/users/second/Library/Caches/com.norvane.quarterd";
+  const std::vector<std::tuple<uint32_t, uint64_t, std::string, uint32_t>> transient = {
+      {33, 5, "/private/var/emplacerd/Library/Caches/com.norvane.quarterd/Bundle/VPNPlugin", 33},
+      {499, 12, "/private/var/root/Library/Caches/com.norvane.quarterd/Temp/Data/System", 0},
+      {502, 2, userCaches + "/Temp/Data/Application", 502}};
+  for (const auto& [user, cls, devicePath, owner] : transient) {
+    auto url = config().containerDirectoryURLForUser(user, cls, true);
+    ASSERT_TRUE(url) << cls;
+    EXPECT_EQ(url->path(), host(devicePath));
+    expectDirectory(url->path(), owner);
+  }
+  expectDirectory(host(userCaches + "/Temp"), 502);
 }
 
-TEST(StoreLayoutClasses, TransientClassDirectories) {
-  auto bundle = config().containerDirectoryURLForUser(33, 5, true);
-  ASSERT_TRUE(bundle);
-  EXPECT_EQ(bundle->path(), host("/private/var/emplacerd/Library/Caches/com.norvane.quarterd/Bundle/VPNPlugin"));
-  expectDirectory(bundle->path(), 33);
-
-  auto system = config().containerDirectoryURLForUser(499, 12, true);
-  ASSERT_TRUE(system);
-  EXPECT_EQ(system->path(), host("/private/var/root/Library/Caches/com.norvane.quarterd/Temp/Data/System"));
-  expectDirectory(system->path(), 0);
-
-  auto data = config().containerDirectoryURLForUser(502, 2, true);
-  ASSERT_TRUE(data);
-  EXPECT_EQ(data->path(), host("/private/var/users/second/Library/Caches/com.norvane.quarterd/Temp/Data/Application"));
-  expectDirectory(host("/private/var/users/second/Library/Caches/com.norvane.quarterd/Temp"), 502);
-  expectDirectory(data->path(), 502);
-}
-
-TEST(StoreLayoutClasses, InvalidClassesGiveNothing) {
+TEST(StoreLayoutClasses, InvalidClassesGiveNothingAndGlobalBaseURLsAreNotCreated) {
   auto mobile = config().getPerUserConfigurationForUserId(501);
   for (uint64_t cls : {uint64_t{0}, uint64_t{14}, UINT64_MAX}) {
     EXPECT_FALSE(config().globalContainerBaseURLWithContentClass(cls, true)) << cls;
@@ -173,9 +153,7 @@ TEST(StoreLayoutClasses, InvalidClassesGiveNothing) {
   }
   EXPECT_FALSE(config().globalContainerBaseURLWithContentClass(2, false));
   EXPECT_FALSE(mobile->containerDirectoryURLForContentClass(12, true));
-}
 
-TEST(StoreLayoutClasses, GlobalBaseURLIsNotCreated) {
   fs::remove_all(host("/private/var/containers/Bundle/Framework"));
   auto url = config().globalContainerBaseURLWithContentClass(8, false);
   ASSERT_TRUE(url);
@@ -186,15 +164,12 @@ TEST(StoreLayoutClasses, GlobalBaseURLIsNotCreated) {
 TEST(StoreLayoutPerUser, HomesAndBackupPaths) {
   auto mobile = config().getPerUserConfigurationForCurrentMobileUser();
   EXPECT_EQ(config().getPerUserConfigurationForUserId(501), mobile);
-  ASSERT_TRUE(mobile->userHomeDirectory());
-  EXPECT_EQ(mobile->userHomeDirectory()->path(), host("/private/var/mobile"));
+  EXPECT_EQ(mobile->userHomeDirectory().value_or(QRTURL()).path(), host("/private/var/mobile"));
   EXPECT_EQ(mobile->systemGroupContainerBackupDirectory()->path(),
             host("/private/var/mobile/Library/Backup/SystemContainers/Shared"));
   EXPECT_FALSE(fs::exists(host("/private/var/mobile/Library/Backup")));
-
   auto linked = config().getPerUserConfigurationForUserId(504);
-  ASSERT_TRUE(linked->userHomeDirectory());
-  EXPECT_EQ(linked->userHomeDirectory()->path(), host("/private/var/real504"));
+  EXPECT_EQ(linked->userHomeDirectory().value_or(QRTURL()).path(), host("/private/var/real504"));
 
   // 502's home is made by the first getter that needs it.
   fs::remove_all(host("/private/var/users"));
@@ -204,33 +179,31 @@ TEST(StoreLayoutPerUser, HomesAndBackupPaths) {
   EXPECT_TRUE(second->existsUserBaseDirectory());
 }
 
-TEST(StoreLayoutPerUser, UserWithoutAccountGivesNothing) {
+TEST(StoreLayoutPerUser, UserWithoutAccountOrHomeGivesNothingUntilAdded) {
   for (uint32_t uid : {777u, 505u}) {
     auto user = config().getPerUserConfigurationForUserId(uid);
-    EXPECT_FALSE(user->userHomeDirectory()) << uid;
-    EXPECT_FALSE(user->existsUserBaseDirectory());
-    EXPECT_FALSE(user->transientDirectory());
-    EXPECT_FALSE(user->oldLoggingPath());
+    EXPECT_FALSE(user->userHomeDirectory() || user->existsUserBaseDirectory() || user->transientDirectory() ||
+                 user->oldLoggingPath())
+        << uid;
     for (uint64_t cls : {2, 4, 6, 7, 9, 10, 11}) {
       EXPECT_FALSE(config().containerDirectoryURLForUser(uid, cls, false)) << cls;
       EXPECT_FALSE(config().containerDirectoryURLForUser(uid, cls, true)) << cls;
     }
   }
-  // An account added later is found at the next look-up.
-  writeFile(host("/etc/passwd"), "late:x:777:777::/private/var/late:/bin/sh\n");
+  appendFile(host("/etc/passwd"), "late:x:777:777::/private/var/late:/bin/sh\n");
   auto late = config().containerDirectoryURLForUser(777, 2, false);
   ASSERT_TRUE(late);
   EXPECT_EQ(late->path(), host("/private/var/late/Containers/Data/Application"));
 }
 
-TEST(StoreLayoutPerUser, ConcurrentLookUpsShareOneObject) {
+TEST(StoreLayoutPerUser, ConcurrentLookUpsShareOneObjectAndDirectory) {
+  std::shared_ptr<QRTPerUserConfiguration> seen[4];
   std::vector<std::thread> threads;
-  std::vector<std::shared_ptr<QRTPerUserConfiguration>> seen(8);
-  for (size_t i = 0; i < seen.size(); ++i) {
-    threads.emplace_back([&seen, i] {
+  for (auto& slot : seen) {
+    threads.emplace_back([&slot] {
       for (int round = 0; round < 50; ++round) {
-        seen[i] = config().getPerUserConfigurationForUserId(501);
-        config().containerDirectoryURLForUser(501, 7, false);
+        slot = config().getPerUserConfigurationForUserId(501);
+        EXPECT_TRUE(config().containerDirectoryURLForUser(501, 7, false));  // created by whoever comes first
       }
     });
   }
