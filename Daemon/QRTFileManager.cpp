@@ -807,14 +807,16 @@ bool QRTFileManager::createDirectoryAtURL(const QRTURL& url, bool withIntermedia
 }
 
 
+// Reports a failed look at a copy or move source; always false.
+static bool statFailed(const char* function, const QRTURL& src, int err, QRTErrorRef* error) {
+  QRTSetError(error, QRTCreatePOSIXError(function, __LINE__, err, "stat of %@ failed: %s", src, errorText(err)));
+  return false;
+}
+
 bool QRTFileManager::_copyItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
                                     QRTErrorRef* error) {
   if (!failIfSrcMissing) {
-    if (int err = lstatError(src)) {
-      if (err == ENOENT) return true;  // nothing to do
-      QRTSetError(error, QRT_POSIX_ERROR(err, "stat of %@ failed: %s", src, errorText(err)));
-      return false;
-    }
+    if (int err = lstatError(src)) return err == ENOENT || statFailed(__func__, src, err, error);
   }
   TreeCloner cloner;
   if (int err = cloner.run(src.fileSystemRepresentation(), toURL.fileSystemRepresentation())) {
@@ -835,11 +837,7 @@ bool QRTFileManager::copyItemIfExistsAtURL(const QRTURL& src, const QRTURL& toUR
 bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
                                     QRTErrorRef* error) {
   if (!failIfSrcMissing) {
-    if (int err = lstatError(src)) {
-      if (err == ENOENT) return true;  // nothing to do
-      QRTSetError(error, QRT_POSIX_ERROR(err, "stat of %@ failed: %s", src, errorText(err)));
-      return false;
-    }
+    if (int err = lstatError(src)) return err == ENOENT || statFailed(__func__, src, err, error);
   }
   if (rename(src.fileSystemRepresentation(), toURL.fileSystemRepresentation()) == 0) return true;
   int err = errno;

@@ -324,19 +324,35 @@ uint64_t QRTFileManager::diskUsageForURL(const QRTURL& url) {
   }
 }
 
+namespace {
+
+// The item itself, never a link's target; -1 with the error on failure.
+int openForClass(const char* function, const char* path, QRTErrorRef* error) {
+  int fd = open(path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+  if (fd < 0) {
+    int err = errno;
+    QRTSetError(error, QRTCreatePOSIXError(function, __LINE__, err, "Failed to open %s : %s", path, errorText(err)));
+  }
+  return fd;
+}
+
+bool readClass(const char* function, int fd, const char* path, int32_t* current, QRTErrorRef* error) {
+  if (int err = QRTGetProtectionClass(fd, current)) {
+    QRTSetError(error, QRTCreatePOSIXError(function, __LINE__, err, "Failed to getclass of file %s: %s", path,
+                                           errorText(err)));
+    return false;
+  }
+  return true;
+}
+
+}  // namespace
+
 bool QRTFileManager::dataProtectionClassOfItemAtURL(const QRTURL& url, int32_t* cls, QRTErrorRef* error) {
   const char* path = url.fileSystemRepresentation();
-  ScopedFd fd(open(path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-  if (!fd.valid()) {
-    int err = errno;
-    QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to open %s : %s", path, errorText(err)));
-    return false;
-  }
+  ScopedFd fd(openForClass(__func__, path, error));
+  if (!fd.valid()) return false;
   int32_t current = 0;
-  if (int err = QRTGetProtectionClass(fd.get(), &current)) {
-    QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to getclass of file %s: %s", path, errorText(err)));
-    return false;
-  }
+  if (!readClass(__func__, fd.get(), path, &current, error)) return false;
   if (cls) *cls = current;
   return true;
 }
@@ -345,18 +361,11 @@ bool QRTFileManager::setDataProtectionClassOfItemAtURL(const QRTURL& url, int32_
                                                        const std::function<bool(int32_t)>& ifPredicate,
                                                        QRTErrorRef* error) {
   const char* path = url.fileSystemRepresentation();
-  ScopedFd fd(open(path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-  if (!fd.valid()) {
-    int err = errno;
-    QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to open %s : %s", path, errorText(err)));
-    return false;
-  }
+  ScopedFd fd(openForClass(__func__, path, error));
+  if (!fd.valid()) return false;
   if (ifPredicate) {
     int32_t current = 0;
-    if (int err = QRTGetProtectionClass(fd.get(), &current)) {
-      QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to getclass of file %s: %s", path, errorText(err)));
-      return false;
-    }
+    if (!readClass(__func__, fd.get(), path, &current, error)) return false;
     try {
       if (!ifPredicate(current)) return true;
     } catch (...) {
