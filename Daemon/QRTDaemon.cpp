@@ -10,9 +10,9 @@
 #include <cstdio>
 #include <string>
 
-#include "Daemon/QRTClientConnection.h"
-#include "Daemon/QRTGlobalConfiguration.h"
-#include "Daemon/QRTRequestDispatcher.h"
+#include "Daemon/store/QRTClientConnection.h"
+#include "Daemon/store/QRTGlobalConfiguration.h"
+#include "Daemon/requests/QRTRequestDispatcher.h"
 #include "platform/DeviceProperties.h"
 #include "platform/DeviceRoot.h"
 #include "platform/FirstBoot.h"

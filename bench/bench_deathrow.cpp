@@ -14,9 +14,9 @@
 #include <string>
 #include <vector>
 
-#include "Daemon/QRTClientConnection.h"
-#include "Daemon/QRTFileManager.h"
-#include "Daemon/QRTGlobalConfiguration.h"
+#include "Daemon/store/QRTClientConnection.h"
+#include "Daemon/fileops/QRTFileManager.h"
+#include "Daemon/store/QRTGlobalConfiguration.h"
 #include "platform/DeviceRoot.h"
 #include "platform/Log.h"
 

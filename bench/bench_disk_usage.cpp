@@ -16,7 +16,7 @@
 #include <string>
 #include <vector>
 
-#include "Daemon/QRTFileManager.h"
+#include "Daemon/fileops/QRTFileManager.h"
 #include "platform/Log.h"
 
 namespace {

@@ -14,7 +14,7 @@
 #include <string>
 #include <vector>
 
-#include "Daemon/QRTFileManager.h"
+#include "Daemon/fileops/QRTFileManager.h"
 
 namespace {
 

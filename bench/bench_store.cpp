@@ -20,9 +20,9 @@
 
 #include "base/PlistCodec.h"
 #include "base/QRTUUID.h"
-#include "Daemon/QRTClientConnection.h"
-#include "Daemon/QRTContainerCache.h"
-#include "Daemon/QRTGlobalConfiguration.h"
+#include "Daemon/store/QRTClientConnection.h"
+#include "Daemon/store/QRTContainerCache.h"
+#include "Daemon/store/QRTGlobalConfiguration.h"
 #include "platform/DeviceRoot.h"
 #include "platform/Log.h"
 

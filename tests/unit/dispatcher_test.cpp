@@ -4,7 +4,7 @@
 
 #include <fstream>
 
-#include "Daemon/QRTRequestDispatcher.h"
+#include "Daemon/requests/QRTRequestDispatcher.h"
 #include "Daemon/QRTError.h"
 #include "platform/DeviceRoot.h"
 

@@ -10,7 +10,7 @@
 #include <fstream>
 #include <string>
 
-#include "Daemon/QRTFileManager.h"
+#include "Daemon/fileops/QRTFileManager.h"
 #include "TempDir.h"
 #include "platform/DeviceRoot.h"
 

@@ -19,7 +19,7 @@
 #include <tuple>
 #include <vector>
 
-#include "Daemon/QRTFileManager.h"
+#include "Daemon/fileops/QRTFileManager.h"
 #include "TempDir.h"
 #include "base/PlistCodec.h"
 #include "platform/DeviceRoot.h"

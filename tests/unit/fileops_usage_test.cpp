@@ -12,7 +12,7 @@
 #include <sstream>
 #include <string>
 
-#include "Daemon/QRTFileManager.h"
+#include "Daemon/fileops/QRTFileManager.h"
 #include "TempDir.h"
 #include "platform/DeviceRoot.h"
 #include "platform/Log.h"

@@ -14,7 +14,7 @@
 
 #include <gtest/gtest.h>
 
-#include "Daemon/QRTLocks.h"
+#include "Daemon/store/QRTLocks.h"
 #include "platform/Log.h"
 
 using namespace std::chrono_literals;

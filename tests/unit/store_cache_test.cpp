@@ -11,9 +11,9 @@
 #include <optional>
 #include <stdexcept>
 
-#include "Daemon/QRTClientConnection.h"
-#include "Daemon/QRTContainerCache.h"
-#include "Daemon/QRTGlobalConfiguration.h"
+#include "Daemon/store/QRTClientConnection.h"
+#include "Daemon/store/QRTContainerCache.h"
+#include "Daemon/store/QRTGlobalConfiguration.h"
 #include "TempDir.h"
 #include "platform/DeviceRoot.h"
 #include "platform/SandboxMappings.h"

@@ -11,9 +11,9 @@
 #include <thread>
 #include <vector>
 
-#include "Daemon/QRTContentClass.h"
-#include "Daemon/QRTGlobalConfiguration.h"
-#include "Daemon/QRTPerUserConfiguration.h"
+#include "Daemon/store/QRTContentClass.h"
+#include "Daemon/store/QRTGlobalConfiguration.h"
+#include "Daemon/store/QRTPerUserConfiguration.h"
 #include "TempDir.h"
 #include "platform/DeviceRoot.h"
 

@@ -3,8 +3,8 @@
 #include <filesystem>
 #include <fstream>
 
-#include "Daemon/QRTFileManager.h"
-#include "Daemon/QRTMetadata.h"
+#include "Daemon/fileops/QRTFileManager.h"
+#include "Daemon/store/QRTMetadata.h"
 #include "TempDir.h"
 
 namespace fs = std::filesystem;

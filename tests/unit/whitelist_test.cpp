@@ -2,7 +2,7 @@
 
 #include <algorithm>
 
-#include "Daemon/QRTWhitelist.h"
+#include "Daemon/store/QRTWhitelist.h"
 
 namespace {
 

@@ -1,4 +1,4 @@
-#include "Daemon/QRTLocks.h"
+#include "Daemon/store/QRTLocks.h"
 
 #include <algorithm>
 #include <cstdio>

@@ -1,11 +1,11 @@
-#include "Daemon/QRTPerUserConfiguration.h"
+#include "Daemon/store/QRTPerUserConfiguration.h"
 
 #include <cstring>
 #include <cstdlib>
 #include <memory>
 
-#include "Daemon/QRTContentClass.h"
-#include "Daemon/QRTFileManager.h"
+#include "Daemon/store/QRTContentClass.h"
+#include "Daemon/fileops/QRTFileManager.h"
 #include "platform/Log.h"
 #include "platform/UserDatabase.h"
 

@@ -1,7 +1,7 @@
-#include "Daemon/QRTMetadata.h"
+#include "Daemon/store/QRTMetadata.h"
 
-#include "Daemon/QRTContentClass.h"
-#include "Daemon/QRTFileManager.h"
+#include "Daemon/store/QRTContentClass.h"
+#include "Daemon/fileops/QRTFileManager.h"
 
 namespace {
 

@@ -1,8 +1,8 @@
-#include "Daemon/QRTContainerCommands.h"
+#include "Daemon/requests/QRTContainerCommands.h"
 
-#include "Daemon/QRTContentClass.h"
-#include "Daemon/QRTMetadata.h"
-#include "Daemon/QRTWhitelist.h"
+#include "Daemon/store/QRTContentClass.h"
+#include "Daemon/store/QRTMetadata.h"
+#include "Daemon/store/QRTWhitelist.h"
 #include "platform/Log.h"
 
 namespace {

@@ -1,9 +1,9 @@
-#include "Daemon/QRTRequestDispatcher.h"
+#include "Daemon/requests/QRTRequestDispatcher.h"
 
-#include "Daemon/QRTContainerCommands.h"
-#include "Daemon/QRTContentClass.h"
+#include "Daemon/requests/QRTContainerCommands.h"
+#include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTError.h"
-#include "Daemon/QRTGlobalConfiguration.h"
+#include "Daemon/store/QRTGlobalConfiguration.h"
 #include "platform/Identity.h"
 #include "platform/Log.h"
 

@@ -1,4 +1,4 @@
-#include "Daemon/QRTFileManager.h"
+#include "Daemon/fileops/QRTFileManager.h"
 
 #include <dirent.h>
 #include <fcntl.h>

@@ -1,8 +1,8 @@
-#include "Daemon/QRTWhitelist.h"
+#include "Daemon/store/QRTWhitelist.h"
 
 #include <utility>
 
-#include "Daemon/QRTContentClass.h"
+#include "Daemon/store/QRTContentClass.h"
 
 namespace {
 

@@ -11,7 +11,7 @@
 
 #include "base/PlistValue.h"
 #include "base/QRTUUID.h"
-#include "Daemon/QRTClientConnection.h"
+#include "Daemon/store/QRTClientConnection.h"
 #include "platform/RequestSocket.h"
 
 inline constexpr const char* QRTEntitlementNone = "com.norvane.private.QuarterKit.none";

@@ -1,8 +1,8 @@
-#include "Daemon/QRTGlobalConfiguration.h"
+#include "Daemon/store/QRTGlobalConfiguration.h"
 
-#include "Daemon/QRTContentClass.h"
-#include "Daemon/QRTFileManager.h"
-#include "Daemon/QRTPerUserConfiguration.h"
+#include "Daemon/store/QRTContentClass.h"
+#include "Daemon/fileops/QRTFileManager.h"
+#include "Daemon/store/QRTPerUserConfiguration.h"
 #include "platform/DeviceRoot.h"
 #include "platform/Log.h"
 #include "platform/UserDatabase.h"

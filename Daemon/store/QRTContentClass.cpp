@@ -1,4 +1,4 @@
-#include "Daemon/QRTContentClass.h"
+#include "Daemon/store/QRTContentClass.h"
 
 const char* QRTContentClassPathName(uint64_t containerClass) {
   static const char* const kNames[] = {

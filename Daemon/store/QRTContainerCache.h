@@ -12,7 +12,7 @@
 #include <vector>
 
 #include "Daemon/QRTError.h"
-#include "Daemon/QRTMetadata.h"
+#include "Daemon/store/QRTMetadata.h"
 
 using QRTMetadataRef = std::shared_ptr<QRTMetadata>;
 

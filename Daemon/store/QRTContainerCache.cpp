@@ -1,8 +1,8 @@
-#include "Daemon/QRTContainerCache.h"
+#include "Daemon/store/QRTContainerCache.h"
 
-#include "Daemon/QRTContentClass.h"
-#include "Daemon/QRTFileManager.h"
-#include "Daemon/QRTGlobalConfiguration.h"
+#include "Daemon/store/QRTContentClass.h"
+#include "Daemon/fileops/QRTFileManager.h"
+#include "Daemon/store/QRTGlobalConfiguration.h"
 #include "platform/Log.h"
 #include "platform/SandboxMappings.h"
 

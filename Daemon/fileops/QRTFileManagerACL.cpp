@@ -18,7 +18,7 @@
 #include <type_traits>
 #include <utility>
 
-#include "Daemon/QRTFileManager.h"
+#include "Daemon/fileops/QRTFileManager.h"
 #include "platform/Log.h"
 #include "platform/UserDatabase.h"
 

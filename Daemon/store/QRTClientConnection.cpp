@@ -1,0 +1,232 @@
+#include "Daemon/store/QRTClientConnection.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdlib>
+#include <map>
+#include <iterator>
+
+#include "base/QRTUUID.h"
+#include "Daemon/store/QRTContainerCache.h"
+#include "Daemon/store/QRTContentClass.h"
+#include "Daemon/QRTCrashPoint.h"
+#include "Daemon/QRTDaemon.h"
+#include "Daemon/fileops/QRTFileManager.h"
+#include "Daemon/store/QRTGlobalConfiguration.h"
+#include "Daemon/store/QRTLocks.h"
+#include "Daemon/store/QRTMetadata.h"
+#include "Daemon/store/QRTWhitelist.h"
+#include "platform/DeviceProperties.h"
+#include "platform/DeviceRoot.h"
+#include "platform/Log.h"
+
+#include "Daemon/store/QRTClientConnectionInternal.h"
+
+QRTClientConnection::QRTClientConnection(std::optional<std::string> bundleId, uint32_t clientUserId,
+                                         bool allowOtherIdLookup,
+                                         std::optional<std::vector<std::string>> entitledWipeIdentifiers)
+    : clientBundleIdentifier_(std::move(bundleId)),
+      clientUserId_(clientUserId),
+      allowOtherIdLookup_(allowOtherIdLookup),
+      entitledWipeIdentifiers_(std::move(entitledWipeIdentifiers)) {}
+
+QRTClientConnection::QRTClientConnection(std::optional<std::string> bundleId, bool allowOtherIdLookup)
+    : QRTClientConnection(std::move(bundleId), 0, allowOtherIdLookup, std::nullopt) {}
+
+QRTClientConnection& QRTClientConnection::sharedClientConnection() {
+  static QRTClientConnection* shared = new QRTClientConnection("com.norvane.quarterd.internal", true);
+  return *shared;
+}
+
+// The first-boot work (upgrade migration, system container installation,
+// transient and orphan clean-up) joins with those subsystems.
+namespace {
+
+// The code-signing mapping will say which programs hold a system container;
+// until it exists no program is known to hold one.
+bool codeSigningGrantsSystemContainer(const std::string&) { return false; }
+
+constexpr const char* kDataSubDirectories[] = {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"};
+constexpr const char* kGroupSubDirectories[] = {"Library", "Library/Caches"};
+
+}  // namespace
+
+bool QRTClientConnection::_createDefaultDirectory(const QRTURL& url, mode_t mode, uint32_t owner,
+                                                  QRTErrorRef* error) {
+  return QRTFileManager::defaultManager().createDirectoryAtURL(url, true, mode, owner, -1, error);
+}
+
+bool QRTClientConnection::_createTopLevelContainerDirectory(const QRTURL& url, uint64_t containerClass,
+                                                            uint32_t owner, QRTErrorRef* error) {
+  uint32_t directoryOwner = owner;
+  if (QRTIsBundleClass(containerClass)) directoryOwner = QRTInstallerUserId;
+  if (QRTIsSystemClass(containerClass)) directoryOwner = 0;
+  return QRTFileManager::defaultManager().createDirectoryAtURL(url, true, 0755, directoryOwner, 0, error);
+}
+
+bool QRTClientConnection::_createSubDirectories(const QRTURL& url, uint32_t userId, uint64_t containerClass,
+                                                QRTErrorRef* error) {
+  const char* const* begin = nullptr;
+  size_t count = 0;
+  if (containerClass == 7 || containerClass == 13) {
+    begin = kGroupSubDirectories;
+    count = std::size(kGroupSubDirectories);
+  } else if (QRTIsPerUserClass(containerClass) || containerClass == 12) {
+    begin = kDataSubDirectories;
+    count = std::size(kDataSubDirectories);
+  }
+  const bool system = QRTIsSystemClass(containerClass);
+  const mode_t mode = system ? 0000 : 0755;
+  const uint32_t owner = system ? kNobodyId : userId;
+  for (size_t i = 0; i < count; ++i) {
+    QRTErrorRef underlying;
+    if (!_createDefaultDirectory(url.URLByAppendingPathComponent(begin[i], true), mode, owner, &underlying)) {
+      QRTSetError(error, QRT_ERROR(QRTErrorCreateSubdirectoryFailed, underlying, true,
+                                   "Failed to create sub-dir at %@%@", url, std::string("/") + begin[i]));
+      return false;
+    }
+  }
+  return true;
+}
+
+std::shared_ptr<QRTMetadata> QRTClientConnection::_buildInStaging(const QRTURL& staging, uint32_t userId,
+                                                                  const std::string& identifier,
+                                                                  uint64_t containerClass, QRTErrorRef* error) {
+  QRTErrorRef underlying;
+  if (!_createTopLevelContainerDirectory(staging, containerClass, userId, &underlying)) {
+    QRTSetError(error, QRT_ERROR(QRTErrorCreateStagingFailed, underlying, true, "Failed to create staging dir at %@ : %@",
+                                 staging, underlying));
+    return nullptr;
+  }
+  auto metadata = std::make_shared<QRTMetadata>(userId, QRTUUID::random(), containerClass, identifier, std::nullopt,
+                                                staging, std::nullopt);
+  if (!metadata->writeMetadataToDiskWithError(error)) return nullptr;
+  if (QRTIsSystemClass(containerClass) &&
+      !QRTFileManager::defaultManager().setTopLevelSystemContainerACLAtURL(staging, error)) {
+    return nullptr;
+  }
+  if (!_createSubDirectories(staging, userId, containerClass, error)) return nullptr;
+  return metadata;
+}
+
+std::shared_ptr<QRTMetadata> QRTClientConnection::_createNewContainer(uint32_t userId, const std::string& identifier,
+                                                                      uint64_t containerClass, bool transient,
+                                                                      QRTErrorRef* error) {
+  QRTGlobalConfiguration& configuration = QRTGlobalConfiguration::sharedInstance();
+  const std::string directoryName = QRTUUID::random().UUIDString();
+  const QRTURL staging = configuration.stagingDirectory().URLByAppendingPathComponent(directoryName, true);
+
+  std::shared_ptr<QRTMetadata> metadata = _buildInStaging(staging, userId, identifier, containerClass, error);
+  if (metadata) {
+    std::optional<QRTURL> classDirectory =
+        configuration.containerDirectoryURLForUser(userId, containerClass, transient);
+    std::string finalName = directoryName;
+    if (auto wellKnown = QRTWhitelist::sharedWhitelist().wellknownContainerForId(identifier, containerClass)) {
+      finalName = *wellKnown;
+    }
+    QRTURL finalURL = classDirectory ? classDirectory->URLByAppendingPathComponent(finalName, true) : QRTURL();
+    QRTErrorRef moveError;
+    if (!classDirectory || !QRTFileManager::defaultManager().moveItemAtURL(staging, finalURL, &moveError)) {
+      QRTSetError(error, QRT_ERROR(QRTErrorMoveStagingToLiveFailed, moveError, true,
+                                   "Failed to move staging dir: %@ to live dir: %@", staging, finalURL));
+      metadata = nullptr;
+    } else {
+      metadata->setUrl(finalURL);
+      metadata->setExisted(false);
+      metadata->setTransient(transient);
+      QRTErrorRef cacheError;
+      if (!QRTContainerCache::sharedInstance().addContainerMetadata(metadata, userId, finalURL, transient, true,
+                                                                    &cacheError)) {
+        QRTSetError(error, QRT_ERROR(QRTErrorCacheAddFailed, cacheError, true,
+                                     "Failed to add to cache for %u : %@, url: %@, transient: %d", userId, metadata,
+                                     finalURL, transient));
+        return nullptr;  // the container is complete on disk; the cache finds it after a restart
+      }
+      return metadata;
+    }
+  }
+  // Nothing half-made stays behind: the staging directory goes to death row.
+  QRTErrorRef cleanupError;
+  if (!_moveItemAtURLToDeathRow(staging, true, true, &cleanupError)) {
+    QRTSetError(error, QRT_ERROR(QRTErrorRemoveStagingFailed, cleanupError, true, "Failed to remove staging dir: %@",
+                                 staging));
+  }
+  return nullptr;
+}
+
+std::shared_ptr<QRTMetadata> QRTClientConnection::createOrLookupContainerForUser(
+    uint32_t userId, const std::optional<std::string>& identifier, bool createIfNecessary, uint64_t containerClass,
+    bool transient, bool useLocking, uint64_t* withError) {
+  if (!identifier || containerClass < 1 || containerClass > 13) {
+    reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
+                         "Can't act on an invalid object: userId: %u, ID: %@, class: %ld", userId, identifier,
+                         static_cast<long>(containerClass)),
+               withError);
+    return nullptr;
+  }
+  if (!user_id_valid_for_class(containerClass, userId)) {
+    reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true, "Invalid userId %u for class %ld, ID: %@", userId,
+                         static_cast<long>(containerClass), identifier),
+               withError);
+    return nullptr;
+  }
+  const bool foreign = identifier != clientBundleIdentifier_;
+  if (foreign && !allowOtherIdLookup_ && !((containerClass == 7 || containerClass == 13) && allowGroupIdLookup_) &&
+      platform::deviceIsInternalBuild()) {
+    QRTLog(platform::kLogDebug,
+           "%@ trying to retrieve container class %ld for identifier: %@. WARNING: Soon you will need an entitlement "
+           "to do this. File a Bugline in \"QuarterKit | all\"",
+           clientBundleIdentifier_, static_cast<long>(containerClass), identifier);
+  }
+  if (containerClass == 12 && !allowOtherIdLookup_ &&
+      (!codeSigningGrantsSystemContainer(*identifier) || foreign)) {
+    reportCode(QRT_ERROR(QRTErrorNotEntitled, nullptr, true, "%@ not entitled for system container with identifier %@",
+                         clientBundleIdentifier_, identifier),
+               withError);
+    return nullptr;
+  }
+
+  QRTErrorRef error;
+  std::shared_ptr<QRTMetadata> result;
+  try {
+    result = _lookupOrCreate(userId, *identifier, createIfNecessary, containerClass, transient, useLocking, &error);
+  } catch (...) {
+    error = QRT_EXCEPTION_ERROR();
+  }
+  if (!result) reportCode(error, withError);
+  return result;
+}
+
+std::shared_ptr<QRTMetadata> QRTClientConnection::_lookupOrCreate(uint32_t userId, const std::string& identifier,
+                                                                  bool createIfNecessary, uint64_t containerClass,
+                                                                  bool transient, bool useLocking, QRTErrorRef* error) {
+  QRTAllIdentifiersLock lock(true, useLocking);
+  QRTErrorRef lookupError;
+  std::shared_ptr<QRTMetadata> found =
+      QRTContainerCache::sharedInstance().containerForUser(userId, containerClass, identifier, transient, &lookupError);
+  if (found && !transient) {
+    found->setExisted(true);
+    return found;
+  }
+  if (found) {
+    // A transient container is never reused.
+    QRTErrorRef moveError;
+    if (!_moveItemAtURLToDeathRow(found->url(), true, true, &moveError)) {
+      QRTSetError(error, QRT_ERROR(QRTErrorRemoveTransientFailed, moveError, true,
+                                   "Failed to remove transient container at %@", found->url()));
+      return nullptr;
+    }
+    // Forget it too, so that a look-up without creation answers "not found"
+    // rather than finding a container that is gone.
+    QRTContainerCache::sharedInstance().removeContainerForUser(userId, containerClass, identifier, true, nullptr);
+  } else if (!(lookupError->domain() == QRTErrorDomain && lookupError->code() == QRTErrorNotFound)) {
+    QRTSetError(error, lookupError);
+    return nullptr;
+  }
+  if (!createIfNecessary) {
+    QRTSetError(error, QRT_ERROR(QRTErrorNotFound, nullptr, false, "Container with identifier: \"%@\" Not Found",
+                                 identifier));
+    return nullptr;
+  }
+  return _createNewContainer(userId, identifier, containerClass, transient, error);
+}
