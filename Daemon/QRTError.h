@@ -13,10 +13,10 @@
 #include "base/QRTFormat.h"
 
 inline constexpr const char* QRTErrorDomain = "QRTErrorDomain";
-inline constexpr const char* QRTPOSIXErrorDomain = "NSPOSIXErrorDomain";
-inline constexpr const char* QRTCocoaErrorDomain = "NSCocoaErrorDomain";
-inline constexpr const char* QRTLocalizedDescriptionKey = "NSLocalizedDescription";
-inline constexpr const char* QRTUnderlyingErrorKey = "NSUnderlyingError";
+inline constexpr const char* QRTPOSIXErrorDomain = "QRTPOSIXErrorDomain";
+inline constexpr const char* QRTPropertyListErrorDomain = "QRTPropertyListErrorDomain";
+inline constexpr const char* QRTLocalizedDescriptionKey = "QRTLocalizedDescription";
+inline constexpr const char* QRTUnderlyingErrorKey = "QRTUnderlyingError";
 
 enum QRTErrorCode : uint64_t {
   QRTErrorNone = 1,

@@ -1029,13 +1029,13 @@ std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& u
   std::string reason;
   std::optional<plist::Value> value = plist::parse(bytes.data(), bytes.size(), &reason);
   if (!value) {
-    QRTSetError(error, QRTCreateError(__func__, __LINE__, QRTCocoaErrorDomain, QRTPropertyListReadCorruptError,
+    QRTSetError(error, QRTCreateError(__func__, __LINE__, QRTPropertyListErrorDomain, QRTPropertyListReadCorruptError,
                                       nullptr, nullptr, false, "Failed to parse property list at %@: %s", url,
                                       reason.c_str()));
     return std::nullopt;
   }
   if (!value->isDictionary()) {
-    QRTSetError(error, QRTCreateError(__func__, __LINE__, QRTCocoaErrorDomain, QRTFormattingError, nullptr, nullptr,
+    QRTSetError(error, QRTCreateError(__func__, __LINE__, QRTPropertyListErrorDomain, QRTFormattingError, nullptr, nullptr,
                                       false, "Property list at %@ is not a dictionary", url));
     return std::nullopt;
   }

@@ -134,7 +134,7 @@ constexpr QRTWriteOptions operator|(QRTWriteOptions a, QRTWriteOptions b) {
 bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTWriteOptions withOptions,
                     QRTErrorRef* error);
 // Reads a property list of any supported format whose top level is a
-// dictionary. Unparsable bytes fail in QRTCocoaErrorDomain with 3840, another
+// dictionary. Unparsable bytes fail in QRTPropertyListErrorDomain with 3840, another
 // top-level type with 2048, a read failure with a POSIX error.
 std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& url, QRTErrorRef* error);
 

@@ -12,8 +12,8 @@ namespace {
 
 const char kHeader[] =
     "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
-    "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" "
-    "\"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
+    "<!DOCTYPE plist PUBLIC \"-//Norvane//DTD PLIST 1.0//EN\" "
+    "\"https://dtd.norvane.example/plist-1.0.dtd\">\n"
     "<plist version=\"1.0\">\n";
 
 std::optional<Value> parseText(const std::string& text, std::string* error = nullptr) {
@@ -33,20 +33,20 @@ std::string nested(size_t levels) {
 }
 
 const char kEntitlements[] = R"(<?xml version="1.0" encoding="UTF-8"?>
-<!DOCTYPE plist PUBLIC "-//Apple//DTD PLIST 1.0//EN" "http://www.apple.com/DTDs/PropertyList-1.0.dtd">
+<!DOCTYPE plist PUBLIC "-//Norvane//DTD PLIST 1.0//EN" "https://dtd.norvane.example/plist-1.0.dtd">
 <plist version="1.0">
 <dict>
 	<!-- written by the signing tool -->
-	<key>CFBundleDisplayName</key>
+	<key>DisplayName</key>
 	<string>Notes &amp; Lists</string>
 	<key>application-groups</key>
 	<array>
 		<string>group.com.example.shared</string>
 		<string>group.com.example.widgets</string>
 	</array>
-	<key>keychain-access-groups</key><array/>
-	<key>platform-application</key><true/>
-	<key>file-sharing</key><false/>
+	<key>credential-store-groups</key><array/>
+	<key>system-program</key><true/>
+	<key>shares-files</key><false/>
 	<key>limits</key>
 	<dict>
 		<key>family</key><array><integer>1</integer><integer>2</integer></array>
@@ -62,16 +62,16 @@ const char kEntitlements[] = R"(<?xml version="1.0" encoding="UTF-8"?>
 </plist>
 )";
 
-TEST(PlistXMLTest, ReadsAppleStyleDocument) {
+TEST(PlistXMLTest, ReadsSigningToolDocument) {
   std::string error;
   auto v = parseText(kEntitlements, &error);
   ASSERT_TRUE(v) << error;
   EXPECT_EQ(*v, Value(Dictionary{
-                    {"CFBundleDisplayName", "Notes & Lists"},
+                    {"DisplayName", "Notes & Lists"},
                     {"application-groups", Array{"group.com.example.shared", "group.com.example.widgets"}},
-                    {"keychain-access-groups", Array{}},
-                    {"platform-application", true},
-                    {"file-sharing", false},
+                    {"credential-store-groups", Array{}},
+                    {"system-program", true},
+                    {"shares-files", false},
                     {"limits", Dictionary{{"family", Array{1, 2}},
                                           {"ratio", 0.75},
                                           {"since", Date{614538000}},

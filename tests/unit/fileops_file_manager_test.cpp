@@ -321,8 +321,8 @@ TEST_F(FileManagerTest, PropertyListFilesRoundTripAndRejectOtherShapes) {
   std::ofstream(path("array.plist")) << std::string(array.begin(), array.end());
   std::ofstream(path("garbage.plist")) << "bplist00 not really";
   const std::vector<std::tuple<const char*, std::string, int>> failures = {
-      {"array.plist", QRTCocoaErrorDomain, 2048},
-      {"garbage.plist", QRTCocoaErrorDomain, 3840},
+      {"array.plist", QRTPropertyListErrorDomain, 2048},
+      {"garbage.plist", QRTPropertyListErrorDomain, 3840},
       {"missing.plist", QRTPOSIXErrorDomain, ENOENT}};
   for (const auto& [rel, domain, code] : failures) {
     EXPECT_FALSE(QRT_dictionaryWithContentsOfURL(url(rel), &error_)) << rel;
