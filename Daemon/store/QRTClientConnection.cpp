@@ -90,8 +90,8 @@ bool QRTClientConnection::_createSubDirectories(const QRTURL& url, uint32_t user
 }
 
 QRTMetadataRef QRTClientConnection::_buildInStaging(const QRTURL& staging, uint32_t userId,
-                                                                  const std::string& identifier,
-                                                                  uint64_t containerClass, QRTErrorRef* error) {
+                                                    const std::string& identifier, uint64_t containerClass,
+                                                    QRTErrorRef* error) {
   QRTErrorRef underlying;
   if (!_createTopLevelContainerDirectory(staging, containerClass, userId, &underlying)) {
     QRTSetError(error, QRT_ERROR(QRTErrorCreateStagingFailed, underlying, true, "Failed to create staging dir at %@ : %@",
@@ -110,8 +110,7 @@ QRTMetadataRef QRTClientConnection::_buildInStaging(const QRTURL& staging, uint3
 }
 
 QRTMetadataRef QRTClientConnection::_createNewContainer(uint32_t userId, const std::string& identifier,
-                                                                      uint64_t containerClass, bool transient,
-                                                                      QRTErrorRef* error) {
+                                                        uint64_t containerClass, bool transient, QRTErrorRef* error) {
   QRTGlobalConfiguration& configuration = QRTGlobalConfiguration::sharedInstance();
   const std::string directoryName = QRTUUID::random().UUIDString();
   const QRTURL staging = configuration.stagingDirectory().URLByAppendingPathComponent(directoryName, true);
@@ -201,8 +200,8 @@ QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(
 }
 
 QRTMetadataRef QRTClientConnection::_lookupOrCreate(uint32_t userId, const std::string& identifier,
-                                                                  bool createIfNecessary, uint64_t containerClass,
-                                                                  bool transient, bool useLocking, QRTErrorRef* error) {
+                                                    bool createIfNecessary, uint64_t containerClass, bool transient,
+                                                    bool useLocking, QRTErrorRef* error) {
   QRTAllIdentifiersLock lock(true, useLocking);
   QRTErrorRef lookupError;
   QRTMetadataRef found =

@@ -40,10 +40,9 @@ class QRTClientConnection {
   // Finds the container of (user, class, identifier, transient), or makes it
   // through the staging directory when asked to. Nothing on failure, with
   // the code in *withError.
-  QRTMetadataRef createOrLookupContainerForUser(uint32_t userId,
-                                                              const std::optional<std::string>& identifier,
-                                                              bool createIfNecessary, uint64_t containerClass,
-                                                              bool transient, bool useLocking, uint64_t* withError);
+  QRTMetadataRef createOrLookupContainerForUser(uint32_t userId, const std::optional<std::string>& identifier,
+                                                bool createIfNecessary, uint64_t containerClass, bool transient,
+                                                bool useLocking, uint64_t* withError);
 
   // Queues a death-row pass; the completion gets its result code.
   void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
@@ -61,11 +60,11 @@ class QRTClientConnection {
                                          uint64_t containerClass, uint64_t* withError);
 
   // Queries and info values of existing containers.
-  std::optional<std::vector<QRTMetadataRef>> containersForUser(uint32_t userId, uint64_t withClass,
-                                                                              bool transient, uint64_t* withError);
+  std::optional<std::vector<QRTMetadataRef>> containersForUser(uint32_t userId, uint64_t withClass, bool transient,
+                                                               uint64_t* withError);
   QRTMetadataRef metadataForUser(uint32_t userId, const std::optional<QRTUUID>& withUUID,
-                                               const std::optional<std::string>& identifier,
-                                               uint64_t containerClass, uint64_t* withError);
+                                 const std::optional<std::string>& identifier, uint64_t containerClass,
+                                 uint64_t* withError);
   // A nil value removes the key.
   void setInfoValue(const std::optional<plist::Value>& value, const std::optional<std::string>& forKey,
                     uint32_t userId, const std::optional<QRTUUID>& uuid, const std::optional<std::string>& identifier,
@@ -115,12 +114,11 @@ class QRTClientConnection {
  private:
   // The body of createOrLookupContainerForUser, under the all-identifiers lock.
   QRTMetadataRef _lookupOrCreate(uint32_t userId, const std::string& identifier, bool createIfNecessary,
-                                               uint64_t containerClass, bool transient, bool useLocking,
-                                               QRTErrorRef* error);
-  QRTMetadataRef _createNewContainer(uint32_t userId, const std::string& identifier,
-                                                   uint64_t containerClass, bool transient, QRTErrorRef* error);
+                                 uint64_t containerClass, bool transient, bool useLocking, QRTErrorRef* error);
+  QRTMetadataRef _createNewContainer(uint32_t userId, const std::string& identifier, uint64_t containerClass,
+                                     bool transient, QRTErrorRef* error);
   QRTMetadataRef _buildInStaging(const QRTURL& staging, uint32_t userId, const std::string& identifier,
-                                               uint64_t containerClass, QRTErrorRef* error);
+                                 uint64_t containerClass, QRTErrorRef* error);
   uint64_t _runDeathRowPass();
   // The replace journal: the four directories of one replace, keyed by the
   // journal's key names.
@@ -133,8 +131,8 @@ class QRTClientConnection {
                                                                                 QRTErrorRef* error);
   // The containers a directory-UUID regeneration renames.
   std::vector<QRTMetadataRef> _containersToRename(uint32_t userId, const QRTUUID& uuid,
-                                                                const std::optional<std::string>& identifier,
-                                                                uint64_t containerClass, QRTErrorRef* error);
+                                                  const std::optional<std::string>& identifier, uint64_t containerClass,
+                                                  QRTErrorRef* error);
 
   std::optional<std::string> clientBundleIdentifier_;
   uint32_t clientUserId_ = 0;

@@ -49,10 +49,8 @@ QRTMetadataRef lookupByUUID(const char* function, uint32_t userId, const QRTUUID
 
 }  // namespace
 
-std::optional<std::vector<QRTMetadataRef>> QRTClientConnection::containersForUser(uint32_t userId,
-                                                                                             uint64_t withClass,
-                                                                                             bool transient,
-                                                                                             uint64_t* withError) {
+std::optional<std::vector<QRTMetadataRef>> QRTClientConnection::containersForUser(uint32_t userId, uint64_t withClass,
+                                                                                  bool transient, uint64_t* withError) {
   if (withClass < 1 || withClass > 13) {
     reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
                          "Can't act on an invalid container-userId: %u, class: %ld", userId,
@@ -72,10 +70,9 @@ std::optional<std::vector<QRTMetadataRef>> QRTClientConnection::containersForUse
   return std::nullopt;
 }
 
-QRTMetadataRef QRTClientConnection::metadataForUser(uint32_t userId,
-                                                                  const std::optional<QRTUUID>& withUUID,
-                                                                  const std::optional<std::string>& identifier,
-                                                                  uint64_t containerClass, uint64_t* withError) {
+QRTMetadataRef QRTClientConnection::metadataForUser(uint32_t userId, const std::optional<QRTUUID>& withUUID,
+                                                    const std::optional<std::string>& identifier,
+                                                    uint64_t containerClass, uint64_t* withError) {
   QRTErrorRef error;
   try {
     if (validSelector(__func__, userId, withUUID, containerClass, &error)) {
