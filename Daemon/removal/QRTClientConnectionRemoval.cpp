@@ -59,6 +59,7 @@ bool QRTClientConnection::_moveItemAtURLToDeathRow(const QRTURL& url, bool isDir
                                    url));
       return false;
     }
+    QRT_PAUSE_POINT("deathrow-hand-over");
     QRTURL target = holding->URLByAppendingPathComponent(url.lastPathComponent(), isDir);
     if (!files.moveItemAtURL(url, target, &underlying)) {
       // Only a missing source means there was nothing to hand over; a

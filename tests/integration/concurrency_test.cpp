@@ -8,6 +8,8 @@
 #include <set>
 #include <string>
 #include <thread>
+
+#include <unistd.h>
 #include <vector>
 
 #include "DaemonFixture.h"
@@ -177,6 +179,32 @@ TEST_F(ConcurrencyTest, TransientRecreationDeletionAndPassesLoseNoContainer) {
     if ((dead = listDirectory(deadDirectory())).empty()) break;
   }
   EXPECT_TRUE(dead.empty()) << dead.size() << " items left on death row, the first " << dead[0];
+}
+
+// A pass requested while a hand-over has made its holding directory but not
+// yet moved the item in must not take the directory from under it: the
+// replaced transient container would stay behind, known to nobody.
+TEST_F(ConcurrencyTest, PassDuringAHandOverLeavesNothingBehind) {
+#ifndef QRT_TEST_HOOKS
+  GTEST_SKIP() << "pause points need a build with test hooks";
+#endif
+  const Container first = createOrLookup(501, "com.example.handover", 2, true, true);
+  ASSERT_EQ(first.error, 1u);
+  ASSERT_EQ(codeOf(call(4)), 1u);
+  writeFile(root + "/run/quarterd.pausepoint", "deathrow-hand-over\n");
+  Container second;
+  std::thread recreate([&] { second = createOrLookup(501, "com.example.handover", 2, true, true); });
+  for (int i = 0; i < 500 && listDirectory(deadDirectory()).empty(); ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+  }
+  EXPECT_EQ(codeOf(call(4)), 1u);
+  recreate.join();
+  unlink((root + "/run/quarterd.pausepoint").c_str());
+  EXPECT_TRUE(logContains("Pause point deathrow-hand-over reached"));
+  EXPECT_EQ(second.error, 1u);
+  EXPECT_FALSE(exists(first.path));
+  EXPECT_EQ(codeOf(call(4)), 1u);
+  EXPECT_TRUE(listDirectory(deadDirectory()).empty());
 }
 
 }  // namespace
