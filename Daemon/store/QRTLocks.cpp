@@ -50,12 +50,17 @@ std::vector<std::string> distinctSorted(std::vector<std::string> sorted, bool as
   return sorted;
 }
 
+// Locks this thread holds. A thread that already holds one is never held
+// back for a waiting writer, which would be waiting for it in turn.
+thread_local int tLocksHeld = 0;
+
 // Under the mutex: waits until a locker of this kind may be counted. Besides
 // what `allowed` says, a waiting all-identifiers writer keeps newcomers out,
 // unless they already waited through a writer's release.
 template <typename Allowed>
 void waitToEnter(std::unique_lock<std::mutex>& hold, std::condition_variable& condition, Allowed allowed) {
   QRTLocksState& locks = gQRTLocks;
+  if (tLocksHeld > 0) return condition.wait(hold, allowed);
   if (allowed() && locks.allWritersWaiting == 0) return;
   const uint64_t releases = locks.allWriterReleases;
   ++locks.lockersWaiting;
@@ -107,7 +112,10 @@ void acquireRecord(std::unique_lock<std::mutex>& hold, QRTIdentifierLockRecord& 
     record.lockState.compare_exchange_strong(previousState, -1);
     QRTLocksAssert(previousState == 0);
   } else {
-    record.released.wait(hold, [&] { return record.lockState.load() != -1 && record.waitingWriters == 0; });
+    const bool holdsOthers = tLocksHeld > 0;
+    record.released.wait(hold, [&] {
+      return record.lockState.load() != -1 && (record.waitingWriters == 0 || holdsOthers);
+    });
     int32_t readersNow = record.lockState.fetch_add(1) + 1;
     QRTLocksAssert(readersNow > 0);
   }
@@ -163,7 +171,10 @@ void takeSortedList(const std::vector<std::string>& sorted, bool writing) {
       throw;
     }
     // Counted in its record, none can be freed while this thread waits on it.
-    for (QRTIdentifierLockRecord* record : records) acquireRecord(hold, *record, writing);
+    for (QRTIdentifierLockRecord* record : records) {
+      acquireRecord(hold, *record, writing);
+      ++tLocksHeld;
+    }
   }
   for (const std::string& identifier : sorted) QRTLocksDebug("Got lock on identifier %@", identifier);
 }
@@ -186,6 +197,7 @@ void unlock_one_lock(const std::string& identifier) {
     releaseRead(record);
   }
   --record.referenceCount;
+  --tLocksHeld;
   QRTLocksDebug("Unlocked identifier %@", identifier);
   if (record.referenceCount == 0) {
     // Every waiter is counted, so none sleeps on the record.
@@ -228,6 +240,7 @@ void _lock_all_identifiers(bool writing) {
       });
       ++locks.allReaderWriterState;
     }
+    ++tLocksHeld;
   }
   QRTLocksDebug("Locked all identifiers for %s", modeName(writing));
 }
@@ -237,6 +250,7 @@ void unlock_all_identifiers() {
   {
     std::lock_guard<std::mutex> hold(locks.mutex);
     QRTLocksAssert(locks.allReaderWriterState == -1 || locks.allReaderWriterState > 0);
+    --tLocksHeld;
     if (locks.allReaderWriterState == -1) {
       locks.allReaderWriterState = 0;
       // Whoever waited through this writer goes before the next one.

@@ -48,9 +48,9 @@ extern QRTLocksState& gQRTLocks;
 
 // Each lock call blocks until held and never fails; pair it with exactly one
 // unlock. A list is taken in ascending and released in descending order, each
-// distinct identifier once, and is let in as a whole. A thread that holds any
-// of these locks must not ask for another one (a waiting writer would wait
-// for it while it waits behind that writer).
+// distinct identifier once, and is let in as a whole. Once a writer waits,
+// newly arriving readers wait behind it, except on a thread that already
+// holds a lock (the writer may be waiting for that one).
 void _lock_identifier(const std::string& identifier, bool writing);
 void _lock_identifier(const std::vector<std::string>& identifiers, bool writing);
 void unlock_identifier(const std::string& identifier);

@@ -271,6 +271,33 @@ TEST_F(IdentifierLockTest, WaitingWriterIsNotStarvedByArrivingReaders) {
   }
 }
 
+// The writer waits for a lock this thread holds; a further lock of the
+// thread must not wait behind the writer, or neither would ever go on.
+TEST_F(IdentifierLockTest, HolderTakesMoreLocksPastAWaitingWriter) {
+  std::promise<void> holding, go, nested;
+  std::thread holder([&] {
+    _lock_identifier("a", false);
+    holding.set_value();
+    go.get_future().wait();
+    _lock_identifier("b", false);
+    _lock_all_identifiers(false);
+    nested.set_value();
+    unlock_all_identifiers();
+    unlock_identifier("b");
+    unlock_identifier("a");
+  });
+  holding.get_future().wait();
+  auto writer = holdAll(true);
+  EXPECT_TRUE(blocked(writer));
+  go.set_value();
+  if (nested.get_future().wait_for(10s) != std::future_status::ready) {
+    fprintf(stderr, "A lock holder waited behind the writer waiting for it\n");
+    abort();
+  }
+  holder.join();
+  EXPECT_TRUE(writer->waitAcquired());
+}
+
 using IdentifierLockDeathTest = IdentifierLockTest;
 
 TEST_F(IdentifierLockDeathTest, UnpairedUnlocksStopTheProcess) {
