@@ -5,20 +5,36 @@
 #include <signal.h>
 #include <string.h>
 
+#include <chrono>
 #include <string>
+#include <thread>
 
 #include "platform/DeviceRoot.h"
 #include "platform/Log.h"
 
-void QRTCrashPointReached(const char* name) {
-  static const std::string armed = platform::hostPath("/run/quarterd.crashpoint");
-  auto text = platform::readHostFile(armed, 256);
-  if (!text) return;
+namespace {
+
+// Whether the host file names this point.
+bool armed(const char* file, const char* name) {
+  auto text = platform::readHostFile(platform::hostPath(file), 256);
+  if (!text) return false;
   std::string wanted = *text;
   while (!wanted.empty() && (wanted.back() == '\n' || wanted.back() == ' ')) wanted.pop_back();
-  if (wanted != name) return;
+  return wanted == name;
+}
+
+}  // namespace
+
+void QRTCrashPointReached(const char* name) {
+  if (!armed("/run/quarterd.crashpoint", name)) return;
   QRTLog(platform::kLogError, "Crash point %s reached: killing the daemon", name);
   raise(SIGKILL);
+}
+
+void QRTPausePointReached(const char* name) {
+  if (!armed("/run/quarterd.pausepoint", name)) return;
+  QRTLog(platform::kLogError, "Pause point %s reached", name);
+  std::this_thread::sleep_for(std::chrono::seconds(1));
 }
 
 #endif

@@ -4,6 +4,7 @@
 #include <cerrno>
 #include <cstdlib>
 #include <map>
+#include <mutex>
 #include <iterator>
 
 #include "base/QRTUUID.h"
@@ -37,23 +38,37 @@ bool QRTClientConnection::_removeItemOrMoveToTempAtURL(const QRTURL& url, QRTErr
   return false;
 }
 
+namespace {
+// A pass lists death row while holding this, and a hand-over holds it from
+// making its holding directory until the item is inside: a pass never sees,
+// and so never removes, a holding directory that is still empty on its way
+// to receiving an item.
+std::mutex gDeathRowHandOverLock;
+}  // namespace
+
 bool QRTClientConnection::_moveItemAtURLToDeathRow(const QRTURL& url, bool isDir, bool startDeletionThread,
                                                    QRTErrorRef* error) {
   QRTFileManager& files = QRTFileManager::defaultManager();
   QRTErrorRef underlying;
-  std::optional<QRTURL> holding = files.createTemporaryDirectoryInDirectoryURL(
-      QRTGlobalConfiguration::sharedInstance().deathrowDirectory(), &underlying);
-  if (!holding) {
-    QRTSetError(error, QRT_ERROR(QRTErrorDeathRowFailed, underlying, true, "Failed to create unique directory at: %@",
-                                 url));
-    return false;
-  }
-  QRTURL target = holding->URLByAppendingPathComponent(url.lastPathComponent(), isDir);
-  if (!files.moveItemAtURL(url, target, &underlying)) {
-    if (underlying->domain() == QRTPOSIXErrorDomain && underlying->code() == ENOENT) return true;
-    QRTSetError(error, QRT_ERROR(QRTErrorDeathRowFailed, underlying, true, "Failed to move item at: %@ to: %@", url,
-                                 target));
-    return false;
+  {
+    std::lock_guard<std::mutex> handOver(gDeathRowHandOverLock);
+    std::optional<QRTURL> holding = files.createTemporaryDirectoryInDirectoryURL(
+        QRTGlobalConfiguration::sharedInstance().deathrowDirectory(), &underlying);
+    if (!holding) {
+      QRTSetError(error, QRT_ERROR(QRTErrorDeathRowFailed, underlying, true, "Failed to create unique directory at: %@",
+                                   url));
+      return false;
+    }
+    QRT_PAUSE_POINT("deathrow-hand-over");
+    QRTURL target = holding->URLByAppendingPathComponent(url.lastPathComponent(), isDir);
+    if (!files.moveItemAtURL(url, target, &underlying)) {
+      // Only a missing source means there was nothing to hand over; a
+      // missing destination leaves the item where it was.
+      if (hasCode(underlying, QRTPOSIXErrorDomain, ENOENT) && files.itemDoesNotExistAtURL(url)) return true;
+      QRTSetError(error, QRT_ERROR(QRTErrorDeathRowFailed, underlying, true, "Failed to move item at: %@ to: %@", url,
+                                   target));
+      return false;
+    }
   }
   if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
   return true;
@@ -62,7 +77,11 @@ bool QRTClientConnection::_moveItemAtURLToDeathRow(const QRTURL& url, bool isDir
 uint64_t QRTClientConnection::_runDeathRowPass() {
   QRTErrorRef listError;
   QRTURL deathRow = QRTGlobalConfiguration::sharedInstance().deathrowDirectory();
-  auto items = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow, &listError);
+  std::optional<std::vector<QRTURL>> items;
+  {
+    std::lock_guard<std::mutex> handOver(gDeathRowHandOverLock);
+    items = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow, &listError);
+  }
   if (!items) {
     if (listError->domain() == QRTPOSIXErrorDomain && listError->code() == ENOENT) return QRTErrorNone;
     return QRT_ERROR(QRTErrorDeleteFailed, listError, true, "Failed to get items for deletion: %@ : %@", nullptr,

@@ -71,6 +71,9 @@ constexpr const char* kNewURLKey = "QRTReplaceOperationNewURL";
 constexpr const char* kStagingURLKey = "QRTReplaceOperationStagingURL";
 constexpr const char* kDestURLKey = "QRTReplaceOperationDestURL";
 constexpr const char* kJournalKeys[] = {kOldURLKey, kNewURLKey, kStagingURLKey, kDestURLKey};
+// A wipe keeps the old container's UUID: recorded before the first move so
+// that the recovery can give it back to whichever content ends up live.
+constexpr const char* kPreservedUUIDKey = "QRTReplaceOperationPreservedUUID";
 
 // Errors and log lines carry the operation's name, whichever helper makes them.
 constexpr const char* kReplace = "replaceContainer";
@@ -106,6 +109,7 @@ struct ReplaceJob {
 
   QRTMetadataRef oldContainer{};
   QRTMetadataRef newContainer{};
+  QRTMetadataRef adopted{};  // the new container as the cache learns it at the destination
   QRTURL oldURL{};
   QRTURL newURL{};
   QRTURL destination{};
@@ -211,34 +215,45 @@ QRTErrorRef locateContainers(ReplaceJob& job) {
   return nullptr;
 }
 
-// The cache forgets the new container where it was and
-// learns it at the destination under the old one's identity.
+// The cache forgets the new container where it was and learns it at the
+// destination under the old one's identity. The metadata file already holds
+// whatever UUID the entry carries.
 QRTErrorRef adoptNewContainer(ReplaceJob& job) {
   QRTContainerCache& cache = QRTContainerCache::sharedInstance();
-  QRTMetadataRef metadata = job.newContainer;
   QRTErrorRef underlying;
-  if (!cache.removeContainerForUser(job.userIdNew, job.classNew, job.identifierNew, metadata->transient(),
+  if (!cache.removeContainerForUser(job.userIdNew, job.classNew, job.identifierNew, job.newContainer->transient(),
                                     &underlying)) {
     return QRT_ERROR_AS(kReplace, QRTErrorCacheRemoveFailed, underlying,
                         "Failed to remove from cache id: %@, class: %ld, transient: %d", job.identifierNew,
-                        static_cast<long>(job.classNew), metadata->transient());
+                        static_cast<long>(job.classNew), job.newContainer->transient());
   }
-  if (job.preserveOldUUID) metadata->setUuid(*job.oldUUID);
-  metadata->setTransient(job.destinationTransient);
-  if (!cache.addContainerMetadata(metadata, job.userIdNew, job.destination, job.destinationTransient, true,
+  if (!cache.addContainerMetadata(job.adopted, job.userIdNew, job.destination, job.destinationTransient, true,
                                   &underlying)) {
     return QRT_ERROR_AS(kReplace, QRTErrorCacheAddFailed, underlying,
-                        "Failed to add to cache: %@, url: %@, transient: %d", metadata, job.destination,
+                        "Failed to add to cache: %@, url: %@, transient: %d", job.adopted, job.destination,
                         job.destinationTransient);
   }
-  // The internal UUID lives in the metadata file: without this the next
-  // start would hand out the replacement's own UUID again.
-  QRTErrorRef writeError;
-  if (job.preserveOldUUID && !metadata->writeMetadataToDiskWithError(&writeError)) {
-    QRTLogAs(kLogError, kReplace, "Failed to keep UUID %@ in metadata at %@ : %@", job.oldUUID, job.destination,
-             writeError);
-  }
   return nullptr;
+}
+
+// With preserveOldUUID the new content takes the old UUID, on disk first. If
+// that write fails the new content goes back where it came from, so that the
+// restore can put the old one back; if even that fails the process ends with
+// the journal in place and the start-up recovery writes the UUID.
+QRTErrorRef keepOldUUID(ReplaceJob& job, bool* restore) {
+  job.adopted = job.newContainer->withUrl(job.destination, job.destinationTransient);
+  if (!job.preserveOldUUID) return nullptr;
+  job.adopted = job.adopted->withUuid(*job.oldUUID);
+  QRTErrorRef writeError;
+  if (job.adopted->writeMetadataToDiskWithError(&writeError)) return nullptr;
+  QRTErrorRef moveError;
+  if (!QRTFileManager::defaultManager().moveItemAtURL(job.destination, job.newURL, &moveError)) {
+    QRTLogAs(kLogError, kReplace, "Failed to keep UUID %@ at %@ (%@) nor move the new content back: %@", job.oldUUID,
+             job.destination, writeError, moveError);
+    std::_Exit(EXIT_FAILURE);
+  }
+  *restore = true;
+  return writeError;
 }
 
 // The moves and the cache swap. *restore tells whether the failing step left
@@ -269,6 +284,8 @@ QRTErrorRef swapContainers(ReplaceJob& job, bool* restore) {
   }
   *restore = false;
   QRT_CRASH_POINT("replace-after-move-new");
+  if (QRTErrorRef error = keepOldUUID(job, restore)) return error;
+  QRT_CRASH_POINT("replace-after-keep-uuid");
   return adoptNewContainer(job);
 }
 
@@ -337,6 +354,20 @@ QRTErrorRef cleanUpReplace(QRTClientConnection& client, const ReplaceJob& job, b
   return result;
 }
 
+// Whichever content is live at the destination of a UUID-preserving replace
+// carries the preserved UUID. A failure keeps the journal for the next start.
+bool restorePreservedUUID(const QRTURL& destination, const QRTUUID& uuid, QRTErrorRef* error) {
+  if (QRTFileManager::defaultManager().itemDoesNotExistAtURL(destination.URLByAppendingPathComponent(
+          QRTMetadataFileName))) {
+    return true;
+  }
+  QRTErrorRef underlying;
+  if (QRTMetadata::rewriteUUIDAtUrl(destination, uuid, &underlying)) return true;
+  QRTSetError(error, QRT_ERROR_AS(kRecover, QRTErrorReplaceJournalFailed, underlying,
+                                  "Failed to restore preserved UUID %@ at %@", uuid, destination));
+  return false;
+}
+
 plist::Dictionary journalDescription(const std::map<std::string, QRTURL>& info) {
   plist::Dictionary paths;
   for (const auto& [key, url] : info) paths[key] = url.path();
@@ -374,7 +405,8 @@ void QRTClientConnection::replaceContainer(const std::optional<QRTUUID>& replace
       const std::string name = QRTUUID::random().UUIDString();
       job.journal = configuration.replaceDirectory().URLByAppendingPathComponent(QRTFormat("%@.plist", name));
       job.staging = configuration.stagingDirectory().URLByAppendingPathComponent(name, true);
-      if (!_writeToDiskReplaceAt(job.journal, job.oldURL, job.newURL, job.staging, job.destination, &error)) {
+      if (!_writeToDiskReplaceAt(job.journal, job.oldURL, job.newURL, job.staging, job.destination,
+                                 job.preserveOldUUID ? job.oldUUID : std::nullopt, &error)) {
         QRTLog(kLogError, "Failed to write replace file: %@", error);
       } else {
         QRT_CRASH_POINT("replace-after-journal");
@@ -399,7 +431,7 @@ void QRTClientConnection::replaceContainer(const std::optional<QRTUUID>& replace
 
 bool QRTClientConnection::_writeToDiskReplaceAt(const QRTURL& replaceURL, const QRTURL& old, const QRTURL& withNew,
                                                 const QRTURL& usingStaging, const QRTURL& toDestination,
-                                                QRTErrorRef* error) {
+                                                const std::optional<QRTUUID>& preservedUUID, QRTErrorRef* error) {
   if (old.empty() || withNew.empty() || usingStaging.empty() || toDestination.empty()) {
     QRTSetError(error, QRT_ERROR(QRTErrorInvalidReplaceInfo, nullptr, true,
                                  "Invalid Replace File Info: old: %@, new: %@, staging: %@, dest: %@", pathOrNil(old),
@@ -410,6 +442,7 @@ bool QRTClientConnection::_writeToDiskReplaceAt(const QRTURL& replaceURL, const 
                             {kNewURLKey, withNew.path()},
                             {kStagingURLKey, usingStaging.path()},
                             {kDestURLKey, toDestination.path()}};
+  if (preservedUUID) journal[kPreservedUUIDKey] = preservedUUID->UUIDString();
   QRTErrorRef writeError;
   if (!QRT_writeToURL(journal, replaceURL, QRTWriteAtomic | QRTWriteFileProtectionNone, &writeError)) {
     QRTSetError(error, QRT_ERROR(QRTErrorWriteFailed, writeError, true, "Failed to write replace dictionary to URL %@",
@@ -420,7 +453,7 @@ bool QRTClientConnection::_writeToDiskReplaceAt(const QRTURL& replaceURL, const 
 }
 
 std::optional<std::map<std::string, QRTURL>> QRTClientConnection::_readAndValidateReplaceFileAtUrl(
-    const QRTURL& url, QRTErrorRef* error) {
+    const QRTURL& url, std::optional<QRTUUID>* preservedUUID, QRTErrorRef* error) {
   QRTErrorRef readError;
   std::optional<plist::Dictionary> journal = QRT_dictionaryWithContentsOfURL(url, &readError);
   if (!journal) {
@@ -442,6 +475,16 @@ std::optional<std::map<std::string, QRTURL>> QRTClientConnection::_readAndValida
     }
     urls[key] = QRTURL::fileURL(*path, true);
   }
+  *preservedUUID = std::nullopt;
+  if (const plist::Value* value = plist::find(*journal, kPreservedUUIDKey)) {
+    const std::string* text = value->stringIf();
+    *preservedUUID = text ? QRTUUID::fromString(*text) : std::nullopt;
+    if (!*preservedUUID) {
+      QRTSetError(error, QRT_ERROR(QRTErrorReplaceJournalFailed, nullptr, true, "Invalid preserved UUID: %@ in %@",
+                                   *value, url));
+      return std::nullopt;
+    }
+  }
   return urls;
 }
 
@@ -458,11 +501,13 @@ bool QRTClientConnection::_recoverFromReplaceOperationsWithError(QRTErrorRef* er
     }
     for (const QRTURL& journalURL : *journals) {
       // An unreadable or invalid journal is not acted on, only removed.
-      auto info = _readAndValidateReplaceFileAtUrl(journalURL, nullptr);
+      std::optional<QRTUUID> preservedUUID;
+      auto info = _readAndValidateReplaceFileAtUrl(journalURL, &preservedUUID, nullptr);
       if (info) {
         QRTLog(kLogDebug, "Doing a replace of %@ with info: %@", journalURL, plist::Value(journalDescription(*info)));
         if (!moveStagingBackIfAside(info->at(kOldURLKey), info->at(kStagingURLKey), info->at(kDestURLKey), kRecover,
-                                    "Recovering from failed replace by moving: %@ to %@", nullptr, error)) {
+                                    "Recovering from failed replace by moving: %@ to %@", nullptr, error) ||
+            (preservedUUID && !restorePreservedUUID(info->at(kDestURLKey), *preservedUUID, error))) {
           return false;
         }
       }

@@ -89,17 +89,17 @@ bool QRTClientConnection::_createSubDirectories(const QRTURL& url, uint32_t user
   return true;
 }
 
-std::shared_ptr<QRTMetadata> QRTClientConnection::_buildInStaging(const QRTURL& staging, uint32_t userId,
-                                                                  const std::string& identifier,
-                                                                  uint64_t containerClass, QRTErrorRef* error) {
+QRTMetadataRef QRTClientConnection::_buildInStaging(const QRTURL& staging, uint32_t userId,
+                                                    const std::string& identifier, uint64_t containerClass,
+                                                    QRTErrorRef* error) {
   QRTErrorRef underlying;
   if (!_createTopLevelContainerDirectory(staging, containerClass, userId, &underlying)) {
     QRTSetError(error, QRT_ERROR(QRTErrorCreateStagingFailed, underlying, true, "Failed to create staging dir at %@ : %@",
                                  staging, underlying));
     return nullptr;
   }
-  auto metadata = std::make_shared<QRTMetadata>(userId, QRTUUID::random(), containerClass, identifier, std::nullopt,
-                                                staging, std::nullopt);
+  auto metadata = std::make_shared<const QRTMetadata>(userId, QRTUUID::random(), containerClass, identifier,
+                                                      std::nullopt, staging, std::nullopt);
   if (!metadata->writeMetadataToDiskWithError(error)) return nullptr;
   if (QRTIsSystemClass(containerClass) &&
       !QRTFileManager::defaultManager().setTopLevelSystemContainerACLAtURL(staging, error)) {
@@ -109,14 +109,13 @@ std::shared_ptr<QRTMetadata> QRTClientConnection::_buildInStaging(const QRTURL& 
   return metadata;
 }
 
-std::shared_ptr<QRTMetadata> QRTClientConnection::_createNewContainer(uint32_t userId, const std::string& identifier,
-                                                                      uint64_t containerClass, bool transient,
-                                                                      QRTErrorRef* error) {
+QRTMetadataRef QRTClientConnection::_createNewContainer(uint32_t userId, const std::string& identifier,
+                                                        uint64_t containerClass, bool transient, QRTErrorRef* error) {
   QRTGlobalConfiguration& configuration = QRTGlobalConfiguration::sharedInstance();
   const std::string directoryName = QRTUUID::random().UUIDString();
   const QRTURL staging = configuration.stagingDirectory().URLByAppendingPathComponent(directoryName, true);
 
-  std::shared_ptr<QRTMetadata> metadata = _buildInStaging(staging, userId, identifier, containerClass, error);
+  QRTMetadataRef metadata = _buildInStaging(staging, userId, identifier, containerClass, error);
   if (metadata) {
     std::optional<QRTURL> classDirectory =
         configuration.containerDirectoryURLForUser(userId, containerClass, transient);
@@ -129,20 +128,23 @@ std::shared_ptr<QRTMetadata> QRTClientConnection::_createNewContainer(uint32_t u
     if (!classDirectory || !QRTFileManager::defaultManager().moveItemAtURL(staging, finalURL, &moveError)) {
       QRTSetError(error, QRT_ERROR(QRTErrorMoveStagingToLiveFailed, moveError, true,
                                    "Failed to move staging dir: %@ to live dir: %@", staging, finalURL));
-      metadata = nullptr;
     } else {
-      metadata->setUrl(finalURL);
-      metadata->setExisted(false);
-      metadata->setTransient(transient);
+      QRTMetadataRef stored;
       QRTErrorRef cacheError;
-      if (!QRTContainerCache::sharedInstance().addContainerMetadata(metadata, userId, finalURL, transient, true,
-                                                                    &cacheError)) {
-        QRTSetError(error, QRT_ERROR(QRTErrorCacheAddFailed, cacheError, true,
-                                     "Failed to add to cache for %u : %@, url: %@, transient: %d", userId, metadata,
-                                     finalURL, transient));
-        return nullptr;  // the container is complete on disk; the cache finds it after a restart
+      if (QRTContainerCache::sharedInstance().addContainerMetadata(metadata, userId, finalURL, transient, true,
+                                                                   &cacheError, &stored)) {
+        return stored;
       }
-      return metadata;
+      QRTSetError(error, QRT_ERROR(QRTErrorCacheAddFailed, cacheError, true,
+                                   "Failed to add to cache for %u : %@, url: %@, transient: %d", userId, metadata,
+                                   finalURL, transient));
+      // No client learns of it, and a container the cache does not know
+      // would be found by nobody until a restart: it goes to death row too.
+      QRTErrorRef cleanupError;
+      if (!_moveItemAtURLToDeathRow(finalURL, true, true, &cleanupError)) {
+        QRTLog(platform::kLogError, "Failed to remove uncached container at %@ : %@", finalURL, cleanupError);
+      }
+      return nullptr;
     }
   }
   // Nothing half-made stays behind: the staging directory goes to death row.
@@ -154,7 +156,7 @@ std::shared_ptr<QRTMetadata> QRTClientConnection::_createNewContainer(uint32_t u
   return nullptr;
 }
 
-std::shared_ptr<QRTMetadata> QRTClientConnection::createOrLookupContainerForUser(
+QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(
     uint32_t userId, const std::optional<std::string>& identifier, bool createIfNecessary, uint64_t containerClass,
     bool transient, bool useLocking, uint64_t* withError) {
   if (!identifier || containerClass < 1 || containerClass > 13) {
@@ -187,7 +189,7 @@ std::shared_ptr<QRTMetadata> QRTClientConnection::createOrLookupContainerForUser
   }
 
   QRTErrorRef error;
-  std::shared_ptr<QRTMetadata> result;
+  QRTMetadataRef result;
   try {
     result = _lookupOrCreate(userId, *identifier, createIfNecessary, containerClass, transient, useLocking, &error);
   } catch (...) {
@@ -197,17 +199,15 @@ std::shared_ptr<QRTMetadata> QRTClientConnection::createOrLookupContainerForUser
   return result;
 }
 
-std::shared_ptr<QRTMetadata> QRTClientConnection::_lookupOrCreate(uint32_t userId, const std::string& identifier,
-                                                                  bool createIfNecessary, uint64_t containerClass,
-                                                                  bool transient, bool useLocking, QRTErrorRef* error) {
+QRTMetadataRef QRTClientConnection::_lookupOrCreate(uint32_t userId, const std::string& identifier,
+                                                    bool createIfNecessary, uint64_t containerClass, bool transient,
+                                                    bool useLocking, QRTErrorRef* error) {
   QRTAllIdentifiersLock lock(true, useLocking);
   QRTErrorRef lookupError;
-  std::shared_ptr<QRTMetadata> found =
+  QRTMetadataRef found =
       QRTContainerCache::sharedInstance().containerForUser(userId, containerClass, identifier, transient, &lookupError);
-  if (found && !transient) {
-    found->setExisted(true);
-    return found;
-  }
+  // Whether it existed belongs to this call: the cached object is shared.
+  if (found && !transient) return found->withExisted(true);
   if (found) {
     // A transient container is never reused.
     QRTErrorRef moveError;

@@ -17,6 +17,7 @@
 #include "Daemon/QRTError.h"
 
 class QRTMetadata;
+using QRTMetadataRef = std::shared_ptr<const QRTMetadata>;
 
 class QRTClientConnection {
  public:
@@ -39,10 +40,9 @@ class QRTClientConnection {
   // Finds the container of (user, class, identifier, transient), or makes it
   // through the staging directory when asked to. Nothing on failure, with
   // the code in *withError.
-  std::shared_ptr<QRTMetadata> createOrLookupContainerForUser(uint32_t userId,
-                                                              const std::optional<std::string>& identifier,
-                                                              bool createIfNecessary, uint64_t containerClass,
-                                                              bool transient, bool useLocking, uint64_t* withError);
+  QRTMetadataRef createOrLookupContainerForUser(uint32_t userId, const std::optional<std::string>& identifier,
+                                                bool createIfNecessary, uint64_t containerClass, bool transient,
+                                                bool useLocking, uint64_t* withError);
 
   // Queues a death-row pass; the completion gets its result code.
   void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
@@ -60,11 +60,11 @@ class QRTClientConnection {
                                          uint64_t containerClass, uint64_t* withError);
 
   // Queries and info values of existing containers.
-  std::optional<std::vector<std::shared_ptr<QRTMetadata>>> containersForUser(uint32_t userId, uint64_t withClass,
-                                                                              bool transient, uint64_t* withError);
-  std::shared_ptr<QRTMetadata> metadataForUser(uint32_t userId, const std::optional<QRTUUID>& withUUID,
-                                               const std::optional<std::string>& identifier,
-                                               uint64_t containerClass, uint64_t* withError);
+  std::optional<std::vector<QRTMetadataRef>> containersForUser(uint32_t userId, uint64_t withClass, bool transient,
+                                                               uint64_t* withError);
+  QRTMetadataRef metadataForUser(uint32_t userId, const std::optional<QRTUUID>& withUUID,
+                                 const std::optional<std::string>& identifier, uint64_t containerClass,
+                                 uint64_t* withError);
   // A nil value removes the key.
   void setInfoValue(const std::optional<plist::Value>& value, const std::optional<std::string>& forKey,
                     uint32_t userId, const std::optional<QRTUUID>& uuid, const std::optional<std::string>& identifier,
@@ -113,24 +113,26 @@ class QRTClientConnection {
 
  private:
   // The body of createOrLookupContainerForUser, under the all-identifiers lock.
-  std::shared_ptr<QRTMetadata> _lookupOrCreate(uint32_t userId, const std::string& identifier, bool createIfNecessary,
-                                               uint64_t containerClass, bool transient, bool useLocking,
-                                               QRTErrorRef* error);
-  std::shared_ptr<QRTMetadata> _createNewContainer(uint32_t userId, const std::string& identifier,
-                                                   uint64_t containerClass, bool transient, QRTErrorRef* error);
-  std::shared_ptr<QRTMetadata> _buildInStaging(const QRTURL& staging, uint32_t userId, const std::string& identifier,
-                                               uint64_t containerClass, QRTErrorRef* error);
+  QRTMetadataRef _lookupOrCreate(uint32_t userId, const std::string& identifier, bool createIfNecessary,
+                                 uint64_t containerClass, bool transient, bool useLocking, QRTErrorRef* error);
+  QRTMetadataRef _createNewContainer(uint32_t userId, const std::string& identifier, uint64_t containerClass,
+                                     bool transient, QRTErrorRef* error);
+  QRTMetadataRef _buildInStaging(const QRTURL& staging, uint32_t userId, const std::string& identifier,
+                                 uint64_t containerClass, QRTErrorRef* error);
   uint64_t _runDeathRowPass();
   // The replace journal: the four directories of one replace, keyed by the
   // journal's key names.
+  // A UUID-preserving replace also records the UUID that must stay.
   bool _writeToDiskReplaceAt(const QRTURL& replaceURL, const QRTURL& old, const QRTURL& withNew,
-                             const QRTURL& usingStaging, const QRTURL& toDestination, QRTErrorRef* error);
+                             const QRTURL& usingStaging, const QRTURL& toDestination,
+                             const std::optional<QRTUUID>& preservedUUID, QRTErrorRef* error);
   std::optional<std::map<std::string, QRTURL>> _readAndValidateReplaceFileAtUrl(const QRTURL& url,
+                                                                                std::optional<QRTUUID>* preservedUUID,
                                                                                 QRTErrorRef* error);
   // The containers a directory-UUID regeneration renames.
-  std::vector<std::shared_ptr<QRTMetadata>> _containersToRename(uint32_t userId, const QRTUUID& uuid,
-                                                                const std::optional<std::string>& identifier,
-                                                                uint64_t containerClass, QRTErrorRef* error);
+  std::vector<QRTMetadataRef> _containersToRename(uint32_t userId, const QRTUUID& uuid,
+                                                  const std::optional<std::string>& identifier, uint64_t containerClass,
+                                                  QRTErrorRef* error);
 
   std::optional<std::string> clientBundleIdentifier_;
   uint32_t clientUserId_ = 0;

@@ -34,7 +34,7 @@ bool validSelector(const char* function, uint32_t userId, const std::optional<QR
   return false;
 }
 
-std::shared_ptr<QRTMetadata> lookupByUUID(const char* function, uint32_t userId, const QRTUUID& uuid,
+QRTMetadataRef lookupByUUID(const char* function, uint32_t userId, const QRTUUID& uuid,
                                           const std::optional<std::string>& identifier, uint64_t containerClass,
                                           QRTErrorRef* error) {
   auto metadata =
@@ -49,10 +49,8 @@ std::shared_ptr<QRTMetadata> lookupByUUID(const char* function, uint32_t userId,
 
 }  // namespace
 
-std::optional<std::vector<std::shared_ptr<QRTMetadata>>> QRTClientConnection::containersForUser(uint32_t userId,
-                                                                                             uint64_t withClass,
-                                                                                             bool transient,
-                                                                                             uint64_t* withError) {
+std::optional<std::vector<QRTMetadataRef>> QRTClientConnection::containersForUser(uint32_t userId, uint64_t withClass,
+                                                                                  bool transient, uint64_t* withError) {
   if (withClass < 1 || withClass > 13) {
     reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
                          "Can't act on an invalid container-userId: %u, class: %ld", userId,
@@ -72,10 +70,9 @@ std::optional<std::vector<std::shared_ptr<QRTMetadata>>> QRTClientConnection::co
   return std::nullopt;
 }
 
-std::shared_ptr<QRTMetadata> QRTClientConnection::metadataForUser(uint32_t userId,
-                                                                  const std::optional<QRTUUID>& withUUID,
-                                                                  const std::optional<std::string>& identifier,
-                                                                  uint64_t containerClass, uint64_t* withError) {
+QRTMetadataRef QRTClientConnection::metadataForUser(uint32_t userId, const std::optional<QRTUUID>& withUUID,
+                                                    const std::optional<std::string>& identifier,
+                                                    uint64_t containerClass, uint64_t* withError) {
   QRTErrorRef error;
   try {
     if (validSelector(__func__, userId, withUUID, containerClass, &error)) {
@@ -113,13 +110,14 @@ void QRTClientConnection::setInfoValue(const std::optional<plist::Value>& value,
     } else {
       info.erase(*forKey);
     }
-    metadata->setInfo(std::move(info));
-    if (!metadata->writeMetadataToDiskWithError(&error)) return reportCode(error, withError);
+    // The file first: a refused or failed write leaves the cached metadata as it was.
+    QRTMetadataRef changed = metadata->withInfo(std::move(info));
+    if (!changed->writeMetadataToDiskWithError(&error)) return reportCode(error, withError);
     QRTErrorRef cacheError;
-    if (!QRTContainerCache::sharedInstance().addContainerMetadata(metadata, metadata->uid(), metadata->url(),
-                                                                  metadata->transient(), false, &cacheError)) {
+    if (!QRTContainerCache::sharedInstance().addContainerMetadata(changed, changed->uid(), changed->url(),
+                                                                  changed->transient(), false, &cacheError)) {
       reportCode(QRT_ERROR(QRTErrorCacheAddFailed, cacheError, true, "Failed to add to cache: %@, url: %@, transient: %d",
-                           metadata, metadata->url(), metadata->transient()),
+                           changed, changed->url(), changed->transient()),
                  withError);
     }
   } catch (...) {
@@ -177,10 +175,10 @@ void QRTClientConnection::recreateDefaultStructureForUser(uint32_t userId, const
   }
 }
 
-std::vector<std::shared_ptr<QRTMetadata>> QRTClientConnection::_containersToRename(
+std::vector<QRTMetadataRef> QRTClientConnection::_containersToRename(
     uint32_t userId, const QRTUUID& uuid, const std::optional<std::string>& identifier, uint64_t containerClass,
     QRTErrorRef* error) {
-  std::vector<std::shared_ptr<QRTMetadata>> chosen;
+  std::vector<QRTMetadataRef> chosen;
   const bool multiUser = QRTIsPerUserClass(containerClass) && (platform::deviceMultiUserFlags() & 0x80000000u);
   if (!multiUser) {
     if (auto metadata = lookupByUUID("regenerateDirectoryUUIDForUser", userId, uuid, identifier, containerClass,

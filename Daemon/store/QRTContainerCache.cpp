@@ -42,28 +42,19 @@ QRTContainerCache& QRTContainerCache::sharedInstance() {
   return *instance;
 }
 
-QRTContainerCache::ClassMap* QRTContainerCache::_getCacheForUserId(uint32_t userId, uint64_t contentClass,
-                                                                   bool transient, bool populateSandboxCache,
-                                                                   QRTErrorRef* error) {
-  if (!user_id_valid_for_class(contentClass, userId)) {
-    QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Invalid cache get-userId %u for class %ld",
-                                 userId, static_cast<long>(contentClass)));
-    return nullptr;
-  }
-  std::string key = cacheKey(userId, contentClass);
-  auto& caches = transient ? transientContainerCache : liveContainerCache;
-  if (auto it = caches.find(key); it != caches.end()) return &it->second;
-
-  QRTLog(kLogDebug, "Rebuilding container class cache: %@%@", key, suffix(transient));
+std::optional<QRTContainerCache::ClassMap> QRTContainerCache::buildClassMap(uint32_t userId, uint64_t contentClass,
+                                                                            bool transient, bool populateSandboxCache,
+                                                                            QRTErrorRef* error) {
+  QRTLog(kLogDebug, "Rebuilding container class cache: %@%@", cacheKey(userId, contentClass), suffix(transient));
   std::optional<QRTURL> classDirectory =
       QRTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(userId, contentClass, transient);
   if (!classDirectory) {
     QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Invalid cache get-userId %u for class %ld",
                                  userId, static_cast<long>(contentClass)));
-    return nullptr;
+    return std::nullopt;
   }
   auto items = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(*classDirectory, error);
-  if (!items) return nullptr;
+  if (!items) return std::nullopt;
 
   ClassMap map;
   const bool pushMappings = populateSandboxCache && !transient &&
@@ -72,7 +63,7 @@ QRTContainerCache::ClassMap* QRTContainerCache::_getCacheForUserId(uint32_t user
     QRTErrorRef readError;
     QRTMetadataRef metadata = QRTMetadata::readAndValidateMetadataAtUrl(item, userId, true, &readError);
     if (!metadata) continue;
-    metadata->setTransient(transient);
+    if (transient) metadata = metadata->withTransient(true);
     if (pushMappings &&
         !setSandboxContainerMappingForUser(userId, metadata->identifier(), contentClass, metadata->url())) {
       QRTLog(kLogError, "Failed to set container mapping during create/lookup operation of %@, %llu",
@@ -80,14 +71,43 @@ QRTContainerCache::ClassMap* QRTContainerCache::_getCacheForUserId(uint32_t user
     }
     map[metadata->identifier()] = std::move(metadata);
   }
-  return &(caches[key] = std::move(map));
+  return map;
 }
 
-QRTContainerCache::ClassMap* QRTContainerCache::lockedClassMap(const char* function, uint32_t userId,
+QRTContainerCache::ClassMap* QRTContainerCache::_getCacheForUserId(std::unique_lock<std::mutex>& hold,
+                                                                   uint32_t userId, uint64_t contentClass,
+                                                                   bool transient, bool populateSandboxCache,
+                                                                   QRTErrorRef* error) {
+  if (!user_id_valid_for_class(contentClass, userId)) {
+    QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Invalid cache get-userId %u for class %ld",
+                                 userId, static_cast<long>(contentClass)));
+    return nullptr;
+  }
+  const std::string key = cacheKey(userId, contentClass);
+  auto& caches = transient ? transientContainerCache : liveContainerCache;
+  if (auto it = caches.find(key); it != caches.end()) return &it->second;
+
+  hold.unlock();
+  std::optional<ClassMap> built;
+  try {
+    built = buildClassMap(userId, contentClass, transient, populateSandboxCache, error);
+  } catch (...) {
+    hold.lock();
+    throw;
+  }
+  hold.lock();
+  // A racing build may have installed its map, and changes may have gone into it since.
+  if (auto it = caches.find(key); it != caches.end()) return &it->second;
+  if (!built) return nullptr;
+  return &(caches[key] = std::move(*built));
+}
+
+QRTContainerCache::ClassMap* QRTContainerCache::lockedClassMap(std::unique_lock<std::mutex>& hold,
+                                                               const char* function, uint32_t userId,
                                                                uint64_t contentClass, bool transient,
                                                                bool populateSandboxCache, QRTErrorRef* error) {
   QRTErrorRef buildError;
-  ClassMap* map = _getCacheForUserId(userId, contentClass, transient, populateSandboxCache, &buildError);
+  ClassMap* map = _getCacheForUserId(hold, userId, contentClass, transient, populateSandboxCache, &buildError);
   if (!map) {
     QRTSetError(error, QRTCreateError(function, __LINE__, QRTErrorDomain, QRTErrorCacheRebuildFailed, buildError,
                                       nullptr, true, "Cache: %u-%@%@: Failed to rebuild", userId,
@@ -110,10 +130,24 @@ bool QRTContainerCache::checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_
                                "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", className,
                                suffix(transient), file, metadata->identifier(),
                                static_cast<unsigned long long>(contentClass)));
-  QRTErrorRef removeError;
-  if (!removeContainerForUser(userId, contentClass, metadata->identifier(), transient, &removeError)) {
-    QRTLog(kLogError, "Failed to remove from cache user: %u, id: %@, class: %llu, transient: %d : %@", userId,
-           metadata->identifier(), static_cast<unsigned long long>(contentClass), transient, removeError);
+  // Only this very entry: a container made again under the identifier since
+  // the look-up stays.
+  bool removed = false;
+  {
+    std::lock_guard<std::mutex> hold(cacheLock);
+    auto& caches = transient ? transientContainerCache : liveContainerCache;
+    if (auto map = caches.find(cacheKey(userId, contentClass)); map != caches.end()) {
+      if (auto entry = map->second.find(metadata->identifier());
+          entry != map->second.end() && entry->second == metadata) {
+        map->second.erase(entry);
+        removed = true;
+      }
+    }
+  }
+  if (removed && !transient &&
+      !setSandboxContainerMappingForUser(userId, metadata->identifier(), contentClass, std::nullopt)) {
+    QRTLog(kLogError, "Failed to remove container mapping of %@, %llu", metadata->identifier(),
+           static_cast<unsigned long long>(contentClass));
   }
   return false;
 }
@@ -125,8 +159,8 @@ QRTMetadataRef QRTContainerCache::containerForUser(uint32_t userId, uint64_t con
   try {
     QRTMetadataRef found;
     {
-      std::lock_guard<std::mutex> hold(cacheLock);
-      ClassMap* map = lockedClassMap(__func__, userId, contentClass, transient, true, error);
+      std::unique_lock<std::mutex> hold(cacheLock);
+      ClassMap* map = lockedClassMap(hold, __func__, userId, contentClass, transient, true, error);
       if (!map) return nullptr;
       auto it = map->find(*identifier);
       if (it == map->end()) {
@@ -151,10 +185,7 @@ QRTMetadataRef QRTContainerCache::containerForUser(uint32_t userId, uint64_t con
                                                    const std::string& uuidString) {
   for (bool transient : {false, true}) {
     QRTMetadataRef metadata = containerForUser(userId, contentClass, identifier, transient, nullptr);
-    if (metadata && metadata->uuid().UUIDString() == uuidString) {
-      metadata->setTransient(transient);
-      return metadata;
-    }
+    if (metadata && metadata->uuid().UUIDString() == uuidString) return metadata;
   }
   return nullptr;
 }
@@ -172,8 +203,8 @@ std::optional<std::vector<QRTMetadataRef>> QRTContainerCache::allContainersForUs
   try {
     std::vector<QRTMetadataRef> snapshot;
     {
-      std::lock_guard<std::mutex> hold(cacheLock);
-      ClassMap* map = lockedClassMap(__func__, userId, contentClass, transient, populateSandboxCache, error);
+      std::unique_lock<std::mutex> hold(cacheLock);
+      ClassMap* map = lockedClassMap(hold, __func__, userId, contentClass, transient, populateSandboxCache, error);
       if (!map) return std::nullopt;
       snapshot.reserve(map->size());
       for (const auto& entry : *map) snapshot.push_back(entry.second);
@@ -195,7 +226,8 @@ std::optional<std::vector<QRTMetadataRef>> QRTContainerCache::allContainersForUs
 }
 
 bool QRTContainerCache::addContainerMetadata(const QRTMetadataRef& metadata, uint32_t forUser, const QRTURL& url,
-                                             bool transient, bool updateSandbox, QRTErrorRef* error) {
+                                             bool transient, bool updateSandbox, QRTErrorRef* error,
+                                             QRTMetadataRef* stored) {
   if (!metadata || !validClass(metadata->containerClass())) {
     QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Invalid Metadata Content Class: %lld",
                                  metadata ? static_cast<long long>(metadata->containerClass()) : 0LL));
@@ -207,13 +239,16 @@ bool QRTContainerCache::addContainerMetadata(const QRTMetadataRef& metadata, uin
   }
   const uint64_t contentClass = metadata->containerClass();
   try {
+    // The entry must agree with the map it is in and the place it names.
+    QRTMetadataRef entry =
+        metadata->url() == url && metadata->transient() == transient ? metadata : metadata->withUrl(url, transient);
     {
-      std::lock_guard<std::mutex> hold(cacheLock);
-      ClassMap* map = lockedClassMap(__func__, forUser, contentClass, transient, true, error);
+      std::unique_lock<std::mutex> hold(cacheLock);
+      ClassMap* map = lockedClassMap(hold, __func__, forUser, contentClass, transient, true, error);
       if (!map) return false;
-      metadata->setUrl(url);
-      (*map)[metadata->identifier()] = metadata;
+      (*map)[entry->identifier()] = entry;
     }
+    if (stored) *stored = entry;
     if (!transient && updateSandbox &&
         !setSandboxContainerMappingForUser(forUser, metadata->identifier(), contentClass, url)) {
       QRTLog(kLogError, "Failed to set container mapping of %@, %llu", metadata->identifier(),
@@ -234,8 +269,8 @@ bool QRTContainerCache::removeContainerForUser(uint32_t userId, uint64_t content
   if (!validInput(contentClass, identifier, "Invalid Identifier: %@", __func__, __LINE__, error)) return false;
   try {
     {
-      std::lock_guard<std::mutex> hold(cacheLock);
-      ClassMap* map = lockedClassMap(__func__, userId, contentClass, transient, true, error);
+      std::unique_lock<std::mutex> hold(cacheLock);
+      ClassMap* map = lockedClassMap(hold, __func__, userId, contentClass, transient, true, error);
       if (!map) return false;
       map->erase(*identifier);
     }

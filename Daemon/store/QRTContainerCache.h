@@ -14,16 +14,14 @@
 #include "Daemon/QRTError.h"
 #include "Daemon/store/QRTMetadata.h"
 
-using QRTMetadataRef = std::shared_ptr<QRTMetadata>;
-
 class QRTContainerCache {
  public:
   static QRTContainerCache& sharedInstance();
 
   QRTMetadataRef containerForUser(uint32_t userId, uint64_t contentClass, const std::optional<std::string>& identifier,
                                   bool transient, QRTErrorRef* error);
-  // By identifier and the upper-case UUID string, live map first; sets the
-  // found container's transient flag.
+  // By identifier and the upper-case UUID string, live map first; the found
+  // metadata's transient flag names the map it came from.
   QRTMetadataRef containerForUser(uint32_t userId, uint64_t contentClass, const std::optional<std::string>& identifier,
                                   const std::string& uuidString);
   std::optional<std::vector<QRTMetadataRef>> allContainersForUser(uint32_t userId, uint64_t contentClass,
@@ -33,8 +31,11 @@ class QRTContainerCache {
                                                                   bool transient, QRTErrorRef* error) {
     return allContainersForUser(userId, contentClass, transient, true, error);
   }
+  // Stores the metadata under its identifier, replacing any entry; the stored
+  // object (a copy when the metadata's own URL or transient flag differ from
+  // the given ones) goes to *stored when asked for.
   bool addContainerMetadata(const QRTMetadataRef& metadata, uint32_t forUser, const QRTURL& url, bool transient,
-                            bool updateSandbox, QRTErrorRef* error);
+                            bool updateSandbox, QRTErrorRef* error, QRTMetadataRef* stored = nullptr);
   bool removeContainerForUser(uint32_t userId, uint64_t contentClass, const std::optional<std::string>& identifier,
                               bool transient, QRTErrorRef* error);
   // Tells the sandbox where a container lies (no URL withdraws it).
@@ -45,13 +46,19 @@ class QRTContainerCache {
   using ClassMap = std::unordered_map<std::string, QRTMetadataRef>;
 
   QRTContainerCache() = default;
-  ClassMap* _getCacheForUserId(uint32_t userId, uint64_t contentClass, bool transient, bool populateSandboxCache,
-                               QRTErrorRef* error);
+  // The class map, built if needed. Called with cacheLock held through hold;
+  // a build runs with the lock released (it reads the disk and may create the
+  // class directory) and installs its map unless a racing build did first.
+  ClassMap* _getCacheForUserId(std::unique_lock<std::mutex>& hold, uint32_t userId, uint64_t contentClass,
+                               bool transient, bool populateSandboxCache, QRTErrorRef* error);
+  std::optional<ClassMap> buildClassMap(uint32_t userId, uint64_t contentClass, bool transient,
+                                        bool populateSandboxCache, QRTErrorRef* error);
   // _getCacheForUserId with its failure wrapped in error 43 for the named operation.
-  ClassMap* lockedClassMap(const char* function, uint32_t userId, uint64_t contentClass, bool transient,
-                           bool populateSandboxCache, QRTErrorRef* error);
-  // The metadata file is gone: forget the container. False with error 44
-  // (or 47 when the entry has no usable URL).
+  ClassMap* lockedClassMap(std::unique_lock<std::mutex>& hold, const char* function, uint32_t userId,
+                           uint64_t contentClass, bool transient, bool populateSandboxCache, QRTErrorRef* error);
+  // The metadata file is gone: forget the container, unless its entry has
+  // been replaced meanwhile. False with error 44 (or 47 when the entry has no
+  // usable URL).
   bool checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_t userId, uint64_t contentClass, bool transient,
                         QRTErrorRef* error);
 

@@ -50,30 +50,43 @@ std::vector<std::string> distinctSorted(std::vector<std::string> sorted, bool as
   return sorted;
 }
 
-// Takes an ascending list; if one step throws, what was already taken is
-// released again so no lock outlives the failed call.
-void takeSortedList(const std::vector<std::string>& sorted, bool writing) {
-  size_t taken = 0;
-  try {
-    for (; taken < sorted.size(); ++taken) take_one_lock(sorted[taken], writing);
-  } catch (...) {
-    while (taken > 0) unlock_one_lock(sorted[--taken]);
-    throw;
+// Locks this thread holds. A thread that already holds one is never held
+// back for a waiting writer, which would be waiting for it in turn.
+thread_local int tLocksHeld = 0;
+
+// Under the mutex: waits until a locker of this kind may be counted. Besides
+// what `allowed` says, a waiting all-identifiers writer keeps newcomers out,
+// unless they already waited through a writer's release.
+template <typename Allowed>
+void waitToEnter(std::unique_lock<std::mutex>& hold, std::condition_variable& condition, Allowed allowed) {
+  QRTLocksState& locks = gQRTLocks;
+  if (tLocksHeld > 0) return condition.wait(hold, allowed);
+  if (allowed() && locks.allWritersWaiting == 0) return;
+  const uint64_t releases = locks.allWriterReleases;
+  ++locks.lockersWaiting;
+  condition.wait(hold, [&] {
+    return allowed() && (locks.allWritersWaiting == 0 || locks.allWriterReleases != releases);
+  });
+  --locks.lockersWaiting;
+  if (locks.allWriterReleases != releases && locks.lockersToAdmit > 0 && --locks.lockersToAdmit == 0) {
+    locks.allWriterCondition.notify_all();
   }
 }
 
-// Under the mutex: waits until this kind of identifier lock may be counted,
-// then returns the identifier's record with this taker counted in it.
-QRTIdentifierLockRecord& enterIdentifier(std::unique_lock<std::mutex>& hold, const std::string& identifier,
-                                         bool writing) {
+void waitToEnterIdentifiers(std::unique_lock<std::mutex>& hold, bool writing) {
   QRTLocksState& locks = gQRTLocks;
   if (writing) {
-    locks.identifierWriterCondition.wait(hold, [&] { return locks.allReaderWriterState == 0; });
+    waitToEnter(hold, locks.identifierWriterCondition, [&] { return locks.allReaderWriterState == 0; });
   } else {
-    locks.identifierReaderCondition.wait(hold, [&] { return locks.allReaderWriterState != -1; });
+    waitToEnter(hold, locks.identifierReaderCondition, [&] { return locks.allReaderWriterState != -1; });
   }
-  // The record is made before anything is counted, so a failed allocation
-  // leaves the bookkeeping as it was.
+}
+
+// Under the mutex: the identifier's record with this taker counted in it.
+// The record is made before anything is counted, so a failed allocation
+// leaves the bookkeeping as it was.
+QRTIdentifierLockRecord& countIn(const std::string& identifier, bool writing) {
+  QRTLocksState& locks = gQRTLocks;
   auto found = locks.identifierToLockMap.find(identifier);
   if (found == locks.identifierToLockMap.end()) {
     found = locks.identifierToLockMap.emplace(identifier, std::make_unique<QRTIdentifierLockRecord>()).first;
@@ -88,6 +101,26 @@ QRTIdentifierLockRecord& enterIdentifier(std::unique_lock<std::mutex>& hold, con
   return record;
 }
 
+// Under the mutex (released while waiting): takes the record. Once a writer
+// waits for it, new readers wait behind the writer.
+void acquireRecord(std::unique_lock<std::mutex>& hold, QRTIdentifierLockRecord& record, bool writing) {
+  if (writing) {
+    ++record.waitingWriters;
+    record.released.wait(hold, [&] { return record.lockState.load() == 0; });
+    --record.waitingWriters;
+    int32_t previousState = 0;
+    record.lockState.compare_exchange_strong(previousState, -1);
+    QRTLocksAssert(previousState == 0);
+  } else {
+    const bool holdsOthers = tLocksHeld > 0;
+    record.released.wait(hold, [&] {
+      return record.lockState.load() != -1 && (record.waitingWriters == 0 || holdsOthers);
+    });
+    int32_t readersNow = record.lockState.fetch_add(1) + 1;
+    QRTLocksAssert(readersNow > 0);
+  }
+}
+
 // Under the mutex: the bookkeeping of giving up a write or a read.
 void releaseWrite(QRTIdentifierLockRecord& record) {
   QRTLocksState& locks = gQRTLocks;
@@ -97,7 +130,7 @@ void releaseWrite(QRTIdentifierLockRecord& record) {
   QRTLocksAssert(locks.allReaderWriterState == 0);
   QRTLocksAssert(locks.identifierWriterCount > 0);
   --locks.identifierWriterCount;
-  if (locks.identifierWriterCount == 0 && locks.identifierReaderCount == 0) locks.allWriterCondition.notify_one();
+  if (locks.identifierWriterCount == 0 && locks.identifierReaderCount == 0) locks.allWriterCondition.notify_all();
   if (locks.identifierWriterCount == 0) locks.allReaderCondition.notify_all();
 }
 
@@ -109,32 +142,46 @@ void releaseRead(QRTIdentifierLockRecord& record) {
   QRTLocksAssert(locks.identifierReaderCount > 0);
   --locks.identifierReaderCount;
   if (locks.allReaderWriterState == 0 && locks.identifierReaderCount == 0 && locks.identifierWriterCount == 0) {
-    locks.allWriterCondition.notify_one();
+    locks.allWriterCondition.notify_all();
   }
+}
+
+// Takes a list sorted ascending, without duplicates: let in once as a whole
+// (so a writer that starts waiting half-way cannot hold back the rest), then
+// each record in order.
+void takeSortedList(const std::vector<std::string>& sorted, bool writing) {
+  if (sorted.empty()) return;
+  for (const std::string& identifier : sorted) QRTLocksDebug("Waiting to lock %@ for %s", identifier, modeName(writing));
+  {
+    std::unique_lock<std::mutex> hold(gQRTLocks.mutex);
+    waitToEnterIdentifiers(hold, writing);
+    std::vector<QRTIdentifierLockRecord*> records;
+    records.reserve(sorted.size());
+    try {
+      for (const std::string& identifier : sorted) records.push_back(&countIn(identifier, writing));
+    } catch (...) {
+      // Nothing of a failed call stays counted.
+      QRTLocksState& locks = gQRTLocks;
+      for (size_t i = 0; i < records.size(); ++i) {
+        --(writing ? locks.identifierWriterCount : locks.identifierReaderCount);
+        if (--records[i]->referenceCount == 0) locks.identifierToLockMap.erase(sorted[i]);
+      }
+      locks.allWriterCondition.notify_all();
+      locks.allReaderCondition.notify_all();
+      throw;
+    }
+    // Counted in its record, none can be freed while this thread waits on it.
+    for (QRTIdentifierLockRecord* record : records) {
+      acquireRecord(hold, *record, writing);
+      ++tLocksHeld;
+    }
+  }
+  for (const std::string& identifier : sorted) QRTLocksDebug("Got lock on identifier %@", identifier);
 }
 
 }  // namespace
 
-void take_one_lock(const std::string& identifier, bool writing) {
-  QRTIdentifierLockRecord* record;
-  {
-    std::unique_lock<std::mutex> hold(gQRTLocks.mutex);
-    record = &enterIdentifier(hold, identifier, writing);
-  }
-  // Counted in the record, it cannot be freed while this thread waits on it.
-  QRTLocksDebug("Waiting to lock %@ for %s", identifier, modeName(writing));
-  if (writing) {
-    record->rwlock.lock();
-    int32_t previousState = 0;
-    record->lockState.compare_exchange_strong(previousState, -1);
-    QRTLocksAssert(previousState == 0);
-  } else {
-    record->rwlock.lock_shared();
-    int32_t readersNow = record->lockState.fetch_add(1) + 1;
-    QRTLocksAssert(readersNow > 0);
-  }
-  QRTLocksDebug("Got lock on identifier %@", identifier);
-}
+void take_one_lock(const std::string& identifier, bool writing) { takeSortedList({identifier}, writing); }
 
 void unlock_one_lock(const std::string& identifier) {
   QRTLocksState& locks = gQRTLocks;
@@ -144,23 +191,21 @@ void unlock_one_lock(const std::string& identifier) {
   QRTIdentifierLockRecord& record = *found->second;
   QRTLocksAssert(record.lockState.load() != 0);
   // The holder's own mode: no writer can hold the record while we read it.
-  bool writing = record.lockState.load() == -1;
-  if (writing) {
+  if (record.lockState.load() == -1) {
     releaseWrite(record);
   } else {
     releaseRead(record);
   }
   --record.referenceCount;
-  if (writing) {
-    record.rwlock.unlock();
-  } else {
-    record.rwlock.unlock_shared();
-  }
+  --tLocksHeld;
   QRTLocksDebug("Unlocked identifier %@", identifier);
   if (record.referenceCount == 0) {
+    // Every waiter is counted, so none sleeps on the record.
     QRTLocksDebug("Destroying lock for identifier %@", identifier);
     QRTLocksAssert(record.lockState.load() == 0);
     locks.identifierToLockMap.erase(found);
+  } else {
+    record.released.notify_all();
   }
 }
 
@@ -179,18 +224,23 @@ void unlock_identifier(const std::vector<std::string>& identifiers) {
 void _lock_all_identifiers(bool writing) {
   QRTLocksState& locks = gQRTLocks;
   QRTLocksDebug("Waiting to lock all identifiers for %s", modeName(writing));
-  std::unique_lock<std::mutex> hold(locks.mutex);
-  if (writing) {
-    locks.allWriterCondition.wait(hold, [&] {
-      return locks.identifierReaderCount == 0 && locks.identifierWriterCount == 0 &&
-             locks.allReaderWriterState == 0;
-    });
-    locks.allReaderWriterState = -1;
-  } else {
-    locks.allReaderCondition.wait(hold, [&] {
-      return locks.identifierWriterCount == 0 && locks.allReaderWriterState != -1;
-    });
-    ++locks.allReaderWriterState;
+  {
+    std::unique_lock<std::mutex> hold(locks.mutex);
+    if (writing) {
+      ++locks.allWritersWaiting;
+      locks.allWriterCondition.wait(hold, [&] {
+        return locks.identifierReaderCount == 0 && locks.identifierWriterCount == 0 &&
+               locks.allReaderWriterState == 0 && locks.lockersToAdmit == 0;
+      });
+      --locks.allWritersWaiting;
+      locks.allReaderWriterState = -1;
+    } else {
+      waitToEnter(hold, locks.allReaderCondition, [&] {
+        return locks.identifierWriterCount == 0 && locks.allReaderWriterState != -1;
+      });
+      ++locks.allReaderWriterState;
+    }
+    ++tLocksHeld;
   }
   QRTLocksDebug("Locked all identifiers for %s", modeName(writing));
 }
@@ -200,16 +250,20 @@ void unlock_all_identifiers() {
   {
     std::lock_guard<std::mutex> hold(locks.mutex);
     QRTLocksAssert(locks.allReaderWriterState == -1 || locks.allReaderWriterState > 0);
+    --tLocksHeld;
     if (locks.allReaderWriterState == -1) {
       locks.allReaderWriterState = 0;
-      locks.allWriterCondition.notify_one();
+      // Whoever waited through this writer goes before the next one.
+      ++locks.allWriterReleases;
+      locks.lockersToAdmit = locks.lockersWaiting;
+      locks.allWriterCondition.notify_all();
       locks.allReaderCondition.notify_all();
       locks.identifierWriterCondition.notify_all();
       locks.identifierReaderCondition.notify_all();
     } else if (--locks.allReaderWriterState == 0) {
       locks.identifierWriterCondition.notify_all();
       if (locks.identifierReaderCount == 0 && locks.identifierWriterCount == 0) {
-        locks.allWriterCondition.notify_one();
+        locks.allWriterCondition.notify_all();
       }
     }
   }

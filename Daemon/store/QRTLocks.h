@@ -10,15 +10,16 @@
 #include <cstdint>
 #include <memory>
 #include <mutex>
-#include <shared_mutex>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
-// One identifier that is locked or awaited.
+// One identifier that is locked or awaited. Its waiters sleep on `released`
+// with gQRTLocks.mutex; once a writer waits, new readers queue behind it.
 struct QRTIdentifierLockRecord {
-  std::shared_mutex rwlock;
+  std::condition_variable released;
   uint64_t referenceCount = 0;          // takers not yet unlocked, waiters included
+  int32_t waitingWriters = 0;           // takers waiting to write
   std::atomic<int32_t> lockState{0};    // -1 written, n > 0 read by n, 0 free
 };
 
@@ -32,6 +33,14 @@ struct QRTLocksState {
   int32_t identifierReaderCount = 0;  // held or awaited for reading
   int32_t identifierWriterCount = 0;  // held or awaited for writing
   int32_t allReaderWriterState = 0;   // -1 written, n > 0 read by n, 0 free
+  // Fairness for the all-identifiers writer: while one waits, lockers that
+  // arrive (identifier lockers and all-identifiers readers) wait behind it.
+  // The lockers that were waiting when a writer lets go are let in before
+  // the next writer, so a stream of writers does not starve them either.
+  int32_t allWritersWaiting = 0;
+  int32_t lockersWaiting = 0;
+  uint64_t allWriterReleases = 0;
+  int32_t lockersToAdmit = 0;
 };
 
 // Never destroyed: request threads may still hold locks while the process exits.
@@ -39,7 +48,9 @@ extern QRTLocksState& gQRTLocks;
 
 // Each lock call blocks until held and never fails; pair it with exactly one
 // unlock. A list is taken in ascending and released in descending order, each
-// distinct identifier once.
+// distinct identifier once, and is let in as a whole. Once a writer waits,
+// newly arriving readers wait behind it, except on a thread that already
+// holds a lock (the writer may be waiting for that one).
 void _lock_identifier(const std::string& identifier, bool writing);
 void _lock_identifier(const std::vector<std::string>& identifiers, bool writing);
 void unlock_identifier(const std::string& identifier);

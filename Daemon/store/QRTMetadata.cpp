@@ -2,6 +2,7 @@
 
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/fileops/QRTFileManager.h"
+#include "base/PlistCodec.h"
 
 namespace {
 
@@ -21,12 +22,37 @@ QRTURL expectedClassDirectory(const QRTURL& containerURL, uint64_t containerClas
 
 QRTMetadata::QRTMetadata(uint32_t uid, QRTUUID uuid, uint64_t containerClass, std::string identifier,
                          std::optional<plist::Dictionary> info, QRTURL url,
-                         std::optional<std::string> userManagedAssetsDirName)
-    : uid_(uid), identifier_(std::move(identifier)), uuid_(uuid), url_(std::move(url)),
+                         std::optional<std::string> userManagedAssetsDirName, bool transient)
+    : transient_(transient), uid_(uid), identifier_(std::move(identifier)), uuid_(uuid), url_(std::move(url)),
       userManagedAssetsDirName_(std::move(userManagedAssetsDirName)), info_(std::move(info)),
       containerClass_(containerClass) {}
 
-bool QRTMetadata::writeMetadataToDiskWithError(QRTErrorRef* error) const {
+#define QRT_METADATA_WITH(field, value)             \
+  auto copy = std::make_shared<QRTMetadata>(*this); \
+  copy->field = (value);                            \
+  return copy
+
+QRTMetadataRef QRTMetadata::withTransient(bool transient) const { QRT_METADATA_WITH(transient_, transient); }
+QRTMetadataRef QRTMetadata::withExisted(bool existed) const { QRT_METADATA_WITH(existed_, existed); }
+QRTMetadataRef QRTMetadata::withUuid(const QRTUUID& uuid) const { QRT_METADATA_WITH(uuid_, uuid); }
+QRTMetadataRef QRTMetadata::withUrl(const QRTURL& url) const { QRT_METADATA_WITH(url_, url); }
+QRTMetadataRef QRTMetadata::withInfo(std::optional<plist::Dictionary> info) const {
+  QRT_METADATA_WITH(info_, std::move(info));
+}
+QRTMetadataRef QRTMetadata::withUserManagedAssetsDirName(std::optional<std::string> name) const {
+  QRT_METADATA_WITH(userManagedAssetsDirName_, std::move(name));
+}
+
+#undef QRT_METADATA_WITH
+
+QRTMetadataRef QRTMetadata::withUrl(const QRTURL& url, bool transient) const {
+  auto copy = std::make_shared<QRTMetadata>(*this);
+  copy->url_ = url;
+  copy->transient_ = transient;
+  return copy;
+}
+
+plist::Dictionary QRTMetadata::dictionaryRepresentation() const {
   plist::Dictionary dictionary;
   if (info_) dictionary[QRTMetadataInfoKey] = *info_;
   dictionary[QRTMetadataContentClassKey] = plist::Value(containerClass_);
@@ -34,12 +60,65 @@ bool QRTMetadata::writeMetadataToDiskWithError(QRTErrorRef* error) const {
   dictionary[QRTMetadataIdentifierKey] = identifier_;
   dictionary[QRTMetadataUUIDKey] = uuid_.UUIDString();
   if (userManagedAssetsDirName_) dictionary[QRTMetadataUserManagedAssetsDirNameKey] = *userManagedAssetsDirName_;
+  return dictionary;
+}
 
+namespace {
+
+// Counts objects as the reader does (every value and every dictionary key,
+// shared ones once per use) and stops early once over the budget.
+bool withinObjectBudget(const plist::Value& value, size_t depth, size_t* objects) {
+  if (++*objects > QRTMetadataMaxObjects || depth > QRTMetadataMaxDepth) return false;
+  if (value.isArray()) {
+    for (const plist::Value& element : value.array()) {
+      if (!withinObjectBudget(element, depth + 1, objects)) return false;
+    }
+  } else if (value.isDictionary()) {
+    for (const auto& [key, element] : value.dictionary()) {
+      if (++*objects > QRTMetadataMaxObjects || !withinObjectBudget(element, depth + 1, objects)) return false;
+    }
+  }
+  return true;
+}
+
+}  // namespace
+
+bool QRTMetadata::writeMetadataToDiskWithError(QRTErrorRef* error) const {
+  plist::Dictionary dictionary = dictionaryRepresentation();
+  const plist::Value whole(dictionary);
+  size_t objects = 0;
+  if (!withinObjectBudget(whole, 1, &objects) || plist::writeBinary(whole).size() > QRTMetadataMaxEncodedBytes) {
+    QRTSetError(error, QRT_ERROR(QRTErrorInvalidArgument, nullptr, true,
+                                 "Metadata for %@ at %@ would exceed %llu bytes, %llu objects or %llu levels",
+                                 identifier_, url_, static_cast<unsigned long long>(QRTMetadataMaxEncodedBytes),
+                                 static_cast<unsigned long long>(QRTMetadataMaxObjects),
+                                 static_cast<unsigned long long>(QRTMetadataMaxDepth)));
+    return false;
+  }
   QRTErrorRef writeError;
   if (!QRT_writeToURL(dictionary, url_.URLByAppendingPathComponent(QRTMetadataFileName),
                       QRTWriteAtomic | QRTWriteFileProtectionNone, &writeError)) {
     QRTSetError(error, QRT_ERROR(QRTErrorWriteFailed, writeError, true,
                                  "Failed to write metadata dictionary to URL %@", url_));
+    return false;
+  }
+  return true;
+}
+
+bool QRTMetadata::rewriteUUIDAtUrl(const QRTURL& url, const QRTUUID& uuid, QRTErrorRef* error) {
+  const QRTURL file = url.URLByAppendingPathComponent(QRTMetadataFileName);
+  QRTErrorRef underlying;
+  std::optional<plist::Dictionary> dictionary = QRT_dictionaryWithContentsOfURL(file, &underlying);
+  if (!dictionary) {
+    QRTSetError(error, QRT_ERROR(QRTErrorReadFailed, underlying, true, "Failed to read metadata at URL %@", url));
+    return false;
+  }
+  const plist::Value* current = plist::find(*dictionary, QRTMetadataUUIDKey);
+  if (current && current->isString() && current->string() == uuid.UUIDString()) return true;
+  (*dictionary)[QRTMetadataUUIDKey] = uuid.UUIDString();
+  if (!QRT_writeToURL(*dictionary, file, QRTWriteAtomic | QRTWriteFileProtectionNone, &underlying)) {
+    QRTSetError(error, QRT_ERROR(QRTErrorWriteFailed, underlying, true,
+                                 "Failed to write metadata dictionary to URL %@", url));
     return false;
   }
   return true;

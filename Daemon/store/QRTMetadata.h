@@ -3,6 +3,7 @@
 // and two flags that are never written to disk.
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <optional>
@@ -22,41 +23,62 @@ inline constexpr const char* QRTMetadataPersonaKey = "QRTMetadataPersona";
 inline constexpr const char* QRTMetadataInfoKey = "QRTMetadataInfo";
 inline constexpr const char* QRTMetadataUserManagedAssetsDirNameKey = "QRTMetadataUserManagedAssetsDirName";
 
+class QRTMetadata;
+// Metadata is shared between requests only as immutable snapshots: a change
+// makes a new object that replaces the cached one.
+using QRTMetadataRef = std::shared_ptr<const QRTMetadata>;
+
+// What a metadata file may hold so that the reader, which refuses larger or
+// deeper property lists, always takes it back: 1 MiB encoded, 100,000 objects
+// and 32 levels of nesting.
+inline constexpr size_t QRTMetadataMaxEncodedBytes = 1u << 20;
+inline constexpr size_t QRTMetadataMaxObjects = 100'000;
+inline constexpr size_t QRTMetadataMaxDepth = 32;
+
 class QRTMetadata {
  public:
   QRTMetadata(uint32_t uid, QRTUUID uuid, uint64_t containerClass, std::string identifier,
-              std::optional<plist::Dictionary> info, QRTURL url, std::optional<std::string> userManagedAssetsDirName);
+              std::optional<plist::Dictionary> info, QRTURL url, std::optional<std::string> userManagedAssetsDirName,
+              bool transient = false);
 
   bool transient() const { return transient_; }
-  void setTransient(bool transient) { transient_ = transient; }
+  // Set only on the per-call copy that create-or-look-up hands out.
   bool existed() const { return existed_; }
-  void setExisted(bool existed) { existed_ = existed; }
   uint32_t uid() const { return uid_; }
   uint32_t userId() const { return uid_; }
-  void setUid(uint32_t uid) { uid_ = uid; }
-  void setUserId(uint32_t userId) { uid_ = userId; }
   const std::string& identifier() const { return identifier_; }
   const QRTUUID& uuid() const { return uuid_; }
-  void setUuid(const QRTUUID& uuid) { uuid_ = uuid; }
   const QRTURL& url() const { return url_; }
-  void setUrl(const QRTURL& url) { url_ = url; }
   const std::optional<std::string>& userManagedAssetsDirName() const { return userManagedAssetsDirName_; }
-  void setUserManagedAssetsDirName(std::optional<std::string> name) { userManagedAssetsDirName_ = std::move(name); }
   const std::optional<plist::Dictionary>& info() const { return info_; }
-  void setInfo(std::optional<plist::Dictionary> info) { info_ = std::move(info); }
   uint64_t containerClass() const { return containerClass_; }
 
+  // Copies with one field changed; this object stays as it is.
+  QRTMetadataRef withTransient(bool transient) const;
+  QRTMetadataRef withExisted(bool existed) const;
+  QRTMetadataRef withUuid(const QRTUUID& uuid) const;
+  QRTMetadataRef withUrl(const QRTURL& url) const;
+  QRTMetadataRef withUrl(const QRTURL& url, bool transient) const;
+  QRTMetadataRef withInfo(std::optional<plist::Dictionary> info) const;
+  QRTMetadataRef withUserManagedAssetsDirName(std::optional<std::string> name) const;
+
   // Writes the metadata file into the container directory, atomically.
+  // Metadata over the size budget is refused with error 38 and not written.
   bool writeMetadataToDiskWithError(QRTErrorRef* error) const;
   // Reads the metadata file of the container at url and checks it belongs to
   // forUser and, with checkClassPath, that the container lies directly in the
   // class directory of its class.
   static std::shared_ptr<QRTMetadata> readAndValidateMetadataAtUrl(const QRTURL& url, uint32_t forUser,
                                                                    bool checkClassPath, QRTErrorRef* error);
+  // Puts uuid into the metadata file of the container at url, leaving the
+  // rest of the file as it is; nothing is written when it is already there.
+  static bool rewriteUUIDAtUrl(const QRTURL& url, const QRTUUID& uuid, QRTErrorRef* error);
 
   std::string description() const;
 
  private:
+  plist::Dictionary dictionaryRepresentation() const;
+
   bool transient_ = false;
   bool existed_ = false;
   uint32_t uid_;

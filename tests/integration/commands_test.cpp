@@ -172,6 +172,9 @@ TEST_F(CommandTest, InfoValuesAndMetadataSurviveARestart) {
   EXPECT_FALSE(at(reply, "ReplyPath"));
   expectCodes({
       {"set without key", 5, with(selector(app), {{"Value", "v"}}), 38},
+      // A metadata file its reader would refuse is never written, nor remembered.
+      {"value over the size budget", 5, with(selector(app), {{"Key", "huge"}, {"Value", plist::Data(2 << 20)}}), 38},
+      {"refused value not kept", 6, with(selector(app), {{"Key", "huge"}}), 24},
       {"get without key", 6, selector(app), 38},
       {"key removed", 6, with(selector(app), {{"Key", "text"}}), 24},
       {"key never set", 6, with(selector(app), {{"Key", "never"}}), 24},

@@ -240,6 +240,64 @@ TEST_F(IdentifierLockTest, ScopedLocksTakeOnlyWhenEnabled) {
   EXPECT_EQ(counts(), (Counts{3, 0, 1, 3}));
 }
 
+// Readers keep arriving, always overlapping; a writer that waits gets in
+// before they stop (with readers first it would wait for the last of them).
+TEST_F(IdentifierLockTest, WaitingWriterIsNotStarvedByArrivingReaders) {
+  const std::pair<std::function<void()>, std::function<void()>> writers[] = {
+      {[] { _lock_identifier("a", true); }, [] { unlock_identifier("a"); }},
+      {[] { _lock_all_identifiers(true); }, [] { unlock_all_identifiers(); }},
+  };
+  for (const auto& [lock, unlock] : writers) {
+    std::atomic<bool> writerDone{false}, inWhileReadersRan{false};
+    std::atomic<int> readersDone{0};
+    auto reader = [&](int index) {
+      for (int i = 0; i < 3000 && !writerDone; ++i) {
+        QRTIdentifierLock hold(i % 2 ? "a" : "b" + std::to_string(index), false);
+        std::this_thread::sleep_for(200us);
+      }
+      ++readersDone;
+    };
+    std::vector<std::function<void()>> bodies;
+    for (int r = 0; r < 4; ++r) bodies.push_back([&, r] { reader(r); });
+    bodies.push_back([&] {
+      while (QRTLocksGetSnapshot().identifierReaderCount == 0) std::this_thread::yield();
+      lock();
+      inWhileReadersRan = readersDone == 0;
+      unlock();
+      writerDone = true;
+    });
+    runConcurrently(bodies);
+    EXPECT_TRUE(inWhileReadersRan);
+  }
+}
+
+// The writer waits for a lock this thread holds; a further lock of the
+// thread must not wait behind the writer, or neither would ever go on.
+TEST_F(IdentifierLockTest, HolderTakesMoreLocksPastAWaitingWriter) {
+  std::promise<void> holding, go, nested;
+  std::thread holder([&] {
+    _lock_identifier("a", false);
+    holding.set_value();
+    go.get_future().wait();
+    _lock_identifier("b", false);
+    _lock_all_identifiers(false);
+    nested.set_value();
+    unlock_all_identifiers();
+    unlock_identifier("b");
+    unlock_identifier("a");
+  });
+  holding.get_future().wait();
+  auto writer = holdAll(true);
+  EXPECT_TRUE(blocked(writer));
+  go.set_value();
+  if (nested.get_future().wait_for(10s) != std::future_status::ready) {
+    fprintf(stderr, "A lock holder waited behind the writer waiting for it\n");
+    abort();
+  }
+  holder.join();
+  EXPECT_TRUE(writer->waitAcquired());
+}
+
 using IdentifierLockDeathTest = IdentifierLockTest;
 
 TEST_F(IdentifierLockDeathTest, UnpairedUnlocksStopTheProcess) {

@@ -93,6 +93,27 @@ TEST_F(ContainerCacheTest, BuildsFromDiskAndForgetsVanishedContainers) {
   EXPECT_EQ(error->code(), 21);
 }
 
+// Entries are shared snapshots: each says which map it is in, and adding one
+// under another place or flag stores a copy and leaves the given one alone.
+TEST_F(ContainerCacheTest, EntriesAgreeWithTheirMapAndAreNeverChangedInPlace) {
+  const QRTURL url = writeContainer(502, 4, "com.example.snap", true);
+  const std::string id = "com.example.snap";
+  QRTErrorRef error;
+  QRTMetadataRef transient = cache.containerForUser(502, 4, id, true, &error);
+  ASSERT_TRUE(transient);
+  EXPECT_TRUE(transient->transient());
+  EXPECT_EQ(cache.containerForUser(502, 4, id, transient->uuid().UUIDString()), transient);
+
+  const QRTURL moved = QRTURL::fileURL(url.path() + "-moved", true);
+  QRTMetadataRef stored;
+  ASSERT_TRUE(cache.addContainerMetadata(transient, 502, moved, false, false, &error, &stored));
+  EXPECT_TRUE(transient->transient());
+  EXPECT_EQ(transient->url(), url);
+  EXPECT_FALSE(stored->transient());
+  EXPECT_EQ(stored->url(), moved);
+  EXPECT_TRUE(cache.removeContainerForUser(502, 4, id, false, &error));
+}
+
 TEST_F(ContainerCacheTest, SystemClassBuildPushesSandboxMappings) {
   QRTURL live = writeContainer(499, 12, "com.example.daemon");
   writeContainer(499, 12, "com.example.transient", true);

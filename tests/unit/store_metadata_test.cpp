@@ -67,14 +67,14 @@ TEST_F(MetadataTest, WriteWithoutOptionalsHasExactlyFourKeys) {
 TEST_F(MetadataTest, RoundTripKeepsInfoAndAssetsDirectoryButNotTheFlags) {
   QRTURL url = container("Data/Application");
   plist::Dictionary info{{"com.norvane.Emplacer.ContentProtectionClass", 3}, {"tags", plist::Array{"a", "b"}}};
-  QRTMetadata metadata(502, QRTUUID::random(), 2, "com.example.app", info, url, std::string("Assets"));
-  metadata.setTransient(true);
-  metadata.setExisted(true);
-  ASSERT_TRUE(metadata.writeMetadataToDiskWithError(nullptr));
+  QRTMetadata original(502, QRTUUID::random(), 2, "com.example.app", info, url, std::string("Assets"));
+  QRTMetadataRef metadata = original.withTransient(true)->withExisted(true);
+  EXPECT_FALSE(original.transient() || original.existed()) << "a copy leaves its original alone";
+  ASSERT_TRUE(metadata->writeMetadataToDiskWithError(nullptr));
   auto read = expectSuccess(url, 502);
   ASSERT_TRUE(read);
   EXPECT_EQ(read->identifier(), "com.example.app");
-  EXPECT_EQ(read->uuid(), metadata.uuid());
+  EXPECT_EQ(read->uuid(), metadata->uuid());
   EXPECT_EQ(read->containerClass(), 2u);
   EXPECT_EQ(read->uid(), 502u);
   EXPECT_EQ(read->url(), url);
@@ -100,6 +100,31 @@ TEST_F(MetadataTest, WriteFailureIs34AndUnreadableFileIs12) {
     if (*content) std::ofstream(metadataFile(url).path()) << content;
     expectFailure(url, 501, 12, "Failed to read metadata at URL " + url.path());
   }
+}
+
+// What the reader would refuse is never written: over 1 MiB, over 100,000
+// objects (a shared value counts at every use) or over 32 levels.
+TEST_F(MetadataTest, InfoBeyondTheBudgetIsRefusedAndNotWritten) {
+  QRTURL url = container("Data/Application");
+  writeRaw(url, validDictionary());
+  plist::Value deep = 1;
+  for (int i = 0; i < 40; ++i) deep = plist::Array{deep};
+  const std::pair<const char*, plist::Value> tooMuch[] = {
+      {"bytes", plist::Data(QRTMetadataMaxEncodedBytes, 7)},
+      {"objects", plist::Array(QRTMetadataMaxObjects, plist::Value(true))},
+      {"depth", deep},
+  };
+  QRTMetadata base(501, *QRTUUID::fromString(kUUID), 2, "com.example.app", std::nullopt, url, std::nullopt);
+  for (const auto& [what, value] : tooMuch) {
+    QRTErrorRef error;
+    EXPECT_FALSE(base.withInfo(plist::Dictionary{{"k", value}})->writeMetadataToDiskWithError(&error)) << what;
+    ASSERT_TRUE(error) << what;
+    EXPECT_EQ(error->code(), QRTErrorInvalidArgument) << what;
+    EXPECT_EQ(QRT_dictionaryWithContentsOfURL(metadataFile(url), nullptr), validDictionary()) << what;
+  }
+  const plist::Dictionary fits{{"k", plist::Data(QRTMetadataMaxEncodedBytes / 2, 7)}};
+  ASSERT_TRUE(base.withInfo(fits)->writeMetadataToDiskWithError(nullptr));
+  EXPECT_EQ(expectSuccess(url, 501)->info(), fits);
 }
 
 // Starts with every value wrong and repairs one at a time, so each check is
