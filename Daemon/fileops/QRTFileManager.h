@@ -27,11 +27,18 @@ struct QRTTraversalEntry {
   Kind kind = Kind::Other;
   struct stat st {};
   int error = 0;  // errno of a directory that could not be read (kind Other)
+  // The directory that holds the entry and its name there: act on the entry
+  // only through these (platform::openItemAt), never through path, and check
+  // that what is opened is still st.
+  int parentFd = -1;
+  const char* name = nullptr;
   // Set by the visitor on a DirectoryPre entry to pass over its contents.
   bool skipDescendants = false;
 };
 
 // Returns false to stop the walk, after storing an error in the slot if it has one.
+// Paths are resolved from the device root (platform/SafePath.h): a symbolic
+// link at any component is refused, never followed.
 using QRTTraversalVisitor = std::function<bool(QRTTraversalEntry& entry, QRTErrorRef* error)>;
 
 class QRTFileManager {
