@@ -60,6 +60,15 @@ int openBeneathWithMode(int dirfd, const char* relative, int flags, mode_t mode,
     fd = syscall(SYS_openat2, dirfd, relative, &how, sizeof how);
   } while (fd < 0 && (errno == EAGAIN || errno == EINTR));
   if (fd < 0 && errno == ENOSYS) fd = openComponentwise(dirfd, relative, flags, mode);
+  if (fd < 0 && errno == ENOTDIR && (flags & O_DIRECTORY)) {
+    // A link at the last component reads as "not a directory"; say link.
+    UniqueFd item;
+    struct stat st;
+    if (openBeneathWithMode(dirfd, relative, O_PATH, 0, &item, walk) == 0 && fstat(item.get(), &st) == 0 &&
+        S_ISLNK(st.st_mode))
+      return ELOOP;
+    errno = ENOTDIR;
+  }
   if (fd < 0) return errno;
   out->reset(static_cast<int>(fd));
   return 0;
