@@ -1019,9 +1019,13 @@ bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool
       err = errno;
       if (err == EXDEV) return moveAcross(src, toURL, from, to, error);
     } else {
-      // Both directories flushed before anyone hears of the move.
+      // Both directories flushed before anyone hears of the move (once when
+      // they are one).
+      struct stat fromStat, toStat;
       err = platform::syncDirectory(to.fd.get());
-      if (!err) err = platform::syncDirectory(from.fd.get());
+      bool same = fstat(from.fd.get(), &fromStat) == 0 && fstat(to.fd.get(), &toStat) == 0 &&
+                  fromStat.st_dev == toStat.st_dev && fromStat.st_ino == toStat.st_ino;
+      if (!err && !same) err = platform::syncDirectory(from.fd.get());
     }
   }
   if (err) {
