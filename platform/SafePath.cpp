@@ -56,9 +56,11 @@ int openBeneathWithMode(int dirfd, const char* relative, int flags, mode_t mode,
   how.mode = (flags & (O_CREAT | O_TMPFILE)) ? mode : 0;
   how.resolve = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | (walk ? RESOLVE_NO_XDEV : 0);
   long fd;
+  // EAGAIN: a rename raced the lookup; a few retries, not an endless loop.
+  int tries = 0;
   do {
     fd = syscall(SYS_openat2, dirfd, relative, &how, sizeof how);
-  } while (fd < 0 && (errno == EAGAIN || errno == EINTR));
+  } while (fd < 0 && (errno == EAGAIN || errno == EINTR) && ++tries < 16);
   if (fd < 0 && errno == ENOSYS) fd = openComponentwise(dirfd, relative, flags, mode);
   if (fd < 0 && errno == ENOTDIR && (flags & O_DIRECTORY)) {
     // A link at the last component reads as "not a directory"; say link.

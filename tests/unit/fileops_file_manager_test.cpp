@@ -308,6 +308,18 @@ TEST_F(FileManagerTest, TraversalSeesDirectoriesTwiceAndCanSkipOrStop) {
   }));
   EXPECT_EQ(calls, 2);
   EXPECT_EQ(error_->localizedDescription(), "visitor gave up");
+
+  std::string rel = "deep";  // deeper than the walk keeps directories open at once
+  for (int i = 0; i < 150; ++i) rel += "/d";
+  makeFile(rel + "/leaf");
+  int pre = 0, post = 0, files = 0;
+  ASSERT_TRUE(fm_._traverseDirectory(url("deep"), &error_, [&](QRTTraversalEntry& e, QRTErrorRef*) {
+    pre += e.kind == QRTTraversalEntry::Kind::DirectoryPre;
+    post += e.kind == QRTTraversalEntry::Kind::DirectoryPost;
+    files += e.kind == QRTTraversalEntry::Kind::File && e.level == 151;
+    return true;
+  }));
+  EXPECT_EQ(std::tuple(pre, post, files), std::tuple(151, 151, 1));
 }
 
 TEST_F(FileManagerTest, PropertyListFilesRoundTripAndRejectOtherShapes) {
