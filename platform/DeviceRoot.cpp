@@ -2,9 +2,11 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <cerrno>
+
+#include "platform/FileIO.h"
+#include "platform/SafePath.h"
 
 namespace platform {
 
@@ -21,6 +23,7 @@ void setDeviceRoot(const std::string& root) {
   std::string value = root;
   while (value.size() > 1 && value.back() == '/') value.pop_back();
   rootStorage() = value.empty() ? "/" : value;
+  resetDeviceRootDescriptor();
 }
 
 const std::string& deviceRoot() { return rootStorage(); }
@@ -35,38 +38,22 @@ std::string hostPath(std::string_view devicePath) {
 }
 
 std::optional<std::string> readHostFile(const std::string& path, size_t limit) {
-  int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
-  if (fd < 0) return std::nullopt;
-  struct stat st;
-  int failure = 0;
-  if (fstat(fd, &st) != 0)
-    failure = errno;
-  else if (S_ISDIR(st.st_mode))
-    failure = EISDIR;
-  else if (!S_ISREG(st.st_mode))
-    failure = EINVAL;
-  else if (static_cast<uint64_t>(st.st_size) > limit)
-    failure = EFBIG;
-  if (failure != 0) {
-    close(fd);
-    errno = failure;
+  std::string content;
+  int err = safeReadFile(path, &content, limit);
+  if (err == EXDEV && !path.empty() && path.front() == '/') {
+    // A system file outside the device root (the kernel's boot id under a
+    // test root): nothing a user of the device can plant.
+    UniqueFd fd(open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY));
+    struct stat st;
+    if (!fd.valid() || fstat(fd.get(), &st) != 0)
+      err = errno;
+    else
+      err = S_ISREG(st.st_mode) ? readAll(fd.get(), &content, limit) : S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
+  }
+  if (err != 0) {
+    errno = err;
     return std::nullopt;
   }
-  std::string content;
-  char buffer[8192];
-  for (;;) {
-    ssize_t n = read(fd, buffer, sizeof buffer);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0 || content.size() + static_cast<size_t>(n) > limit) {
-      int saved = n < 0 ? errno : EFBIG;
-      close(fd);
-      errno = saved;
-      return std::nullopt;
-    }
-    if (n == 0) break;
-    content.append(buffer, static_cast<size_t>(n));
-  }
-  close(fd);
   return content;
 }
 

@@ -15,7 +15,8 @@ const std::string& deviceRoot();
 std::string hostPath(std::string_view devicePath);
 
 // The whole content of a small file at a host path; nothing when it is
-// missing, unreadable or longer than limit (errno tells which).
+// missing, unreadable or longer than limit (errno tells which). Inside the
+// device root it is resolved safely (SafePath.h): a link on the way is ELOOP.
 std::optional<std::string> readHostFile(const std::string& path, size_t limit = 16u << 20);
 
 }  // namespace platform

@@ -1,13 +1,11 @@
 #include "platform/FirstBoot.h"
 
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <cerrno>
 #include <optional>
 
 #include "platform/DeviceRoot.h"
+#include "platform/FileIO.h"
+#include "platform/SafePath.h"
 
 namespace platform {
 
@@ -31,17 +29,6 @@ std::optional<std::string> currentBootId() {
   return value;
 }
 
-bool writeAll(int fd, const std::string& text) {
-  size_t done = 0;
-  while (done < text.size()) {
-    ssize_t n = write(fd, text.data() + done, text.size() - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    done += static_cast<size_t>(n);
-  }
-  return true;
-}
-
 }  // namespace
 
 std::string firstBootMarkerPath() { return hostPath("/run/quarterd.fb_check"); }
@@ -55,22 +42,11 @@ bool firstBootMarkerExists() {
 bool createFirstBootMarker() {
   std::optional<std::string> bootId = currentBootId();
   if (!bootId) return false;
-  std::string runDirectory = hostPath("/run");
-  if (mkdir(runDirectory.c_str(), 0755) != 0 && errno != EEXIST) return false;
-  std::string temporary = runDirectory + "/.quarterd.fb_check.XXXXXX";
-  int fd = mkostemp(temporary.data(), O_CLOEXEC);
-  if (fd < 0) return false;
-  bool written = writeAll(fd, *bootId + "\n") && fchmod(fd, 0400) == 0;
-  int error = errno;
-  if (close(fd) != 0 && written) {
-    written = false;
-    error = errno;
-  }
-  if (written && rename(temporary.c_str(), firstBootMarkerPath().c_str()) == 0) return true;
-  if (written) error = errno;
-  unlink(temporary.c_str());
-  errno = error;
-  return false;
+  UniqueFd run;
+  int err = safeMakeDirectory(hostPath("/run"), 0755, false, kAnyOwner, &run);
+  if (!err) err = replaceFileAt(run.get(), "quarterd.fb_check", (*bootId + "\n").data(), bootId->size() + 1, 0400);
+  if (err) errno = err;
+  return err == 0;
 }
 
 }  // namespace platform

@@ -1,6 +1,6 @@
 #include "platform/Identity.h"
 
-#include <dirent.h>
+#include <fcntl.h>
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -18,7 +18,9 @@
 
 #include "base/PlistCodec.h"
 #include "platform/DeviceRoot.h"
+#include "platform/FileIO.h"
 #include "platform/Log.h"
+#include "platform/SafePath.h"
 
 #ifndef SO_PEERPIDFD
 #define SO_PEERPIDFD 77  // Linux 6.5; older C library headers lack it
@@ -78,7 +80,7 @@ DirectoryStamp stampOf(const std::string& path) {
   DirectoryStamp stamp;
   stamp.path = path;
   struct stat st;
-  if (stat(path.c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) return stamp;
+  if (safeStat(path, &st) != 0 || !S_ISDIR(st.st_mode)) return stamp;
   stamp.present = true;
   stamp.device = st.st_dev;
   stamp.inode = st.st_ino;
@@ -102,28 +104,29 @@ Registry& registry() {
   return *instance;
 }
 
-std::vector<std::string> registryFileNames(const std::string& directory) {
+std::vector<std::string> registryFileNames(int dirfd) {
   std::vector<std::string> names;
-  DIR* dir = opendir(directory.c_str());
-  if (!dir) return names;
-  while (dirent* entry = readdir(dir)) {
-    std::string_view name = entry->d_name;
-    if (name.size() > 6 && name.front() != '.' && name.ends_with(".plist")) names.emplace_back(name);
+  auto batch = std::make_unique<DirectoryBatch>();
+  for (ssize_t n; (n = readDirectoryBatch(dirfd, batch.get())) > 0;) {
+    forEachEntry(*batch, static_cast<size_t>(n), [&](uint64_t, unsigned char, const char* entry) {
+      std::string_view name = entry ? entry : "";
+      if (name.size() > 6 && name.front() != '.' && name.ends_with(".plist")) names.emplace_back(name);
+    });
   }
-  closedir(dir);
   std::sort(names.begin(), names.end());
   return names;
 }
 
 // Adds one file's entry; a later file replaces an earlier one's whole entry.
-void addRegistryFile(const std::string& path, IdentityMap& identities) {
-  std::optional<std::string> bytes = readHostFile(path);
-  if (!bytes) {
-    QRTLog(kLogError, "Cannot read identity file %s: %s", path.c_str(), strerror(errno));
+void addRegistryFile(int dirfd, const std::string& directory, const std::string& name, IdentityMap& identities) {
+  const std::string path = directory + "/" + name;
+  std::string bytes;
+  if (int err = readFileAt(dirfd, name.c_str(), &bytes, 16u << 20)) {
+    QRTLog(kLogError, "Cannot read identity file %s: %s", path.c_str(), strerror(err));
     return;
   }
   std::string error;
-  std::optional<plist::Value> value = plist::parse(bytes->data(), bytes->size(), &error);
+  std::optional<plist::Value> value = plist::parse(bytes.data(), bytes.size(), &error);
   const plist::Dictionary* entry = value ? value->dictionaryIf() : nullptr;
   const plist::Value* executable = entry ? plist::find(*entry, "Executable") : nullptr;
   if (!executable || !executable->stringIf()) {
@@ -141,7 +144,9 @@ void addRegistryFile(const std::string& path, IdentityMap& identities) {
 
 IdentityMap loadRegistry(const std::string& directory) {
   IdentityMap identities;
-  for (const std::string& name : registryFileNames(directory)) addRegistryFile(directory + "/" + name, identities);
+  UniqueFd fd;
+  if (safeOpen(directory, O_RDONLY | O_DIRECTORY, &fd) != 0) return identities;
+  for (const std::string& name : registryFileNames(fd.get())) addRegistryFile(fd.get(), directory, name, identities);
   return identities;
 }
 

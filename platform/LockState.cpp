@@ -14,6 +14,8 @@
 #include <thread>
 
 #include "platform/DeviceRoot.h"
+#include "platform/FileIO.h"
+#include "platform/SafePath.h"
 #include "platform/Log.h"
 #include "platform/Queue.h"
 
@@ -25,11 +27,6 @@ constexpr int kTransitionalState = 2;
 constexpr const char* kStateFileName = "lockstate";
 
 std::string stateDirectory() { return hostPath("/run/device"); }
-
-int makeDirectory(const std::string& path) {
-  if (mkdir(path.c_str(), 0755) == 0 || errno == EEXIST) return 0;
-  return errno;
-}
 
 // Reads inotify events until the watch goes away; each batch that touched the
 // state file posts one onChange to the main queue.
@@ -70,13 +67,14 @@ int deviceLockState() {
 }
 
 int watchLockState(std::function<void()> onChange) {
-  std::string directory = stateDirectory();
-  if (int error = makeDirectory(hostPath("/run")); error != 0) return error;
-  if (int error = makeDirectory(directory); error != 0) return error;
+  UniqueFd directory;
+  if (int error = safeMakeDirectory(stateDirectory(), 0755, true, kAnyOwner, &directory); error != 0) return error;
   int inotifyFd = inotify_init1(IN_CLOEXEC);
   if (inotifyFd < 0) return errno;
   uint32_t events = IN_CLOSE_WRITE | IN_MOVED_TO | IN_MOVED_FROM | IN_CREATE | IN_DELETE | IN_ONLYDIR;
-  if (inotify_add_watch(inotifyFd, directory.c_str(), events) < 0) {
+  // The directory just checked, through its descriptor's own entry.
+  std::string watched = "/proc/self/fd/" + std::to_string(directory.get());
+  if (inotify_add_watch(inotifyFd, watched.c_str(), events) < 0) {
     int error = errno;
     close(inotifyFd);
     return error;

@@ -11,6 +11,9 @@
 #include <cstring>
 #include <ctime>
 #include <mutex>
+#include <string_view>
+
+#include "platform/FileIO.h"
 
 namespace platform {
 
@@ -46,6 +49,24 @@ std::string levelTag(int level) {
 
 int syslogPriority(int level) { return level < LOG_EMERG ? LOG_EMERG : level > LOG_DEBUG ? LOG_DEBUG : level; }
 
+// A message is one line whatever a client put in an identifier or a path:
+// control bytes and DEL are written as \xNN.
+std::string escaped(std::string_view text) {
+  std::string out;
+  out.reserve(text.size());
+  for (unsigned char c : text) {
+    if (c >= 0x20 && c != 0x7f) {
+      out += static_cast<char>(c);
+      continue;
+    }
+    static const char kHex[] = "0123456789abcdef";
+    out += "\\x";
+    out += kHex[c >> 4];
+    out += kHex[c & 0xf];
+  }
+  return out;
+}
+
 std::string formatLine(int level, const char* function, const std::string& message) {
   timespec now{};
   clock_gettime(CLOCK_REALTIME, &now);
@@ -59,21 +80,11 @@ std::string formatLine(int level, const char* function, const std::string& messa
   std::string line = head;
   line += levelTag(level);
   line += ' ';
-  line += function ? function : "(null)";
+  line += escaped(function ? function : "(null)");
   line += ": ";
-  line += message;
+  line += escaped(message);
   line += '\n';
   return line;
-}
-
-void writeAll(int fd, const std::string& text) {
-  size_t done = 0;
-  while (done < text.size()) {
-    ssize_t n = write(fd, text.data() + done, text.size() - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return;
-    done += static_cast<size_t>(n);
-  }
 }
 
 // openlog keeps the pointer it is given, so identities are never freed.
@@ -85,7 +96,9 @@ void setSyslogIdentity(const std::string& name) {
 }
 
 bool openFileLocked(LogFile& file) {
-  file.fd = open(file.path.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOCTTY, 0644);
+  // The log lives in root's own directories; a link put in its place is
+  // still not followed.
+  file.fd = open(file.path.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOCTTY | O_NOFOLLOW, 0644);
   if (file.fd < 0) {
     gFileOpen = false;
     return false;
@@ -104,17 +117,33 @@ void closeFileLocked(LogFile& file) {
 
 std::string numbered(const std::string& path, uint32_t index) { return path + "." + std::to_string(index); }
 
+// The log cannot report on itself: the system log and standard error do.
+void rotationFailed(const char* step, const std::string& path, int err) {
+  std::string text = "Log rotation failed to " + std::string(step) + " " + escaped(path) + ": " + strerror(err);
+  syslog(LOG_ERR, "%s", text.c_str());
+  text += '\n';
+  writeAll(STDERR_FILENO, text);
+}
+
+// A missing older file is no failure.
+void renameForRotation(const std::string& from, const std::string& to) {
+  if (rename(from.c_str(), to.c_str()) != 0 && errno != ENOENT) rotationFailed("rename", from, errno);
+}
+
 // quarterd.log -> .0, .0 -> .1, ...; files numbered fileCount and up go away.
 void rotateLocked(LogFile& file) {
   closeFileLocked(file);
   if (file.fileCount == 0) {
-    unlink(file.path.c_str());
+    if (unlink(file.path.c_str()) != 0 && errno != ENOENT) rotationFailed("remove", file.path, errno);
   } else {
-    for (uint32_t i = file.fileCount - 1; i >= 1; --i)
-      rename(numbered(file.path, i - 1).c_str(), numbered(file.path, i).c_str());
-    rename(file.path.c_str(), numbered(file.path, 0).c_str());
+    for (uint32_t i = file.fileCount - 1; i >= 1; --i) renameForRotation(numbered(file.path, i - 1), numbered(file.path, i));
+    renameForRotation(file.path, numbered(file.path, 0));
   }
-  for (uint32_t i = file.fileCount; unlink(numbered(file.path, i).c_str()) == 0; ++i) {
+  for (uint32_t i = file.fileCount;; ++i) {
+    std::string old = numbered(file.path, i);
+    if (unlink(old.c_str()) == 0) continue;
+    if (errno != ENOENT) rotationFailed("remove", old, errno);
+    break;
   }
   if (!openFileLocked(file))
     syslog(LOG_ERR, "Failed to reopen log %s after rotation: %s", file.path.c_str(), strerror(errno));
@@ -157,12 +186,12 @@ void logWrite(int level, const char* function, const std::string& message) {
     writeAll(file.fd, line);
     file.size += line.size();
   } else {
-    syslog(syslogPriority(level), "%s: %s", function ? function : "(null)", message.c_str());
+    syslog(syslogPriority(level), "%s: %s", escaped(function ? function : "(null)").c_str(), escaped(message).c_str());
   }
   if (gStderr) writeAll(STDERR_FILENO, line);
 }
 
-void syslogWrite(int priority, const std::string& message) { syslog(priority, "%s", message.c_str()); }
+void syslogWrite(int priority, const std::string& message) { syslog(priority, "%s", escaped(message).c_str()); }
 
 void logClose() {
   LogFile& file = logFile();

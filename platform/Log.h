@@ -23,6 +23,8 @@ int logLevel();
 bool logEnabled(int level);
 // Every line is copied to standard error as well.
 void logSetStderr(bool on);
+// Control bytes (below 0x20, and 0x7f) of the function name and the message
+// are written as \xNN, so that every message stays one line.
 void logWrite(int level, const char* function, const std::string& message);
 // Straight to the system log, for lines about the log itself.
 void syslogWrite(int priority, const std::string& message);

@@ -2,9 +2,7 @@
 
 #include <dirent.h>
 #include <fcntl.h>
-#include <fts.h>
-#include <linux/fs.h>
-#include <sys/ioctl.h>
+#include <sys/random.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -20,70 +18,29 @@
 #include <utility>
 
 #include "base/PlistCodec.h"
-#include "platform/LockState.h"
+#include "platform/FileIO.h"
 #include "platform/Log.h"
+#include "platform/SafePath.h"
 
 using platform::kLogError;
 using platform::kLogNotice;
+using platform::openDirectoryAt;
+using platform::SafeParent;
+using platform::UniqueFd;
 
 namespace {
 
-constexpr const char* kProtectionClassAttribute = "trusted.com.norvane.protection-class";
 constexpr const char* kAccessAclAttribute = "system.posix_acl_access";
 constexpr const char* kDefaultAclAttribute = "system.posix_acl_default";
-constexpr size_t kDirentBufferSize = 32 * 1024;
 constexpr size_t kParallelUnlinkThreshold = 64;
 constexpr unsigned kUnlinkThreads = 4;
 // Deeper trees than this are walked with only this many directories open;
 // the rest are reopened through ".." on the way back up.
 constexpr size_t kMaxOpenDirectories = 64;
 // Property-list files are small; anything beyond this is not one of ours.
-constexpr off_t kMaxPropertyListFileSize = 64 << 20;
+constexpr size_t kMaxPropertyListFileSize = 64 << 20;
 
 const char* errorText(int err) { return strerror(err); }
-
-class UniqueFd {
- public:
-  explicit UniqueFd(int fd = -1) : fd_(fd) {}
-  UniqueFd(UniqueFd&& o) noexcept : fd_(o.release()) {}
-  UniqueFd& operator=(UniqueFd&& o) noexcept {
-    reset(o.release());
-    return *this;
-  }
-  UniqueFd(const UniqueFd&) = delete;
-  UniqueFd& operator=(const UniqueFd&) = delete;
-  ~UniqueFd() { reset(); }
-  int get() const { return fd_; }
-  bool valid() const { return fd_ >= 0; }
-  int release() { return std::exchange(fd_, -1); }
-  void reset(int fd = -1) {
-    if (fd_ >= 0) close(fd_);
-    fd_ = fd;
-  }
-
- private:
-  int fd_;
-};
-
-struct DirCloser {
-  void operator()(DIR* d) const { closedir(d); }
-};
-using UniqueDir = std::unique_ptr<DIR, DirCloser>;
-
-bool isDotOrDotDot(const char* name) {
-  return name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0'));
-}
-
-// O_NOATIME spares an inode write per directory but needs ownership or
-// CAP_FOWNER, hence the retry without it.
-int openNoFollow(int dirfd, const char* name, int flags) {
-  flags |= O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC;
-  int fd = openat(dirfd, name, flags | O_NOATIME);
-  if (fd < 0 && errno == EPERM) fd = openat(dirfd, name, flags);
-  return fd;
-}
-
-int openDirectoryAt(int dirfd, const char* name) { return openNoFollow(dirfd, name, O_RDONLY | O_DIRECTORY); }
 
 // ---------------------------------------------------------------------------
 // Recursive removal.
@@ -94,7 +51,9 @@ int openDirectoryAt(int dirfd, const char* name) { return openNoFollow(dirfd, na
 // are unlinked by a few threads at once.
 class TreePruner {
  public:
-  explicit TreePruner(const char* root) : path_(root) {}
+  // The item name in the directory parentFd; path names it in messages.
+  TreePruner(int parentFd, std::string name, std::string path)
+      : parentFd_(parentFd), rootName_(std::move(name)), path_(std::move(path)) {}
   // 0 when the walk reached its end, else the errno that stopped it.
   int run();
   int firstError() const { return firstError_.load(); }
@@ -129,9 +88,11 @@ class TreePruner {
   }
   std::string childPath(const char* name) const { return path_ + "/" + name; }
 
+  int parentFd_;
+  std::string rootName_;
   std::string path_;  // the path of the directory on top of the stack
   std::vector<Frame> stack_;
-  std::unique_ptr<char[]> buffer_;
+  std::unique_ptr<platform::DirectoryBatch> batch_;
   std::vector<Victim> victims_;  // scratch of scan()
   std::string names_;
   dev_t rootDevice_ = 0;
@@ -139,17 +100,17 @@ class TreePruner {
 };
 
 int TreePruner::run() {
-  UniqueFd fd(openDirectoryAt(AT_FDCWD, path_.c_str()));
+  UniqueFd fd(openDirectoryAt(parentFd_, rootName_.c_str()));
   if (!fd.valid()) {
     int err = errno;
     if (err != ENOTDIR && err != ELOOP) return err;
-    removeAt(AT_FDCWD, path_.c_str(), 0, path_);  // a file or a link
+    removeAt(parentFd_, rootName_.c_str(), 0, path_);  // a file or a link
     return 0;
   }
   struct stat st;
   if (fstat(fd.get(), &st) != 0) return errno;
   rootDevice_ = st.st_dev;
-  buffer_ = std::make_unique<char[]>(kDirentBufferSize);
+  batch_ = std::make_unique<platform::DirectoryBatch>();
   stack_.push_back(Frame{std::move(fd), st.st_dev, st.st_ino, path_.size(), path_, {}});
   scan(stack_.back());
   while (!stack_.empty()) {
@@ -172,22 +133,19 @@ void TreePruner::scan(Frame& frame) {
   victims_.clear();
   names_.clear();
   for (bool more = true; more;) {
-    ssize_t n = getdents64(frame.fd.get(), buffer_.get(), kDirentBufferSize);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) record(path_, errno);
+    ssize_t n = platform::readDirectoryBatch(frame.fd.get(), batch_.get());
+    if (n < 0) record(path_, static_cast<int>(-n));
     more = n > 0;
-    for (ssize_t offset = 0; offset < n;) {
-      auto* entry = reinterpret_cast<struct dirent64*>(buffer_.get() + offset);
-      offset += entry->d_reclen;
-      const char* name = entry->d_name;
-      if (isDotOrDotDot(name)) continue;
-      if (entry->d_type == DT_DIR) {
+    if (!more) break;
+    platform::forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t inode, unsigned char type, const char* name) {
+      if (!name) return;
+      if (type == DT_DIR) {
         frame.subdirectories.emplace_back(name);
       } else {
-        victims_.push_back({entry->d_ino, names_.size()});
+        victims_.push_back({inode, names_.size()});
         names_.append(name, strlen(name) + 1);
       }
-    }
+    });
   }
   std::sort(victims_.begin(), victims_.end(), [](const Victim& a, const Victim& b) { return a.inode < b.inode; });
   unlinkVictims(frame);
@@ -268,7 +226,7 @@ int TreePruner::leave() {
   stack_.pop_back();
   if (stack_.empty()) {
     child.fd.reset();
-    removeAt(AT_FDCWD, path_.c_str(), AT_REMOVEDIR, path_);
+    removeAt(parentFd_, rootName_.c_str(), AT_REMOVEDIR, path_);
     return 0;
   }
   Frame& parent = stack_.back();
@@ -318,23 +276,22 @@ void TreePruner::record(const std::string& path, int err) {
 // The flags live behind an open file; links and special files never carry
 // the flag we repair, and opening them could block or have side effects.
 bool TreePruner::unsetImmutable(int dirfd, const char* name, const std::string& path) {
-  struct stat st;
-  if (fstatat(dirfd, name, &st, AT_SYMLINK_NOFOLLOW) != 0) {
-    QRTLog(kLogError, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", path.c_str(), errorText(errno));
+  platform::Item item;
+  if (int err = platform::openItemAt(dirfd, name, &item)) {
+    QRTLog(kLogError, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", path.c_str(), errorText(err));
     return false;
   }
-  if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) return false;
-  UniqueFd fd(openNoFollow(dirfd, name, O_RDONLY | O_NOCTTY));
-  int flags = 0;
-  if (!fd.valid() || ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) != 0) {
-    if (errno == ENOTTY || errno == EOPNOTSUPP) return false;  // no flags on this file system
-    QRTLog(kLogError, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", path.c_str(), errorText(errno));
+  UniqueFd fd;
+  if (platform::reopenItem(item, O_RDONLY, &fd) != 0) return false;
+  bool immutable = false;
+  if (int err = platform::immutableFlag(fd.get(), &immutable)) {
+    if (err == ENOTTY || err == EOPNOTSUPP) return false;  // no flags on this file system
+    QRTLog(kLogError, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", path.c_str(), errorText(err));
     return false;
   }
-  if (!(flags & FS_IMMUTABLE_FL)) return false;
-  flags &= ~FS_IMMUTABLE_FL;
-  if (ioctl(fd.get(), FS_IOC_SETFLAGS, &flags) != 0) {
-    QRTLog(kLogError, "Failed to lchflags %s: %s", path.c_str(), errorText(errno));
+  if (!immutable) return false;
+  if (int err = platform::clearImmutableFlag(fd.get())) {
+    QRTLog(kLogError, "Failed to lchflags %s: %s", path.c_str(), errorText(err));
     return false;
   }
   QRTLog(kLogNotice, "Unset UF_IMMUTABLE on %s", path.c_str());
@@ -347,20 +304,31 @@ bool TreePruner::unsetImmutable(int dirfd, const char* name, const std::string& 
 // Copies a tree with data, owner, mode, times and every extended attribute
 // (ACLs included), links as links, never following one at either end. A
 // directory's own attributes are set after its contents, so that neither its
-// mode nor its default ACL can get in the way of the copy below it.
+// mode nor its default ACL can get in the way of the copy below it. Running as
+// root over trees that users filled, it makes no device nodes and drops the
+// set-user-id and set-group-id bits. A durable copy flushes every file and
+// directory it made.
 class TreeCloner {
  public:
-  int run(const char* src, const char* dst);
+  explicit TreeCloner(bool durable) : durable_(durable) {}
+  int run(int sparent, const char* sname, int dparent, const char* dname);
 
  private:
+  struct Child {
+    std::string name;
+    unsigned char type;
+  };
   struct Frame {
-    UniqueDir src;
+    UniqueFd src;
     UniqueFd dst;
     struct stat st;
+    std::vector<Child> children;
+    size_t next = 0;
   };
 
   int copyEntry(int sdir, const char* sname, int ddir, const char* dname, unsigned char type);
   int enterDirectory(int sdir, const char* sname, int ddir, const char* dname);
+  int readChildren(Frame& frame);
   int walk();
   int finishDirectory(Frame& frame);
   int copyFile(int sdir, const char* sname, int ddir, const char* dname);
@@ -372,10 +340,12 @@ class TreeCloner {
   ssize_t readXattrList(int sfd);
   ssize_t readXattr(int sfd, const char* name);
 
+  bool durable_;
   std::vector<Frame> stack_;
   std::vector<char> names_ = std::vector<char>(4096);
   std::vector<char> value_ = std::vector<char>(4096);
   std::unique_ptr<char[]> dataBuffer_;
+  std::unique_ptr<platform::DirectoryBatch> batch_;
   dev_t dstRootDevice_ = 0;
   ino_t dstRootInode_ = 0;
   // Items created under a directory with a default ACL inherit ACLs the
@@ -384,6 +354,7 @@ class TreeCloner {
 };
 
 constexpr size_t kCopyBufferSize = 128 * 1024;
+constexpr mode_t kCopiedModeBits = 01777;  // no set-id bits
 
 unsigned char typeOfMode(mode_t mode) {
   if (S_ISDIR(mode)) return DT_DIR;
@@ -392,34 +363,36 @@ unsigned char typeOfMode(mode_t mode) {
   return DT_UNKNOWN;
 }
 
-int TreeCloner::run(const char* src, const char* dst) {
+int TreeCloner::run(int sparent, const char* sname, int dparent, const char* dname) {
   struct stat st;
-  if (lstat(src, &st) != 0) return errno;
-  if (!S_ISDIR(st.st_mode)) return copyEntry(AT_FDCWD, src, AT_FDCWD, dst, typeOfMode(st.st_mode));
-  if (int err = enterDirectory(AT_FDCWD, src, AT_FDCWD, dst)) return err;
+  if (fstatat(sparent, sname, &st, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+  if (!S_ISDIR(st.st_mode)) {
+    int err = copyEntry(sparent, sname, dparent, dname, typeOfMode(st.st_mode));
+    return err ? err : durable_ ? platform::syncDirectory(dparent) : 0;
+  }
+  if (int err = enterDirectory(sparent, sname, dparent, dname)) return err;
   struct stat dstStat;
   if (fstat(stack_.back().dst.get(), &dstStat) != 0) return errno;
   dstRootDevice_ = dstStat.st_dev;
   dstRootInode_ = dstStat.st_ino;
   dropInheritedAcls_ = fgetxattr(stack_.back().dst.get(), kDefaultAclAttribute, nullptr, 0) >= 0;
-  return walk();
+  if (int err = walk()) return err;
+  return durable_ ? platform::syncDirectory(dparent) : 0;
 }
 
 int TreeCloner::walk() {
   while (!stack_.empty()) {
     Frame& top = stack_.back();
-    errno = 0;
-    struct dirent* entry = readdir(top.src.get());
-    if (!entry) {
-      if (errno != 0) return errno;
+    if (top.next == top.children.size()) {
       int err = finishDirectory(top);
       stack_.pop_back();
       if (err) return err;
       continue;
     }
-    if (isDotOrDotDot(entry->d_name)) continue;
-    int sdir = dirfd(top.src.get());
-    if (int err = copyEntry(sdir, entry->d_name, top.dst.get(), entry->d_name, entry->d_type)) return err;
+    // copyEntry may push a frame: nothing of top is used after it.
+    const Child child = top.children[top.next++];
+    if (int err = copyEntry(top.src.get(), child.name.c_str(), top.dst.get(), child.name.c_str(), child.type))
+      return err;
   }
   return 0;
 }
@@ -442,7 +415,8 @@ int TreeCloner::copyEntry(int sdir, const char* sname, int ddir, const char* dna
   }
 }
 
-// An existing directory at the destination is copied into.
+// An existing directory at the destination is copied into; a link there is
+// refused (ELOOP).
 int TreeCloner::enterDirectory(int sdir, const char* sname, int ddir, const char* dname) {
   UniqueFd sfd(openDirectoryAt(sdir, sname));
   if (!sfd.valid()) return errno;
@@ -452,19 +426,38 @@ int TreeCloner::enterDirectory(int sdir, const char* sname, int ddir, const char
   if (mkdirat(ddir, dname, S_IRWXU) != 0 && errno != EEXIST) return errno;
   UniqueFd dfd(openDirectoryAt(ddir, dname));
   if (!dfd.valid()) return errno;
-  UniqueDir dir(fdopendir(sfd.get()));
-  if (!dir) return errno;
-  sfd.release();
-  stack_.push_back(Frame{std::move(dir), std::move(dfd), st});
-  return 0;
+  stack_.push_back(Frame{std::move(sfd), std::move(dfd), st, {}, 0});
+  return readChildren(stack_.back());
+}
+
+// The whole listing up front, so that the source descriptor serves only to
+// open children.
+int TreeCloner::readChildren(Frame& frame) {
+  if (!batch_) batch_ = std::make_unique<platform::DirectoryBatch>();
+  for (;;) {
+    ssize_t n = platform::readDirectoryBatch(frame.src.get(), batch_.get());
+    if (n < 0) return static_cast<int>(-n);
+    if (n == 0) return 0;
+    int err = 0;
+    platform::forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t, unsigned char type, const char* name) {
+      if (name)
+        frame.children.push_back(Child{name, type});
+      else
+        err = EIO;
+    });
+    if (err) return err;
+  }
 }
 
 int TreeCloner::finishDirectory(Frame& frame) {
-  return finishItem(dirfd(frame.src.get()), frame.dst.get(), frame.st, true);
+  if (int err = finishItem(frame.src.get(), frame.dst.get(), frame.st, true)) return err;
+  return durable_ ? platform::syncDirectory(frame.dst.get()) : 0;
 }
 
 int TreeCloner::copyFile(int sdir, const char* sname, int ddir, const char* dname) {
-  UniqueFd sfd(openNoFollow(sdir, sname, O_RDONLY | O_NOCTTY));
+  // Non-blocking and checked at once: a name swapped for a FIFO is refused
+  // below without ever being read.
+  UniqueFd sfd(platform::openNoFollowAt(sdir, sname, O_RDONLY));
   if (!sfd.valid()) return errno;
   struct stat st;
   if (fstat(sfd.get(), &st) != 0) return errno;
@@ -478,6 +471,7 @@ int TreeCloner::copyFile(int sdir, const char* sname, int ddir, const char* dnam
   if (!dfd.valid()) return errno;
   if (int err = copyData(sfd.get(), dfd.get(), st.st_size)) return err;
   if (int err = finishItem(sfd.get(), dfd.get(), st, false)) return err;
+  if (durable_ && fsync(dfd.get()) != 0) return errno;
   if (close(dfd.release()) != 0) return errno;
   return 0;
 }
@@ -505,12 +499,7 @@ int TreeCloner::copyData(int sfd, int dfd, off_t size) {
       if (errno == EINTR) continue;
       return errno;
     }
-    for (ssize_t done = 0; done < n;) {
-      ssize_t w = write(dfd, dataBuffer_.get() + done, static_cast<size_t>(n - done));
-      if (w < 0 && errno == EINTR) continue;
-      if (w < 0) return errno;
-      done += w;
-    }
+    if (int err = platform::writeAll(dfd, dataBuffer_.get(), static_cast<size_t>(n))) return err;
     size -= n;
   }
   return 0;
@@ -535,28 +524,36 @@ int TreeCloner::copySymlink(int sdir, const char* sname, int ddir, const char* d
   return 0;
 }
 
-// FIFOs, sockets and device nodes: made anew, owner, mode and times kept.
+// FIFOs and sockets are made anew with owner, mode and times; device nodes
+// are left out.
 int TreeCloner::copySpecial(int sdir, const char* sname, int ddir, const char* dname) {
   struct stat st;
   if (fstatat(sdir, sname, &st, AT_SYMLINK_NOFOLLOW) != 0) return errno;
-  const mode_t mode = st.st_mode & (S_IFMT | S_IRWXU);
-  if (mknodat(ddir, dname, mode, st.st_rdev) != 0) {
-    if (errno != EEXIST || unlinkat(ddir, dname, 0) != 0 || mknodat(ddir, dname, mode, st.st_rdev) != 0)
-      return errno;
+  if (S_ISCHR(st.st_mode) || S_ISBLK(st.st_mode)) {
+    QRTLogAs(kLogNotice, "clonetree", "Not copying device node %s", sname);
+    return 0;
   }
-  if (fchownat(ddir, dname, st.st_uid, st.st_gid, AT_SYMLINK_NOFOLLOW) != 0) return errno;
-  if (fchmodat(ddir, dname, st.st_mode & 07777, 0) != 0) return errno;
+  const mode_t mode = st.st_mode & (S_IFMT | S_IRWXU);
+  if (mknodat(ddir, dname, mode, 0) != 0) {
+    if (errno != EEXIST || unlinkat(ddir, dname, 0) != 0 || mknodat(ddir, dname, mode, 0) != 0) return errno;
+  }
+  // What was just made, pinned: a name swapped meanwhile is not followed.
+  platform::Item made;
+  if (int err = platform::openItemAt(ddir, dname, &made)) return err;
+  if ((made.st.st_mode & S_IFMT) != (st.st_mode & S_IFMT)) return ESTALE;
+  if (int err = platform::chownItem(made, st.st_uid, st.st_gid)) return err;
+  if (int err = platform::chmodItem(made, st.st_mode & kCopiedModeBits)) return err;
   const struct timespec times[2] = {st.st_atim, st.st_mtim};
   if (utimensat(ddir, dname, times, AT_SYMLINK_NOFOLLOW) != 0) return errno;
   return 0;
 }
 
-// Owner before mode (a change of owner clears set-id bits), the ACL before
-// the mode (both set the group class bits and agree), times last.
+// Owner before mode, the ACL before the mode (both set the group class bits
+// and agree), times last.
 int TreeCloner::finishItem(int sfd, int dfd, const struct stat& st, bool isDirectory) {
   if (fchown(dfd, st.st_uid, st.st_gid) != 0) return errno;
   if (int err = copyXattrs(sfd, dfd, isDirectory)) return err;
-  if (fchmod(dfd, st.st_mode & 07777) != 0) return errno;
+  if (fchmod(dfd, st.st_mode & kCopiedModeBits) != 0) return errno;
   const struct timespec times[2] = {st.st_atim, st.st_mtim};
   if (futimens(dfd, times) != 0) return errno;
   return 0;
@@ -617,121 +614,251 @@ int TreeCloner::copyXattrs(int sfd, int dfd, bool isDirectory) {
 }
 
 // ---------------------------------------------------------------------------
-// Create with parents.
+// Tree walk.
 
-// Like mkdir -p: finds the deepest existing ancestor going up, then creates
-// the missing ones going down. Returns 0, EEXIST for an existing path, or
-// the errno that stopped it.
-int ensureDirectories(const std::string& path, mode_t mode) {
-  if (mkdirat(AT_FDCWD, path.c_str(), mode) == 0) return 0;
-  if (errno != ENOENT) return errno;
-  std::vector<size_t> missing{path.size()};
-  for (size_t end = path.size();;) {
-    size_t slash = path.rfind('/', end - 1);
-    if (slash == std::string::npos || slash == 0) break;
-    end = slash;
-    std::string parent = path.substr(0, end);
-    if (mkdirat(AT_FDCWD, parent.c_str(), mode) == 0 || errno == EEXIST) break;
-    if (errno != ENOENT) return errno;
-    missing.push_back(end);
+// A physical walk on the root's device that reaches every entry through its
+// parent's descriptor. Directories are opened without following links and
+// checked against what the listing said, so a swap during the walk ends in
+// an entry that cannot be read, never in a walk of something else.
+class TreeWalker {
+ public:
+  TreeWalker(const QRTURL& root, const QRTTraversalVisitor& visitor) : root_(root), visitor_(visitor) {}
+  // False when the walk stopped; error holds why, if anyone said.
+  bool run(QRTErrorRef* error);
+
+ private:
+  struct Frame {
+    UniqueFd fd;
+    struct stat st;
+    std::string name;
+    size_t parentPathLength;
+    std::vector<std::string> children;
+    size_t next = 0;
+  };
+
+  bool visit(QRTTraversalEntry::Kind kind, int parentFd, const char* name, const struct stat& st, int level,
+             int error = 0, bool* skip = nullptr);
+  bool visitChild(const std::string& name);
+  bool enter(int parentFd, const std::string& name, const struct stat& st);
+  bool leave();
+  int parentFdOfTop();
+  int readChildren(Frame& frame);
+  bool fail(int err);
+
+  const QRTURL& root_;
+  const QRTTraversalVisitor& visitor_;
+  SafeParent rootParent_;
+  std::string path_;
+  std::vector<Frame> stack_;
+  std::unique_ptr<platform::DirectoryBatch> batch_;
+  dev_t device_ = 0;
+  QRTErrorRef error_;
+};
+
+QRTTraversalEntry::Kind kindOfMode(mode_t mode) {
+  if (S_ISDIR(mode)) return QRTTraversalEntry::Kind::DirectoryPre;
+  if (S_ISREG(mode)) return QRTTraversalEntry::Kind::File;
+  if (S_ISLNK(mode)) return QRTTraversalEntry::Kind::Symlink;
+  return QRTTraversalEntry::Kind::Other;
+}
+
+bool TreeWalker::fail(int err) {
+  error_ = QRT_POSIX_ERROR(err, "Error for path %s: %s", root_.fileSystemRepresentation(), errorText(err));
+  return false;
+}
+
+bool TreeWalker::run(QRTErrorRef* error) {
+  path_ = root_.path();
+  struct stat st;
+  int err = platform::safeOpenParent(path_, &rootParent_);
+  if (!err && fstatat(rootParent_.fd.get(), rootParent_.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) err = errno;
+  bool ok = err ? fail(err) : true;
+  if (ok) {
+    device_ = st.st_dev;
+    const int parentFd = rootParent_.fd.get();
+    ok = S_ISDIR(st.st_mode) ? enter(parentFd, rootParent_.name, st)
+                             : visit(kindOfMode(st.st_mode), parentFd, rootParent_.name.c_str(), st, 0);
   }
-  for (auto it = missing.rbegin(); it != missing.rend(); ++it) {
-    std::string prefix = path.substr(0, *it);
-    if (mkdirat(AT_FDCWD, prefix.c_str(), mode) != 0 && errno != EEXIST) return errno;
+  while (ok && !stack_.empty()) {
+    Frame& top = stack_.back();
+    if (top.next < top.children.size()) {
+      std::string name = std::move(top.children[top.next++]);
+      ok = visitChild(name);
+    } else {
+      ok = leave();
+    }
   }
-  return 0;
+  if (!ok && error_) QRTSetError(error, error_);
+  return ok;
+}
+
+bool TreeWalker::visit(QRTTraversalEntry::Kind kind, int parentFd, const char* name, const struct stat& st,
+                       int level, int error, bool* skip) {
+  QRTTraversalEntry entry;
+  entry.path = path_.c_str();
+  entry.level = level;
+  entry.kind = kind;
+  entry.st = st;
+  entry.error = error;
+  entry.parentFd = parentFd;
+  entry.name = name;
+  QRTErrorRef visitorError;
+  if (!visitor_(entry, &visitorError)) {
+    error_ = std::move(visitorError);
+    return false;
+  }
+  if (skip) *skip = entry.skipDescendants;
+  return true;
+}
+
+bool TreeWalker::visitChild(const std::string& name) {
+  const int parentFd = stack_.back().fd.get();
+  const size_t parentLength = path_.size();
+  struct stat st;
+  if (fstatat(parentFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
+    if (errno == ENOENT) return true;  // gone meanwhile
+    return fail(errno);
+  }
+  bool ok;
+  if (S_ISDIR(st.st_mode)) {
+    ok = enter(parentFd, name, st);
+  } else {
+    path_ += '/';
+    path_ += name;
+    ok = visit(kindOfMode(st.st_mode), parentFd, name.c_str(), st, static_cast<int>(stack_.size()));
+    path_.resize(parentLength);
+  }
+  return ok;
+}
+
+// Visits the directory, then pushes it unless it is to be passed over.
+bool TreeWalker::enter(int parentFd, const std::string& name, const struct stat& st) {
+  const size_t parentLength = path_.size();
+  const int level = static_cast<int>(stack_.size());
+  if (level > 0) {
+    path_ += '/';
+    path_ += name;
+  }
+  UniqueFd fd;
+  int err = 0;
+  if (st.st_dev == device_) {
+    fd.reset(openDirectoryAt(parentFd, name.c_str()));
+    struct stat opened;
+    if (!fd.valid())
+      err = errno;
+    else if (fstat(fd.get(), &opened) != 0)
+      err = errno;
+    else if (opened.st_dev != st.st_dev || opened.st_ino != st.st_ino)
+      err = ESTALE;
+  }
+  if (err) {
+    // Unreadable, or swapped since the listing: reported, not entered.
+    bool ok = visit(QRTTraversalEntry::Kind::Other, parentFd, name.c_str(), st, level, err);
+    path_.resize(parentLength);
+    return ok;
+  }
+  bool skip = false;
+  if (!visit(QRTTraversalEntry::Kind::DirectoryPre, parentFd, name.c_str(), st, level, 0, &skip)) return false;
+  Frame frame{std::move(fd), st, name, parentLength, {}, 0};
+  // Another file system's directory is seen, never entered.
+  if (!skip && frame.fd.valid()) {
+    if (int readErr = readChildren(frame)) return fail(readErr);
+  }
+  if (stack_.size() >= kMaxOpenDirectories) stack_[stack_.size() - kMaxOpenDirectories].fd.reset();
+  stack_.push_back(std::move(frame));
+  return true;
+}
+
+int TreeWalker::readChildren(Frame& frame) {
+  if (!batch_) batch_ = std::make_unique<platform::DirectoryBatch>();
+  for (;;) {
+    ssize_t n = platform::readDirectoryBatch(frame.fd.get(), batch_.get());
+    if (n < 0) return static_cast<int>(-n);
+    if (n == 0) return 0;
+    platform::forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t, unsigned char, const char* name) {
+      if (name) frame.children.emplace_back(name);
+    });
+  }
+}
+
+// The descriptor of the directory below the top, reopened through the top's
+// ".." when it was closed for depth, and only if it is still the one we came
+// from.
+int TreeWalker::parentFdOfTop() {
+  if (stack_.size() < 2) return rootParent_.fd.get();
+  Frame& parent = stack_[stack_.size() - 2];
+  if (!parent.fd.valid()) {
+    const Frame& child = stack_.back();
+    if (!child.fd.valid()) return -1;
+    UniqueFd fd(openDirectoryAt(child.fd.get(), ".."));
+    struct stat st;
+    if (!fd.valid() || fstat(fd.get(), &st) != 0) return -1;
+    if (st.st_dev != parent.st.st_dev || st.st_ino != parent.st.st_ino) {
+      errno = ESTALE;
+      return -1;
+    }
+    parent.fd = std::move(fd);
+  }
+  return parent.fd.get();
+}
+
+bool TreeWalker::leave() {
+  int parentFd = parentFdOfTop();
+  if (parentFd < 0) return fail(errno);
+  Frame& top = stack_.back();
+  const int level = static_cast<int>(stack_.size()) - 1;
+  bool ok = visit(QRTTraversalEntry::Kind::DirectoryPost, parentFd, top.name.c_str(), top.st, level);
+  path_.resize(top.parentPathLength);
+  stack_.pop_back();
+  return ok;
 }
 
 // ---------------------------------------------------------------------------
-// Property-list files.
 
-int writeAll(int fd, const plist::Data& bytes) {
-  for (size_t done = 0; done < bytes.size();) {
-    ssize_t n = write(fd, bytes.data() + done, bytes.size() - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) return errno;
-    done += static_cast<size_t>(n);
-  }
-  return 0;
+// A fresh hidden name beside name, for a copy that is renamed into place.
+std::string hiddenSibling(const std::string& name) {
+  uint64_t random = 0;
+  if (getrandom(&random, sizeof random, GRND_NONBLOCK) != sizeof random) random = static_cast<uint64_t>(getpid());
+  return "." + name.substr(0, 200) + ".qrt-move-" + std::to_string(random);
 }
 
-// A link planted at the destination is replaced, never written through. The
-// temporary name is hidden so that directory listings pass over it.
-int writeAtomically(const std::string& path, const plist::Data& bytes) {
-  const size_t slash = path.rfind('/');
-  const size_t nameStart = slash == std::string::npos ? 0 : slash + 1;
-  const std::string directory = slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
-  std::string temp = path.substr(0, nameStart) + "." + path.substr(nameStart) + ".XXXXXX";
-  UniqueFd fd(mkostemp(temp.data(), O_CLOEXEC));
-  if (!fd.valid()) return errno;
-  int err = fchmod(fd.get(), S_IRUSR | S_IWUSR | S_IRGRP | S_IROTH) != 0 ? errno : 0;
-  if (!err) err = writeAll(fd.get(), bytes);
-  if (!err && fsync(fd.get()) != 0) err = errno;
-  if (!err && close(fd.release()) != 0) err = errno;
-  if (!err && rename(temp.c_str(), path.c_str()) != 0) err = errno;
-  if (err) {
-    unlink(temp.c_str());
+std::string randomSuffix(size_t length) {
+  static const char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789";
+  unsigned char bytes[16];
+  if (getrandom(bytes, sizeof bytes, GRND_NONBLOCK) != sizeof bytes) {
+    static std::atomic<uint64_t> counter{0};
+    uint64_t seed = static_cast<uint64_t>(getpid()) * 0x9E3779B97F4A7C15ull + counter.fetch_add(1) * 7919;
+    for (unsigned char& b : bytes) b = static_cast<unsigned char>(seed >>= 3);
+  }
+  std::string suffix;
+  for (size_t i = 0; i < length && i < sizeof bytes; ++i) suffix += kAlphabet[bytes[i] % (sizeof kAlphabet - 1)];
+  return suffix;
+}
+
+// Writes in place without following a link or writing through a second
+// name: only a regular file with one link, or a new one, is written.
+int writeInPlace(int dirfd, const char* name, const plist::Data& bytes, bool noProtection) {
+  platform::Item item;
+  UniqueFd fd;
+  int err = platform::openItemAt(dirfd, name, &item);
+  if (err == ENOENT) {
+    fd.reset(openat(dirfd, name, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644));
+    if (!fd.valid()) return errno;
+  } else if (err) {
     return err;
+  } else {
+    if (S_ISLNK(item.st.st_mode)) return ELOOP;
+    if (!S_ISREG(item.st.st_mode)) return EINVAL;
+    if (item.st.st_nlink != 1) return EMLINK;
+    if (int reopenErr = platform::reopenItem(item, O_WRONLY, &fd)) return reopenErr;
+    if (ftruncate(fd.get(), 0) != 0) return errno;
   }
-  UniqueFd dir(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!dir.valid()) return errno;
-  if (fsync(dir.get()) != 0 && errno != EINVAL) return errno;
-  return 0;
-}
-
-int writeInPlace(const std::string& path, const plist::Data& bytes, bool noProtection) {
-  UniqueFd fd(open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0644));
-  if (!fd.valid()) return errno;
-  if (int err = writeAll(fd.get(), bytes)) return err;
-  if (noProtection && fremovexattr(fd.get(), kProtectionClassAttribute) != 0 && errno != ENODATA &&
-      errno != EOPNOTSUPP)
-    return errno;
+  if (int writeErr = platform::writeAll(fd.get(), bytes.data(), bytes.size())) return writeErr;
+  if (noProtection) {
+    if (int clearErr = platform::clearProtectionClass(fd.get())) return clearErr;
+  }
   if (close(fd.release()) != 0) return errno;
   return 0;
-}
-
-// Reads a regular file whole; a FIFO or a link put in place of one of our
-// files is refused rather than waited on or followed.
-int readSmallFile(const char* path, plist::Data* out) {
-  UniqueFd fd(open(path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-  if (!fd.valid()) return errno;
-  struct stat st;
-  if (fstat(fd.get(), &st) != 0) return errno;
-  if (S_ISDIR(st.st_mode)) return EISDIR;
-  if (!S_ISREG(st.st_mode)) return EINVAL;
-  if (st.st_size > kMaxPropertyListFileSize) return EFBIG;
-  out->resize(static_cast<size_t>(st.st_size));
-  size_t done = 0;
-  while (done < out->size()) {
-    ssize_t n = read(fd.get(), out->data() + done, out->size() - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) return errno;
-    if (n == 0) break;
-    done += static_cast<size_t>(n);
-  }
-  out->resize(done);
-  return 0;
-}
-
-int lstatError(const QRTURL& url) {
-  struct stat st;
-  return lstat(url.fileSystemRepresentation(), &st) == 0 ? 0 : errno;
-}
-
-QRTTraversalEntry::Kind kindOfFtsEntry(int info) {
-  switch (info) {
-    case FTS_D:
-      return QRTTraversalEntry::Kind::DirectoryPre;
-    case FTS_DP:
-      return QRTTraversalEntry::Kind::DirectoryPost;
-    case FTS_F:
-      return QRTTraversalEntry::Kind::File;
-    case FTS_SL:
-    case FTS_SLNONE:
-      return QRTTraversalEntry::Kind::Symlink;
-    default:
-      return QRTTraversalEntry::Kind::Other;
-  }
 }
 
 }  // namespace
@@ -748,9 +875,13 @@ bool QRTFileManager::removeItemAtURL(const QRTURL& url, QRTErrorRef* error) {
     QRTSetError(error, QRT_POSIX_ERROR(EFAULT, "nil url passed to -removeItemAtURL:error:"));
     return false;
   }
-  TreePruner pruner(url.fileSystemRepresentation());
-  int err = pruner.run();
-  if (err == 0 || err == ENOENT) err = pruner.firstError();
+  SafeParent parent;
+  int err = platform::safeOpenParent(url.path(), &parent);
+  if (err == 0) {
+    TreePruner pruner(parent.fd.get(), parent.name, url.path());
+    err = pruner.run();
+    if (err == 0 || err == ENOENT) err = pruner.firstError();
+  }
   if (err != 0 && err != ENOENT) {
     QRTSetError(error, QRT_POSIX_ERROR(err, "prunetree of %@ failed: %s", url, errorText(err)));
     return false;
@@ -761,32 +892,21 @@ bool QRTFileManager::removeItemAtURL(const QRTURL& url, QRTErrorRef* error) {
 bool QRTFileManager::createDirectoryAtURL(const QRTURL& url, bool withIntermediateDirectories, mode_t mode,
                                           uint32_t owner, int32_t protectionClass, QRTErrorRef* error) {
   const char* path = url.fileSystemRepresentation();
-  if (withIntermediateDirectories) {
-    int err = ensureDirectories(url.path(), mode);
-    if (err != 0 && err != EEXIST) {
+  UniqueFd fd;
+  const uid_t wanted = owner == 0 ? platform::kAnyOwner : owner;
+  if (int err = platform::safeMakeDirectory(url.path(), mode, withIntermediateDirectories, wanted, &fd)) {
+    if (withIntermediateDirectories)
       QRTSetError(error, QRT_POSIX_ERROR(err, "ensuredirs of %s failed: %s", path, errorText(err)));
-      return false;
-    }
-  } else if (mkdir(path, mode) != 0 && errno != EEXIST) {
-    int err = errno;
-    QRTSetError(error, QRT_POSIX_ERROR(err, "mkdir of %s failed: %s", path, errorText(err)));
+    else
+      QRTSetError(error, QRT_POSIX_ERROR(err, "mkdir of %s failed: %s", path, errorText(err)));
     return false;
   }
   if (protectionClass != -1) {
-    UniqueFd fd(open(path, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!fd.valid()) {
-      int err = errno;
-      QRTSetError(error, QRT_POSIX_ERROR(err, "opendir of %s failed: %s", path, errorText(err)));
-      return false;
-    }
-    if (int err = QRTSetProtectionClass(fd.get(), protectionClass)) {
+    if (int err = platform::setProtectionClass(fd.get(), protectionClass)) {
       QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to setclass(%d) on directory %s: %s", protectionClass, path,
                                          errorText(err)));
       return false;
     }
-  }
-  if (owner != 0 && chown(path, owner, owner) != 0) {
-    // Ignored: the directory is there and usable; callers that care check the owner.
   }
   return true;
 }
@@ -806,20 +926,39 @@ bool QRTFileManager::createDirectoryAtURL(const QRTURL& url, bool withIntermedia
   return createDirectoryAtURL(url, withIntermediateDirectories, mode, 0u, -1, error);
 }
 
-
 // Reports a failed look at a copy or move source; always false.
 static bool statFailed(const char* function, const QRTURL& src, int err, QRTErrorRef* error) {
   QRTSetError(error, QRTCreatePOSIXError(function, __LINE__, err, "stat of %@ failed: %s", src, errorText(err)));
   return false;
 }
 
+// The source's parent; with failIfSrcMissing false a missing source is
+// reported as *missing (and true).
+static bool openSource(const char* function, const QRTURL& src, bool failIfSrcMissing, SafeParent* parent,
+                       bool* missing, int* resolveError, QRTErrorRef* error) {
+  *missing = false;
+  *resolveError = platform::safeOpenParent(src.path(), parent);
+  if (failIfSrcMissing) return true;
+  int err = *resolveError;
+  struct stat st;
+  if (!err && fstatat(parent->fd.get(), parent->name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) err = errno;
+  if (err == ENOENT) *missing = true;
+  return err == 0 || err == ENOENT || statFailed(function, src, err, error);
+}
+
 bool QRTFileManager::_copyItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
                                     QRTErrorRef* error) {
-  if (!failIfSrcMissing) {
-    if (int err = lstatError(src)) return err == ENOENT || statFailed(__func__, src, err, error);
+  SafeParent from, to;
+  bool missing;
+  int err;
+  if (!openSource(__func__, src, failIfSrcMissing, &from, &missing, &err, error)) return false;
+  if (missing) return true;
+  if (!err) err = platform::safeOpenParent(toURL.path(), &to);
+  if (!err) {
+    TreeCloner cloner(false);
+    err = cloner.run(from.fd.get(), from.name.c_str(), to.fd.get(), to.name.c_str());
   }
-  TreeCloner cloner;
-  if (int err = cloner.run(src.fileSystemRepresentation(), toURL.fileSystemRepresentation())) {
+  if (err) {
     QRTSetError(error, QRT_POSIX_ERROR(err, "clonetree of %@ to %@ failed: %s", src, toURL, errorText(err)));
     return false;
   }
@@ -834,21 +973,64 @@ bool QRTFileManager::copyItemIfExistsAtURL(const QRTURL& src, const QRTURL& toUR
   return _copyItemAtURL(src, toURL, false, error);
 }
 
-bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
-                                    QRTErrorRef* error) {
-  if (!failIfSrcMissing) {
-    if (int err = lstatError(src)) return err == ENOENT || statFailed(__func__, src, err, error);
-  }
-  if (rename(src.fileSystemRepresentation(), toURL.fileSystemRepresentation()) == 0) return true;
-  int err = errno;
-  if (err != EXDEV) {
-    QRTSetError(error, QRT_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", src, toURL, errorText(err)));
+namespace {
+
+// Across file systems: a durable copy under a hidden name beside the
+// destination, renamed into place (so the destination never holds half a
+// copy, and a failed copy is removed), then the source goes.
+bool moveAcross(const QRTURL& src, const QRTURL& toURL, SafeParent& from, SafeParent& to, QRTErrorRef* error) {
+  const std::string temporary = hiddenSibling(to.name);
+  TreeCloner cloner(true);
+  int err = cloner.run(from.fd.get(), from.name.c_str(), to.fd.get(), temporary.c_str());
+  if (err) {
+    TreePruner(to.fd.get(), temporary, toURL.path()).run();
+    QRTSetError(error, QRTCreatePOSIXError("_moveItemAtURL", __LINE__, err, "clonetree of %@ to %@ failed: %s", src,
+                                           toURL, errorText(err)));
     return false;
   }
-  if (!_copyItemAtURL(src, toURL, true, error)) return false;
-  QRTErrorRef removeError;
-  if (!removeItemAtURL(src, &removeError)) {
-    QRTLog(kLogError, "Failed to remove source %@ : %s", src, errorText(removeError ? removeError->code() : 0));
+  if (renameat(to.fd.get(), temporary.c_str(), to.fd.get(), to.name.c_str()) != 0 ||
+      (err = platform::syncDirectory(to.fd.get())) != 0) {
+    if (!err) err = errno;
+    TreePruner(to.fd.get(), temporary, toURL.path()).run();
+    QRTSetError(error, QRTCreatePOSIXError("_moveItemAtURL", __LINE__, err, "rename of %@ to %@ failed: %s", src,
+                                           toURL, errorText(err)));
+    return false;
+  }
+  TreePruner pruner(from.fd.get(), from.name, src.path());
+  err = pruner.run();
+  if (err == 0 || err == ENOENT) err = pruner.firstError();
+  if (err == 0 || err == ENOENT) err = platform::syncDirectory(from.fd.get());
+  if (err != 0 && err != ENOENT) QRTLogAs(kLogError, "_moveItemAtURL", "Failed to remove source %@ : %s", src, errorText(err));
+  return true;
+}
+
+}  // namespace
+
+bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
+                                    QRTErrorRef* error) {
+  SafeParent from, to;
+  bool missing;
+  int err;
+  if (!openSource(__func__, src, failIfSrcMissing, &from, &missing, &err, error)) return false;
+  if (missing) return true;
+  if (!err) err = platform::safeOpenParent(toURL.path(), &to);
+  if (!err) {
+    if (renameat(from.fd.get(), from.name.c_str(), to.fd.get(), to.name.c_str()) != 0) {
+      err = errno;
+      if (err == EXDEV) return moveAcross(src, toURL, from, to, error);
+    } else {
+      // Both directories flushed before anyone hears of the move (once when
+      // they are one).
+      struct stat fromStat, toStat;
+      err = platform::syncDirectory(to.fd.get());
+      bool same = fstat(from.fd.get(), &fromStat) == 0 && fstat(to.fd.get(), &toStat) == 0 &&
+                  fromStat.st_dev == toStat.st_dev && fromStat.st_ino == toStat.st_ino;
+      if (!err && !same) err = platform::syncDirectory(from.fd.get());
+    }
+  }
+  if (err) {
+    QRTSetError(error, QRT_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", src, toURL, errorText(err)));
+    return false;
   }
   return true;
 }
@@ -865,15 +1047,18 @@ std::optional<QRTURL> QRTFileManager::createTemporaryDirectoryInDirectoryURL(con
                                                                              std::string_view withNamePrefix,
                                                                              QRTErrorRef* error) {
   if (error) *error = nullptr;
-  std::string name(withNamePrefix);
-  name += "XXXXXX";
-  std::string path = parent.URLByAppendingPathComponent(name, true).path();
-  if (!mkdtemp(path.data())) {
-    int err = errno;
-    QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to create temp dir at path %s : %s", path, errorText(err)));
-    return std::nullopt;
+  const std::string prefix(withNamePrefix);
+  UniqueFd directory;
+  int err = platform::safeOpen(parent.path(), O_RDONLY | O_DIRECTORY, &directory);
+  for (int attempt = 0; !err && attempt < 100; ++attempt) {
+    std::string name = prefix + randomSuffix(6);
+    if (mkdirat(directory.get(), name.c_str(), S_IRWXU) == 0) return parent.URLByAppendingPathComponent(name, true);
+    if (errno != EEXIST) err = errno;
   }
-  return QRTURL::fileURL(path, true);
+  if (!err) err = EEXIST;
+  std::string path = parent.URLByAppendingPathComponent(prefix + "XXXXXX", true).path();
+  QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to create temp dir at path %s : %s", path, errorText(err)));
+  return std::nullopt;
 }
 
 std::optional<QRTURL> QRTFileManager::createTemporaryDirectoryInDirectoryURL(const QRTURL& parent,
@@ -883,55 +1068,7 @@ std::optional<QRTURL> QRTFileManager::createTemporaryDirectoryInDirectoryURL(con
 
 bool QRTFileManager::_traverseDirectory(const QRTURL& root, QRTErrorRef* error,
                                         const QRTTraversalVisitor& withBlock) {
-  const char* path = root.fileSystemRepresentation();
-  char* roots[] = {const_cast<char*>(path), nullptr};
-  struct FtsCloser {
-    void operator()(FTS* fts) const { fts_close(fts); }
-  };
-  std::unique_ptr<FTS, FtsCloser> fts(fts_open(roots, FTS_PHYSICAL | FTS_NOCHDIR | FTS_XDEV, nullptr));
-  if (!fts) {
-    int err = errno;
-    QRTSetError(error, QRT_POSIX_ERROR(err, "fts_open failed for %s with error %s", path, errorText(err)));
-    return false;
-  }
-  bool stopped = false;
-  QRTErrorRef walkError;
-  for (;;) {
-    errno = 0;
-    FTSENT* ent = fts_read(fts.get());
-    if (!ent) {
-      if (errno != 0) {
-        stopped = true;
-        walkError = QRT_POSIX_ERROR(errno, "Error for path %s: %s", path, errorText(errno));
-      }
-      break;
-    }
-    if (ent->fts_info == FTS_ERR || ent->fts_info == FTS_NS) {
-      stopped = true;
-      walkError = QRT_POSIX_ERROR(ent->fts_errno, "Error for path %s: %s", path, errorText(ent->fts_errno));
-      break;
-    }
-    QRTTraversalEntry entry;
-    QRTErrorRef visitorError;
-    entry.path = ent->fts_path;
-    entry.level = ent->fts_level;
-    entry.kind = kindOfFtsEntry(ent->fts_info);
-    if (ent->fts_statp) entry.st = *ent->fts_statp;
-    entry.error = ent->fts_info == FTS_DNR ? ent->fts_errno : 0;
-    if (!withBlock(entry, &visitorError)) {
-      stopped = true;
-      walkError = std::move(visitorError);
-      break;
-    }
-    if (entry.skipDescendants && ent->fts_info == FTS_D) fts_set(fts.get(), ent, FTS_SKIP);
-  }
-  if (fts_close(fts.release()) != 0 && !walkError) {
-    int err = errno;
-    stopped = true;
-    walkError = QRT_POSIX_ERROR(err, "fts_close failed for %s with error %s", path, errorText(err));
-  }
-  if (stopped && walkError) QRTSetError(error, walkError);
-  return !stopped;
+  return TreeWalker(root, withBlock).run(error);
 }
 
 namespace {
@@ -939,33 +1076,31 @@ namespace {
 // Calls visit(name, isDirectory) for every visible entry of the directory.
 template <typename Visit>
 bool iterateDirectory(const QRTURL& url, QRTErrorRef* error, Visit visit) {
-  const char* path = url.fileSystemRepresentation();
-  UniqueDir dir(opendir(path));
-  if (!dir) {
-    int err = errno;
-    if (err != ENOENT) QRTLogAs(kLogError, "_IterateDirectory", "opendir of %s failed: %s", path, errorText(err));
+  UniqueFd fd;
+  int err = platform::safeOpen(url.path(), O_RDONLY | O_DIRECTORY, &fd);
+  if (err) {
+    if (err != ENOENT)
+      QRTLogAs(kLogError, "_IterateDirectory", "opendir of %s failed: %s", url.fileSystemRepresentation(),
+               errorText(err));
     QRTSetError(error, QRT_POSIX_ERROR(err, "_IterateDirectory for %@ returned %s", url, errorText(err)));
     return false;
   }
+  auto batch = std::make_unique<platform::DirectoryBatch>();
   for (;;) {
-    errno = 0;
-    struct dirent* entry = readdir(dir.get());
-    if (!entry) break;
-    if (entry->d_name[0] == '.') continue;
-    unsigned char type = entry->d_type;
-    if (type == DT_UNKNOWN) {
-      struct stat st;
-      std::string child = std::string(path) + "/" + entry->d_name;
-      if (stat(child.c_str(), &st) == 0) type = typeOfMode(st.st_mode);
+    ssize_t n = platform::readDirectoryBatch(fd.get(), batch.get());
+    if (n == 0) return true;
+    if (n < 0) {
+      err = static_cast<int>(-n);
+      QRTSetError(error, QRT_POSIX_ERROR(err, "_IterateDirectory for %@ returned %s", url, errorText(err)));
+      return false;
     }
-    visit(entry->d_name, type == DT_DIR);
+    platform::forEachEntry(*batch, static_cast<size_t>(n), [&](uint64_t, unsigned char type, const char* name) {
+      if (!name || name[0] == '.') return;
+      struct stat st;
+      if (type == DT_UNKNOWN && fstatat(fd.get(), name, &st, AT_SYMLINK_NOFOLLOW) == 0) type = typeOfMode(st.st_mode);
+      visit(name, type == DT_DIR);
+    });
   }
-  if (errno != 0) {
-    int err = errno;
-    QRTSetError(error, QRT_POSIX_ERROR(err, "_IterateDirectory for %@ returned %s", url, errorText(err)));
-    return false;
-  }
-  return true;
 }
 
 }  // namespace
@@ -982,16 +1117,16 @@ std::optional<std::vector<QRTURL>> QRTFileManager::urlsForItemsInDirectoryAtURL(
 
 bool QRTFileManager::itemExistsAtURL(const QRTURL& url) {
   struct stat st;
-  if (lstat(url.fileSystemRepresentation(), &st) == 0) return true;
-  int err = errno;
+  int err = platform::safeStat(url.path(), &st);
+  if (err == 0) return true;
   if (err != ENOENT) QRTLog(kLogError, "Failed to determine if %@ exists: %s", url, errorText(err));
   return false;
 }
 
 bool QRTFileManager::itemDoesNotExistAtURL(const QRTURL& url) {
   struct stat st;
-  if (lstat(url.fileSystemRepresentation(), &st) == 0) return false;
-  int err = errno;
+  int err = platform::safeStat(url.path(), &st);
+  if (err == 0) return false;
   if (err == ENOENT) return true;
   QRTLog(kLogError, "Failed to determine if %@ exists: %s", url, errorText(err));
   return false;
@@ -1008,10 +1143,15 @@ bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTW
   } catch (const std::bad_alloc&) {
     err = ENOMEM;
   }
+  SafeParent parent;
+  if (!err) err = platform::safeOpenParent(url.path(), &parent);
   if (!err) {
+    // A fresh temporary carries no protection class, so an atomic write
+    // needs nothing more for QRTWriteFileProtectionNone.
     err = (withOptions & QRTWriteAtomic)
-              ? writeAtomically(url.path(), bytes)
-              : writeInPlace(url.path(), bytes, (withOptions & QRTWriteFileProtectionNone) != 0);
+              ? platform::replaceFileAt(parent.fd.get(), parent.name, bytes.data(), bytes.size(), 0644)
+              : writeInPlace(parent.fd.get(), parent.name.c_str(), bytes,
+                             (withOptions & QRTWriteFileProtectionNone) != 0);
   }
   if (err) {
     QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to write property list to %@: %s", url, errorText(err)));
@@ -1021,13 +1161,14 @@ bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTW
 }
 
 std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& url, QRTErrorRef* error) {
-  plist::Data bytes;
-  if (int err = readSmallFile(url.fileSystemRepresentation(), &bytes)) {
+  std::string bytes;
+  if (int err = platform::safeReadFile(url.path(), &bytes, kMaxPropertyListFileSize)) {
     QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to read property list at %@: %s", url, errorText(err)));
     return std::nullopt;
   }
   std::string reason;
-  std::optional<plist::Value> value = plist::parse(bytes.data(), bytes.size(), &reason);
+  std::optional<plist::Value> value =
+      plist::parse(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size(), &reason);
   if (!value) {
     QRTSetError(error, QRTCreateError(__func__, __LINE__, QRTPropertyListErrorDomain, QRTPropertyListReadCorruptError,
                                       nullptr, nullptr, false, "Failed to parse property list at %@: %s", url,
@@ -1035,8 +1176,8 @@ std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& u
     return std::nullopt;
   }
   if (!value->isDictionary()) {
-    QRTSetError(error, QRTCreateError(__func__, __LINE__, QRTPropertyListErrorDomain, QRTFormattingError, nullptr, nullptr,
-                                      false, "Property list at %@ is not a dictionary", url));
+    QRTSetError(error, QRTCreateError(__func__, __LINE__, QRTPropertyListErrorDomain, QRTFormattingError, nullptr,
+                                      nullptr, false, "Property list at %@ is not a dictionary", url));
     return std::nullopt;
   }
   return std::move(value->dictionary());
@@ -1060,33 +1201,6 @@ std::string stringWithFileSystemRepresentation(const char* bytes) {
   return bytes ? std::string(bytes) : std::string();
 }
 
-// ---------------------------------------------------------------------------
+int QRTGetProtectionClass(int fd, int32_t* cls) { return platform::getProtectionClass(fd, cls); }
 
-int QRTGetProtectionClass(int fd, int32_t* cls) {
-  if (!cls) return EFAULT;
-  uint8_t b[4];
-  ssize_t n = fgetxattr(fd, kProtectionClassAttribute, b, sizeof b);
-  if (n < 0) {
-    if (errno != ENODATA) return errno;
-    *cls = 0;
-    return 0;
-  }
-  if (n != sizeof b) return EINVAL;
-  *cls = static_cast<int32_t>(static_cast<uint32_t>(b[0]) | static_cast<uint32_t>(b[1]) << 8 |
-                              static_cast<uint32_t>(b[2]) << 16 | static_cast<uint32_t>(b[3]) << 24);
-  return 0;
-}
-
-int QRTSetProtectionClass(int fd, int32_t cls) {
-  if (platform::deviceLockState() == 1) {
-    if (cls == 1) return EPERM;
-    int32_t current = 0;
-    if (int err = QRTGetProtectionClass(fd, &current)) return err;
-    if (current == 1) return EPERM;
-  }
-  const uint32_t v = static_cast<uint32_t>(cls);
-  const uint8_t b[4] = {static_cast<uint8_t>(v), static_cast<uint8_t>(v >> 8), static_cast<uint8_t>(v >> 16),
-                        static_cast<uint8_t>(v >> 24)};
-  if (fsetxattr(fd, kProtectionClassAttribute, b, sizeof b, 0) != 0) return errno;
-  return 0;
-}
+int QRTSetProtectionClass(int fd, int32_t cls) { return platform::setProtectionClass(fd, cls); }

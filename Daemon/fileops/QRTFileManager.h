@@ -1,7 +1,9 @@
 // The one door through which the daemon changes the file system. Each operation
 // has a single meaning (already there, already gone count as success), reports
-// failures as POSIX-domain errors with fixed messages and never follows
-// symbolic links inside the trees it walks.
+// failures as POSIX-domain errors with fixed messages and never follows a
+// symbolic link: every path is resolved from the device root's descriptor
+// (platform/SafePath.h), so a link at any component fails with ELOOP and a
+// path outside the device root or with a ".." component with EXDEV.
 #pragma once
 
 #include <sys/stat.h>
@@ -27,11 +29,18 @@ struct QRTTraversalEntry {
   Kind kind = Kind::Other;
   struct stat st {};
   int error = 0;  // errno of a directory that could not be read (kind Other)
+  // The directory that holds the entry and its name there: act on the entry
+  // only through these (platform::openItemAt), never through path, and check
+  // that what is opened is still st.
+  int parentFd = -1;
+  const char* name = nullptr;
   // Set by the visitor on a DirectoryPre entry to pass over its contents.
   bool skipDescendants = false;
 };
 
 // Returns false to stop the walk, after storing an error in the slot if it has one.
+// Paths are resolved from the device root (platform/SafePath.h): a symbolic
+// link at any component is refused, never followed.
 using QRTTraversalVisitor = std::function<bool(QRTTraversalEntry& entry, QRTErrorRef* error)>;
 
 class QRTFileManager {
@@ -40,6 +49,14 @@ class QRTFileManager {
 
   bool removeItemAtURL(const QRTURL& url, QRTErrorRef* error);
 
+  // Creates the directory (with withIntermediateDirectories every missing
+  // level, one at a time, each opened without following a link before the
+  // next is made in it) with mode, then sets the class on the directory's
+  // descriptor. An existing item is accepted only if it is a real directory
+  // and, when an owner is asked for, owned by that owner or by root (a root
+  // directory is then given to owner:owner); otherwise the call fails (ELOOP,
+  // ENOTDIR, EPERM) with a log line. The mode is applied only by creation;
+  // levels made on the way stay root's. Not flushed: publish with a move.
   // owner 0 leaves the owner alone, protectionClass -1 the class. Of the two
   // overloads that take only one of them, an int argument picks the class
   // form and a uint32_t the owner form.
@@ -55,16 +72,27 @@ class QRTFileManager {
   bool copyItemAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
   bool copyItemIfExistsAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
 
+  // renameat between the two safely opened parent directories, both of which
+  // are flushed before true is returned: true means the move is durable. A
+  // false after the rename itself succeeded (a failed flush) leaves the item
+  // at the destination. Across file systems: a flushed copy under a hidden
+  // name beside the destination, renamed into place (a failed copy is
+  // removed and the source left whole), then the source removed (a failure
+  // there is only logged).
   bool _moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing, QRTErrorRef* error);
   bool moveItemAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
   bool moveItemIfExistsAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
 
+  // mkdirat of prefix plus six random letters and digits, mode 0700 (owned
+  // by root), relative to the safely opened parent; a name taken is retried.
   std::optional<QRTURL> createTemporaryDirectoryInDirectoryURL(const QRTURL& parent, std::string_view withNamePrefix,
                                                                QRTErrorRef* error);
   std::optional<QRTURL> createTemporaryDirectoryInDirectoryURL(const QRTURL& parent, QRTErrorRef* error);
 
-  // Physical walk on the root's device; directories are seen before and after
-  // their contents.
+  // Physical walk on the root's device through descriptors; directories are
+  // seen before and after their contents. An entry that vanishes meanwhile is
+  // passed over; a directory swapped since the listing is an Other entry with
+  // error ESTALE and is not entered.
   bool _traverseDirectory(const QRTURL& root, QRTErrorRef* error, const QRTTraversalVisitor& withBlock);
 
   // Items of the directory in directory order, hidden names left out.
@@ -98,7 +126,8 @@ class QRTFileManager {
   // Every container directory of a system class directory.
   bool standardizeAllSystemContainerACLsAtURL(const QRTURL& url, QRTErrorRef* error);
   // Owner and group as given, mode 0755 or 0644; symbolic links are changed
-  // themselves, never their targets.
+  // themselves, never their targets. Both walks leave alone a regular file
+  // with more than one link that is not already the target owner's.
   bool standardizeOwnershipAtURL(const QRTURL& url, uid_t toUID, gid_t GID, QRTErrorRef* error);
 
   // Disk usage and protection classes (QRTFileManagerUsage.cpp)
@@ -130,7 +159,12 @@ constexpr QRTWriteOptions operator|(QRTWriteOptions a, QRTWriteOptions b) {
   return static_cast<QRTWriteOptions>(static_cast<uint32_t>(a) | static_cast<uint32_t>(b));
 }
 
-// Writes the dictionary as a binary property list.
+// Writes the dictionary as a binary property list. Atomic: a hidden
+// temporary (mode 0644, exclusive, no link followed) in the safely opened
+// directory, written, fsync'd, renameat over the name, the directory fsync'd;
+// a link or hard link at the name is replaced, never written through, and
+// the new file has no protection class. In place: only a new file or a
+// regular file with one link is written (ELOOP, EINVAL, EMLINK otherwise).
 bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTWriteOptions withOptions,
                     QRTErrorRef* error);
 // Reads a property list of any supported format whose top level is a

@@ -4,11 +4,8 @@
 // the same entries so that new items inherit them.
 
 #include <acl/libacl.h>
-#include <fcntl.h>
-#include <linux/openat2.h>
 #include <sys/acl.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -19,7 +16,9 @@
 #include <utility>
 
 #include "Daemon/fileops/QRTFileManager.h"
+#include "platform/FileIO.h"
 #include "platform/Log.h"
+#include "platform/SafePath.h"
 #include "platform/UserDatabase.h"
 
 using platform::kLogError;
@@ -172,76 +171,28 @@ int adoptModeBits(UniqueAcl& list, mode_t mode) {
   return acl_calc_mask(&slot.raw) == 0 ? 0 : errno;
 }
 
-// An O_PATH handle on one item.
-class ItemHandle {
- public:
-  explicit ItemHandle(int fd = -1) : fd_(fd) {}
-  ItemHandle(ItemHandle&& o) noexcept : fd_(std::exchange(o.fd_, -1)) {}
-  ItemHandle(const ItemHandle&) = delete;
-  ItemHandle& operator=(const ItemHandle&) = delete;
-  ~ItemHandle() {
-    if (fd_ >= 0) close(fd_);
-  }
-  bool valid() const { return fd_ >= 0; }
-  int fd() const { return fd_; }
-  // Path-based calls (ACLs, chmod) reach the item itself through it.
-  std::string procPath() const { return "/proc/self/fd/" + std::to_string(fd_); }
+// The entry the walk saw, pinned; ESTALE when its name now holds another item.
+int openEntry(const QRTTraversalEntry& entry, platform::Item* item) {
+  if (int err = platform::openItemAt(entry.parentFd, entry.name, item)) return err;
+  if (item->st.st_dev != entry.st.st_dev || item->st.st_ino != entry.st.st_ino) return ESTALE;
+  return 0;
+}
 
- private:
-  int fd_;
-};
-
-// Opens the items of a walk without following a symbolic link at any
-// component below the root, so that an entry swapped for a link during the
-// walk cannot redirect a change to something outside the tree.
-class TreeItems {
- public:
-  explicit TreeItems(const QRTURL& root)
-      : rootPath_(root.path()), rootFd_(open(rootPath_.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC)),
-        rootError_(rootFd_.valid() ? 0 : errno) {}
-
-  // The root item itself (a link at the root is the link, not its target).
-  ItemHandle openRoot() const { return ItemHandle(open(rootPath_.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC)); }
-
-  // On failure the handle is invalid and errno tells why.
-  ItemHandle openEntry(const QRTTraversalEntry& entry) const {
-    if (entry.level == 0) return openRoot();
-    if (!rootFd_.valid()) {
-      errno = rootError_;
-      return ItemHandle();
-    }
-    const char* relative = relativePath(entry.path);
-    if (!relative) {
-      errno = EINVAL;
-      return ItemHandle();
-    }
-    struct open_how how {};
-    how.flags = O_PATH | O_NOFOLLOW | O_CLOEXEC;
-    how.resolve = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS;
-    long fd = syscall(SYS_openat2, rootFd_.fd(), relative, &how, sizeof how);
-    // Kernels without openat2 still get a final component that is not followed.
-    if (fd < 0 && errno == ENOSYS) fd = openat(rootFd_.fd(), relative, O_PATH | O_NOFOLLOW | O_CLOEXEC);
-    return ItemHandle(static_cast<int>(fd));
-  }
-
- private:
-  const char* relativePath(const char* path) const {
-    if (strncmp(path, rootPath_.c_str(), rootPath_.size()) != 0) return nullptr;
-    path += rootPath_.size();
-    while (*path == '/') ++path;
-    return *path ? path : nullptr;
-  }
-
-  std::string rootPath_;
-  ItemHandle rootFd_;
-  int rootError_;
-};
+// A second name of a file someone else owns may lead outside the tree: such
+// a file keeps its owner, mode and list.
+bool foreignHardLink(const struct stat& st, uid_t owner, const char* path, const char* function) {
+  if (!S_ISREG(st.st_mode) || st.st_nlink <= 1 || st.st_uid == owner) return false;
+  QRTLogAs(kLogError, function, "Leaving %s alone: a file with %u links owned by %u", path,
+           static_cast<unsigned>(st.st_nlink), static_cast<unsigned>(st.st_uid));
+  return true;
+}
 
 // 0 or an errno value. keepModeOf, when given, supplies the owner, group and
-// other rights in place of the list's empty ones.
-int applyList(const ItemHandle& item, const QRTFileManager::SystemContainerACL& list,
+// other rights in place of the list's empty ones. Set through the item's own
+// descriptor entry, which reaches its inode without opening it.
+int applyList(const platform::Item& item, const QRTFileManager::SystemContainerACL& list,
               const struct stat* keepModeOf) {
-  std::string path = item.procPath();
+  std::string path = platform::itemProcPath(item);
   acl_t access = list.access.get();
   UniqueAcl merged;
   if (keepModeOf) {
@@ -250,7 +201,9 @@ int applyList(const ItemHandle& item, const QRTFileManager::SystemContainerACL& 
     if (int err = adoptModeBits(merged, keepModeOf->st_mode)) return err;
     access = merged.get();
   }
-  if (list.inherited && acl_set_file(path.c_str(), ACL_TYPE_DEFAULT, list.inherited.get()) != 0) return errno;
+  if (list.inherited && S_ISDIR(item.st.st_mode) &&
+      acl_set_file(path.c_str(), ACL_TYPE_DEFAULT, list.inherited.get()) != 0)
+    return errno;
   if (acl_set_file(path.c_str(), ACL_TYPE_ACCESS, access) != 0) return errno;
   return 0;
 }
@@ -262,21 +215,22 @@ struct StampLists {
 };
 
 // One entry of a stamping walk; failures are logged and the walk goes on.
-void stampItem(const TreeItems& items, const QRTTraversalEntry& entry, const StampLists& lists,
-               bool isContainerRoot) {
-  ItemHandle item = items.openEntry(entry);
-  struct stat st;
-  if (!item.valid() || fstat(item.fd(), &st) != 0) {
-    QRTLogAs(kLogError, "standardizeACLsAtURL", "Failed to set ACL on dir %s: %s", entry.path, errorText(errno));
+void stampItem(const QRTTraversalEntry& entry, const StampLists& lists, bool isContainerRoot) {
+  platform::Item item;
+  if (int err = openEntry(entry, &item)) {
+    QRTLogAs(kLogError, "standardizeACLsAtURL", "Failed to set ACL on dir %s: %s", entry.path, errorText(err));
     return;
   }
+  const struct stat& st = item.st;
   // Links carry no ACL, and their targets may lie outside the tree.
   if (S_ISLNK(st.st_mode)) return;
+  if (!isContainerRoot && foreignHardLink(st, kNobodyId, entry.path, "standardizeACLsAtURL")) return;
   bool isDirectory = S_ISDIR(st.st_mode);
-  std::string path = item.procPath();
   // chmod rewrites an access ACL, so the mode goes before the list is set.
-  if (!isContainerRoot && chmod(path.c_str(), 0) != 0)
-    QRTLogAs(kLogError, "standardizeACLsAtURL", "Could not chmod %s: %s", entry.path, errorText(errno));
+  if (!isContainerRoot) {
+    if (int err = platform::chmodItem(item, 0))
+      QRTLogAs(kLogError, "standardizeACLsAtURL", "Could not chmod %s: %s", entry.path, errorText(err));
+  }
   const auto& list = isDirectory ? (isContainerRoot ? lists.topLevel : lists.directory) : lists.file;
   if (int err = applyList(item, *list, isContainerRoot ? &st : nullptr)) {
     if (isDirectory && isContainerRoot)
@@ -285,8 +239,10 @@ void stampItem(const TreeItems& items, const QRTTraversalEntry& entry, const Sta
     else
       QRTLogAs(kLogError, "standardizeACLsAtURL", "Failed to set ACL on dir %s: %s", entry.path, errorText(err));
   }
-  if (!isContainerRoot && fchownat(item.fd(), "", kNobodyId, kNobodyId, AT_EMPTY_PATH) != 0)
-    QRTLogAs(kLogError, "standardizeACLsAtURL", "Could not chown %s: %s", entry.path, errorText(errno));
+  if (!isContainerRoot) {
+    if (int err = platform::chownItem(item, kNobodyId, kNobodyId))
+      QRTLogAs(kLogError, "standardizeACLsAtURL", "Could not chown %s: %s", entry.path, errorText(err));
+  }
 }
 
 mode_t ownershipMode(mode_t mode) {
@@ -294,15 +250,16 @@ mode_t ownershipMode(mode_t mode) {
 }
 
 // Sets owner and mode of one item; changeOwner decides whether chown runs.
-void resetOwnership(const ItemHandle& item, const struct stat& st, bool changeOwner, uid_t uid, gid_t gid,
-                    const char* displayPath) {
-  if (changeOwner && fchownat(item.fd(), "", uid, gid, AT_EMPTY_PATH) != 0)
-    QRTLogAs(kLogError, "standardizeOwnershipAtURL", "Could not chown %s: %s", displayPath, errorText(errno));
+void resetOwnership(const platform::Item& item, bool changeOwner, uid_t uid, gid_t gid, const char* displayPath) {
+  if (foreignHardLink(item.st, uid, displayPath, "standardizeOwnershipAtURL")) return;
+  if (changeOwner) {
+    if (int err = platform::chownItem(item, uid, gid))
+      QRTLogAs(kLogError, "standardizeOwnershipAtURL", "Could not chown %s: %s", displayPath, errorText(err));
+  }
   // A link's own mode means nothing on Linux and cannot be changed.
-  if (S_ISLNK(st.st_mode)) return;
-  std::string path = item.procPath();
-  if (chmod(path.c_str(), ownershipMode(st.st_mode)) != 0)
-    QRTLogAs(kLogError, "standardizeOwnershipAtURL", "Could not chmod %s: %s", displayPath, errorText(errno));
+  if (S_ISLNK(item.st.st_mode)) return;
+  if (int err = platform::chmodItem(item, ownershipMode(item.st.st_mode)))
+    QRTLogAs(kLogError, "standardizeOwnershipAtURL", "Could not chmod %s: %s", displayPath, errorText(err));
 }
 
 }  // namespace
@@ -360,14 +317,10 @@ bool QRTFileManager::setTopLevelSystemContainerACLAtURL(const QRTURL& url, QRTEr
   if (!list) {
     err = EINVAL;
   } else {
-    ItemHandle item(open(url.fileSystemRepresentation(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-    struct stat st;
-    if (!item.valid() || fstat(item.fd(), &st) != 0)
-      err = errno;
-    else if (S_ISLNK(st.st_mode))
-      err = ELOOP;
-    else
-      err = applyList(item, *list, &st);
+    platform::Item item;
+    err = platform::safeOpenItem(url.path(), &item);
+    if (!err && S_ISLNK(item.st.st_mode)) err = ELOOP;
+    if (!err) err = applyList(item, *list, &item.st);
   }
   if (err == 0) return true;
   QRTSetError(error, QRT_ERROR(QRTErrorACLFailed, listError, false, "Failed to set ACL on %@: %s", url,
@@ -381,10 +334,9 @@ bool QRTFileManager::standardizeACLsAtURL(const QRTURL& url, bool isSystemContai
       !(lists.directory = _CopySystemContainerACLWithNumACEs(1, true, false, error)) ||
       !(lists.file = _CopySystemContainerACLWithNumACEs(1, false, false, error)))
     return false;
-  TreeItems items(url);
   return _traverseDirectory(url, error, [&](QRTTraversalEntry& entry, QRTErrorRef*) {
     if (entry.kind != QRTTraversalEntry::Kind::DirectoryPost && !isMetadataPath(entry.path))
-      stampItem(items, entry, lists, isSystemContainer && entry.level == 0);
+      stampItem(entry, lists, isSystemContainer && entry.level == 0);
     return true;
   });
 }
@@ -418,26 +370,22 @@ bool QRTFileManager::standardizeAllSystemContainerACLsAtURL(const QRTURL& url, Q
 }
 
 bool QRTFileManager::standardizeOwnershipAtURL(const QRTURL& url, uid_t toUID, gid_t GID, QRTErrorRef* error) {
-  TreeItems items(url);
   bool walked = _traverseDirectory(url, error, [&](QRTTraversalEntry& entry, QRTErrorRef*) {
     if (entry.kind == QRTTraversalEntry::Kind::DirectoryPost || isMetadataPath(entry.path)) return true;
-    ItemHandle item = items.openEntry(entry);
-    struct stat st;
-    if (!item.valid() || fstat(item.fd(), &st) != 0) {
-      QRTLogAs(kLogError, "standardizeOwnershipAtURL", "Could not chown %s: %s", entry.path, errorText(errno));
+    platform::Item item;
+    if (int err = openEntry(entry, &item)) {
+      QRTLogAs(kLogError, "standardizeOwnershipAtURL", "Could not chown %s: %s", entry.path, errorText(err));
       return true;
     }
-    resetOwnership(item, st, st.st_uid != toUID || st.st_gid != GID, toUID, GID, entry.path);
+    resetOwnership(item, item.st.st_uid != toUID || item.st.st_gid != GID, toUID, GID, entry.path);
     return true;
   });
   // The root once more, in case the walk could not reach it.
-  ItemHandle root = items.openRoot();
-  struct stat st;
-  if (!root.valid() || fstat(root.fd(), &st) != 0) {
-    int err = errno;
+  platform::Item root;
+  if (int err = platform::safeOpenItem(url.path(), &root)) {
     QRTSetError(error, QRT_POSIX_ERROR(err, "Could not stat %s: %s", url.fileSystemRepresentation(), errorText(err)));
     return false;
   }
-  resetOwnership(root, st, st.st_uid != toUID, toUID, GID, url.fileSystemRepresentation());
+  resetOwnership(root, root.st.st_uid != toUID, toUID, GID, url.fileSystemRepresentation());
   return walked;
 }

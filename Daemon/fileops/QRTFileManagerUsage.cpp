@@ -2,9 +2,8 @@
 
 #include <dirent.h>
 #include <fcntl.h>
-#include <fts.h>
 #include <sys/stat.h>
-#include <sys/sysmacros.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -23,45 +22,22 @@
 #include <utility>
 #include <vector>
 
+#include "platform/FileIO.h"
 #include "platform/Log.h"
+#include "platform/SafePath.h"
 
 using platform::kLogDebug;
 using platform::kLogError;
 
 namespace {
 
-constexpr size_t kBulkReadSize = 32768;
-constexpr unsigned kEntryAttributes = STATX_TYPE | STATX_BLOCKS | STATX_NLINK | STATX_INO;
 // A second thread costs about as much as this many entries; smaller trees
 // are walked by the calling thread alone.
 constexpr uint64_t kEntriesBeforeHelper = 256;
 
 const char* errorText(int err) { return strerror(err); }
 
-class ScopedFd {
- public:
-  explicit ScopedFd(int fd) : fd_(fd) {}
-  ScopedFd(const ScopedFd&) = delete;
-  ScopedFd& operator=(const ScopedFd&) = delete;
-  ~ScopedFd() {
-    if (fd_ >= 0) close(fd_);
-  }
-  int get() const { return fd_; }
-  bool valid() const { return fd_ >= 0; }
-
- private:
-  int fd_;
-};
-
-// The record getdents64 fills in; glibc's struct dirent may differ in layout.
-struct KernelDirent {
-  uint64_t d_ino;
-  int64_t d_off;
-  unsigned short d_reclen;
-  unsigned char d_type;
-  char d_name[1];
-};
-constexpr size_t kDirentHeaderSize = offsetof(KernelDirent, d_name);
+using platform::UniqueFd;
 
 struct FileId {
   uint64_t device;
@@ -81,31 +57,35 @@ class DiskUsageWalk;
 class DirectoryReader {
  public:
   explicit DirectoryReader(DiskUsageWalk& walk) : walk_(walk) {}
-  void measureDirectory(const std::string& path);
+  // relative: below the walk's root ("." for the root itself).
+  void measureDirectory(const std::string& relative);
   std::vector<std::string>& children() { return children_; }
   uint64_t total() const { return total_; }
   uint64_t entriesSeen() const { return entriesSeen_; }
 
  private:
-  void visitBatch(int dirfd, const std::string& path, size_t length, uint64_t& index);
-  void visitEntry(int dirfd, const std::string& path, uint64_t index, unsigned char type, const char* name);
-  void queueDirectory(const std::string& path, uint64_t index, const char* name);
-  void countFile(const struct statx& attributes, const std::string& path, const char* name);
+  void visitEntry(int dirfd, const std::string& relative, uint64_t index, unsigned char type, const char* name);
+  void queueDirectory(const std::string& relative, uint64_t index, const char* name);
+  void countFile(const platform::EntryAttributes& attributes, const std::string& relative, const char* name);
+  std::string pathOf(const std::string& relative) const;
 
   DiskUsageWalk& walk_;
-  std::unique_ptr<uint64_t[]> buffer_{new uint64_t[kBulkReadSize / sizeof(uint64_t)]};
+  std::unique_ptr<platform::DirectoryBatch> batch_ = std::make_unique<platform::DirectoryBatch>();
   std::vector<std::string> children_;
   uint64_t total_ = 0;
   uint64_t entriesSeen_ = 0;
 };
 
-// One measurement: breadth first over a queue of directory paths, so that
-// depth costs no stack. The walk is bound by one system call per entry, not
+// One measurement: breadth first over a queue of directories (relative to
+// the walk's root, each opened beneath it without following a link or
+// crossing a mount), so that depth costs no stack. The walk is bound by one system call per entry, not
 // by the disk, so in a larger tree a second thread takes part once two
 // directories wait.
 class DiskUsageWalk {
  public:
-  explicit DiskUsageWalk(std::string root) { queue_.push_back(std::move(root)); }
+  DiskUsageWalk(int rootFd, std::string rootPath) : rootFd_(rootFd), rootPath_(std::move(rootPath)) {
+    queue_.push_back(".");
+  }
   ~DiskUsageWalk() {
     if (helper_.joinable()) helper_.join();
   }
@@ -113,6 +93,8 @@ class DiskUsageWalk {
   uint64_t run();
   // True the first time a multiply-linked file is offered.
   bool firstSighting(const FileId& id);
+  int rootFd() const { return rootFd_; }
+  const std::string& rootPath() const { return rootPath_; }
 
  private:
   void work(bool mayStartHelper);
@@ -121,6 +103,8 @@ class DiskUsageWalk {
   size_t finishDirectory(std::vector<std::string>& children);
   void startHelper();
 
+  const int rootFd_;
+  const std::string rootPath_;
   bool helperConsidered_ = false;  // by the calling thread, once
   std::mutex mutex_;
   std::condition_variable changed_;
@@ -194,119 +178,88 @@ void DiskUsageWalk::startHelper() {
   }
 }
 
-void DirectoryReader::measureDirectory(const std::string& path) {
-  ScopedFd fd(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-  if (!fd.valid()) {
-    QRTLogAs(kLogError, "diskUsageForURL", "Failed to open directory %@ : %s", path, errorText(errno));
+std::string DirectoryReader::pathOf(const std::string& relative) const {
+  return relative == "." ? walk_.rootPath() : walk_.rootPath() + "/" + relative;
+}
+
+void DirectoryReader::measureDirectory(const std::string& relative) {
+  UniqueFd fd;
+  if (int err = platform::openBeneath(walk_.rootFd(), relative.c_str(), O_RDONLY | O_DIRECTORY, &fd, true)) {
+    QRTLogAs(kLogError, "diskUsageForURL", "Failed to open directory %@ : %s", pathOf(relative), errorText(err));
     return;
   }
   uint64_t index = 0;
   for (;;) {
-    ssize_t length = getdents64(fd.get(), buffer_.get(), kBulkReadSize);
-    if (length < 0 && errno == EINTR) continue;
+    ssize_t length = platform::readDirectoryBatch(fd.get(), batch_.get());
     if (length < 0) {
       QRTLogAs(kLogError, "diskUsageForURL", "bulkdirread on entry %llu in %@ returned error %s",
-               static_cast<unsigned long long>(index), path, errorText(errno));
+               static_cast<unsigned long long>(index), pathOf(relative), errorText(static_cast<int>(-length)));
       return;
     }
     if (length == 0) return;
-    visitBatch(fd.get(), path, static_cast<size_t>(length), index);
+    platform::forEachEntry(*batch_, static_cast<size_t>(length), [&](uint64_t, unsigned char type, const char* name) {
+      ++entriesSeen_;
+      visitEntry(fd.get(), relative, index++, type, name);
+    });
   }
 }
 
-void DirectoryReader::visitBatch(int dirfd, const std::string& path, size_t length, uint64_t& index) {
-  const char* bytes = reinterpret_cast<const char*>(buffer_.get());
-  for (size_t offset = 0; offset + kDirentHeaderSize <= length;) {
-    const auto* entry = reinterpret_cast<const KernelDirent*>(bytes + offset);
-    const size_t recordLength = entry->d_reclen;
-    if (recordLength <= kDirentHeaderSize || recordLength > length - offset) return;
-    offset += recordLength;
-    const char* name = entry->d_name;
-    const size_t nameRoom = recordLength - kDirentHeaderSize;
-    const size_t nameLength = strnlen(name, nameRoom);
-    if (name[0] == '.' && (nameLength == 1 || (nameLength == 2 && name[1] == '.'))) continue;
-    ++entriesSeen_;
-    // A name that fills its record unterminated is no name at all.
-    visitEntry(dirfd, path, index++, entry->d_type, nameLength < nameRoom && nameLength > 0 ? name : nullptr);
-  }
-}
-
-void DirectoryReader::visitEntry(int dirfd, const std::string& path, uint64_t index, unsigned char type,
+void DirectoryReader::visitEntry(int dirfd, const std::string& relative, uint64_t index, unsigned char type,
                                  const char* name) {
   if (type == DT_DIR) {
-    queueDirectory(path, index, name);
+    queueDirectory(relative, index, name);
     return;
   }
-  struct statx attributes {};
-  int err = name ? 0 : EINVAL;
-  if (!err && statx(dirfd, name, AT_SYMLINK_NOFOLLOW | AT_STATX_DONT_SYNC, kEntryAttributes, &attributes) != 0) {
-    err = errno;
-  }
+  platform::EntryAttributes attributes;
+  int err = name ? platform::entryAttributesAt(dirfd, name, &attributes) : EINVAL;
   if (err) {
     QRTLogAs(kLogError, "diskUsageForURL", "Got error %s while processing entry %llu in %@", errorText(err),
-             static_cast<unsigned long long>(index), path);
+             static_cast<unsigned long long>(index), pathOf(relative));
     return;
   }
-  if (type == DT_UNKNOWN && (attributes.stx_mask & STATX_TYPE) && S_ISDIR(attributes.stx_mode)) {
-    queueDirectory(path, index, name);
+  if (type == DT_UNKNOWN && attributes.hasType && S_ISDIR(attributes.mode)) {
+    queueDirectory(relative, index, name);
     return;
   }
-  countFile(attributes, path, name);
+  countFile(attributes, relative, name);
 }
 
-void DirectoryReader::queueDirectory(const std::string& path, uint64_t index, const char* name) {
+void DirectoryReader::queueDirectory(const std::string& relative, uint64_t index, const char* name) {
   // Linux reports no entry count with a directory's entry, so an empty child
   // is opened and read like any other.
   if (!name) {
     QRTLogAs(kLogError, "diskUsageForURL",
              "Failed to get name for directory item %llu in %@; not counting its children",
-             static_cast<unsigned long long>(index), path);
+             static_cast<unsigned long long>(index), pathOf(relative));
     return;
   }
   const size_t nameLength = strlen(name);
-  const bool needsSeparator = path.empty() || path.back() != '/';
-  if (path.size() + needsSeparator + nameLength >= PATH_MAX) {
+  const std::string& root = walk_.rootPath();
+  const size_t pathLength = root.size() + (relative == "." ? 0 : 1 + relative.size()) + 1 + nameLength;
+  if (pathLength >= PATH_MAX) {
     QRTLogAs(kLogError, "diskUsageForURL", "Failed to create path to child directory by appending \"%s\" to %@",
-             name, path);
+             name, pathOf(relative));
     return;
   }
   std::string child;
-  child.reserve(path.size() + 1 + nameLength);
-  child.append(path);
-  if (needsSeparator) child.push_back('/');
+  if (relative != ".") {
+    child.reserve(relative.size() + 1 + nameLength);
+    child.append(relative);
+    child.push_back('/');
+  }
   child.append(name, nameLength);
   children_.push_back(std::move(child));
 }
 
-void DirectoryReader::countFile(const struct statx& attributes, const std::string& path, const char* name) {
-  const uint64_t allocated = (attributes.stx_mask & STATX_BLOCKS) ? attributes.stx_blocks * 512 : 0;
-  const uint32_t links = (attributes.stx_mask & STATX_NLINK) ? attributes.stx_nlink : 0;
-  if (links != 1) {
-    const uint64_t inode = (attributes.stx_mask & STATX_INO) ? attributes.stx_ino : 0;
-    if (!walk_.firstSighting({makedev(attributes.stx_dev_major, attributes.stx_dev_minor), inode})) {
-      QRTLogAs(kLogDebug, "diskUsageForURL", "Skipping hardlinked file at %@/%s", path, name);
+void DirectoryReader::countFile(const platform::EntryAttributes& attributes, const std::string& relative,
+                                const char* name) {
+  if (attributes.links != 1) {
+    if (!walk_.firstSighting({attributes.device, attributes.inode})) {
+      QRTLogAs(kLogDebug, "diskUsageForURL", "Skipping hardlinked file at %@/%s", pathOf(relative), name);
       return;
     }
   }
-  total_ += allocated;
-}
-
-void logTreeEntry(const FTSENT* entry) {
-  switch (entry->fts_info) {
-    case FTS_DP:
-      return;
-    case FTS_D:
-    case FTS_F:
-    case FTS_SL:
-    case FTS_SLNONE:
-    case FTS_DEFAULT:
-      QRTLogAs(kLogError, "printDirectoryStructureAtURL", "\tOrphaned File: %s", entry->fts_path);
-      return;
-    default:
-      QRTLogAs(kLogError, "printDirectoryStructureAtURL", "FTS returned error for %s : %s", entry->fts_path,
-               errorText(entry->fts_errno));
-      return;
-  }
+  total_ += attributes.allocated;
 }
 
 }  // namespace
@@ -316,8 +269,17 @@ uint64_t QRTFileManager::diskUsageForURL(const QRTURL& url) {
     QRTLog(kLogError, "Failed to get path to url %@", url);
     return 0;
   }
+  // The root is resolved safely from the device root; the walk below it
+  // stays on the root's file system.
+  UniqueFd root;
+  if (int err = platform::safeOpen(url.path(), O_PATH | O_DIRECTORY, &root)) {
+    QRTLog(kLogError, "Failed to open directory %@ : %s", url.path(), errorText(err));
+    return 0;
+  }
+  std::string rootPath = url.path();
+  while (rootPath.size() > 1 && rootPath.back() == '/') rootPath.pop_back();
   try {
-    return DiskUsageWalk(url.path()).run();
+    return DiskUsageWalk(root.get(), std::move(rootPath)).run();
   } catch (...) {
     QRT_EXCEPTION_ERROR();  // logs it; only allocation can throw here
     return 0;
@@ -326,20 +288,23 @@ uint64_t QRTFileManager::diskUsageForURL(const QRTURL& url) {
 
 namespace {
 
-// The item itself, never a link's target; -1 with the error on failure.
-int openForClass(const char* function, const char* path, QRTErrorRef* error) {
-  int fd = open(path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
-  if (fd < 0) {
-    int err = errno;
-    QRTSetError(error, QRTCreatePOSIXError(function, __LINE__, err, "Failed to open %s : %s", path, errorText(err)));
+// The item itself, pinned, never a link's target; a link is ELOOP.
+bool openForClass(const char* function, const QRTURL& url, platform::Item* item, QRTErrorRef* error) {
+  int err = platform::safeOpenItem(url.path(), item);
+  if (!err && S_ISLNK(item->st.st_mode)) err = ELOOP;
+  if (err) {
+    QRTSetError(error, QRTCreatePOSIXError(function, __LINE__, err, "Failed to open %s : %s",
+                                           url.fileSystemRepresentation(), errorText(err)));
+    return false;
   }
-  return fd;
+  return true;
 }
 
-bool readClass(const char* function, int fd, const char* path, int32_t* current, QRTErrorRef* error) {
-  if (int err = QRTGetProtectionClass(fd, current)) {
-    QRTSetError(error, QRTCreatePOSIXError(function, __LINE__, err, "Failed to getclass of file %s: %s", path,
-                                           errorText(err)));
+bool readClass(const char* function, const platform::Item& item, const QRTURL& url, int32_t* current,
+               QRTErrorRef* error) {
+  if (int err = platform::itemProtectionClass(item, current)) {
+    QRTSetError(error, QRTCreatePOSIXError(function, __LINE__, err, "Failed to getclass of file %s: %s",
+                                           url.fileSystemRepresentation(), errorText(err)));
     return false;
   }
   return true;
@@ -348,24 +313,24 @@ bool readClass(const char* function, int fd, const char* path, int32_t* current,
 }  // namespace
 
 bool QRTFileManager::dataProtectionClassOfItemAtURL(const QRTURL& url, int32_t* cls, QRTErrorRef* error) {
-  const char* path = url.fileSystemRepresentation();
-  ScopedFd fd(openForClass(__func__, path, error));
-  if (!fd.valid()) return false;
+  platform::Item item;
+  if (!openForClass(__func__, url, &item, error)) return false;
   int32_t current = 0;
-  if (!readClass(__func__, fd.get(), path, &current, error)) return false;
+  if (!readClass(__func__, item, url, &current, error)) return false;
   if (cls) *cls = current;
   return true;
 }
 
+// The class is read and set on the one pinned item, so the predicate judges
+// what is then changed.
 bool QRTFileManager::setDataProtectionClassOfItemAtURL(const QRTURL& url, int32_t toClass,
                                                        const std::function<bool(int32_t)>& ifPredicate,
                                                        QRTErrorRef* error) {
-  const char* path = url.fileSystemRepresentation();
-  ScopedFd fd(openForClass(__func__, path, error));
-  if (!fd.valid()) return false;
+  platform::Item item;
+  if (!openForClass(__func__, url, &item, error)) return false;
   if (ifPredicate) {
     int32_t current = 0;
-    if (!readClass(__func__, fd.get(), path, &current, error)) return false;
+    if (!readClass(__func__, item, url, &current, error)) return false;
     try {
       if (!ifPredicate(current)) return true;
     } catch (...) {
@@ -373,21 +338,26 @@ bool QRTFileManager::setDataProtectionClassOfItemAtURL(const QRTURL& url, int32_
       return false;
     }
   }
-  if (int err = QRTSetProtectionClass(fd.get(), toClass)) {
-    QRTSetError(error,
-                QRT_POSIX_ERROR(err, "Failed to setclass(%d) on file %s: %s", toClass, path, errorText(err)));
+  if (int err = platform::setItemProtectionClass(item, toClass)) {
+    QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to setclass(%d) on file %s: %s", toClass,
+                                       url.fileSystemRepresentation(), errorText(err)));
     return false;
   }
   return true;
 }
 
 void QRTFileManager::printDirectoryStructureAtURL(const QRTURL& url) {
-  char* roots[] = {const_cast<char*>(url.fileSystemRepresentation()), nullptr};
-  FTS* fts = fts_open(roots, FTS_PHYSICAL | FTS_NOCHDIR | FTS_XDEV, nullptr);
-  if (!fts) {
-    QRTLog(kLogError, "fts_open failed for %@ : %s", url, errorText(errno));
-    return;
-  }
-  while (const FTSENT* entry = fts_read(fts)) logTreeEntry(entry);
-  fts_close(fts);
+  QRTErrorRef error;
+  bool ok = _traverseDirectory(url, &error, [](QRTTraversalEntry& entry, QRTErrorRef*) {
+    if (entry.kind == QRTTraversalEntry::Kind::DirectoryPost) return true;
+    if (entry.error != 0)
+      QRTLogAs(kLogError, "printDirectoryStructureAtURL", "FTS returned error for %s : %s", entry.path,
+               errorText(entry.error));
+    else
+      QRTLogAs(kLogError, "printDirectoryStructureAtURL", "\tOrphaned File: %s", entry.path);
+    return true;
+  });
+  if (!ok && error)
+    QRTLog(kLogError, "FTS returned error for %s : %s", url.fileSystemRepresentation(),
+           errorText(static_cast<int>(error->code())));
 }

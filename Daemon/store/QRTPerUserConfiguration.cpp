@@ -1,8 +1,7 @@
 #include "Daemon/store/QRTPerUserConfiguration.h"
 
-#include <cstring>
-#include <cstdlib>
-#include <memory>
+#include <string>
+#include <string_view>
 
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/fileops/QRTFileManager.h"
@@ -14,20 +13,30 @@ namespace {
 constexpr mode_t kDirectoryMode = 0755;
 constexpr size_t kMaxHomePathLength = 1023;
 
-// The home with its links resolved; as given when it cannot be resolved (a
-// home that does not exist yet), so that its absence can still be observed.
-std::optional<QRTURL> resolvedHome(const std::string& home) {
-  if (home.empty() || home.front() != '/') return std::nullopt;
-  std::unique_ptr<char, decltype(&free)> resolved(realpath(home.c_str(), nullptr), &free);
-  if (resolved && strlen(resolved.get()) <= kMaxHomePathLength) return QRTURL::fileURL(resolved.get(), true);
-  return QRTURL::fileURL(home, true);
+// The home as an absolute path with "." and doubled slashes dropped. Links
+// are not resolved: every use goes through the safe resolution, which refuses
+// a link anywhere on the way, and a ".." component is refused here already.
+std::optional<QRTURL> normalisedHome(const std::string& home) {
+  if (home.empty() || home.front() != '/' || home.size() > kMaxHomePathLength) return std::nullopt;
+  std::string path;
+  for (size_t start = 0; start <= home.size();) {
+    size_t slash = home.find('/', start);
+    if (slash == std::string::npos) slash = home.size();
+    std::string_view component(home.data() + start, slash - start);
+    start = slash + 1;
+    if (component.empty() || component == ".") continue;
+    if (component == "..") return std::nullopt;
+    path += '/';
+    path += component;
+  }
+  return QRTURL::fileURL(path.empty() ? "/" : path, true);
 }
 
 }  // namespace
 
 QRTPerUserConfiguration::QRTPerUserConfiguration(uint32_t userId) : userId_(userId) {
   std::optional<platform::UserAccount> account = platform::userById(userId);
-  if (account) userHomeDirectory_ = resolvedHome(account->homeDirectory);
+  if (account) userHomeDirectory_ = normalisedHome(account->homeDirectory);
   if (!userHomeDirectory_) QRTLog(platform::kLogError, "Failed to getpwuid for uid: %u", userId);
 }
 

@@ -186,7 +186,7 @@ TEST_F(FileManagerTest, CopyKeepsDataModeOwnerXattrsAclsAndLinks) {
   makeFile("src/sub/file", "payload");
   makeFile("src/setuid", "s");
   ASSERT_EQ(chown(path("src/sub/file").c_str(), 502, 503), 0);
-  ASSERT_EQ(chmod(path("src/setuid").c_str(), 04755), 0);  // survives only if the owner is set first
+  ASSERT_EQ(chmod(path("src/setuid").c_str(), 06755), 0);  // set-id bits are dropped
   ASSERT_EQ(chown(path("src/sub").c_str(), 501, 20), 0);
   ASSERT_EQ(setxattr(path("src/sub/file").c_str(), "user.note", "v1", 2, 0), 0);
   ASSERT_EQ(setxattr(path("src/sub/file").c_str(), "trusted.com.norvane.protection-class", "\3\0\0\0", 4, 0), 0);
@@ -207,8 +207,9 @@ TEST_F(FileManagerTest, CopyKeepsDataModeOwnerXattrsAclsAndLinks) {
     EXPECT_EQ(lstat(p.c_str(), &st), 0) << p;
     return std::tuple(st.st_mode, st.st_uid, st.st_gid, st.st_mtim.tv_sec);
   };
-  for (std::string rel : {"sub", "sub/file", "setuid", "dangling", "sub/link"})
+  for (std::string rel : {"sub", "sub/file", "dangling", "sub/link"})
     EXPECT_EQ(meta(path("dst/" + rel)), meta(path("src/" + rel))) << rel;
+  EXPECT_EQ(std::get<0>(meta(path("dst/setuid"))), S_IFREG | 0755u);
   for (const char* name : {"user.note", "trusted.com.norvane.protection-class", "system.posix_acl_access"})
     EXPECT_EQ(xattr(path("dst/sub/file"), name), xattr(path("src/sub/file"), name)) << name;
   EXPECT_EQ(xattr(path("dst/sub"), "system.posix_acl_default"), xattr(path("src/sub"), "system.posix_acl_default"));
@@ -307,6 +308,18 @@ TEST_F(FileManagerTest, TraversalSeesDirectoriesTwiceAndCanSkipOrStop) {
   }));
   EXPECT_EQ(calls, 2);
   EXPECT_EQ(error_->localizedDescription(), "visitor gave up");
+
+  std::string rel = "deep";  // deeper than the walk keeps directories open at once
+  for (int i = 0; i < 150; ++i) rel += "/d";
+  makeFile(rel + "/leaf");
+  int pre = 0, post = 0, files = 0;
+  ASSERT_TRUE(fm_._traverseDirectory(url("deep"), &error_, [&](QRTTraversalEntry& e, QRTErrorRef*) {
+    pre += e.kind == QRTTraversalEntry::Kind::DirectoryPre;
+    post += e.kind == QRTTraversalEntry::Kind::DirectoryPost;
+    files += e.kind == QRTTraversalEntry::Kind::File && e.level == 151;
+    return true;
+  }));
+  EXPECT_EQ(std::tuple(pre, post, files), std::tuple(151, 151, 1));
 }
 
 TEST_F(FileManagerTest, PropertyListFilesRoundTripAndRejectOtherShapes) {

@@ -97,15 +97,15 @@ TEST_F(LogTest, LinesCarryTimeProgramPidLevelAndFunctionAndGoToStderrOnRequest) 
   logWrite(kLogNotice, "firstFunction", "hello 100%");
   QRTLog(kLogError, "value %d of %@", 7, std::string("thing"));
   logSetStderr(true);
-  logWrite(kLogDebug, "third", "two\nlines");
+  logWrite(kLogDebug, "third", "two\nlines\x7f\t");
   logSetStderr(false);
   logWrite(4, "fourth", "odd level");
   std::string copy = testing::internal::GetCapturedStderr();
   std::string content = readFile(logPath());
   EXPECT_TRUE(hasExactly(content, {"<Notice> firstFunction: hello 100%", "<Error> TestBody: value 7 of thing",
-                                   "<Debug> third: two\nlines", "<Level 4> fourth: odd level"}))
+                                   "<Debug> third: two\\x0alines\\x7f\\x09", "<Level 4> fourth: odd level"}))
       << content;
-  EXPECT_TRUE(hasExactly(copy, {"<Debug> third: two\nlines"})) << copy;
+  EXPECT_TRUE(hasExactly(copy, {"<Debug> third: two\\x0alines\\x7f\\x09"})) << copy;
 }
 
 TEST_F(LogTest, LevelFiltersLinesWhileAFileIsOpen) {
@@ -150,6 +150,18 @@ TEST_F(LogTest, RotationShiftsOlderFilesUpAndDropsTheOldest) {
     for (const std::string& path : stale) EXPECT_FALSE(fs::exists(path)) << path;
     logClose();
   }
+}
+
+TEST_F(LogTest, FailedRotationStepIsReportedOnStandardError) {
+  fs::create_directories(logPath() + ".0/occupied");  // no file can be renamed over it
+  ASSERT_TRUE(logOpen(logPath(), "com.norvane.quarterd", kLogNotice));
+  logSetRotation(1, 100);
+  testing::internal::CaptureStderr();
+  for (int i = 0; i < 5; ++i) logWrite(kLogNotice, "f", "a line long enough to rotate " + std::to_string(i));
+  std::string report = testing::internal::GetCapturedStderr();
+  EXPECT_NE(report.find("Log rotation failed to rename " + logPath() + ": Is a directory"), std::string::npos)
+      << report;
+  logClose();
 }
 
 // ---- user database and identities ----

@@ -169,7 +169,10 @@ TEST(StoreLayoutPerUser, HomesAndBackupPaths) {
             host("/private/var/mobile/Library/Backup/SystemContainers/Shared"));
   EXPECT_FALSE(fs::exists(host("/private/var/mobile/Library/Backup")));
   auto linked = config().getPerUserConfigurationForUserId(504);
-  EXPECT_EQ(linked->userHomeDirectory().value_or(QRTURL()).path(), host("/private/var/real504"));
+  // A home reached through a link is taken as written, and refused when used.
+  EXPECT_EQ(linked->userHomeDirectory().value_or(QRTURL()).path(), host("/private/var/link504"));
+  linked->userBaseDirectory();
+  EXPECT_FALSE(fs::exists(host("/private/var/real504/Containers")));
 
   // 502's home is made by the first getter that needs it.
   fs::remove_all(host("/private/var/users"));

@@ -1,0 +1,153 @@
+// Small descriptor-level I/O shared by the platform adapters and the file
+// manager: an owning descriptor, whole writes and reads, atomic replacement,
+// bulk directory reads, item attributes, file flags and protection classes.
+// Every call that takes a name acts relative to a directory descriptor and
+// never follows a final symbolic link. Results are 0 or an errno value.
+#pragma once
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/types.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <cstring>
+#include <string>
+#include <string_view>
+#include <utility>
+
+namespace platform {
+
+class UniqueFd {
+ public:
+  explicit UniqueFd(int fd = -1) : fd_(fd) {}
+  UniqueFd(UniqueFd&& o) noexcept : fd_(o.release()) {}
+  UniqueFd& operator=(UniqueFd&& o) noexcept {
+    reset(o.release());
+    return *this;
+  }
+  UniqueFd(const UniqueFd&) = delete;
+  UniqueFd& operator=(const UniqueFd&) = delete;
+  ~UniqueFd() { reset(); }
+  int get() const { return fd_; }
+  bool valid() const { return fd_ >= 0; }
+  int release() { return std::exchange(fd_, -1); }
+  void reset(int fd = -1);
+
+ private:
+  int fd_;
+};
+
+int writeAll(int fd, const void* data, size_t size);
+inline int writeAll(int fd, std::string_view text) { return writeAll(fd, text.data(), text.size()); }
+// Reads to the end; EFBIG past limit.
+int readAll(int fd, std::string* out, size_t limit);
+// fsync of a directory; file systems that cannot (EINVAL) count as done.
+int syncDirectory(int fd);
+
+// The regular file dirfd/name whole. A link, a directory (EISDIR) or a
+// special file (EINVAL) is refused without being opened for reading.
+int readFileAt(int dirfd, const char* name, std::string* out, size_t limit);
+
+// Replaces dirfd/name atomically: a hidden temporary in the same directory
+// (exclusive, no link followed), written, flushed, renamed over the name, the
+// directory flushed. Whatever was at the name, a planted link included, is
+// replaced, never written through. ownerUid/ownerGid -1 keep root's.
+int replaceFileAt(int dirfd, std::string_view name, const void* data, size_t size, mode_t mode,
+                  uid_t ownerUid = static_cast<uid_t>(-1), gid_t ownerGid = static_cast<gid_t>(-1));
+
+// openat with O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK (and O_NOATIME where the
+// caller may have it); -1 with errno on failure.
+int openNoFollowAt(int dirfd, const char* name, int flags);
+inline int openDirectoryAt(int dirfd, const char* name) {
+  return openNoFollowAt(dirfd, name, O_RDONLY | O_DIRECTORY);
+}
+
+// An item pinned by an O_PATH descriptor and checked with fstat: whatever
+// happens to its name afterwards, changes reach this inode and no other.
+// Special files are never opened for reading; links are never followed.
+struct Item {
+  UniqueFd fd;
+  struct stat st {};
+};
+int openItemAt(int dirfd, const char* name, Item* item);
+// A readable descriptor of a regular file or directory item (EINVAL for
+// anything else).
+int reopenItem(const Item& item, int flags, UniqueFd* out);
+int chownItem(const Item& item, uid_t uid, gid_t gid);
+// Links have no mode of their own here (EOPNOTSUPP).
+int chmodItem(const Item& item, mode_t mode);
+// The item as a path that reaches exactly its inode (for libacl).
+std::string itemProcPath(const Item& item);
+
+// Bulk directory reads (getdents64). Calls visit(inode, type, name) for each
+// entry but "." and ".."; name is null for a malformed record. Returns the
+// bytes read (0 at the end) or -errno.
+struct DirectoryBatch {
+  static constexpr size_t kSize = 32 * 1024;
+  alignas(8) char bytes[kSize];
+};
+ssize_t readDirectoryBatch(int fd, DirectoryBatch* batch);
+template <typename Visit>
+void forEachEntry(const DirectoryBatch& batch, size_t length, Visit&& visit);
+
+// Attributes of dirfd/name (statx, not following a link, no sync). A field
+// the file system did not return is 0.
+struct EntryAttributes {
+  mode_t mode = 0;  // type bits only when returned
+  bool hasType = false;
+  uint64_t allocated = 0;
+  uint32_t links = 0;
+  uint64_t inode = 0;
+  dev_t device = 0;
+};
+int entryAttributesAt(int dirfd, const char* name, EntryAttributes* out);
+
+// The user-immutable flag (FS_IMMUTABLE_FL) of an open regular file or
+// directory. ENOTTY/EOPNOTSUPP: the file system has no flags.
+int immutableFlag(int fd, bool* set);
+int clearImmutableFlag(int fd);
+
+// Protection class: the 4-byte little-endian attribute
+// trusted.com.norvane.protection-class of an open file (0 when absent).
+// While the device is locked, setting fails with EPERM when the current or
+// the new class is 1.
+int getProtectionClass(int fd, int32_t* cls);
+int setProtectionClass(int fd, int32_t cls);
+// The same on a pinned item (a link is ELOOP); FIFOs and sockets are
+// reached without being opened.
+int itemProtectionClass(const Item& item, int32_t* cls);
+int setItemProtectionClass(const Item& item, int32_t cls);
+// Removes the attribute (already absent, or no attributes there, is done).
+int clearProtectionClass(int fd);
+extern const char* const kProtectionClassAttribute;
+
+// ---------------------------------------------------------------------------
+
+struct KernelDirent {
+  uint64_t d_ino;
+  int64_t d_off;
+  unsigned short d_reclen;
+  unsigned char d_type;
+  char d_name[1];
+};
+
+template <typename Visit>
+void forEachEntry(const DirectoryBatch& batch, size_t length, Visit&& visit) {
+  constexpr size_t header = offsetof(KernelDirent, d_name);
+  for (size_t offset = 0; offset + header <= length;) {
+    const auto* entry = reinterpret_cast<const KernelDirent*>(batch.bytes + offset);
+    const size_t recordLength = entry->d_reclen;
+    if (recordLength <= header || recordLength > length - offset) return;
+    offset += recordLength;
+    const char* name = entry->d_name;
+    const size_t room = recordLength - header;
+    const size_t nameLength = strnlen(name, room);
+    if (name[0] == '.' && (nameLength == 1 || (nameLength == 2 && name[1] == '.'))) continue;
+    // A name that fills its record unterminated is no name at all.
+    visit(entry->d_ino, entry->d_type, nameLength < room && nameLength > 0 ? name : nullptr);
+  }
+}
+
+}  // namespace platform

@@ -1,0 +1,275 @@
+#include "platform/SafePath.h"
+
+#include <fcntl.h>
+#include <linux/openat2.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstring>
+#include <mutex>
+#include <vector>
+
+#include "platform/DeviceRoot.h"
+#include "platform/Log.h"
+
+namespace platform {
+
+namespace {
+
+std::atomic<int> gRootFd{-1};
+std::mutex gRootMutex;
+
+int openRoot(const std::string& root) { return open(root.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC); }
+
+// Kernels without openat2: one O_NOFOLLOW open per component, which refuses
+// links just the same (mounts are not told apart).
+int openComponentwise(int dirfd, const char* relative, int flags, mode_t mode) {
+  std::string_view rest(relative);
+  UniqueFd current;
+  int base = dirfd;
+  for (;;) {
+    size_t slash = rest.find('/');
+    std::string component(rest.substr(0, slash));
+    if (slash == std::string_view::npos) {
+      int fd = openat(base, component.c_str(), flags | O_NOFOLLOW | O_CLOEXEC, mode);
+      return fd;
+    }
+    rest.remove_prefix(slash + 1);
+    if (component.empty() || component == ".") continue;
+    if (component == "..") {
+      errno = EXDEV;
+      return -1;
+    }
+    int next = openat(base, component.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    if (next < 0) return -1;
+    current.reset(next);
+    base = next;
+  }
+}
+
+int openBeneathWithMode(int dirfd, const char* relative, int flags, mode_t mode, UniqueFd* out, bool walk) {
+  struct open_how how {};
+  how.flags = static_cast<uint64_t>(flags | O_NOFOLLOW | O_CLOEXEC);
+  how.mode = (flags & (O_CREAT | O_TMPFILE)) ? mode : 0;
+  how.resolve = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | (walk ? RESOLVE_NO_XDEV : 0);
+  long fd;
+  // EAGAIN: a rename raced the lookup; a few retries, not an endless loop.
+  int tries = 0;
+  do {
+    fd = syscall(SYS_openat2, dirfd, relative, &how, sizeof how);
+  } while (fd < 0 && (errno == EAGAIN || errno == EINTR) && ++tries < 16);
+  if (fd < 0 && errno == ENOSYS) fd = openComponentwise(dirfd, relative, flags, mode);
+  if (fd < 0 && errno == ENOTDIR && (flags & O_DIRECTORY)) {
+    // A link at the last component reads as "not a directory"; say link.
+    UniqueFd item;
+    struct stat st;
+    if (openBeneathWithMode(dirfd, relative, O_PATH, 0, &item, walk) == 0 && fstat(item.get(), &st) == 0 &&
+        S_ISLNK(st.st_mode))
+      return ELOOP;
+    errno = ENOTDIR;
+  }
+  if (fd < 0) return errno;
+  out->reset(static_cast<int>(fd));
+  return 0;
+}
+
+void splitParent(const std::string& relative, std::string* parent, std::string* name) {
+  size_t slash = relative.rfind('/');
+  if (slash == std::string::npos) {
+    *parent = ".";
+    *name = relative;
+  } else {
+    *parent = relative.substr(0, slash);
+    *name = relative.substr(slash + 1);
+  }
+}
+
+const char* errorText(int err) { return strerror(err); }
+
+// The checks on an item found where a directory was to be made.
+int acceptDirectory(int fd, std::string_view hostPath, uid_t owner) {
+  struct stat st;
+  if (fstat(fd, &st) != 0) return errno;
+  if (!S_ISDIR(st.st_mode)) {
+    QRTLogAs(kLogError, "safeMakeDirectory", "Refusing %s: not a directory", std::string(hostPath).c_str());
+    return ENOTDIR;
+  }
+  if (owner == kAnyOwner) return 0;
+  if (st.st_uid != owner && st.st_uid != 0) {
+    QRTLogAs(kLogError, "safeMakeDirectory", "Refusing %s: owned by %u, not by %u", std::string(hostPath).c_str(),
+             static_cast<unsigned>(st.st_uid), static_cast<unsigned>(owner));
+    return EPERM;
+  }
+  if ((st.st_uid != owner || st.st_gid != owner) && fchown(fd, owner, owner) != 0) return errno;
+  return 0;
+}
+
+// mkdirat then an O_NOFOLLOW open of what is there; *made tells whether this
+// call made it.
+int makeOne(int dirfd, const char* name, mode_t mode, std::string_view hostPath, UniqueFd* out, bool* made) {
+  *made = mkdirat(dirfd, name, mode) == 0;
+  if (!*made && errno != EEXIST) return errno;
+  out->reset(openat(dirfd, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (out->valid()) return 0;
+  int err = errno;
+  if (err == ELOOP || err == ENOTDIR) {
+    QRTLogAs(kLogError, "safeMakeDirectory", "Refusing %s: %s where a directory belongs",
+             std::string(hostPath).c_str(), err == ELOOP ? "a symbolic link" : "another kind of item");
+  }
+  return err;
+}
+
+}  // namespace
+
+void resetDeviceRootDescriptor() {
+  std::lock_guard<std::mutex> hold(gRootMutex);
+  int fd = openRoot(deviceRoot());
+  int old = gRootFd.exchange(fd);
+  if (old >= 0) close(old);
+}
+
+int deviceRootDescriptor() {
+  int fd = gRootFd.load(std::memory_order_acquire);
+  if (fd >= 0) return fd;
+  std::lock_guard<std::mutex> hold(gRootMutex);
+  fd = gRootFd.load();
+  if (fd >= 0) return fd;
+  fd = openRoot(deviceRoot());
+  if (fd < 0) return -1;
+  gRootFd.store(fd, std::memory_order_release);
+  return fd;
+}
+
+int pathBelowDeviceRoot(std::string_view hostPath, std::string* relative) {
+  if (hostPath.empty() || hostPath.front() != '/') return EXDEV;
+  std::string normal;
+  normal.reserve(hostPath.size());
+  while (!hostPath.empty()) {
+    size_t slash = hostPath.find('/');
+    std::string_view component = hostPath.substr(0, slash);
+    hostPath.remove_prefix(slash == std::string_view::npos ? hostPath.size() : slash + 1);
+    if (component.empty() || component == ".") continue;
+    if (component == "..") return EXDEV;
+    normal += '/';
+    normal += component;
+  }
+  const std::string& root = deviceRoot();
+  if (root == "/") {
+    *relative = normal.empty() ? "." : normal.substr(1);
+    return 0;
+  }
+  if (normal.compare(0, root.size(), root) != 0) return EXDEV;
+  if (normal.size() == root.size()) {
+    *relative = ".";
+    return 0;
+  }
+  if (normal[root.size()] != '/') return EXDEV;
+  *relative = normal.substr(root.size() + 1);
+  return 0;
+}
+
+int openBeneath(int dirfd, const char* relative, int flags, UniqueFd* out, bool walk) {
+  return openBeneathWithMode(dirfd, relative, flags, 0, out, walk);
+}
+
+int safeOpen(std::string_view hostPath, int flags, UniqueFd* out, bool walk) {
+  std::string relative;
+  if (int err = pathBelowDeviceRoot(hostPath, &relative)) return err;
+  int root = deviceRootDescriptor();
+  if (root < 0) return errno;
+  return openBeneath(root, relative.c_str(), flags, out, walk);
+}
+
+int safeOpenParent(std::string_view hostPath, SafeParent* out) {
+  std::string relative, parent;
+  if (int err = pathBelowDeviceRoot(hostPath, &relative)) return err;
+  if (relative == ".") return EINVAL;
+  splitParent(relative, &parent, &out->name);
+  int root = deviceRootDescriptor();
+  if (root < 0) return errno;
+  return openBeneath(root, parent.c_str(), O_RDONLY | O_DIRECTORY, &out->fd);
+}
+
+int safeOpenItem(std::string_view hostPath, Item* item) {
+  SafeParent parent;
+  if (int err = safeOpenParent(hostPath, &parent)) return err;
+  return openItemAt(parent.fd.get(), parent.name.c_str(), item);
+}
+
+int safeStat(std::string_view hostPath, struct stat* st) {
+  std::string relative;
+  if (int err = pathBelowDeviceRoot(hostPath, &relative)) return err;
+  if (relative == ".") {
+    int root = deviceRootDescriptor();
+    if (root < 0) return errno;
+    return fstat(root, st) == 0 ? 0 : errno;
+  }
+  SafeParent parent;
+  if (int err = safeOpenParent(hostPath, &parent)) return err;
+  return fstatat(parent.fd.get(), parent.name.c_str(), st, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
+}
+
+int safeMakeDirectory(std::string_view hostPath, mode_t mode, bool withParents, uid_t owner, UniqueFd* out,
+                      bool* created) {
+  if (created) *created = false;
+  std::string relative;
+  if (int err = pathBelowDeviceRoot(hostPath, &relative)) return err;
+  int root = deviceRootDescriptor();
+  if (root < 0) return errno;
+  // Most calls find the directory there already: one resolution settles it.
+  UniqueFd fd;
+  int err = openBeneath(root, relative.c_str(), O_RDONLY | O_DIRECTORY, &fd);
+  if (err == 0) {
+    if (int refused = acceptDirectory(fd.get(), hostPath, owner)) return refused;
+    *out = std::move(fd);
+    return 0;
+  }
+  if (err != ENOENT) {
+    if (err == ELOOP || err == ENOTDIR)
+      QRTLogAs(kLogError, "safeMakeDirectory", "Refusing %s: %s", std::string(hostPath).c_str(), errorText(err));
+    return err;
+  }
+  bool made = false;
+  if (!withParents) {
+    SafeParent parent;
+    if (int perr = safeOpenParent(hostPath, &parent)) return perr;
+    if (int merr = makeOne(parent.fd.get(), parent.name.c_str(), mode, hostPath, &fd, &made)) return merr;
+  } else {
+    // Level by level from the root; each level is opened without following
+    // a link before the next one is made inside it.
+    UniqueFd level;
+    int base = root;
+    std::string_view rest(relative);
+    while (!rest.empty()) {
+      size_t slash = rest.find('/');
+      std::string name(rest.substr(0, slash));
+      rest.remove_prefix(slash == std::string_view::npos ? rest.size() : slash + 1);
+      UniqueFd next;
+      if (int merr = makeOne(base, name.c_str(), mode, hostPath, &next, &made)) return merr;
+      level = std::move(next);
+      base = level.get();
+    }
+    fd = std::move(level);
+  }
+  if (created) *created = made;
+  if (int refused = acceptDirectory(fd.get(), hostPath, owner)) return refused;
+  *out = std::move(fd);
+  return 0;
+}
+
+int safeReadFile(std::string_view hostPath, std::string* out, size_t limit) {
+  SafeParent parent;
+  if (int err = safeOpenParent(hostPath, &parent)) return err;
+  return readFileAt(parent.fd.get(), parent.name.c_str(), out, limit);
+}
+
+int safeReplaceFile(std::string_view hostPath, std::string_view content, mode_t mode) {
+  SafeParent parent;
+  if (int err = safeOpenParent(hostPath, &parent)) return err;
+  return replaceFileAt(parent.fd.get(), parent.name, content.data(), content.size(), mode);
+}
+
+}  // namespace platform

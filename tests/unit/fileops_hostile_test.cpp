@@ -1,0 +1,165 @@
+// Every operation of QRTFileManager against links, swaps and hard links a
+// user can plant in a container they own. A marker tree outside the device
+// root stands for what the user may not change: no case may touch it.
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <map>
+#include <sstream>
+#include <string>
+
+#include "Daemon/fileops/QRTFileManager.h"
+#include "TempDir.h"
+#include "platform/DeviceRoot.h"
+#include "platform/Log.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+std::string readFile(const std::string& p) {
+  std::stringstream s;
+  s << std::ifstream(p).rdbuf();
+  return s.str();
+}
+
+// Owner, mode, content and attributes of every item below dir.
+std::map<std::string, std::string> snapshot(const std::string& dir) {
+  std::map<std::string, std::string> items;
+  for (auto& e : fs::recursive_directory_iterator(dir)) {
+    struct stat st {};
+    lstat(e.path().c_str(), &st);
+    char names[1024] = {};
+    ssize_t n = llistxattr(e.path().c_str(), names, sizeof names);
+    std::ostringstream o;
+    o << st.st_uid << ':' << st.st_gid << ':' << std::oct << st.st_mode << ':'
+      << std::string(names, n > 0 ? n : 0);
+    if (S_ISREG(st.st_mode)) o << ':' << readFile(e.path());
+    items[e.path()] = o.str();
+  }
+  return items;
+}
+
+struct stat lstatOf(const std::string& p) {
+  struct stat st {};
+  EXPECT_EQ(lstat(p.c_str(), &st), 0) << p;
+  return st;
+}
+
+class HostileTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    fs::create_directories(marker_ + "/dir");
+    std::ofstream(marker_ + "/file") << "precious";
+    std::ofstream(marker_ + "/dir/inner") << "inner";
+    ASSERT_EQ(setxattr((marker_ + "/file").c_str(), "user.mark", "m", 1, 0), 0);
+    fs::create_directories(root_ + "/etc");
+    std::ofstream(root_ + "/etc/group") << "systemusers:x:4242:\n";
+    fs::create_directories(c_ + "/own");
+    std::ofstream(c_ + "/own/file") << "mine";
+    ASSERT_EQ(symlink(marker_.c_str(), (c_ + "/link").c_str()), 0);
+    ASSERT_EQ(symlink((marker_ + "/file").c_str(), (c_ + "/filelink").c_str()), 0);
+    ASSERT_EQ(link((marker_ + "/file").c_str(), (c_ + "/own/hard").c_str()), 0);
+    platform::setDeviceRoot(root_);
+    platform::logOpen(tmp_ / "quarterd.log", "hostile-test", 5);
+    before_ = snapshot(marker_);
+  }
+  void TearDown() override {
+    EXPECT_EQ(snapshot(marker_), before_) << "the marker tree changed";
+    platform::logClose();
+    for (const std::string& m : mounts_) umount2(m.c_str(), MNT_DETACH);
+    platform::setDeviceRoot("/");
+  }
+  QRTURL url(const std::string& rel) const { return QRTURL::fileURL(c_ + "/" + rel); }
+  int64_t code() const { return error_ ? error_->code() : 0; }
+
+  TempDir tmp_{"/var/tmp/qrt-hostile"};
+  std::string root_ = tmp_ / "root", marker_ = tmp_ / "marker", c_ = root_ + "/c";
+  std::map<std::string, std::string> before_;
+  std::vector<std::string> mounts_;
+  QRTFileManager& fm_ = QRTFileManager::defaultManager();
+  QRTErrorRef error_;
+};
+
+TEST_F(HostileTest, NoOperationReachesThroughALink) {
+  plist::Dictionary dict{{"k", "v"}};
+  int32_t cls = 0;
+  const std::vector<std::pair<const char*, std::function<bool()>>> cases = {
+      {"remove below a link", [&] { return fm_.removeItemAtURL(url("link/file"), &error_); }},
+      {"create below a link", [&] { return fm_.createDirectoryAtURL(url("link/new"), true, 0755, &error_); }},
+      {"create at a link", [&] { return fm_.createDirectoryAtURL(url("link"), false, 0755, 501u, &error_); }},
+      {"copy from below a link", [&] { return fm_.copyItemAtURL(url("link/file"), url("copied"), &error_); }},
+      {"copy to below a link", [&] { return fm_.copyItemAtURL(url("own"), url("link/own"), &error_); }},
+      {"move from below a link", [&] { return fm_.moveItemAtURL(url("link/file"), url("moved"), &error_); }},
+      {"move to below a link", [&] { return fm_.moveItemAtURL(url("own"), url("link/own"), &error_); }},
+      {"temporary directory below a link",
+       [&] { return fm_.createTemporaryDirectoryInDirectoryURL(url("link"), &error_).has_value(); }},
+      {"list a link", [&] { return fm_.urlsForItemsInDirectoryAtURL(url("link"), &error_).has_value(); }},
+      {"write below a link", [&] { return QRT_writeToURL(dict, url("link/file"), QRTWriteAtomic, &error_); }},
+      {"write in place at a link", [&] { return QRT_writeToURL(dict, url("filelink"), QRTWriteOptionsNone, &error_); }},
+      {"read through a link", [&] { return QRT_dictionaryWithContentsOfURL(url("filelink"), &error_).has_value(); }},
+      {"class of a link", [&] { return fm_.setDataProtectionClassOfItemAtURL(url("filelink"), 3, {}, &error_); }},
+      {"class below a link", [&] { return fm_.dataProtectionClassOfItemAtURL(url("link/file"), &cls, &error_); }},
+      {"ownership below a link", [&] { return fm_.standardizeOwnershipAtURL(url("link/dir"), 501, 501, &error_); }},
+      {"top ACL of a link", [&] { return fm_.setTopLevelSystemContainerACLAtURL(url("link"), &error_); }},
+  };
+  for (const auto& [what, act] : cases) {
+    error_.reset();
+    EXPECT_FALSE(act()) << what;
+    EXPECT_EQ(code(), what == std::string("top ACL of a link") ? 63 : ELOOP) << what;
+  }
+  EXPECT_FALSE(fm_.itemExistsAtURL(url("link/file")) || fm_.itemDoesNotExistAtURL(url("link/file")));
+  EXPECT_EQ(fm_.diskUsageForURL(url("link")), 0u);
+  EXPECT_TRUE(fm_.removeItemAtURL(url("link"), &error_));  // the link itself goes
+  EXPECT_TRUE(fs::exists(marker_ + "/dir/inner"));
+}
+
+TEST_F(HostileTest, OwnershipWalksLeaveForeignHardLinksAlone) {
+  ASSERT_TRUE(fm_.standardizeOwnershipAtURL(QRTURL::fileURL(c_, true), 501, 501, &error_));
+  EXPECT_EQ(lstatOf(c_ + "/own/file").st_uid, 501u);
+  EXPECT_EQ(lstatOf(c_ + "/link").st_uid, 501u);  // the link itself
+  ASSERT_TRUE(fm_.standardizeACLsAtURL(QRTURL::fileURL(c_, true), false, &error_));
+  EXPECT_EQ(lstatOf(c_ + "/own/file").st_uid, static_cast<uid_t>(-2));
+  // A directory swapped for a link between the listing and the change.
+  fs::rename(c_ + "/own", c_ + "/own.old");
+  ASSERT_EQ(symlink((marker_ + "/dir").c_str(), (c_ + "/own").c_str()), 0);
+  EXPECT_TRUE(fm_.standardizeOwnershipAtURL(QRTURL::fileURL(c_, true), 502, 502, &error_));
+}
+
+TEST_F(HostileTest, CopyDropsSetIdBitsAndDeviceNodes) {
+  std::ofstream(c_ + "/own/tool") << "#!";
+  ASSERT_EQ(chmod((c_ + "/own/tool").c_str(), 06755), 0);
+  ASSERT_EQ(mknod((c_ + "/own/null").c_str(), S_IFCHR | 0666, makedev(1, 3)), 0);
+  ASSERT_EQ(mkfifo((c_ + "/own/fifo").c_str(), 0640), 0);
+  ASSERT_TRUE(fm_.copyItemAtURL(url("own"), url("copy"), &error_)) << error_->description();
+  EXPECT_EQ(lstatOf(c_ + "/copy/tool").st_mode & 07777, 0755u);
+  EXPECT_FALSE(fs::exists(fs::symlink_status(c_ + "/copy/null")));
+  EXPECT_TRUE(S_ISFIFO(lstatOf(c_ + "/copy/fifo").st_mode));
+  EXPECT_EQ(lstatOf(c_ + "/copy/fifo").st_mode & 07777, 0640u);
+  EXPECT_EQ(lstatOf(c_ + "/copy/hard").st_nlink, 1u);  // a copy, not another name of the marker
+}
+
+TEST_F(HostileTest, CrossDeviceMoveThatFailsMidwayLeavesNoPartialCopy) {
+  fs::create_directories(root_ + "/mnt");
+  if (mount("tmpfs", (root_ + "/mnt").c_str(), "tmpfs", 0, "size=256k") != 0) GTEST_SKIP() << "no tmpfs";
+  mounts_.push_back(root_ + "/mnt");
+  std::ofstream(c_ + "/own/big") << std::string(1 << 20, 'b');
+  EXPECT_FALSE(fm_.moveItemAtURL(url("own"), QRTURL::fileURL(root_ + "/mnt/own"), &error_));
+  EXPECT_EQ(code(), ENOSPC);
+  EXPECT_EQ(std::distance(fs::directory_iterator(root_ + "/mnt"), {}), 0);
+  EXPECT_EQ(fs::file_size(c_ + "/own/big"), 1u << 20);  // the source is whole
+  fs::remove(c_ + "/own/big");
+  ASSERT_TRUE(fm_.moveItemAtURL(url("own"), QRTURL::fileURL(root_ + "/mnt/own"), &error_));
+  EXPECT_EQ(readFile(root_ + "/mnt/own/file"), "mine");
+  EXPECT_FALSE(fs::exists(c_ + "/own"));
+}
+
+}  // namespace

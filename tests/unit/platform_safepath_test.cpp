@@ -1,0 +1,171 @@
+// The safe path primitive against the arrangements a user can make in a
+// directory they own. A marker tree outside the device root stands for
+// everything the user may not change; no case may touch it.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <map>
+#include <optional>
+#include <sstream>
+#include <string>
+
+#include "TempDir.h"
+#include "platform/DeviceRoot.h"
+#include "platform/FileIO.h"
+#include "platform/SafePath.h"
+
+namespace fs = std::filesystem;
+using namespace platform;
+
+namespace {
+
+std::string readFile(const std::string& p) {
+  std::stringstream s;
+  s << std::ifstream(p).rdbuf();
+  return s.str();
+}
+
+// Owner, mode, content and attributes of every item below dir.
+std::map<std::string, std::string> snapshot(const std::string& dir) {
+  std::map<std::string, std::string> items;
+  for (auto& e : fs::recursive_directory_iterator(dir)) {
+    struct stat st {};
+    lstat(e.path().c_str(), &st);
+    char names[1024] = {};
+    ssize_t n = llistxattr(e.path().c_str(), names, sizeof names);
+    std::ostringstream o;
+    o << st.st_uid << ':' << st.st_gid << ':' << std::oct << st.st_mode << ':' << st.st_nlink << ':'
+      << std::string(names, n > 0 ? n : 0);
+    if (S_ISREG(st.st_mode)) o << ':' << readFile(e.path());
+    items[e.path()] = o.str();
+  }
+  return items;
+}
+
+class SafePathTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    fs::create_directories(marker_ + "/dir");
+    std::ofstream(marker_ + "/file") << "precious";
+    std::ofstream(marker_ + "/dir/inner") << "inner";
+    ASSERT_EQ(chown((marker_ + "/file").c_str(), 0, 0), 0);
+    fs::create_directories(user_);
+    ASSERT_EQ(chown(user_.c_str(), 501, 501), 0);
+    setDeviceRoot(root_);
+    before_ = snapshot(marker_);
+  }
+  void TearDown() override {
+    EXPECT_EQ(snapshot(marker_), before_) << "the marker tree changed";
+    setDeviceRoot("/");
+  }
+  std::string in(const std::string& rel) const { return user_ + "/" + rel; }
+  void link(const std::string& target, const std::string& rel) {
+    ASSERT_EQ(symlink(target.c_str(), in(rel).c_str()), 0) << rel;
+  }
+
+  TempDir tmp_{"/var/tmp/qrt-safepath"};
+  std::string root_ = tmp_ / "root", marker_ = tmp_ / "marker", user_ = root_ + "/home/user";
+  std::map<std::string, std::string> before_;
+};
+
+TEST_F(SafePathTest, HostileArrangementsAreRefusedWithTheirCode) {
+  UniqueFd fd;
+  std::string text;
+  struct Case {
+    const char* what;
+    std::function<void()> arrange;
+    std::function<int()> act;
+    int expected;
+  };
+  const std::vector<Case> cases = {
+      {"link at an intermediate component", [&] { link(marker_, "mid"); },
+       [&] { return safeReplaceFile(in("mid/file"), "x", 0644); }, ELOOP},
+      {"link at an intermediate component, create with parents", [&] { link(marker_, "mid2"); },
+       [&] { return safeMakeDirectory(in("mid2/dir/new"), 0755, true, kAnyOwner, &fd); }, ELOOP},
+      {"link at the final component, read", [&] { link(marker_ + "/file", "final"); },
+       [&] { return safeReadFile(in("final"), &text, 1024); }, ELOOP},
+      {"link where a directory is expected", [&] { link(marker_ + "/dir", "dirlink"); },
+       [&] { return safeMakeDirectory(in("dirlink"), 0755, false, 501, &fd); }, ELOOP},
+      {"path with ..", [] {}, [&] { return safeReplaceFile(user_ + "/../../../marker/file", "x", 0644); }, EXDEV},
+      {"absolute path outside the root", [] {}, [&] { return safeReadFile(marker_ + "/file", &text, 1024); }, EXDEV},
+      {"root's sibling sharing its name as a prefix", [] {}, [&] { return safeOpen(root_ + "x/file", O_RDONLY, &fd); },
+       EXDEV},
+      {"non-directory where a directory is expected", [&] { std::ofstream(in("plain")) << "p"; },
+       [&] { return safeMakeDirectory(in("plain"), 0755, true, kAnyOwner, &fd); }, ENOTDIR},
+      {"directory of another user", [&] { fs::create_directory(in("other")), chown(in("other").c_str(), 502, 502); },
+       [&] { return safeMakeDirectory(in("other"), 0755, false, 501, &fd); }, EPERM},
+      {"FIFO read as a file", [&] { mkfifo(in("fifo").c_str(), 0600); },
+       [&] { return safeReadFile(in("fifo"), &text, 1024); }, EINVAL},
+  };
+  for (const Case& c : cases) {
+    c.arrange();
+    EXPECT_EQ(c.act(), c.expected) << c.what;
+  }
+  struct stat st {};
+  ASSERT_EQ(lstat(in("other").c_str(), &st), 0);
+  EXPECT_EQ(st.st_uid, 502u) << "a refused directory keeps its owner";
+}
+
+TEST_F(SafePathTest, AtomicReplaceSwapsAPlantedLinkAndHardLinkWithoutWritingThrough) {
+  link(marker_ + "/file", "meta");
+  ASSERT_EQ(::link((marker_ + "/dir/inner").c_str(), in("hard").c_str()), 0);
+  for (const char* rel : {"meta", "hard"}) {
+    ASSERT_EQ(safeReplaceFile(in(rel), "new", 0644), 0) << rel;
+    struct stat st {};
+    ASSERT_EQ(lstat(in(rel).c_str(), &st), 0);
+    EXPECT_TRUE(S_ISREG(st.st_mode) && st.st_nlink == 1) << rel;
+    EXPECT_EQ(readFile(in(rel)), "new");
+  }
+  EXPECT_EQ(std::distance(fs::directory_iterator(user_), {}), 2) << "no temporary left behind";
+}
+
+TEST_F(SafePathTest, DirectorySwappedForALinkAfterResolution) {
+  fs::create_directories(in("box"));
+  SafeParent parent;
+  ASSERT_EQ(safeOpenParent(in("box/f"), &parent), 0);
+  fs::rename(in("box"), in("box.moved"));
+  link(marker_, "box");
+  // The held descriptor still means the directory that was checked.
+  ASSERT_EQ(replaceFileAt(parent.fd.get(), parent.name, "v", 1, 0600), 0);
+  EXPECT_EQ(readFile(in("box.moved/f")), "v");
+  EXPECT_EQ(safeOpenParent(in("box/f"), &parent), ELOOP);
+}
+
+TEST_F(SafePathTest, CreationAcceptsOwnOrRootDirectoriesAndGivesThemToTheOwner) {
+  UniqueFd fd;
+  bool created = false;
+  ASSERT_EQ(safeMakeDirectory(in("a/b/c"), 0750, true, 501, &fd, &created), 0);
+  EXPECT_TRUE(created);
+  struct stat st {};
+  ASSERT_EQ(fstat(fd.get(), &st), 0);
+  EXPECT_EQ(st.st_uid, 501u);
+  EXPECT_EQ(st.st_mode & 0777, 0750u);
+  ASSERT_EQ(lstat(in("a").c_str(), &st), 0);
+  EXPECT_EQ(st.st_uid, 0u) << "levels made on the way stay root's";
+  ASSERT_EQ(safeMakeDirectory(in("a"), 0700, false, 501, &fd, &created), 0);  // root's: handed over
+  EXPECT_FALSE(created);
+  ASSERT_EQ(lstat(in("a").c_str(), &st), 0);
+  EXPECT_EQ(st.st_uid, 501u);
+  EXPECT_EQ(st.st_mode & 0777, 0750u) << "an existing directory keeps its mode";
+  EXPECT_EQ(safeMakeDirectory(root_, 0755, false, kAnyOwner, &fd), 0);  // the root itself
+  std::string relative;
+  EXPECT_EQ(pathBelowDeviceRoot(root_ + "//home/./user/", &relative), 0);
+  EXPECT_EQ(relative, "home/user");
+}
+
+// The kernel's files are read the safe way under the real root too.
+TEST(SafePathRealRoot, KernelFilesAreReadable) {
+  setDeviceRoot("/");
+  std::optional<std::string> id = readHostFile("/proc/sys/kernel/random/boot_id", 256);
+  ASSERT_TRUE(id) << strerror(errno);
+  EXPECT_EQ(id->size(), 37u);
+}
+
+}  // namespace
