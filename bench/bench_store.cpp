@@ -1,7 +1,8 @@
 // The container store's two costly paths against floors that make the same
 // system calls without the daemon around them:
 //  - creating a container (staging mkdir, atomic metadata write with fsync and
-//    rename, five sub-directories, rename into place), per creation;
+//    rename, five sub-directories, rename into place and both directories
+//    flushed), per creation;
 //  - the first look-up in a class directory of N containers (the cache build)
 //    against reading and parsing the same N metadata files.
 // Usage: bench_store [creations (default 300)] [containers (default 10000)] [scratch-parent]
@@ -59,6 +60,12 @@ void floorCreate(const std::string& staging, const std::string& classDir, const 
     check(mkdir((dir + "/" + sub).c_str(), 0755) == 0, sub);
   }
   check(rename(dir.c_str(), (classDir + "/" + name).c_str()) == 0, "rename into place");
+  // The move into place is made durable before anyone hears of the container.
+  for (const std::string& parent : {staging, classDir}) {
+    int parentFd = open(parent.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    check(parentFd >= 0 && fsync(parentFd) == 0, "fsync " + parent);
+    close(parentFd);
+  }
 }
 
 // The cache-build floor: read and parse every metadata file of the class directory.
