@@ -14,6 +14,7 @@
 #include <atomic>
 #include <chrono>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <map>
@@ -76,17 +77,23 @@ std::string describe(const Item& i) {
   return out.str() + "}";
 }
 
+// The first few differences, one a line; empty when there are none.
 std::string differences(const Snapshot& before, const Snapshot& after) {
-  std::ostringstream out;
+  std::vector<std::string> lines;
   for (const auto& [path, item] : before) {
     auto now = after.find(path);
-    if (now == after.end()) out << "\n  removed " << path;
-    else if (!(now->second == item)) out << "\n  changed " << path << ": " << describe(item) << "  =>  " << describe(now->second);
+    if (now == after.end())
+      lines.push_back("removed " + path);
+    else if (!(now->second == item))
+      lines.push_back("changed " + path + ": " + describe(item) + "  =>  " + describe(now->second));
   }
   for (const auto& [path, item] : after) {
-    if (!before.count(path)) out << "\n  created " << path << ": " << describe(item);
+    if (!before.count(path)) lines.push_back("created " + path + ": " + describe(item));
   }
-  return out.str();
+  std::string text;
+  for (size_t i = 0; i < lines.size() && i < 8; ++i) text += "\n  " + lines[i];
+  if (lines.size() > 8) text += "\n  ... and " + std::to_string(lines.size() - 8) + " more";
+  return text;
 }
 
 void becomeUser(uid_t uid) {
@@ -122,12 +129,16 @@ class Racer {
     }
     _exit(0);
   }
+  ~Racer() {
+    if (shared_) finish();
+  }
   // Stops the child once it has put everything back; the rounds it ran.
   long finish() {
     shared_->stop.store(true);
     waitpid(pid_, nullptr, 0);
     long rounds = shared_->rounds.load();
     munmap(shared_, sizeof(Shared));
+    shared_ = nullptr;
     return rounds;
   }
 
@@ -146,9 +157,16 @@ bool swapForLink(const std::string& path, const std::string& target) {
   return (rename(path.c_str(), (path + ".away").c_str()) == 0 || errno == ENOENT) &&
          symlink(target.c_str(), path.c_str()) == 0;
 }
-void swapBack(const std::string& path) {
-  unlink(path.c_str());
-  rename((path + ".away").c_str(), path.c_str());
+// One round of a race: the item trades places with a link to target for a
+// moment, atomically, so that the path never goes missing.
+void flip(const std::string& path, const std::string& target) {
+  const std::string link = path + ".link";
+  symlink(target.c_str(), link.c_str());
+  if (renameat2(AT_FDCWD, path.c_str(), AT_FDCWD, link.c_str(), RENAME_EXCHANGE) == 0) {
+    usleep(1000);
+    renameat2(AT_FDCWD, path.c_str(), AT_FDCWD, link.c_str(), RENAME_EXCHANGE);
+  }
+  usleep(300);
 }
 
 class AdversarialTest;
@@ -186,9 +204,9 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
     ASSERT_EQ(mkdir(otherHome().c_str(), 0755), 0);
     ASSERT_EQ(chown(otherHome().c_str(), kOtherUser, kOtherUser), 0);
 
-    setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true},
-                                             {"com.norvane.private.QuarterKit.wipeContainer",
-                                              plist::Array{"com.example.addon"}}});
+    setOwnIdentity("com.example.installer",
+                   {{"com.norvane.private.QuarterKit.allowed", true},
+                    {"com.norvane.private.QuarterKit.wipeContainer", plist::Array{"com.example.addon"}}});
     app = make(kUser, "com.example.app", 2);
     addon = make(kUser, "com.example.addon", 4);
     other = make(kOtherUser, "com.example.other", 2);
@@ -223,25 +241,32 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
     startDaemon();
   }
 
+  // The keys with more added; a key in both takes its value from more.
+  static plist::Dictionary with(plist::Dictionary keys, plist::Dictionary more) { return more.merge(keys), more; }
   static plist::Dictionary selector(const Container& c) {
     return {{"UserID", c.user}, {"ContainerClass", c.cls}, {"Identifier", c.identifier}, {"UUID", uuidData(c.uuid)}};
   }
   static plist::Dictionary stage(const Container& c) {
-    return {{"ContainerClassesArray", plist::Array{c.cls}}, {"UserIDsArray", plist::Array{c.user}},
-            {"UUIDsArray", plist::Array{uuidData(c.uuid)}}, {"IdentifiersArray", plist::Array{c.identifier}}};
+    return {{"ContainerClassesArray", plist::Array{c.cls}},
+            {"UserIDsArray", plist::Array{c.user}},
+            {"UUIDsArray", plist::Array{uuidData(c.uuid)}},
+            {"IdentifiersArray", plist::Array{c.identifier}}};
   }
   static plist::Dictionary replace(const Container& old, const Container& fresh) {
-    return {{"OldContainerUUID", uuidData(old.uuid)},      {"OldContainerClass", old.cls},
-            {"OldContainerUserID", old.user},             {"OldIdentifier", old.identifier},
-            {"NewContainerUUID", uuidData(fresh.uuid)},    {"NewContainerClass", fresh.cls},
-            {"NewContainerUserID", fresh.user},           {"NewIdentifier", fresh.identifier}};
+    return {{"OldContainerUUID", uuidData(old.uuid)},   {"OldContainerClass", old.cls},
+            {"OldContainerUserID", old.user},           {"OldIdentifier", old.identifier},
+            {"NewContainerUUID", uuidData(fresh.uuid)}, {"NewContainerClass", fresh.cls},
+            {"NewContainerUserID", fresh.user},         {"NewIdentifier", fresh.identifier}};
   }
   static plist::Dictionary byName(const Container& c) {
     return {{"UserID", c.user}, {"ContainerClass", c.cls}, {"Identifier", c.identifier}};
   }
   static plist::Dictionary creation(const std::string& identifier, bool transient = false) {
-    return {{"UserID", kUser}, {"ContainerClass", 2}, {"Identifier", identifier},
-            {"CreateIfNecessary", true}, {"Transient", transient}};
+    return {{"UserID", kUser},
+            {"ContainerClass", 2},
+            {"Identifier", identifier},
+            {"CreateIfNecessary", true},
+            {"Transient", transient}};
   }
 
   std::string home() const { return root + "/private/var/mobile"; }
@@ -284,7 +309,9 @@ TEST_P(AdversarialTest, NothingOutsideTheUsersReachChanges) {
     EXPECT_GT(racer->finish(), 0) << "the race never ran";
   }
 
-  EXPECT_EQ(differences(before, snapshot()), "") << "replies (command:code):" << trace_;
+  RecordProperty("replies", trace_);
+  const std::string changed = differences(before, snapshot());
+  EXPECT_TRUE(changed.empty()) << "outside the user's reach:" << changed << "\nreplies (command:code):" << trace_;
   auto connection = qk::Connection::connect(qk::requestSocketPath(root));
   auto reply = connection ? connection->call(request(0, byName(other)), kRequestTimeout) : std::nullopt;
   EXPECT_EQ(codeOf(reply), 1u) << "the daemon no longer serves; replies (command:code):" << trace_;
@@ -305,6 +332,18 @@ std::string otherContainer(const T& t) { return t.other.path; }
 // A hard link in the container to a root-owned file outside, made by root: the
 // kernel's protected_hardlinks keeps users from linking files they do not
 // own, but such a link may predate it or come from a restored backup.
+// As the user: a directory that passes for the container (it has a copy of
+// its metadata file), with links to targets where its default directories belong.
+bool plantDecoy(const T& t, const Container& c, const std::string& dir) {
+  std::error_code error;
+  std::filesystem::create_directories(dir, error);
+  writeFile(dir + "/" + kMetadataFile, readFile(t.in(c, kMetadataFile)));
+  return exists(dir + "/" + kMetadataFile) && symlink(t.outside.c_str(), (dir + "/Documents").c_str()) == 0 &&
+         symlink(t.outside.c_str(), (dir + "/Library").c_str()) == 0 &&
+         symlink((t.root + "/etc").c_str(), (dir + "/tmp").c_str()) == 0;
+}
+std::string baseName(const std::string& path) { return path.substr(path.rfind('/') + 1); }
+
 void hardLinks(T& t) {
   ASSERT_EQ(link((t.outside + "/secret").c_str(), t.in(t.app, "Documents/secret").c_str()), 0);
   ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/suid").c_str()), 0);
@@ -314,13 +353,17 @@ const Case kCases[] = {
     // The metadata file.
     {"MetadataLinkToOutsideFile_SetInfo",
      [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, kMetadataFile), t.outside + "/public"); }); },
-     [](T& t) { t.send(5, [&] { auto k = T::selector(t.app); k["Key"] = "k"; k["Value"] = "v"; return k; }()); }},
+     [](T& t) {
+       t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", "v"}}));
+     }},
     {"MetadataHardLinkToOutsideFile_SetInfo",
      [](T& t) {
        ASSERT_EQ(unlink(t.in(t.app, kMetadataFile).c_str()), 0);
        ASSERT_EQ(link((t.outside + "/public").c_str(), t.in(t.app, kMetadataFile).c_str()), 0);
      },
-     [](T& t) { t.send(5, [&] { auto k = T::selector(t.app); k["Key"] = "k"; k["Value"] = "v"; return k; }()); }},
+     [](T& t) {
+       t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", "v"}}));
+     }},
     {"MetadataLinkToOtherUsersMetadata_Restart_ReadAndSet",
      [](T& t) {
        t.plant([&] { return swapForLink(t.in(t.app, kMetadataFile), t.in(t.other, kMetadataFile)); });
@@ -328,11 +371,10 @@ const Case kCases[] = {
      },
      [](T& t) {
        for (const Container* c : {&t.app, &t.other}) {
-         auto keys = T::selector(*c);
-         t.send(7, [&] { auto k = keys; k["InfoDictRequested"] = true; return k; }());
-         t.send(6, [&] { auto k = keys; k["Key"] = "k"; return k; }());
-         t.send(5, [&] { auto k = keys; k["Key"] = "k"; k["Value"] = "v"; return k; }());
+         t.send(7, T::with(T::selector(*c), {{"InfoDictRequested", true}}));
+         t.send(6, T::with(T::selector(*c), {{"Key", "k"}}));
        }
+       t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", "v"}}));
      }},
     {"MetadataFifo_Restart_LookupAndRead",
      [](T& t) {
@@ -345,7 +387,7 @@ const Case kCases[] = {
      [](T& t) {
        t.send(0, T::byName(t.app));
        t.send(7, T::selector(t.app));
-       t.send(6, [&] { auto k = T::selector(t.app); k["Key"] = "k"; return k; }());
+       t.send(6, T::with(T::selector(t.app), {{"Key", "k"}}));
        t.send(23, T::selector(t.app));
      }},
     // Default sub-directories: recreated and given to the user.
@@ -363,7 +405,8 @@ const Case kCases[] = {
      [](T& t) { t.send(22, T::selector(t.app)); }},
     {"TmpAndCachesHardLinkedToOutsideFiles_Recreate",
      [](T& t) {
-       t.plant([&] { return rmdir(t.in(t.app, "tmp").c_str()) == 0 && rmdir(t.in(t.app, "Library/Caches").c_str()) == 0; });
+       t.plant(
+           [&] { return rmdir(t.in(t.app, "tmp").c_str()) == 0 && rmdir(t.in(t.app, "Library/Caches").c_str()) == 0; });
        ASSERT_EQ(link((t.outside + "/secret").c_str(), t.in(t.app, "tmp").c_str()), 0);
        ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/Caches").c_str()), 0);
      },
@@ -381,11 +424,10 @@ const Case kCases[] = {
        });
      },
      [](T& t) { t.send(0, T::creation("com.example.new")); }},
-    {"ContainersLinkToOutside_Create",
-     [](T& t) { t.plant([&] { return swapForLink(t.containers(), t.outside); }); },
+    {"ContainersLinkToOutside_Create", [](T& t) { t.plant([&] { return swapForLink(t.containers(), t.outside); }); },
      [](T& t) {
        t.send(0, T::creation("com.example.new"));
-       t.send(0, [] { auto k = T::creation("com.example.new"); k["ContainerClass"] = 6; return k; }());
+       t.send(0, T::with(T::creation("com.example.new"), {{"ContainerClass", 6}}));
      }},
     {"HomeLibraryLinkToOutside_CreateTransient",
      [](T& t) { t.plant([&] { return swapForLink(t.home() + "/Library", t.outside); }); },
@@ -465,61 +507,73 @@ const Case kCases[] = {
        t.send(4);
      }},
     // Swaps while requests run.
-    {"RaceContainerAndLink_RecreateSetInfoUsage", [](T&) {},
+    // A link to a decoy that passes for the container (it has the metadata
+    // file), with links to targets where the default directories belong.
+    {"RaceContainerAndLinkToDecoy_RecreateSetInfoUsage",
+     [](T& t) { t.plant([&] { return plantDecoy(t, t.app, t.home() + "/decoy"); }); },
      [](T& t) {
        for (int i = 0; i < 20; ++i) {
          for (uint64_t command : {8, 22, 23}) t.send(command, T::selector(t.app));
-         t.send(5, [&] { auto k = T::selector(t.app); k["Key"] = "k"; k["Value"] = i; return k; }());
+         t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", i}}));
        }
      },
-     [](const T& t) {
-       rmdir(t.in(t.app, "tmp").c_str());
-       swapForLink(t.app.path, t.outside);
-       usleep(300);
-       swapBack(t.app.path);
-       usleep(300);
-     }},
+     [](const T& t) { flip(t.app.path, t.home() + "/decoy"); }},
     {"RaceLibraryAndLink_Recreate", [](T&) {},
      [](T& t) {
        for (int i = 0; i < 30; ++i) t.send(i % 2 ? 8 : 22, T::selector(t.app));
      },
      [](const T& t) {
        rmdir(t.in(t.app, "Library/Caches").c_str());
-       swapForLink(t.in(t.app, "Library"), t.outside);
-       usleep(300);
-       swapBack(t.in(t.app, "Library"));
-       usleep(300);
+       flip(t.in(t.app, "Library"), t.outside);
      }},
-    {"RaceClassDirectoryAndLink_Create", [](T&) {},
+    {"RaceStagedContainerAndLinks_DeathRowPass",
+     [](T& t) {
+       for (int i = 0; i < 40; ++i) {
+         const std::string dir = t.in(t.app, "Documents/d" + std::to_string(i));
+         ASSERT_EQ(mkdir(dir.c_str(), 0755), 0);
+         for (int j = 0; j < 20; ++j) writeFile(dir + "/f" + std::to_string(j), "x");
+       }
+       ASSERT_EQ(system(("chown -R 501:501 " + t.in(t.app, "Documents")).c_str()), 0);
+     },
+     [](T& t) {
+       t.send(3, T::stage(t.app));
+       t.send(4);
+     },
+     // The staged container stays the user's, and reachable, inside the death-row directory.
+     [](const T& t) {
+       static int i = 0;
+       const std::string dir =
+           t.daemonCaches() + "/Dead/" + baseName(t.app.path) + "/Documents/d" + std::to_string(i++ % 40);
+       flip(dir, t.outside);
+     }},
+    {"RaceClassDirectoryAndLink_Create",
+     [](T& t) {
+       t.plant([&] {
+         return mkdir((t.home() + "/fake").c_str(), 0755) == 0 &&
+                symlink(t.outside.c_str(), (t.home() + "/fake/Application").c_str()) == 0;
+       });
+     },
      [](T& t) {
        for (int i = 0; i < 20; ++i) t.send(0, T::creation("com.example.race" + std::to_string(i)));
      },
-     [](const T& t) {
-       const std::string data = t.containers() + "/Data";
-       if (rename(data.c_str(), (data + ".away").c_str()) == 0 && mkdir(data.c_str(), 0755) == 0) {
-         symlink(t.outside.c_str(), (data + "/Application").c_str());
-         usleep(300);
-         unlink((data + "/Application").c_str());
-         rmdir(data.c_str());
-       }
-       rename((data + ".away").c_str(), data.c_str());
-       usleep(300);
-     }},
-    {"RaceContainersAndLink_RegenerateWipeReplaceStageDelete", [](T&) {},
+     [](const T& t) { flip(t.containers() + "/Data", t.home() + "/fake"); }},
+    {"RaceContainersAndLinkToDecoys_WipeReplaceStageRegenerateDelete",
      [](T& t) {
-       for (int i = 0; i < 5; ++i) t.send(9, T::selector(t.app));
+       t.plant([&] {
+         return plantDecoy(t, t.app, t.home() + "/decoys/Data/Application/" + baseName(t.app.path)) &&
+                plantDecoy(t, t.addon, t.home() + "/decoys/Data/AddonPlugin/" + baseName(t.addon.path));
+       });
+     },
+     [](T& t) {
        t.send(12, T::byName(t.app));
        t.send(2, T::replace(t.app, t.make(kUser, "com.example.app", 2, true)));
        t.send(3, T::stage(t.addon));
+       // Last: a new directory name lives in one of the two trees only.
+       for (int i = 0; i < 3; ++i) t.send(9, T::selector(t.app));
        t.send(10, T::byName(t.app));
        t.send(4);
      },
-     [](const T& t) {
-       swapForLink(t.containers(), t.outside);
-       usleep(300);
-       swapBack(t.containers());
-       usleep(300);
-     }},
+     [](const T& t) { flip(t.containers(), t.home() + "/decoys"); }},
 };
 
 INSTANTIATE_TEST_SUITE_P(Arrangements, AdversarialTest, ::testing::ValuesIn(kCases),
