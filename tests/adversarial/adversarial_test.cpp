@@ -446,36 +446,37 @@ const Case kCases[] = {
                     t.send(10, T::byName(t.app));
                     t.send(4);
                   }),
-    containerLink("ContainerLinkToOutside_RegenerateUUID", outsideDir,
+    containerLink("ContainerLinkToOtherUsersContainer_RegenerateUUID", otherContainer,
                   [](T& t) {
                     t.send(9, T::selector(t.app));
                     t.send(8, T::selector(t.app));
                   }),
-    containerLink("ContainerLinkToOutside_DiskUsage", outsideDir, [](T& t) { t.send(23, T::selector(t.app)); }),
-    containerLink("ContainerLinkToOutside_Wipe", outsideDir,
+    containerLink("ContainerLinkToOtherUsersContainer_DiskUsage", otherContainer,
+                  [](T& t) { t.send(23, T::selector(t.app)); }),
+    containerLink("ContainerLinkToOtherUsersContainer_Wipe", otherContainer,
                   [](T& t) {
                     t.send(12, T::byName(t.app));
                     t.send(4);
                   }),
-    {"AddonContainerLinkToOutside_WipeAddon",
-     [](T& t) { t.plant([&] { return swapForLink(t.addon.path, t.outside); }); },
+    {"AddonContainerLinkToOtherUsersContainer_WipeAddon",
+     [](T& t) { t.plant([&] { return swapForLink(t.addon.path, t.other.path); }); },
      [](T& t) {
        t.send(11, T::byName(t.addon));
        t.send(4);
      }},
-    {"OldContainerLinkToOutside_Replace",
+    {"OldContainerLinkToOtherUsersContainer_Replace",
      [](T& t) {
        t.fresh = t.make(kUser, "com.example.app", 2, true);
-       t.plant([&] { return swapForLink(t.app.path, t.outside); });
+       t.plant([&] { return swapForLink(t.app.path, t.other.path); });
      },
      [](T& t) {
        t.send(2, T::replace(t.app, t.fresh));
        t.send(4);
      }},
-    {"NewContainerLinkToOutside_Replace",
+    {"NewContainerLinkToOtherUsersContainer_Replace",
      [](T& t) {
        t.fresh = t.make(kUser, "com.example.app", 2, true);
-       t.plant([&] { return swapForLink(t.fresh.path, t.outside); });
+       t.plant([&] { return swapForLink(t.fresh.path, t.other.path); });
      },
      [](T& t) {
        t.send(2, T::replace(t.app, t.fresh));
