@@ -18,8 +18,8 @@
 #include <fstream>
 #include <functional>
 #include <map>
+#include <new>
 #include <sstream>
-#include <thread>
 
 #include "DaemonFixture.h"
 
@@ -118,6 +118,7 @@ class Racer {
  public:
   Racer(uid_t uid, const std::function<void()>& step) {
     void* shared = mmap(nullptr, sizeof(Shared), PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
+    if (shared == MAP_FAILED) abort();
     shared_ = new (shared) Shared();
     pid_ = fork();
     if (pid_ != 0) return;
@@ -329,9 +330,6 @@ Case containerLink(const char* name, std::string (*target)(const T&), std::funct
 }
 std::string outsideDir(const T& t) { return t.outside; }
 std::string otherContainer(const T& t) { return t.other.path; }
-// A hard link in the container to a root-owned file outside, made by root: the
-// kernel's protected_hardlinks keeps users from linking files they do not
-// own, but such a link may predate it or come from a restored backup.
 // As the user: a directory that passes for the container (it has a copy of
 // its metadata file), with links to targets where its default directories belong.
 bool plantDecoy(const T& t, const Container& c, const std::string& dir) {
@@ -344,6 +342,9 @@ bool plantDecoy(const T& t, const Container& c, const std::string& dir) {
 }
 std::string baseName(const std::string& path) { return path.substr(path.rfind('/') + 1); }
 
+// Hard links in the container to root-owned files outside, made by root: the
+// kernel's protected_hardlinks keeps users from linking files they do not
+// own, but such links may predate it or come from a restored backup.
 void hardLinks(T& t) {
   ASSERT_EQ(link((t.outside + "/secret").c_str(), t.in(t.app, "Documents/secret").c_str()), 0);
   ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/suid").c_str()), 0);
@@ -351,8 +352,8 @@ void hardLinks(T& t) {
 
 const Case kCases[] = {
     // The metadata file.
-    {"MetadataLinkToOutsideFile_SetInfo",
-     [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, kMetadataFile), t.outside + "/public"); }); },
+    {"MetadataLinkToDevicePasswd_SetInfo",
+     [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, kMetadataFile), t.root + "/etc/passwd"); }); },
      [](T& t) {
        t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", "v"}}));
      }},
