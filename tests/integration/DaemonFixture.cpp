@@ -82,6 +82,8 @@ void DaemonFixture::SetUp() {
   char tmpl[] = "/tmp/quarterd-test.XXXXXX";
   ASSERT_NE(mkdtemp(tmpl), nullptr);
   root = tmpl;
+  // The daemon serves users below the root; they must be able to reach it.
+  ASSERT_EQ(chmod(root.c_str(), 0755), 0);
   std::string script = std::string(QRT_TEST_SOURCE_DIR) + "/../scripts/make-device-root";
   ASSERT_EQ(system((script + " " + root).c_str()), 0);
   startDaemon();

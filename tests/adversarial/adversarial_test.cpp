@@ -1,0 +1,584 @@
+// What a user can make the root daemon do to files it does not own: links
+// planted where the daemon expects its own directories and files, hard links
+// to foreign files, and paths swapped while requests run. The daemon may
+// refuse any of these; it must never change anything outside the user's reach
+// and must keep serving.
+#include <fcntl.h>
+#include <grp.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <map>
+#include <new>
+#include <sstream>
+
+#include "DaemonFixture.h"
+
+namespace {
+
+const char* kMetadataFile = ".com.norvane.quarter_kit.metadata.plist";
+constexpr uid_t kUser = 501, kOtherUser = 502;
+constexpr auto kRequestTimeout = std::chrono::seconds(10);
+constexpr auto kRaceLimit = std::chrono::seconds(5);
+
+// Whatever a write, chown, chmod, setxattr, unlink or create through a
+// followed link would change; times and link counts are left out.
+struct Item {
+  uid_t uid = 0;
+  gid_t gid = 0;
+  mode_t mode = 0;
+  off_t size = 0;
+  size_t content = 0;
+  std::string link;
+  std::map<std::string, std::string> xattrs;
+  bool operator==(const Item&) const = default;
+};
+using Snapshot = std::map<std::string, Item>;
+
+std::optional<Item> itemAt(const std::string& path) {
+  struct stat st;
+  if (lstat(path.c_str(), &st) != 0) return std::nullopt;
+  Item item{st.st_uid, st.st_gid, st.st_mode, S_ISDIR(st.st_mode) ? 0 : st.st_size, 0, {}, {}};
+  if (S_ISREG(st.st_mode)) item.content = std::hash<std::string>{}(readFile(path));
+  if (S_ISLNK(st.st_mode)) item.link = readLink(path);
+  char names[4096];
+  ssize_t n = llistxattr(path.c_str(), names, sizeof names);
+  for (ssize_t i = 0; i < n; i += static_cast<ssize_t>(strlen(names + i)) + 1) {
+    char value[4096];
+    ssize_t v = lgetxattr(path.c_str(), names + i, value, sizeof value);
+    item.xattrs[names + i] = std::string(value, static_cast<size_t>(std::max<ssize_t>(v, 0)));
+  }
+  return item;
+}
+
+void addItem(Snapshot& snapshot, const std::string& path, bool recursive) {
+  auto item = itemAt(path);
+  if (!item) return;
+  snapshot[path] = *item;
+  if (recursive && S_ISDIR(item->mode)) {
+    for (const std::string& name : listDirectory(path)) addItem(snapshot, path + "/" + name, true);
+  }
+}
+
+std::string describe(const Item& i) {
+  std::ostringstream out;
+  out << "owner " << i.uid << ":" << i.gid << " mode " << std::oct << i.mode << std::dec << " size " << i.size
+      << " content " << std::hex << i.content << std::dec << (i.link.empty() ? "" : " -> " + i.link) << " xattrs {";
+  for (const auto& [name, value] : i.xattrs) out << name << "=" << value.size() << "B ";
+  return out.str() + "}";
+}
+
+// The first few differences, one a line; empty when there are none.
+std::string differences(const Snapshot& before, const Snapshot& after) {
+  std::vector<std::string> lines;
+  for (const auto& [path, item] : before) {
+    auto now = after.find(path);
+    if (now == after.end())
+      lines.push_back("removed " + path);
+    else if (!(now->second == item))
+      lines.push_back("changed " + path + ": " + describe(item) + "  =>  " + describe(now->second));
+  }
+  for (const auto& [path, item] : after) {
+    if (!before.count(path)) lines.push_back("created " + path + ": " + describe(item));
+  }
+  std::string text;
+  for (size_t i = 0; i < lines.size() && i < 8; ++i) text += "\n  " + lines[i];
+  if (lines.size() > 8) text += "\n  ... and " + std::to_string(lines.size() - 8) + " more";
+  return text;
+}
+
+void becomeUser(uid_t uid) {
+  if (setgroups(0, nullptr) != 0 || setresgid(uid, uid, uid) != 0 || setresuid(uid, uid, uid) != 0) _exit(126);
+}
+
+// Runs step in a child as the user; the child's wait status (0 when step returned true).
+int asUser(uid_t uid, const std::function<bool()>& step) {
+  pid_t pid = fork();
+  if (pid == 0) {
+    becomeUser(uid);
+    _exit(step() ? 0 : 1);
+  }
+  int status = -1;
+  waitpid(pid, &status, 0);
+  return status;
+}
+
+// A child of the user's that repeats a step until stopped or out of time.
+// Forked while this process has no connection open, hence no other thread.
+class Racer {
+ public:
+  Racer(uid_t uid, const std::function<void()>& step) {
+    void* shared = mmap(nullptr, sizeof(Shared), PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
+    if (shared == MAP_FAILED) abort();
+    shared_ = new (shared) Shared();
+    pid_ = fork();
+    if (pid_ != 0) return;
+    becomeUser(uid);
+    const auto deadline = std::chrono::steady_clock::now() + kRaceLimit;
+    while (!shared_->stop.load() && std::chrono::steady_clock::now() < deadline) {
+      step();
+      shared_->rounds.fetch_add(1);
+    }
+    _exit(0);
+  }
+  ~Racer() {
+    if (shared_) finish();
+  }
+  // Stops the child once it has put everything back; the rounds it ran.
+  long finish() {
+    shared_->stop.store(true);
+    waitpid(pid_, nullptr, 0);
+    long rounds = shared_->rounds.load();
+    munmap(shared_, sizeof(Shared));
+    shared_ = nullptr;
+    return rounds;
+  }
+
+ private:
+  struct Shared {
+    std::atomic<bool> stop{false};
+    std::atomic<long> rounds{0};
+  };
+  static_assert(std::atomic<long>::is_always_lock_free && std::atomic<bool>::is_always_lock_free);
+  Shared* shared_ = nullptr;
+  pid_t pid_ = -1;
+};
+
+// Moves a user's item aside and leaves a symbolic link to target in its place.
+bool swapForLink(const std::string& path, const std::string& target) {
+  return (rename(path.c_str(), (path + ".away").c_str()) == 0 || errno == ENOENT) &&
+         symlink(target.c_str(), path.c_str()) == 0;
+}
+// One round of a race: the item trades places with a link to target for a
+// moment, atomically, so that the path never goes missing.
+void flip(const std::string& path, const std::string& target) {
+  const std::string link = path + ".link";
+  symlink(target.c_str(), link.c_str());
+  if (renameat2(AT_FDCWD, path.c_str(), AT_FDCWD, link.c_str(), RENAME_EXCHANGE) == 0) {
+    usleep(1000);
+    renameat2(AT_FDCWD, path.c_str(), AT_FDCWD, link.c_str(), RENAME_EXCHANGE);
+  }
+  usleep(300);
+}
+
+class AdversarialTest;
+struct Case {
+  const char* name;
+  // As root: containers, and the arrangement (planted by the user through asUser).
+  std::function<void(AdversarialTest&)> setup;
+  std::function<void(AdversarialTest&)> requests;
+  // Repeated by the user while the requests run, each round ending where it began.
+  std::function<void(const AdversarialTest&)> race = nullptr;
+};
+
+class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterface<Case> {
+ public:
+  using DaemonFixture::root;
+  void SetUp() override {
+    DaemonFixture::SetUp();
+    if (HasFatalFailure()) return;
+    // The attacker's targets outside the device root, on its file system
+    // so that hard links to them are possible.
+    outside = root + "-outside";
+    ASSERT_EQ(system(("rm -rf " + outside).c_str()), 0);
+    ASSERT_EQ(mkdir(outside.c_str(), 0755), 0);
+    ASSERT_EQ(mkdir((outside + "/sub").c_str(), 0700), 0);
+    for (auto [name, mode] : {std::pair{"/secret", 0600}, {"/public", 0644}, {"/suid", 04755}, {"/sub/deep", 0600}}) {
+      writeFile(outside + name, std::string("marker ") + name);
+      ASSERT_EQ(chmod((outside + name).c_str(), static_cast<mode_t>(mode)), 0) << name;
+    }
+    for (const char* name : {"", "/secret", "/sub"}) {
+      ASSERT_EQ(setxattr((outside + name).c_str(), "user.marker", name, strlen(name), 0), 0) << name;
+    }
+
+    ASSERT_EQ(chown(home().c_str(), kUser, kUser), 0);
+    std::ofstream(root + "/etc/passwd", std::ios::app) << "other:x:502:502::/private/var/other:/bin/sh\n";
+    ASSERT_EQ(mkdir(otherHome().c_str(), 0755), 0);
+    ASSERT_EQ(chown(otherHome().c_str(), kOtherUser, kOtherUser), 0);
+
+    setOwnIdentity("com.example.installer",
+                   {{"com.norvane.private.QuarterKit.allowed", true},
+                    {"com.norvane.private.QuarterKit.wipeContainer", plist::Array{"com.example.addon"}}});
+    app = make(kUser, "com.example.app", 2);
+    addon = make(kUser, "com.example.addon", 4);
+    other = make(kOtherUser, "com.example.other", 2);
+    writeFile(other.path + "/Documents/mine", "the other user's");
+  }
+
+  void TearDown() override {
+    // A daemon stuck on a request would not stop on SIGTERM.
+    if (stuck_ && daemon > 0) killDaemon();
+    if (!HasFailure()) system(("rm -rf " + outside).c_str());
+    DaemonFixture::TearDown();
+  }
+
+  Container make(uid_t user, const std::string& identifier, uint64_t cls, bool transient = false) {
+    Container c = createOrLookup(user, identifier, cls, true, transient);
+    EXPECT_EQ(c.error, 1u) << identifier;
+    return c;
+  }
+
+  // One request, bounded in time; its code (or its silence) goes into the trace.
+  uint64_t send(uint64_t command, const plist::Dictionary& keys = {}) {
+    auto connection = qk::Connection::connect(qk::requestSocketPath(root));
+    auto reply = connection ? connection->call(request(command, keys), kRequestTimeout) : std::nullopt;
+    trace_ += " " + std::to_string(command) + ":" + (reply ? std::to_string(codeOf(reply)) : "no reply");
+    if (!reply) stuck_ = true;
+    return codeOf(reply);
+  }
+
+  void plant(const std::function<bool()>& step) { ASSERT_EQ(asUser(kUser, step), 0) << "the user could not plant"; }
+  void restart() {
+    ASSERT_EQ(stopDaemon(), 0);
+    startDaemon();
+  }
+
+  // The keys with more added; a key in both takes its value from more.
+  static plist::Dictionary with(plist::Dictionary keys, plist::Dictionary more) { return more.merge(keys), more; }
+  static plist::Dictionary selector(const Container& c) {
+    return {{"UserID", c.user}, {"ContainerClass", c.cls}, {"Identifier", c.identifier}, {"UUID", uuidData(c.uuid)}};
+  }
+  static plist::Dictionary stage(const Container& c) {
+    return {{"ContainerClassesArray", plist::Array{c.cls}},
+            {"UserIDsArray", plist::Array{c.user}},
+            {"UUIDsArray", plist::Array{uuidData(c.uuid)}},
+            {"IdentifiersArray", plist::Array{c.identifier}}};
+  }
+  static plist::Dictionary replace(const Container& old, const Container& fresh) {
+    return {{"OldContainerUUID", uuidData(old.uuid)},   {"OldContainerClass", old.cls},
+            {"OldContainerUserID", old.user},           {"OldIdentifier", old.identifier},
+            {"NewContainerUUID", uuidData(fresh.uuid)}, {"NewContainerClass", fresh.cls},
+            {"NewContainerUserID", fresh.user},         {"NewIdentifier", fresh.identifier}};
+  }
+  static plist::Dictionary byName(const Container& c) {
+    return {{"UserID", c.user}, {"ContainerClass", c.cls}, {"Identifier", c.identifier}};
+  }
+  static plist::Dictionary creation(const std::string& identifier, bool transient = false) {
+    return {{"UserID", kUser},
+            {"ContainerClass", 2},
+            {"Identifier", identifier},
+            {"CreateIfNecessary", true},
+            {"Transient", transient}};
+  }
+
+  std::string home() const { return root + "/private/var/mobile"; }
+  std::string otherHome() const { return root + "/private/var/other"; }
+  std::string containers() const { return home() + "/Containers"; }
+  std::string daemonCaches() const { return root + "/private/var/root/Library/Caches/com.norvane.quarterd"; }
+  std::string in(const Container& c, const std::string& sub) const { return c.path + "/" + sub; }
+
+  // Everything outside the user's reach that a request could be steered at.
+  Snapshot snapshot() const {
+    Snapshot s;
+    for (const std::string& tree : {outside, root + "/etc", otherHome()}) addItem(s, tree, true);
+    const std::string daemonHome = root + "/private/var/root";
+    for (const std::string& item :
+         {root, root + "/private", root + "/private/var", daemonHome, daemonHome + "/Library",
+          daemonHome + "/Library/Caches", daemonCaches(), daemonCaches() + "/Dead", daemonCaches() + "/Staging",
+          daemonCaches() + "/Temp", daemonHome + "/Library/QuarterKit", daemonHome + "/Library/QuarterKit/Replace",
+          daemonHome + "/Library/Logs/QuarterKit", root + "/private/var/emplacerd", root + "/run",
+          root + "/run/sandbox/mappings"}) {
+      addItem(s, item, false);
+    }
+    return s;
+  }
+
+  std::string outside;
+  // The user's application and addon containers, a replacement, and another user's container.
+  Container app, addon, fresh, other;
+  std::string trace_;
+  bool stuck_ = false;
+};
+
+TEST_P(AdversarialTest, NothingOutsideTheUsersReachChanges) {
+  const Case& c = GetParam();
+  ASSERT_NO_FATAL_FAILURE(c.setup(*this));
+  const Snapshot before = snapshot();
+  std::optional<Racer> racer;
+  if (c.race) racer.emplace(kUser, [&] { c.race(*this); });
+  c.requests(*this);
+  if (racer) {
+    EXPECT_GT(racer->finish(), 0) << "the race never ran";
+  }
+
+  RecordProperty("replies", trace_);
+  const std::string changed = differences(before, snapshot());
+  EXPECT_TRUE(changed.empty()) << "outside the user's reach:" << changed << "\nreplies (command:code):" << trace_;
+  auto connection = qk::Connection::connect(qk::requestSocketPath(root));
+  auto reply = connection ? connection->call(request(0, byName(other)), kRequestTimeout) : std::nullopt;
+  EXPECT_EQ(codeOf(reply), 1u) << "the daemon no longer serves; replies (command:code):" << trace_;
+  const plist::Value* path = reply ? plist::find(*reply, "ReplyPath") : nullptr;
+  EXPECT_TRUE(path && path->isString() && path->string() == other.path) << "the other user's container moved";
+  if (!reply) stuck_ = true;
+}
+
+void PrintTo(const Case& c, std::ostream* out) { *out << c.name; }
+
+using T = AdversarialTest;
+// The user's own container swapped for a link to target, then the requests.
+Case containerLink(const char* name, std::string (*target)(const T&), std::function<void(T&)> requests) {
+  return {name, [target](T& t) { t.plant([&] { return swapForLink(t.app.path, target(t)); }); }, std::move(requests)};
+}
+std::string outsideDir(const T& t) { return t.outside; }
+std::string otherContainer(const T& t) { return t.other.path; }
+// As the user: a directory that passes for the container (it has a copy of
+// its metadata file), with links to targets where its default directories belong.
+bool plantDecoy(const T& t, const Container& c, const std::string& dir) {
+  std::error_code error;
+  std::filesystem::create_directories(dir, error);
+  writeFile(dir + "/" + kMetadataFile, readFile(t.in(c, kMetadataFile)));
+  return exists(dir + "/" + kMetadataFile) && symlink(t.outside.c_str(), (dir + "/Documents").c_str()) == 0 &&
+         symlink(t.outside.c_str(), (dir + "/Library").c_str()) == 0 &&
+         symlink((t.root + "/etc").c_str(), (dir + "/tmp").c_str()) == 0;
+}
+std::string baseName(const std::string& path) { return path.substr(path.rfind('/') + 1); }
+
+// Hard links in the container to root-owned files outside, made by root: the
+// kernel's protected_hardlinks keeps users from linking files they do not
+// own, but such links may predate it or come from a restored backup.
+void hardLinks(T& t) {
+  ASSERT_EQ(link((t.outside + "/secret").c_str(), t.in(t.app, "Documents/secret").c_str()), 0);
+  ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/suid").c_str()), 0);
+}
+
+const Case kCases[] = {
+    // The metadata file.
+    {"MetadataLinkToDevicePasswd_SetInfo",
+     [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, kMetadataFile), t.root + "/etc/passwd"); }); },
+     [](T& t) {
+       t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", "v"}}));
+     }},
+    {"MetadataHardLinkToOutsideFile_SetInfo",
+     [](T& t) {
+       ASSERT_EQ(unlink(t.in(t.app, kMetadataFile).c_str()), 0);
+       ASSERT_EQ(link((t.outside + "/public").c_str(), t.in(t.app, kMetadataFile).c_str()), 0);
+     },
+     [](T& t) {
+       t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", "v"}}));
+     }},
+    {"MetadataLinkToOtherUsersMetadata_Restart_ReadAndSet",
+     [](T& t) {
+       t.plant([&] { return swapForLink(t.in(t.app, kMetadataFile), t.in(t.other, kMetadataFile)); });
+       t.restart();
+     },
+     [](T& t) {
+       for (const Container* c : {&t.app, &t.other}) {
+         t.send(7, T::with(T::selector(*c), {{"InfoDictRequested", true}}));
+         t.send(6, T::with(T::selector(*c), {{"Key", "k"}}));
+       }
+       t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", "v"}}));
+     }},
+    {"MetadataFifo_Restart_LookupAndRead",
+     [](T& t) {
+       t.plant([&] {
+         const std::string metadata = t.in(t.app, kMetadataFile);
+         return unlink(metadata.c_str()) == 0 && mkfifo(metadata.c_str(), 0644) == 0;
+       });
+       t.restart();
+     },
+     [](T& t) {
+       t.send(0, T::byName(t.app));
+       t.send(7, T::selector(t.app));
+       t.send(6, T::with(T::selector(t.app), {{"Key", "k"}}));
+       t.send(23, T::selector(t.app));
+     }},
+    // Default sub-directories: recreated and given to the user.
+    {"DocumentsLinkToOutside_Recreate",
+     [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, "Documents"), t.outside); }); },
+     [](T& t) { t.send(8, T::selector(t.app)); }},
+    {"LibraryLinkToOutside_RecreateMissing",
+     [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, "Library"), t.outside); }); },
+     [](T& t) { t.send(22, T::selector(t.app)); }},
+    {"TmpLinkToDeviceEtc_Recreate",
+     [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, "tmp"), t.root + "/etc"); }); },
+     [](T& t) { t.send(8, T::selector(t.app)); }},
+    {"DocumentsLinkToOtherUsersDocuments_RecreateMissing",
+     [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, "Documents"), t.in(t.other, "Documents")); }); },
+     [](T& t) { t.send(22, T::selector(t.app)); }},
+    {"TmpAndCachesHardLinkedToOutsideFiles_Recreate",
+     [](T& t) {
+       t.plant(
+           [&] { return rmdir(t.in(t.app, "tmp").c_str()) == 0 && rmdir(t.in(t.app, "Library/Caches").c_str()) == 0; });
+       ASSERT_EQ(link((t.outside + "/secret").c_str(), t.in(t.app, "tmp").c_str()), 0);
+       ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/Caches").c_str()), 0);
+     },
+     [](T& t) {
+       t.send(8, T::selector(t.app));
+       t.send(22, T::selector(t.app));
+     }},
+    // Where new containers are made.
+    {"ClassDirectoryLinkToOutside_Create",
+     [](T& t) {
+       t.plant([&] {
+         const std::string data = t.containers() + "/Data";
+         return rename(data.c_str(), (data + ".away").c_str()) == 0 && mkdir(data.c_str(), 0755) == 0 &&
+                symlink(t.outside.c_str(), (data + "/Application").c_str()) == 0;
+       });
+     },
+     [](T& t) { t.send(0, T::creation("com.example.new")); }},
+    {"ContainersLinkToOutside_Create", [](T& t) { t.plant([&] { return swapForLink(t.containers(), t.outside); }); },
+     [](T& t) {
+       t.send(0, T::creation("com.example.new"));
+       t.send(0, T::with(T::creation("com.example.new"), {{"ContainerClass", 6}}));
+     }},
+    {"HomeLibraryLinkToOutside_CreateTransient",
+     [](T& t) { t.plant([&] { return swapForLink(t.home() + "/Library", t.outside); }); },
+     [](T& t) { t.send(0, T::creation("com.example.new", true)); }},
+    {"HomeLibraryLinkToDaemonLibrary_CreateTransient",
+     [](T& t) { t.plant([&] { return swapForLink(t.home() + "/Library", t.root + "/private/var/root/Library"); }); },
+     [](T& t) { t.send(0, T::creation("com.example.new", true)); }},
+    // The container directory itself.
+    containerLink("ContainerLinkToOutside_StageAndPass", outsideDir,
+                  [](T& t) {
+                    t.send(3, T::stage(t.app));
+                    t.send(4);
+                  }),
+    containerLink("ContainerLinkToOtherUsersContainer_DeleteAndPass", otherContainer,
+                  [](T& t) {
+                    t.send(10, T::byName(t.app));
+                    t.send(4);
+                  }),
+    containerLink("ContainerLinkToOtherUsersContainer_RegenerateUUID", otherContainer,
+                  [](T& t) {
+                    t.send(9, T::selector(t.app));
+                    t.send(8, T::selector(t.app));
+                  }),
+    containerLink("ContainerLinkToOtherUsersContainer_DiskUsage", otherContainer,
+                  [](T& t) { t.send(23, T::selector(t.app)); }),
+    containerLink("ContainerLinkToOtherUsersContainer_Wipe", otherContainer,
+                  [](T& t) {
+                    t.send(12, T::byName(t.app));
+                    t.send(4);
+                  }),
+    {"AddonContainerLinkToOtherUsersContainer_WipeAddon",
+     [](T& t) { t.plant([&] { return swapForLink(t.addon.path, t.other.path); }); },
+     [](T& t) {
+       t.send(11, T::byName(t.addon));
+       t.send(4);
+     }},
+    {"OldContainerLinkToOtherUsersContainer_Replace",
+     [](T& t) {
+       t.fresh = t.make(kUser, "com.example.app", 2, true);
+       t.plant([&] { return swapForLink(t.app.path, t.other.path); });
+     },
+     [](T& t) {
+       t.send(2, T::replace(t.app, t.fresh));
+       t.send(4);
+     }},
+    {"NewContainerLinkToOtherUsersContainer_Replace",
+     [](T& t) {
+       t.fresh = t.make(kUser, "com.example.app", 2, true);
+       t.plant([&] { return swapForLink(t.fresh.path, t.other.path); });
+     },
+     [](T& t) {
+       t.send(2, T::replace(t.app, t.fresh));
+       t.send(8, T::selector(t.app));
+       t.send(4);
+     }},
+    // Hard links to files outside, inside a container that is then worked on.
+    {"HardLinksInContainer_DeleteAndPass", hardLinks,
+     [](T& t) {
+       t.send(10, T::byName(t.app));
+       t.send(4);
+     }},
+    {"HardLinksInContainer_WipeAndPass", hardLinks,
+     [](T& t) {
+       t.send(12, T::byName(t.app));
+       t.send(4);
+     }},
+    {"HardLinksInContainer_UsageRegenerateRecreate", hardLinks,
+     [](T& t) {
+       t.send(23, T::selector(t.app));
+       t.send(9, T::selector(t.app));
+       t.send(22, T::selector(t.app));
+     }},
+    {"FifoInContainer_UsageAndDelete",
+     [](T& t) { t.plant([&] { return mkfifo(t.in(t.app, "Documents/pipe").c_str(), 0644) == 0; }); },
+     [](T& t) {
+       t.send(23, T::selector(t.app));
+       t.send(10, T::byName(t.app));
+       t.send(4);
+     }},
+    // Swaps while requests run.
+    // A link to a decoy that passes for the container (it has the metadata
+    // file), with links to targets where the default directories belong.
+    {"RaceContainerAndLinkToDecoy_RecreateSetInfoUsage",
+     [](T& t) { t.plant([&] { return plantDecoy(t, t.app, t.home() + "/decoy"); }); },
+     [](T& t) {
+       for (int i = 0; i < 20; ++i) {
+         for (uint64_t command : {8, 22, 23}) t.send(command, T::selector(t.app));
+         t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", i}}));
+       }
+     },
+     [](const T& t) { flip(t.app.path, t.home() + "/decoy"); }},
+    {"RaceLibraryAndLink_Recreate", [](T&) {},
+     [](T& t) {
+       for (int i = 0; i < 30; ++i) t.send(i % 2 ? 8 : 22, T::selector(t.app));
+     },
+     [](const T& t) {
+       rmdir(t.in(t.app, "Library/Caches").c_str());
+       flip(t.in(t.app, "Library"), t.outside);
+     }},
+    {"RaceStagedContainerAndLinks_DeathRowPass",
+     [](T& t) {
+       for (int i = 0; i < 40; ++i) {
+         const std::string dir = t.in(t.app, "Documents/d" + std::to_string(i));
+         ASSERT_EQ(mkdir(dir.c_str(), 0755), 0);
+         for (int j = 0; j < 20; ++j) writeFile(dir + "/f" + std::to_string(j), "x");
+       }
+       ASSERT_EQ(system(("chown -R 501:501 " + t.in(t.app, "Documents")).c_str()), 0);
+     },
+     [](T& t) {
+       t.send(3, T::stage(t.app));
+       t.send(4);
+     },
+     // The staged container stays the user's, and reachable, inside the death-row directory.
+     [](const T& t) {
+       static int i = 0;
+       const std::string dir =
+           t.daemonCaches() + "/Dead/" + baseName(t.app.path) + "/Documents/d" + std::to_string(i++ % 40);
+       flip(dir, t.outside);
+     }},
+    {"RaceClassDirectoryAndLink_Create",
+     [](T& t) {
+       t.plant([&] {
+         return mkdir((t.home() + "/fake").c_str(), 0755) == 0 &&
+                symlink(t.outside.c_str(), (t.home() + "/fake/Application").c_str()) == 0;
+       });
+     },
+     [](T& t) {
+       for (int i = 0; i < 20; ++i) t.send(0, T::creation("com.example.race" + std::to_string(i)));
+     },
+     [](const T& t) { flip(t.containers() + "/Data", t.home() + "/fake"); }},
+    {"RaceContainersAndLinkToDecoys_WipeReplaceStageRegenerateDelete",
+     [](T& t) {
+       t.plant([&] {
+         return plantDecoy(t, t.app, t.home() + "/decoys/Data/Application/" + baseName(t.app.path)) &&
+                plantDecoy(t, t.addon, t.home() + "/decoys/Data/AddonPlugin/" + baseName(t.addon.path));
+       });
+     },
+     [](T& t) {
+       t.send(12, T::byName(t.app));
+       t.send(2, T::replace(t.app, t.make(kUser, "com.example.app", 2, true)));
+       t.send(3, T::stage(t.addon));
+       // Last: a new directory name lives in one of the two trees only.
+       for (int i = 0; i < 3; ++i) t.send(9, T::selector(t.app));
+       t.send(10, T::byName(t.app));
+       t.send(4);
+     },
+     [](const T& t) { flip(t.containers(), t.home() + "/decoys"); }},
+};
+
+INSTANTIATE_TEST_SUITE_P(Arrangements, AdversarialTest, ::testing::ValuesIn(kCases),
+                         [](const ::testing::TestParamInfo<Case>& info) { return std::string(info.param.name); });
+
+}  // namespace
