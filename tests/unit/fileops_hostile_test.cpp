@@ -108,6 +108,7 @@ TEST_F(HostileTest, NoOperationReachesThroughALink) {
       {"read through a link", [&] { return QRT_dictionaryWithContentsOfURL(url("filelink"), &error_).has_value(); }},
       {"class of a link", [&] { return fm_.setDataProtectionClassOfItemAtURL(url("filelink"), 3, {}, &error_); }},
       {"class below a link", [&] { return fm_.dataProtectionClassOfItemAtURL(url("link/file"), &cls, &error_); }},
+      {"class read of a link", [&] { return fm_.dataProtectionClassOfItemAtURL(url("filelink"), &cls, &error_); }},
       {"ownership below a link", [&] { return fm_.standardizeOwnershipAtURL(url("link/dir"), 501, 501, &error_); }},
       {"top ACL of a link", [&] { return fm_.setTopLevelSystemContainerACLAtURL(url("link"), &error_); }},
   };
