@@ -14,7 +14,6 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 #include <string>
 #include <tuple>
 #include <vector>
@@ -28,12 +27,6 @@
 namespace fs = std::filesystem;
 
 namespace {
-
-std::string readFile(const std::string& p) {
-  std::stringstream s;
-  s << std::ifstream(p).rdbuf();
-  return s.str();
-}
 
 std::string xattr(const std::string& p, const char* name) {
   char buf[4096];
@@ -201,7 +194,7 @@ TEST_F(FileManagerTest, CopyKeepsDataModeOwnerXattrsAclsAndLinks) {
   ASSERT_EQ(utimensat(AT_FDCWD, path("src/sub/file").c_str(), old, 0), 0);
 
   ASSERT_TRUE(fm_.copyItemAtURL(url("src"), url("dst"), &error_)) << error_->description();
-  EXPECT_EQ(readFile(path("dst/sub/file")), "payload");
+  EXPECT_EQ(fileText(path("dst/sub/file")), "payload");
   auto meta = [](const std::string& p) {
     struct stat st {};
     EXPECT_EQ(lstat(p.c_str(), &st), 0) << p;
@@ -239,8 +232,8 @@ TEST_F(FileManagerTest, MoveAcrossFileSystemsCopiesThenRemovesTheSource) {
   if (!mountTmpfs("mnt")) GTEST_SKIP() << "mounting tmpfs refused: " << strerror(errno);
   ASSERT_TRUE(fm_.moveItemAtURL(url("src"), url("mnt/moved"), &error_)) << error_->description();
   EXPECT_FALSE(exists("src"));
-  EXPECT_EQ(readFile(path("mnt/moved/a/one")), "1");
-  EXPECT_EQ(readFile(path("mnt/moved/two")), "2");
+  EXPECT_EQ(fileText(path("mnt/moved/a/one")), "1");
+  EXPECT_EQ(fileText(path("mnt/moved/two")), "2");
   EXPECT_EQ(xattr(path("mnt/moved/two"), "trusted.k"), "v");
   EXPECT_EQ(fs::read_symlink(path("mnt/moved/link")), "a/one");
 }

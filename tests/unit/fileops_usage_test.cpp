@@ -9,7 +9,6 @@
 #include <cerrno>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 #include <string>
 
 #include "Daemon/fileops/QRTFileManager.h"
@@ -43,11 +42,7 @@ class UsageTest : public ::testing::Test {
     EXPECT_EQ(lstat(path(rel).c_str(), &st), 0) << rel;
     return static_cast<uint64_t>(st.st_blocks) * 512;
   }
-  std::string logText() const {
-    std::stringstream s;
-    s << std::ifstream(tmp_ / "quarterd.log").rdbuf();
-    return s.str();
-  }
+  std::string logText() const { return fileText(tmp_ / "quarterd.log"); }
   bool logged(const std::string& line) const { return logText().find(line) != std::string::npos; }
   int32_t classOf(const std::string& rel) {
     int32_t cls = -100;
