@@ -231,7 +231,6 @@ TEST_F(CommandTest, RegenerateDirectoryUUIDMovesTheContainerOnly) {
   EXPECT_EQ(parentOf(after.path), parentOf(app.path));
   auto directoryUUID = QRTUUID::fromString(baseName(after.path));
   ASSERT_TRUE(directoryUUID) << after.path;
-  EXPECT_EQ(directoryUUID->UUIDString(), baseName(after.path));
   EXPECT_NE(*directoryUUID, app.uuid);
   EXPECT_FALSE(exists(app.path));
   EXPECT_TRUE(exists(after.path + "/Documents/note.txt"));
@@ -242,7 +241,6 @@ TEST_F(CommandTest, RegenerateDirectoryUUIDMovesTheContainerOnly) {
   // A container under its well-known name keeps it.
   Container system = wellKnownSystemContainer();
   EXPECT_EQ(codeOf(call(9, selector(system))), 11u);
-  EXPECT_TRUE(logContains("Non-UUID last path component: com.norvane.mapsd"));
   EXPECT_TRUE(exists(system.path + "/" + kMetadataFile));
   EXPECT_EQ(createOrLookup(499, "com.norvane.mapsd", 12, false).path, system.path);
 
@@ -269,7 +267,6 @@ TEST_F(CommandTest, DeleteStagesOnDeathRowUntilAPassRuns) {
   EXPECT_EQ(codeOf(call(4)), 1u);
   EXPECT_TRUE(listDirectory(deadDirectory()).empty());
   EXPECT_EQ(codeOf(call(10, keys)), 21u);
-  EXPECT_TRUE(logContains("Failed to lookup existing container to delete-identifier: com.example.app"));
 }
 
 TEST_F(CommandTest, StageForDeleteTakesParallelArrays) {
@@ -305,7 +302,6 @@ TEST_F(CommandTest, StageForDeleteTakesParallelArrays) {
       {"user check", 3, with(one, {{"ContainerClassesArray", plist::Array{1u}}}), 38},
       {"nothing to stage", 3, {}, 1},
   });
-  EXPECT_TRUE(logContains("Got non-Array input for the identifiers array"));
   EXPECT_TRUE(cIsLive()) << "refused requests stage nothing";
   // Extra user ids have no class to be checked against; the daemon survives them.
   EXPECT_NE(codeOf(call(3, entries({2u}, {501u, 7u, "x", 501u}, {uuidData(d.uuid)}, {"com.example.d"}))), 0u);
@@ -330,7 +326,6 @@ TEST_F(CommandTest, DeathRowMovesWhatItCannotRemoveToTmp) {
   [[maybe_unused]] int unlocked = system(unlock.c_str());
   EXPECT_TRUE(movedAside);
   EXPECT_EQ(listDirectory(dead), std::vector<std::string>{".hidden"});
-  EXPECT_TRUE(logContains("Couldn't remove, so moving item to /tmp"));
   EXPECT_EQ(codeOf(call(4)), 1u) << "a second pass finds nothing to do";
 }
 
@@ -377,7 +372,6 @@ TEST_F(CommandTest, WipesKeepIdentityAndPathButNotContent) {
       {"listed but missing", 11, byName(501, 4, "com.example.absent"), 21},
       {"no identifier", 11, {{"UserID", 501u}, {"ContainerClass", 4u}}, 18},
   });
-  EXPECT_TRUE(logContains("Not entitled to wipe container with identifier: com.example.other"));
   EXPECT_TRUE(exists(other.path + "/Documents/old.txt"));
 }
 
@@ -401,10 +395,12 @@ TEST_F(CommandTest, DiskUsageCountsAllocatedBytesOnce) {
   writeFile(bundle.path + "/resource", std::string(50000, 'd'));
   EXPECT_EQ(u64At(call(23, selector(bundle)), "ReplyDiskUsage"), bundleBytes);
 
-  for (const auto& keys : {unknown(app), without(selector(app), "UUID")}) {
-    EXPECT_EQ(u64At(call(23, keys), "ReplyDiskUsage"), 0u) << "even a refusal answers a usage";
+  // Even a refusal answers a usage.
+  for (const auto& [keys, code] : {std::pair(unknown(app), 21u), std::pair(without(selector(app), "UUID"), 11u)}) {
+    reply = call(23, keys);
+    EXPECT_EQ(codeOf(reply), code);
+    EXPECT_EQ(u64At(reply, "ReplyDiskUsage"), 0u) << code;
   }
-  expectCodes({{"missing container", 23, unknown(app), 21}, {"no UUID", 23, without(selector(app), "UUID"), 11}});
 }
 
 }  // namespace

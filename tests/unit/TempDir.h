@@ -3,8 +3,13 @@
 #pragma once
 
 #include <stdlib.h>
+#include <sys/stat.h>
+#include <sys/xattr.h>
 
 #include <filesystem>
+#include <fstream>
+#include <map>
+#include <sstream>
 #include <stdexcept>
 #include <string>
 #include <system_error>
@@ -28,3 +33,27 @@ class TempDir {
  private:
   std::string path_;
 };
+
+inline std::string fileText(const std::string& path) {
+  std::stringstream s;
+  s << std::ifstream(path).rdbuf();
+  return s.str();
+}
+
+// Owner, mode, link count (if asked), attribute names and content of every
+// item below dir: what a marker tree compares before and after a test.
+inline std::map<std::string, std::string> treeSnapshot(const std::string& dir, bool linkCount = true) {
+  std::map<std::string, std::string> items;
+  for (auto& e : std::filesystem::recursive_directory_iterator(dir)) {
+    struct stat st {};
+    lstat(e.path().c_str(), &st);
+    char names[1024] = {};
+    ssize_t n = llistxattr(e.path().c_str(), names, sizeof names);
+    std::ostringstream o;
+    o << st.st_uid << ':' << st.st_gid << ':' << std::oct << st.st_mode << ':' << (linkCount ? st.st_nlink : 0) << ':'
+      << std::string(names, n > 0 ? static_cast<size_t>(n) : 0);
+    if (S_ISREG(st.st_mode)) o << ':' << fileText(e.path());
+    items[e.path()] = o.str();
+  }
+  return items;
+}

@@ -9,12 +9,10 @@
 #include <cerrno>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 #include <string>
 
 #include "Daemon/fileops/QRTFileManager.h"
 #include "TempDir.h"
-#include "platform/DeviceRoot.h"
 #include "platform/Log.h"
 
 namespace fs = std::filesystem;
@@ -27,10 +25,7 @@ class UsageTest : public ::testing::Test {
     ASSERT_EQ(mkdir(root_.c_str(), 0755), 0);
     platform::logOpen(tmp_ / "quarterd.log", "usage-test", 7);
   }
-  void TearDown() override {
-    platform::logClose();
-    platform::setDeviceRoot(oldRoot_);
-  }
+  void TearDown() override { platform::logClose(); }
 
   std::string path(const std::string& rel) const { return root_ + "/" + rel; }
   QRTURL url(const std::string& rel) const { return QRTURL::fileURL(path(rel)); }
@@ -43,11 +38,7 @@ class UsageTest : public ::testing::Test {
     EXPECT_EQ(lstat(path(rel).c_str(), &st), 0) << rel;
     return static_cast<uint64_t>(st.st_blocks) * 512;
   }
-  std::string logText() const {
-    std::stringstream s;
-    s << std::ifstream(tmp_ / "quarterd.log").rdbuf();
-    return s.str();
-  }
+  std::string logText() const { return fileText(tmp_ / "quarterd.log"); }
   bool logged(const std::string& line) const { return logText().find(line) != std::string::npos; }
   int32_t classOf(const std::string& rel) {
     int32_t cls = -100;
@@ -56,7 +47,7 @@ class UsageTest : public ::testing::Test {
   }
 
   TempDir tmp_{"/var/tmp/qrt-usage-test"};
-  std::string root_ = tmp_ / "t", oldRoot_ = platform::deviceRoot();
+  std::string root_ = tmp_ / "t";
   QRTFileManager& fm_ = QRTFileManager::defaultManager();
   QRTErrorRef error_;
 };
@@ -90,17 +81,12 @@ TEST_F(UsageTest, HardLinkedFileCountedOncePerWalk) {
   const uint64_t expected = allocated("c/d0/twin") + allocated("shared");
   EXPECT_EQ(fm_.diskUsageForURL(url("c")), expected);
   EXPECT_EQ(fm_.diskUsageForURL(url("c")), expected);  // nothing remembered between walks
-  EXPECT_TRUE(logged("Skipping hardlinked file at " + path("c/d")));
 }
 
 TEST_F(UsageTest, RootThatIsNoDirectoryMeasuresZeroAndIsLogged) {
   makeFile("file", 5000);
-  makeFile("dir/inner", 5000);
-  ASSERT_EQ(symlink(path("dir").c_str(), path("link").c_str()), 0);
-  for (const char* rel : {"missing", "file", "link"}) EXPECT_EQ(fm_.diskUsageForURL(url(rel)), 0u) << rel;
+  for (const char* rel : {"missing", "file"}) EXPECT_EQ(fm_.diskUsageForURL(url(rel)), 0u) << rel;  // links: hostile suite
   EXPECT_EQ(fm_.diskUsageForURL(QRTURL()), 0u);
-  EXPECT_TRUE(logged("Failed to open directory " + path("missing") + " : No such file or directory"));
-  EXPECT_TRUE(logged("Failed to open directory " + path("link") + " : Too many levels of symbolic links"));
 }
 
 // An app can nest directories deeper than any path the kernel takes.
@@ -121,7 +107,6 @@ TEST_F(UsageTest, ChildDirectoryBeyondPathMaxIsLeftOut) {
   close(fd);
   sync();
   EXPECT_EQ(fm_.diskUsageForURL(url("c")), allocated("c/counted"));
-  EXPECT_TRUE(logged("Failed to create path to child directory by appending \"" + name + "\" to "));
   fs::remove_all(path("c"));  // the TempDir's removal would stop at the long path
 }
 
@@ -144,33 +129,7 @@ TEST_F(UsageTest, ClassIsSetAndReadOnFilesAndDirectoriesUnlessThePredicateDeclin
                                                     &error_));
   EXPECT_EQ(classOf("f"), 2);
   EXPECT_FALSE(error_);
-}
-
-TEST_F(UsageTest, WhileLockedClassOneCannotBeSetButOthersCan) {
-  fs::create_directories(tmp_ / "run/device");
-  std::ofstream(tmp_ / "run/device/lockstate") << "1\n";
-  platform::setDeviceRoot(tmp_.path());
-  makeFile("f", 10);
-  EXPECT_FALSE(fm_.setDataProtectionClassOfItemAtURL(url("f"), 1, {}, &error_));
-  ASSERT_TRUE(error_);
-  EXPECT_EQ(error_->domain(), QRTPOSIXErrorDomain);
-  EXPECT_EQ(error_->code(), EPERM);
-  EXPECT_EQ(error_->localizedDescription(), "Failed to setclass(1) on file " + path("f") + ": Operation not permitted");
-  EXPECT_EQ(classOf("f"), 0);  // unchanged
-  EXPECT_TRUE(fm_.setDataProtectionClassOfItemAtURL(url("f"), 3, {}, &error_));
-  EXPECT_EQ(classOf("f"), 3);
-}
-
-TEST_F(UsageTest, SymbolicLinksAndMissingItemsFailToOpen) {
-  makeFile("target", 10);
-  ASSERT_EQ(symlink(path("target").c_str(), path("link").c_str()), 0);
-  int32_t cls = 99;
-  EXPECT_FALSE(fm_.dataProtectionClassOfItemAtURL(url("link"), &cls, &error_));
-  EXPECT_EQ(error_->localizedDescription(), "Failed to open " + path("link") + " : Too many levels of symbolic links");
-  EXPECT_EQ(cls, 99);
-  EXPECT_FALSE(fm_.setDataProtectionClassOfItemAtURL(url("link"), 3, {}, &error_));
-  EXPECT_EQ(error_->code(), ELOOP);
-  EXPECT_EQ(classOf("target"), 0);  // the target was left alone
+  // Links are refused with the others in the hostile suite.
   EXPECT_FALSE(fm_.setDataProtectionClassOfItemAtURL(url("missing"), 3, {}, &error_));
   EXPECT_EQ(error_->code(), ENOENT);
 }

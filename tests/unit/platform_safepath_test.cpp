@@ -3,7 +3,6 @@
 // everything the user may not change; no case may touch it.
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -13,7 +12,6 @@
 #include <functional>
 #include <map>
 #include <optional>
-#include <sstream>
 #include <string>
 
 #include "TempDir.h"
@@ -26,29 +24,6 @@ using namespace platform;
 
 namespace {
 
-std::string readFile(const std::string& p) {
-  std::stringstream s;
-  s << std::ifstream(p).rdbuf();
-  return s.str();
-}
-
-// Owner, mode, content and attributes of every item below dir.
-std::map<std::string, std::string> snapshot(const std::string& dir) {
-  std::map<std::string, std::string> items;
-  for (auto& e : fs::recursive_directory_iterator(dir)) {
-    struct stat st {};
-    lstat(e.path().c_str(), &st);
-    char names[1024] = {};
-    ssize_t n = llistxattr(e.path().c_str(), names, sizeof names);
-    std::ostringstream o;
-    o << st.st_uid << ':' << st.st_gid << ':' << std::oct << st.st_mode << ':' << st.st_nlink << ':'
-      << std::string(names, n > 0 ? n : 0);
-    if (S_ISREG(st.st_mode)) o << ':' << readFile(e.path());
-    items[e.path()] = o.str();
-  }
-  return items;
-}
-
 class SafePathTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -59,10 +34,10 @@ class SafePathTest : public ::testing::Test {
     fs::create_directories(user_);
     ASSERT_EQ(chown(user_.c_str(), 501, 501), 0);
     setDeviceRoot(root_);
-    before_ = snapshot(marker_);
+    before_ = treeSnapshot(marker_);
   }
   void TearDown() override {
-    EXPECT_EQ(snapshot(marker_), before_) << "the marker tree changed";
+    EXPECT_EQ(treeSnapshot(marker_), before_) << "the marker tree changed";
     setDeviceRoot("/");
   }
   std::string in(const std::string& rel) const { return user_ + "/" + rel; }
@@ -121,7 +96,7 @@ TEST_F(SafePathTest, AtomicReplaceSwapsAPlantedLinkAndHardLinkWithoutWritingThro
     struct stat st {};
     ASSERT_EQ(lstat(in(rel).c_str(), &st), 0);
     EXPECT_TRUE(S_ISREG(st.st_mode) && st.st_nlink == 1) << rel;
-    EXPECT_EQ(readFile(in(rel)), "new");
+    EXPECT_EQ(fileText(in(rel)), "new");
   }
   EXPECT_EQ(std::distance(fs::directory_iterator(user_), {}), 2) << "no temporary left behind";
 }
@@ -134,7 +109,7 @@ TEST_F(SafePathTest, DirectorySwappedForALinkAfterResolution) {
   link(marker_, "box");
   // The held descriptor still means the directory that was checked.
   ASSERT_EQ(replaceFileAt(parent.fd.get(), parent.name, "v", 1, 0600), 0);
-  EXPECT_EQ(readFile(in("box.moved/f")), "v");
+  EXPECT_EQ(fileText(in("box.moved/f")), "v");
   EXPECT_EQ(safeOpenParent(in("box/f"), &parent), ELOOP);
 }
 

@@ -51,12 +51,10 @@ class ContainerCacheTest : public ::testing::Test {
 
 TEST_F(ContainerCacheTest, RejectsBadInputBeforeTouchingAnything) {
   QRTErrorRef error;
-  EXPECT_FALSE(cache.containerForUser(501, 0, std::string("a"), false, &error));
-  EXPECT_EQ(error->code(), 47);
-  EXPECT_FALSE(cache.containerForUser(501, 14, std::string("a"), false, &error));
-  EXPECT_EQ(error->code(), 47);
-  EXPECT_FALSE(cache.containerForUser(501, 2, std::nullopt, false, &error));
-  EXPECT_EQ(error->code(), 47);
+  for (const auto& [cls, identifier] : {std::pair<uint64_t, std::optional<std::string>>{0, "a"}, {14, "a"}, {2, {}}}) {
+    EXPECT_FALSE(cache.containerForUser(501, cls, identifier, false, &error)) << cls;
+    EXPECT_EQ(error->code(), 47) << cls;
+  }
   // A user that cannot own the class: the build refuses, the look-up says rebuild failed.
   EXPECT_FALSE(cache.containerForUser(501, 1, std::string("a"), false, &error));
   EXPECT_EQ(error->code(), 43);

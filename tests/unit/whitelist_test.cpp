@@ -1,45 +1,29 @@
 #include <gtest/gtest.h>
 
-#include <algorithm>
-
 #include "Daemon/store/QRTWhitelist.h"
 
 namespace {
 
 const QRTWhitelist& whitelist() { return QRTWhitelist::sharedWhitelist(); }
 
+// Each list answers only for its own class, and only for the exact name.
 TEST(WhitelistTest, EachListAnswersOnlyForItsClass) {
-  EXPECT_TRUE(whitelist().containerIdIsWellknown("com.norvane.mapsd", 12));
-  EXPECT_FALSE(whitelist().containerIdIsWellknown("com.norvane.mapsd", 13));
-  EXPECT_EQ(whitelist().wellknownContainerForId("com.norvane.mapsd", 12), "com.norvane.mapsd");
-  EXPECT_EQ(whitelist().wellknownContainerForId("com.norvane.mapsd", 13), std::nullopt);
-
-  EXPECT_TRUE(whitelist().containerIdIsWellknown("systemgroup.com.norvane.assetpacks", 13));
-  EXPECT_FALSE(whitelist().containerIdIsWellknown("systemgroup.com.norvane.assetpacks", 12));
-  EXPECT_EQ(whitelist().wellknownSystemGroupContainerForId("systemgroup.com.norvane.assetpacks"),
-            "systemgroup.com.norvane.assetpacks");
-  EXPECT_FALSE(whitelist().systemContainerIdIsWellknown("systemgroup.com.norvane.assetpacks"));
-}
-
-TEST(WhitelistTest, OtherClassesAndCaseVariantsAreNeverWellKnown) {
-  for (uint64_t containerClass : {0, 2, 7, 14}) {
-    EXPECT_FALSE(whitelist().containerIdIsWellknown("com.norvane.mapsd", containerClass)) << containerClass;
-    EXPECT_FALSE(whitelist().containerIdIsWellknown("systemgroup.com.norvane.policysets", containerClass));
-    EXPECT_EQ(whitelist().wellknownContainerForId("com.norvane.lazyloadd", containerClass), std::nullopt);
+  const std::tuple<const char*, uint64_t, bool> cases[] = {
+      {"com.norvane.mapsd", 12, true},  {"com.norvane.mapsd", 13, false},
+      {"systemgroup.com.norvane.assetpacks", 13, true}, {"systemgroup.com.norvane.assetpacks", 12, false},
+      {"com.norvane.MapsD", 12, false}, {"", 12, false},
+  };
+  for (const auto& [identifier, cls, known] : cases) {
+    EXPECT_EQ(whitelist().containerIdIsWellknown(identifier, cls), known) << identifier << " " << cls;
+    EXPECT_EQ(whitelist().wellknownContainerForId(identifier, cls),
+              known ? std::optional<std::string>(identifier) : std::nullopt) << identifier << " " << cls;
   }
-  EXPECT_FALSE(whitelist().containerIdIsWellknown("com.norvane.MapsD", 12));
+  for (uint64_t cls : {0, 2, 7, 14}) {
+    EXPECT_FALSE(whitelist().containerIdIsWellknown("com.norvane.mapsd", cls)) << cls;
+    EXPECT_FALSE(whitelist().containerIdIsWellknown("systemgroup.com.norvane.policysets", cls)) << cls;
+  }
+  EXPECT_FALSE(whitelist().systemContainerIdIsWellknown("systemgroup.com.norvane.assetpacks"));
   EXPECT_FALSE(whitelist().systemGroupContainerIdIsWellknown("SystemGroup.com.norvane.assetpacks"));
-  EXPECT_FALSE(whitelist().containerIdIsWellknown("", 12));
-}
-
-TEST(WhitelistTest, ListsHoldTheFixedIdentifiers) {
-  auto system = whitelist().wellknownSystemContainers();
-  std::sort(system.begin(), system.end());
-  EXPECT_EQ(system, (std::vector<std::string>{"com.norvane.lazyloadd", "com.norvane.mapsd"}));
-  auto groups = whitelist().wellknownSystemGroupContainers();
-  EXPECT_EQ(groups.size(), 5u);
-  for (const std::string& identifier : groups)
-    EXPECT_EQ(whitelist().wellknownSystemGroupContainerForId(identifier), identifier);
 }
 
 TEST(WhitelistTest, AnInstanceAnswersFromItsOwnMaps) {
