@@ -14,6 +14,7 @@
 #include <string_view>
 
 #include "platform/FileIO.h"
+#include "platform/SafePath.h"
 
 namespace platform {
 
@@ -23,6 +24,10 @@ struct LogFile {
   std::mutex mutex;
   int fd = -1;
   std::string path;
+  // The log's directory and the file's name in it: opening and rotation act
+  // relative to the directory, never on the path again.
+  UniqueFd directory;
+  std::string name;
   uint32_t fileCount = 1;
   uint64_t sizeLimit = 0;  // 0: never rotate
   uint64_t size = 0;
@@ -50,12 +55,13 @@ std::string levelTag(int level) {
 int syslogPriority(int level) { return level < LOG_EMERG ? LOG_EMERG : level > LOG_DEBUG ? LOG_DEBUG : level; }
 
 // A message is one line whatever a client put in an identifier or a path:
-// control bytes and DEL are written as \xNN.
+// control bytes (but the tab some fixed messages begin with) and DEL are
+// written as \xNN.
 std::string escaped(std::string_view text) {
   std::string out;
   out.reserve(text.size());
   for (unsigned char c : text) {
-    if (c >= 0x20 && c != 0x7f) {
+    if ((c >= 0x20 || c == '\t') && c != 0x7f) {
       out += static_cast<char>(c);
       continue;
     }
@@ -95,10 +101,25 @@ void setSyslogIdentity(const std::string& name) {
   openlog(current->c_str(), LOG_PID, LOG_DAEMON);
 }
 
+// The directory is resolved like every path below the device root; a log
+// elsewhere (a test's /dev/null) is opened as it is, still with no link at
+// its last component followed.
+bool openDirectoryLocked(LogFile& file) {
+  const size_t slash = file.path.rfind('/');
+  const std::string directory = slash == std::string::npos ? "." : slash == 0 ? "/" : file.path.substr(0, slash);
+  file.name = file.path.substr(slash == std::string::npos ? 0 : slash + 1);
+  file.directory.reset();
+  int err = safeOpen(directory, O_RDONLY | O_DIRECTORY, &file.directory);
+  if (err == EXDEV) file.directory.reset(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  else if (err) errno = err;
+  return file.directory.valid();
+}
+
 bool openFileLocked(LogFile& file) {
-  // The log lives in root's own directories; a link put in its place is
-  // still not followed.
-  file.fd = open(file.path.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOCTTY | O_NOFOLLOW, 0644);
+  file.fd = file.directory.valid()
+                ? openat(file.directory.get(), file.name.c_str(),
+                         O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOCTTY | O_NOFOLLOW, 0644)
+                : -1;
   if (file.fd < 0) {
     gFileOpen = false;
     return false;
@@ -115,7 +136,7 @@ void closeFileLocked(LogFile& file) {
   gFileOpen = false;
 }
 
-std::string numbered(const std::string& path, uint32_t index) { return path + "." + std::to_string(index); }
+std::string numbered(const std::string& name, uint32_t index) { return name + "." + std::to_string(index); }
 
 // The log cannot report on itself: the system log and standard error do.
 void rotationFailed(const char* step, const std::string& path, int err) {
@@ -126,23 +147,26 @@ void rotationFailed(const char* step, const std::string& path, int err) {
 }
 
 // A missing older file is no failure.
-void renameForRotation(const std::string& from, const std::string& to) {
-  if (rename(from.c_str(), to.c_str()) != 0 && errno != ENOENT) rotationFailed("rename", from, errno);
+void renameForRotation(const LogFile& file, const std::string& from, const std::string& to) {
+  if (renameat(file.directory.get(), from.c_str(), file.directory.get(), to.c_str()) != 0 && errno != ENOENT)
+    rotationFailed("rename", file.path.substr(0, file.path.size() - file.name.size()) + from, errno);
 }
 
 // quarterd.log -> .0, .0 -> .1, ...; files numbered fileCount and up go away.
 void rotateLocked(LogFile& file) {
   closeFileLocked(file);
+  const int dir = file.directory.get();
   if (file.fileCount == 0) {
-    if (unlink(file.path.c_str()) != 0 && errno != ENOENT) rotationFailed("remove", file.path, errno);
+    if (unlinkat(dir, file.name.c_str(), 0) != 0 && errno != ENOENT) rotationFailed("remove", file.path, errno);
   } else {
-    for (uint32_t i = file.fileCount - 1; i >= 1; --i) renameForRotation(numbered(file.path, i - 1), numbered(file.path, i));
-    renameForRotation(file.path, numbered(file.path, 0));
+    for (uint32_t i = file.fileCount - 1; i >= 1; --i)
+      renameForRotation(file, numbered(file.name, i - 1), numbered(file.name, i));
+    renameForRotation(file, file.name, numbered(file.name, 0));
   }
   for (uint32_t i = file.fileCount;; ++i) {
-    std::string old = numbered(file.path, i);
-    if (unlink(old.c_str()) == 0) continue;
-    if (errno != ENOENT) rotationFailed("remove", old, errno);
+    std::string old = numbered(file.name, i);
+    if (unlinkat(dir, old.c_str(), 0) == 0) continue;
+    if (errno != ENOENT) rotationFailed("remove", numbered(file.path, i), errno);
     break;
   }
   if (!openFileLocked(file))
@@ -158,7 +182,7 @@ bool logOpen(const std::string& path, const std::string& name, int level) {
   gLevel = level;
   closeFileLocked(file);
   file.path = path;
-  return openFileLocked(file);
+  return openDirectoryLocked(file) && openFileLocked(file);
 }
 
 void logSetRotation(uint32_t fileCount, uint64_t sizeLimit) {

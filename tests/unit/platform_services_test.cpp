@@ -97,15 +97,15 @@ TEST_F(LogTest, LinesCarryTimeProgramPidLevelAndFunctionAndGoToStderrOnRequest) 
   logWrite(kLogNotice, "firstFunction", "hello 100%");
   QRTLog(kLogError, "value %d of %@", 7, std::string("thing"));
   logSetStderr(true);
-  logWrite(kLogDebug, "third", "two\nlines\x7f\t");
+  logWrite(kLogDebug, "third", "two\nlines\x7f\x1b\t");
   logSetStderr(false);
   logWrite(4, "fourth", "odd level");
   std::string copy = testing::internal::GetCapturedStderr();
   std::string content = readFile(logPath());
   EXPECT_TRUE(hasExactly(content, {"<Notice> firstFunction: hello 100%", "<Error> TestBody: value 7 of thing",
-                                   "<Debug> third: two\\x0alines\\x7f\\x09", "<Level 4> fourth: odd level"}))
+                                   "<Debug> third: two\\x0alines\\x7f\\x1b\t", "<Level 4> fourth: odd level"}))
       << content;
-  EXPECT_TRUE(hasExactly(copy, {"<Debug> third: two\\x0alines\\x7f\\x09"})) << copy;
+  EXPECT_TRUE(hasExactly(copy, {"<Debug> third: two\\x0alines\\x7f\\x1b\t"})) << copy;
 }
 
 TEST_F(LogTest, LevelFiltersLinesWhileAFileIsOpen) {
