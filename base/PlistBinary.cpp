@@ -15,6 +15,7 @@ constexpr size_t kTrailerSize = 32;
 // What one object costs in memory once built, besides its payload: the value
 // itself and its share of a container (a dictionary entry holds two).
 constexpr uint64_t kObjectFootprint = 64;
+static_assert(sizeof(Value) <= kObjectFootprint);
 
 uint64_t readBE(const uint8_t* p, size_t width) {
   uint64_t v = 0;
