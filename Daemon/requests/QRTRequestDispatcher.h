@@ -73,6 +73,6 @@ bool QRTMessageBool(const plist::Dictionary& message, std::string_view key);
 std::optional<std::string> QRTMessageString(const plist::Dictionary& message, std::string_view key);
 std::optional<QRTUUID> QRTMessageUUID(const plist::Dictionary& message, std::string_view key);
 const plist::Value* QRTMessageObject(const plist::Dictionary& message, std::string_view key);
-// "Identifier", or the caller's own identifier when the key is missing.
+// "Identifier", or the caller's own identifier when the key is missing or not a string.
 std::optional<std::string> QRTMessageIdentifier(const plist::Dictionary& message,
                                                 const std::optional<std::string>& clientIdentifier);

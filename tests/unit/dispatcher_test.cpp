@@ -61,28 +61,32 @@ TEST_F(ValidateUserIdTest, SystemCallersNameAnyUserOfAPerUserClass) {
   EXPECT_EQ(result, 38u);
 }
 
+// Each reader against a value of every type: only its own type reads.
 TEST(MessageReaders, MissingOrMistypedValuesReadAsNothing) {
   std::array<uint8_t, 16> bytes{};
   bytes[0] = 0xAB;
-  plist::Dictionary message{{"Big", UINT64_MAX},
-                            {"Neg", -5},
-                            {"Flag", true},
-                            {"Name", "com.example"},
-                            {"UUID", plist::Data(bytes.begin(), bytes.end())},
-                            {"ShortUUID", plist::Data{1, 2, 3}},
-                            {"Identifier", 17}};
-  EXPECT_EQ(QRTMessageU64(message, "Big"), UINT64_MAX);
-  EXPECT_EQ(QRTMessageI64(message, "Neg"), -5);
-  EXPECT_EQ(QRTMessageU64(message, "Name"), 0u);
-  EXPECT_FALSE(QRTMessageBool(message, "Missing"));
-  EXPECT_FALSE(QRTMessageBool(message, "Big"));
-  EXPECT_EQ(QRTMessageString(message, "Name"), "com.example");
-  EXPECT_EQ(QRTMessageString(message, "Flag"), std::nullopt);
-  ASSERT_TRUE(QRTMessageUUID(message, "UUID"));
-  EXPECT_EQ(QRTMessageUUID(message, "UUID")->bytes()[0], 0xAB);
-  EXPECT_EQ(QRTMessageUUID(message, "ShortUUID"), std::nullopt);
-  // A present but mistyped identifier is nil; only a missing one falls back.
-  EXPECT_EQ(QRTMessageIdentifier(message, std::string("own")), std::nullopt);
+  const plist::Data uuid(bytes.begin(), bytes.end());
+  const std::pair<const char*, plist::Value> values[] = {
+      {"u64", UINT64_MAX}, {"i64", -5},       {"bool", true},          {"string", "com.example"},
+      {"uuid", uuid},      {"data", plist::Data{1, 2, 3}},             {"real", 2.5},
+      {"array", plist::Array{"com.example"}}, {"dict", plist::Dictionary{{"k", 1}}},
+  };
+  plist::Dictionary message;
+  for (const auto& [key, value] : values) message[key] = value;
+  for (const auto& [key, value] : values) {
+    const std::string k = key;
+    EXPECT_EQ(QRTMessageU64(message, k), k == "u64" ? UINT64_MAX : k == "i64" ? uint64_t(-5) : 0u) << k;
+    EXPECT_EQ(QRTMessageI64(message, k), k == "u64" ? -1 : k == "i64" ? -5 : 0) << k;
+    EXPECT_EQ(QRTMessageBool(message, k), k == "bool") << k;
+    EXPECT_EQ(QRTMessageString(message, k).has_value(), k == "string") << k;
+    EXPECT_EQ(QRTMessageUUID(message, k).has_value(), k == "uuid") << k;
+    // A present identifier of another type reads as missing: the caller's own.
+    plist::Dictionary withIdentifier{{"Identifier", value}};
+    EXPECT_EQ(QRTMessageIdentifier(withIdentifier, std::string("own")), k == "string" ? "com.example" : "own") << k;
+    EXPECT_EQ(QRTMessageIdentifier(withIdentifier, std::nullopt).has_value(), k == "string") << k;
+  }
+  EXPECT_EQ(QRTMessageUUID(message, "uuid")->bytes()[0], 0xAB);
+  EXPECT_FALSE(QRTMessageBool(message, "missing"));
   EXPECT_EQ(QRTMessageIdentifier(plist::Dictionary{}, std::string("own")), "own");
 }
 
