@@ -9,6 +9,7 @@
 #include <atomic>
 #include <cerrno>
 #include <condition_variable>
+#include <cstring>
 #include <deque>
 #include <future>
 #include <mutex>
@@ -420,7 +421,8 @@ void installTerminationHandler(std::function<void()> stopAccepting) {
     sigset_t signals;
     sigemptyset(&signals);
     sigaddset(&signals, SIGTERM);
-    pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+    if (int error = pthread_sigmask(SIG_BLOCK, &signals, nullptr))
+      QRTLog(kLogError, "Cannot block SIGTERM: %s", strerror(error));
     try {
       std::thread(terminationThread, signals, std::move(stopAccepting)).detach();
     } catch (const std::system_error& e) {

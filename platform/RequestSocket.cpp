@@ -493,7 +493,8 @@ void RequestListener::Impl::sweepIdle() {
   {
     std::lock_guard<std::mutex> hold(clientsLock);
     for (auto& [fd, client] : clients) {
-      if (client->inFlight.load() == 0 && !client->parked.load() && client->lastActive.load() < cutoff)
+      if (client->inFlight.load() == 0 && client->connection->repliesDue() == 0 && !client->parked.load() &&
+          client->lastActive.load() < cutoff)
         idle.push_back(client);
     }
   }
@@ -520,7 +521,10 @@ void RequestListener::Impl::run() {
     int fd = event.data.fd;
     if (fd == wakeFd) continue;
     if (fd == listenFd || fd == backoffFd) {
-      if (fd == backoffFd) drain(backoffFd);
+      if (fd == backoffFd) {
+        drain(backoffFd);
+        arm(backoffFd, EPOLLIN | EPOLLONESHOT);
+      }
       acceptClients();
     } else if (fd == budgetFd) {
       serveWaiters();
@@ -535,48 +539,55 @@ void RequestListener::Impl::run() {
 std::unique_ptr<RequestListener> RequestListener::create(const std::string& path, std::shared_ptr<Queue> queue,
                                                          RequestHandler handler) {
   auto impl = std::make_unique<Impl>();
+  // The caller reads errno: keep it past the clean-up of what was opened.
+  auto fail = [&impl]() -> std::unique_ptr<RequestListener> {
+    const int error = errno;
+    impl.reset();
+    errno = error;
+    return nullptr;
+  };
   impl->path = path;
   impl->queue = std::move(queue);
   impl->handler = std::move(handler);
   sockaddr_un addr{};
   if (path.size() >= sizeof addr.sun_path) {
     errno = ENAMETOOLONG;
-    return nullptr;
+    return fail();
   }
   addr.sun_family = AF_UNIX;
   memcpy(addr.sun_path, path.c_str(), path.size() + 1);
   impl->listenFd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
-  if (impl->listenFd < 0) return nullptr;
-  if (::unlink(path.c_str()) != 0 && errno != ENOENT) return nullptr;
-  if (::bind(impl->listenFd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) return nullptr;
+  if (impl->listenFd < 0) return fail();
+  if (::unlink(path.c_str()) != 0 && errno != ENOENT) return fail();
+  if (::bind(impl->listenFd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) return fail();
   // Any process may connect; entitlements decide what it may do.
-  if (::fchmodat(AT_FDCWD, path.c_str(), 0666, 0) != 0) return nullptr;
-  if (::listen(impl->listenFd, SOMAXCONN) != 0) return nullptr;
+  if (::fchmodat(AT_FDCWD, path.c_str(), 0666, 0) != 0) return fail();
+  if (::listen(impl->listenFd, SOMAXCONN) != 0) return fail();
   impl->epollFd = ::epoll_create1(EPOLL_CLOEXEC);
   impl->wakeFd = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
   impl->budgetFd = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
   impl->backoffFd = ::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK);
   impl->sweepFd = ::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK);
   if (impl->epollFd < 0 || impl->wakeFd < 0 || impl->budgetFd < 0 || impl->backoffFd < 0 || impl->sweepFd < 0)
-    return nullptr;
+    return fail();
   impl->budget = std::make_shared<ByteBudget>(kRequestBufferBudget, impl->budgetFd);
   itimerspec sweep{};
   sweep.it_value.tv_sec = sweep.it_interval.tv_sec = kIdleSweepInterval.count();
-  if (::timerfd_settime(impl->sweepFd, 0, &sweep, nullptr) != 0) return nullptr;
+  if (::timerfd_settime(impl->sweepFd, 0, &sweep, nullptr) != 0) return fail();
   // The stop event stays readable, so that it wakes every poller.
   epoll_event ev{};
   ev.events = EPOLLIN;
   ev.data.fd = impl->wakeFd;
-  if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, impl->wakeFd, &ev) != 0) return nullptr;
+  if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, impl->wakeFd, &ev) != 0) return fail();
   for (int fd : {impl->budgetFd, impl->backoffFd}) {
     ev.events = EPOLLIN | EPOLLONESHOT;
     ev.data.fd = fd;
-    if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, fd, &ev) != 0) return nullptr;
+    if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, fd, &ev) != 0) return fail();
   }
   // The sweep's readiness is taken by one poller each time it fires.
   ev.events = EPOLLIN | EPOLLET;
   ev.data.fd = impl->sweepFd;
-  if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, impl->sweepFd, &ev) != 0) return nullptr;
+  if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, impl->sweepFd, &ev) != 0) return fail();
   return std::unique_ptr<RequestListener>(new RequestListener(std::move(impl)));
 }
 

@@ -49,6 +49,11 @@ class RequestConnection {
   // Closes the connection; replies due to it are dropped.
   void cancel();
   bool cancelled() const { return cancelled_; }
+  // Replies promised by work that finishes after its request (a connection
+  // owed one is not idle).
+  void replyDue() { repliesDue_.fetch_add(1); }
+  void replyDone() { repliesDue_.fetch_sub(1); }
+  int repliesDue() const { return repliesDue_.load(); }
   int fd() const { return fd_; }
 
  private:
@@ -57,6 +62,7 @@ class RequestConnection {
   std::shared_ptr<ByteBudget> budget_;
   std::mutex writeLock_;
   std::atomic<bool> cancelled_{false};
+  std::atomic<int> repliesDue_{0};
 };
 
 using ConnectionRef = std::shared_ptr<RequestConnection>;

@@ -11,7 +11,9 @@ using platform::kLogError;
 
 void QRTReply::send(uint64_t code) {
   dictionary["ReplyError"] = code;
-  if (connection_->send(messageId_, dictionary) != platform::SendResult::TooLarge) return;
+  const platform::SendResult sent = connection_->send(messageId_, dictionary);
+  done();
+  if (sent != platform::SendResult::TooLarge) return;
   // The stream stays whole: the client gets an error in place of the reply.
   QRTLog(kLogError, "Reply to message %llu with code %llu does not fit in one frame; answering %llu",
          static_cast<unsigned long long>(messageId_), static_cast<unsigned long long>(code),

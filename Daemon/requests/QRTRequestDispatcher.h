@@ -3,6 +3,7 @@
 // the reply with its "ReplyError".
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -28,14 +29,23 @@ inline constexpr const char* QRTEntitlementUserManagedAssets = "com.norvane.priv
 class QRTReply {
  public:
   QRTReply(platform::ConnectionRef connection, uint64_t messageId)
-      : connection_(std::move(connection)), messageId_(messageId) {}
+      : connection_(std::move(connection)), messageId_(messageId) {
+    connection_->replyDue();
+  }
+  ~QRTReply() { done(); }
+  QRTReply(const QRTReply&) = delete;
+  QRTReply& operator=(const QRTReply&) = delete;
   plist::Dictionary dictionary;
   // Stores code under "ReplyError" and sends the reply.
   void send(uint64_t code);
 
  private:
+  void done() {
+    if (!done_.exchange(true)) connection_->replyDone();
+  }
   platform::ConnectionRef connection_;
   uint64_t messageId_;
+  std::atomic<bool> done_{false};
 };
 using QRTReplyRef = std::shared_ptr<QRTReply>;
 
