@@ -404,7 +404,12 @@ RequestListener::Impl::ReadResult RequestListener::Impl::readEvent(const ClientR
             serveClient(c, false);
           }
         };
-        if (!budget->takeOrWait(whole - client->reserved, std::move(resume))) return ReadResult::Parked;
+        if (!budget->takeOrWait(whole - client->reserved, std::move(resume))) {
+          const auto& peer = client->connection->peer();
+          QRTLog(kLogDebug, "Request buffer budget full: connection of pid %d waits for %zu bytes",
+                 peer ? static_cast<int>(peer->pid) : 0, whole);
+          return ReadResult::Parked;
+        }
         client->parked = false;
         client->reserved = whole;
       }

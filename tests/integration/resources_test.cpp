@@ -147,7 +147,7 @@ TEST_F(ResourcesTest, FloodOfLargestFramesStaysWithinTheBudget) {
   plist::Dictionary big = request(30);
   big["Pad"] = plist::Data(frame::kMaxLength - 8 - 256, 0x5a);
   ASSERT_LE(frame::encode(1, big).size() - 4, frame::kMaxLength);
-  constexpr int kClients = 4, kFramesEach = 4;
+  constexpr int kClients = 5, kFramesEach = 3;  // more than the budget holds at once
   std::vector<std::future<int>> clients;
   for (int c = 0; c < kClients; ++c) {
     clients.push_back(std::async(std::launch::async, [&] {
@@ -165,6 +165,7 @@ TEST_F(ResourcesTest, FloodOfLargestFramesStaysWithinTheBudget) {
   int served = 0;
   for (auto& client : clients) served += client.get();
   EXPECT_EQ(served, kClients * kFramesEach);
+  EXPECT_TRUE(logContains("Request buffer budget full: connection of pid"));
   const long peak = statusKiB(daemon, "VmHWM");
   RecordProperty("PeakKiB", std::to_string(peak));
   RecordProperty("BaselineKiB", std::to_string(before));

@@ -2,7 +2,12 @@
 #include <gtest/gtest.h>
 #include <stdlib.h>
 
+#include <sys/socket.h>
+
 #include <fstream>
+#include <thread>
+
+#include "base/Frame.h"
 
 #include "Daemon/requests/QRTRequestDispatcher.h"
 #include "Daemon/QRTError.h"
@@ -88,6 +93,38 @@ TEST(MessageReaders, MissingOrMistypedValuesReadAsNothing) {
   EXPECT_EQ(QRTMessageUUID(message, "uuid")->bytes()[0], 0xAB);
   EXPECT_FALSE(QRTMessageBool(message, "missing"));
   EXPECT_EQ(QRTMessageIdentifier(plist::Dictionary{}, std::string("own")), "own");
+}
+
+// A reply too big for one frame becomes a small error reply; the stream
+// stays usable for the next one.
+TEST(ReplySending, OversizedReplyBecomesErrorFortyOnAnIntactStream) {
+  int fds[2];
+  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+  auto connection = std::make_shared<platform::RequestConnection>(fds[0], std::nullopt);
+  std::thread sender([&] {
+    auto big = std::make_shared<QRTReply>(connection, 7);
+    big->dictionary["Blob"] = plist::Data(frame::kMaxLength, 1);
+    big->send(1);
+    auto small = std::make_shared<QRTReply>(connection, 8);
+    small->send(1);
+  });
+  frame::Decoder decoder;
+  std::vector<std::pair<uint64_t, uint64_t>> replies;  // message id, ReplyError
+  uint8_t buffer[4096];
+  while (replies.size() < 2) {
+    ssize_t n = recv(fds[1], buffer, sizeof buffer, 0);
+    ASSERT_GT(n, 0);
+    decoder.append(buffer, static_cast<size_t>(n));
+    while (auto f = decoder.next()) {
+      auto message = frame::decodeMessage(f->payload);
+      ASSERT_TRUE(message);
+      replies.emplace_back(f->messageId, QRTMessageU64(*message, "ReplyError"));
+    }
+  }
+  sender.join();
+  EXPECT_EQ(replies, (std::vector<std::pair<uint64_t, uint64_t>>{{7, QRTErrorException}, {8, 1}}));
+  EXPECT_EQ(connection->repliesDue(), 0);
+  close(fds[1]);
 }
 
 TEST(CommandTable, RowsMatchTheirNumbersAndEntitlements) {
