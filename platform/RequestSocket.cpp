@@ -213,6 +213,7 @@ struct RequestListener::Impl {
   std::vector<std::thread> pollers;
   std::atomic<bool> stopping{false};
   std::atomic<int> idlePollers{0};
+  std::atomic<bool> acceptShort{false};  // out of descriptors (or memory) at the last accept
   std::mutex clientsLock;
   std::unordered_map<int, ClientRef> clients;
   struct UserSlots {
@@ -288,7 +289,8 @@ void RequestListener::Impl::acceptClients() {
       if (errno == EINTR || errno == ECONNABORTED) continue;
       if (errno == EAGAIN || errno == EWOULDBLOCK) break;
       const bool exhausted = errno == EMFILE || errno == ENFILE || errno == ENOBUFS || errno == ENOMEM;
-      QRTLog(kLogError, "accept failed: %s", strerror(errno));
+      // Once per shortage, not at every retry.
+      if (!exhausted || !acceptShort.exchange(true)) QRTLog(kLogError, "accept failed: %s", strerror(errno));
       if (!exhausted) break;
       // Pending connections keep the listener readable: polling it now would
       // spin. Accepting resumes when the timer fires.
@@ -300,6 +302,7 @@ void RequestListener::Impl::acceptClients() {
       }
       return;
     }
+    if (acceptShort.exchange(false)) QRTLog(kLogNotice, "Accepting connections again");
     std::optional<PeerCredentials> peer = peerCredentials(fd);
     uint32_t uid;
     if (!admit(peer, &uid)) {

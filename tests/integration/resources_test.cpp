@@ -198,6 +198,7 @@ TEST_F(ResourcesTest, RunningOutOfDescriptorsDoesNotSpin) {
   for (int fd : fds) close(fd);
   ASSERT_EQ(prlimit(daemon, RLIMIT_NOFILE, &restored, nullptr), 0);
   EXPECT_EQ(replyError(request(30)), kNotServed);
+  EXPECT_TRUE(logContains("Accepting connections again"));
 }
 
 TEST_F(ResourcesTest, SecondDaemonOnTheSameRootExitsAndLeavesTheFirstServing) {
