@@ -1,6 +1,5 @@
 #include "base/Frame.h"
 
-#include <algorithm>
 #include <cstring>
 
 #include "base/PlistCodec.h"
@@ -46,8 +45,7 @@ void Decoder::append(const void* bytes, size_t length) {
   // A frame whose length is known gets its room at once (and its successor's
   // header with it) instead of by doubling, so a big frame costs its size.
   const size_t whole = pendingFrameSize();
-  const size_t need = std::max(buffer_.size() + length, whole ? start_ + whole + kHeaderSize : 0);
-  if (need > buffer_.capacity() && whole) buffer_.reserve(need);
+  if (whole && start_ + whole + kHeaderSize > buffer_.capacity()) buffer_.reserve(start_ + whole + kHeaderSize);
   const auto* p = static_cast<const uint8_t*>(bytes);
   buffer_.insert(buffer_.end(), p, p + length);
 }
