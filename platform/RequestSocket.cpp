@@ -13,8 +13,10 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <condition_variable>
 #include <cstring>
 #include <deque>
+#include <system_error>
 #include <thread>
 #include <unordered_map>
 #include <vector>
@@ -31,21 +33,31 @@ using Clock = std::chrono::steady_clock;
 // A client that reads nothing for this long loses its connection rather than
 // holding a request thread.
 constexpr int kWriteStallMs = 10000;
+constexpr int kDrainWriteStallMs = 2000;
 constexpr size_t kReadChunk = 64 * 1024;
 // Requests of one connection queued or running at once; past this the
 // connection is not read until some finish, so a flood cannot grow memory.
 constexpr int kMaxInFlight = 256;
 constexpr auto kIdleSweepInterval = std::chrono::seconds(5);
 
-// Waits for the socket to take more, at most the stall limit and never past
-// the exit deadline once SIGTERM came.
+// Waits for the socket to take more, at most the stall limit. Once SIGTERM
+// came, a client that takes nothing for a shorter while is given up, so that
+// the requests queued behind it finish and the process exits early.
 bool waitWritable(int fd) {
-  const auto deadline = std::min(Clock::now() + std::chrono::milliseconds(kWriteStallMs), exitDeadline());
+  const auto start = Clock::now();
+  auto deadline = start + std::chrono::milliseconds(kWriteStallMs);
+  bool draining = false;
   for (;;) {
-    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now()).count();
+    const auto now = Clock::now();
+    if (!draining && exitDeadline() != Clock::time_point::max()) {
+      draining = true;
+      deadline = std::min({deadline, now + std::chrono::milliseconds(kDrainWriteStallMs), exitDeadline()});
+    }
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - now).count();
     if (left <= 0) return false;
     pollfd pfd{fd, POLLOUT, 0};
-    int r = ::poll(&pfd, 1, static_cast<int>(std::min<long long>(left, 1000)));
+    // Short slices, so that a SIGTERM meanwhile is noticed.
+    int r = ::poll(&pfd, 1, static_cast<int>(std::min<long long>(left, 250)));
     if (r > 0) return !(pfd.revents & (POLLERR | POLLHUP | POLLNVAL));
     if (r < 0 && errno != EINTR) return false;
   }
@@ -210,7 +222,12 @@ struct RequestListener::Impl {
   std::shared_ptr<ByteBudget> budget;
   std::shared_ptr<Queue> queue;
   RequestHandler handler;
-  std::vector<std::thread> pollers;
+  // Pollers are detached: after stopAccepting one may still be busy with a
+  // request, and the process does not wait for it. Destruction does.
+  std::mutex pollersLock;
+  std::condition_variable pollersGone;
+  int runningPollers = 0;
+  bool started = false;
   std::atomic<bool> stopping{false};
   std::atomic<int> idlePollers{0};
   std::atomic<bool> acceptShort{false};  // out of descriptors (or memory) at the last accept
@@ -224,8 +241,10 @@ struct RequestListener::Impl {
 
   ~Impl() {
     stop();
-    for (std::thread& t : pollers) t.join();
-    pollers.clear();
+    {
+      std::unique_lock<std::mutex> hold(pollersLock);
+      pollersGone.wait(hold, [&] { return runningPollers == 0; });
+    }
     // Requests still running may re-arm into the epoll set: it stays open
     // until no poller or request can use it, which a joined listener means.
     for (int fd : {listenFd, epollFd, wakeFd, budgetFd, backoffFd, sweepFd})
@@ -603,9 +622,30 @@ RequestListener::RequestListener(std::unique_ptr<Impl> impl) : impl_(std::move(i
 RequestListener::~RequestListener() = default;
 
 void RequestListener::resume() {
-  if (!impl_->pollers.empty()) return;
-  impl_->arm(impl_->listenFd, EPOLLIN | EPOLLONESHOT);
-  for (int i = 0; i < Impl::kPollers; ++i) impl_->pollers.emplace_back([impl = impl_.get()] { impl->run(); });
+  Impl* impl = impl_.get();
+  {
+    std::lock_guard<std::mutex> hold(impl->pollersLock);
+    if (impl->started) return;
+    impl->started = true;
+  }
+  impl->arm(impl->listenFd, EPOLLIN | EPOLLONESHOT);
+  for (int i = 0; i < Impl::kPollers; ++i) {
+    {
+      std::lock_guard<std::mutex> hold(impl->pollersLock);
+      ++impl->runningPollers;
+    }
+    try {
+      std::thread([impl] {
+        impl->run();
+        std::lock_guard<std::mutex> hold(impl->pollersLock);
+        if (--impl->runningPollers == 0) impl->pollersGone.notify_all();
+      }).detach();
+    } catch (const std::system_error& e) {
+      QRTLog(kLogError, "Cannot start a request poller: %s", e.what());
+      std::lock_guard<std::mutex> hold(impl->pollersLock);
+      --impl->runningPollers;
+    }
+  }
 }
 
 // Pollers busy with a request (or a reply to a client that does not read)
