@@ -576,45 +576,55 @@ std::unique_ptr<RequestListener> RequestListener::create(const std::string& path
   impl->path = path;
   impl->queue = std::move(queue);
   impl->handler = std::move(handler);
+  // Bound under a staging name and renamed into place once listening, so
+  // that a client never finds a socket that refuses it.
+  const std::string staging = path + ".new";
   sockaddr_un addr{};
-  if (path.size() >= sizeof addr.sun_path) {
+  if (staging.size() >= sizeof addr.sun_path) {
     errno = ENAMETOOLONG;
     return fail();
   }
   addr.sun_family = AF_UNIX;
-  memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+  memcpy(addr.sun_path, staging.c_str(), staging.size() + 1);
   impl->listenFd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
   if (impl->listenFd < 0) return fail();
-  if (::unlink(path.c_str()) != 0 && errno != ENOENT) return fail();
+  if (::unlink(staging.c_str()) != 0 && errno != ENOENT) return fail();
   if (::bind(impl->listenFd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) return fail();
+  auto failBound = [&] {
+    const int error = errno;
+    ::unlink(staging.c_str());
+    errno = error;
+    return fail();
+  };
   // Any process may connect; entitlements decide what it may do.
-  if (::fchmodat(AT_FDCWD, path.c_str(), 0666, 0) != 0) return fail();
-  if (::listen(impl->listenFd, SOMAXCONN) != 0) return fail();
+  if (::fchmodat(AT_FDCWD, staging.c_str(), 0666, 0) != 0) return failBound();
+  if (::listen(impl->listenFd, SOMAXCONN) != 0) return failBound();
   impl->epollFd = ::epoll_create1(EPOLL_CLOEXEC);
   impl->wakeFd = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
   impl->budgetFd = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
   impl->backoffFd = ::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK);
   impl->sweepFd = ::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK);
   if (impl->epollFd < 0 || impl->wakeFd < 0 || impl->budgetFd < 0 || impl->backoffFd < 0 || impl->sweepFd < 0)
-    return fail();
+    return failBound();
   impl->budget = std::make_shared<ByteBudget>(kRequestBufferBudget, impl->budgetFd);
   itimerspec sweep{};
   sweep.it_value.tv_sec = sweep.it_interval.tv_sec = kIdleSweepInterval.count();
-  if (::timerfd_settime(impl->sweepFd, 0, &sweep, nullptr) != 0) return fail();
+  if (::timerfd_settime(impl->sweepFd, 0, &sweep, nullptr) != 0) return failBound();
   // The stop event stays readable, so that it wakes every poller.
   epoll_event ev{};
   ev.events = EPOLLIN;
   ev.data.fd = impl->wakeFd;
-  if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, impl->wakeFd, &ev) != 0) return fail();
+  if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, impl->wakeFd, &ev) != 0) return failBound();
   for (int fd : {impl->budgetFd, impl->backoffFd}) {
     ev.events = EPOLLIN | EPOLLONESHOT;
     ev.data.fd = fd;
-    if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, fd, &ev) != 0) return fail();
+    if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, fd, &ev) != 0) return failBound();
   }
   // The sweep's readiness is taken by one poller each time it fires.
   ev.events = EPOLLIN | EPOLLET;
   ev.data.fd = impl->sweepFd;
-  if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, impl->sweepFd, &ev) != 0) return fail();
+  if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, impl->sweepFd, &ev) != 0) return failBound();
+  if (::rename(staging.c_str(), path.c_str()) != 0) return failBound();
   return std::unique_ptr<RequestListener>(new RequestListener(std::move(impl)));
 }
 
