@@ -195,11 +195,7 @@ int QRTDaemonMain(int argc, char** argv) {
     return 2;
   }
   // A client that goes away mid-reply must not end the daemon.
-  signal(SIGPIPE, SIG_IGN);
-  // Frames and messages of megabytes go straight back to the system when
-  // served, rather than staying in a thread's arena: the request budget then
-  // bounds resident memory, not just what is in use.
-  if (mallopt(M_MMAP_THRESHOLD, 256 * 1024) != 1) fprintf(stderr, "quarterd: mallopt(M_MMAP_THRESHOLD) failed\n");
+  if (signal(SIGPIPE, SIG_IGN) == SIG_ERR) fprintf(stderr, "quarterd: cannot ignore SIGPIPE: %s\n", strerror(errno));
   // Before any thread exists, so that every thread inherits the blocked SIGTERM.
   platform::installTerminationHandler(stopListener);
   if (!setUpDeviceRoot(options.root)) return 2;
@@ -209,6 +205,11 @@ int QRTDaemonMain(int argc, char** argv) {
   if (!takeInstanceLock()) return 1;
   QRTLog(kLogDebug, "quarterd built at %s %s started", __DATE__, __TIME__);
   raiseDescriptorLimit();
+  // Frames and messages of megabytes go straight back to the system when
+  // served, rather than staying in a thread's arena: the request budget then
+  // bounds resident memory, not just what is in use. (Sanitizer allocators
+  // refuse the setting.)
+  if (mallopt(M_MMAP_THRESHOLD, 256 * 1024) != 1) QRTLog(kLogDebug, "mallopt(M_MMAP_THRESHOLD) refused");
 
   // Queue creation cannot fail here short of running out of memory, which
   // ends the process anyway; they are made now so that start-up work finds them.

@@ -351,7 +351,9 @@ Transactions& transactions() {
   return *t;
 }
 
-std::atomic<std::chrono::steady_clock::rep> gExitDeadline{std::chrono::steady_clock::time_point::max().time_since_epoch().count()};
+// Set once by the SIGTERM thread, read by writers on any thread.
+std::atomic<std::chrono::steady_clock::rep> gExitDeadline{
+    std::chrono::steady_clock::time_point::max().time_since_epoch().count()};
 
 void terminationThread(sigset_t signals, const std::function<void()>& stopAccepting) {
   int received = 0;
