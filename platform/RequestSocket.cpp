@@ -95,35 +95,43 @@ void drain(int fd) {
 // The bytes buffered from and for clients. A reader takes the whole of a
 // frame once its length is known, so every byte held belongs to a frame
 // that can complete, a request that will finish or a reply being written:
-// whoever waits for room is never waiting on another waiter.
+// whoever waits for room is never waiting on another waiter. A user other
+// than root holds at most half, so that no one user can starve the others.
 class ByteBudget {
  public:
   using Waiter = std::function<void()>;
+  static constexpr uint32_t kNoUser = UINT32_MAX - 1;  // replies: counted globally only
 
   ByteBudget(size_t limit, int wakeFd) : limit_(limit), wakeFd_(wakeFd) {}
 
-  // Takes n bytes when they fit; otherwise queues waiter, which a poller
-  // runs once bytes come back.
-  bool takeOrWait(size_t n, Waiter waiter) {
+  // Takes n bytes for user when they fit; otherwise queues waiter, which a
+  // poller runs once bytes come back.
+  bool takeOrWait(size_t n, uint32_t user, Waiter waiter) {
     std::lock_guard<std::mutex> hold(lock_);
-    if (used_ == 0 || used_ + n <= limit_) {
-      used_ += n;
+    const size_t held = heldBy(user);
+    const bool userRoom = user == 0 || user == kNoUser || held == 0 || held + n <= limit_ / 2;
+    if (userRoom && (used_ == 0 || used_ + n <= limit_)) {
+      addLocked(n, user);
       return true;
     }
     waiters_.push_back(std::move(waiter));
     return false;
   }
   // For work already admitted: a decoded message, a reply.
-  void force(size_t n) {
+  void force(size_t n, uint32_t user = kNoUser) {
     std::lock_guard<std::mutex> hold(lock_);
-    used_ += n;
+    addLocked(n, user);
   }
-  void give(size_t n) {
+  void give(size_t n, uint32_t user = kNoUser) {
     if (n == 0) return;
     bool signal;
     {
       std::lock_guard<std::mutex> hold(lock_);
       used_ -= std::min(n, used_);
+      if (user != kNoUser) {
+        auto it = perUser_.find(user);
+        if (it != perUser_.end() && (it->second -= std::min(n, it->second)) == 0) perUser_.erase(it);
+      }
       signal = !waiters_.empty() && !signalled_;
       signalled_ = signalled_ || signal;
     }
@@ -137,16 +145,21 @@ class ByteBudget {
     ready.swap(waiters_);
     return ready;
   }
-  size_t used() const {
-    std::lock_guard<std::mutex> hold(lock_);
-    return used_;
+ private:
+  size_t heldBy(uint32_t user) const {
+    auto it = perUser_.find(user);
+    return it == perUser_.end() ? 0 : it->second;
+  }
+  void addLocked(size_t n, uint32_t user) {
+    used_ += n;
+    if (user != kNoUser) perUser_[user] += n;
   }
 
- private:
   mutable std::mutex lock_;
   const size_t limit_;
   const int wakeFd_;
   size_t used_ = 0;
+  std::unordered_map<uint32_t, size_t> perUser_;
   bool signalled_ = false;
   std::deque<Waiter> waiters_;
 };
@@ -352,7 +365,7 @@ void RequestListener::Impl::dropClient(const ClientRef& client) {
   int fd = client->connection->fd();
   if (::epoll_ctl(epollFd, EPOLL_CTL_DEL, fd, nullptr) != 0 && errno != ENOENT)
     QRTLog(kLogError, "epoll_ctl(DEL) for descriptor %d failed: %s", fd, strerror(errno));
-  budget->give(client->reserved);
+  budget->give(client->reserved, client->uid);
   client->reserved = 0;
   std::lock_guard<std::mutex> hold(clientsLock);
   auto it = clients.find(fd);
@@ -373,7 +386,7 @@ void RequestListener::Impl::runEvent(const ClientRef& client, RequestEvent& even
 
 void RequestListener::Impl::finishEvent(const ClientRef& client, size_t charge) {
   client->touch();
-  budget->give(charge);
+  budget->give(charge, client->uid);
   if (client->inFlight.fetch_sub(1) == kMaxInFlight) {
     bool resume = false;
     {
@@ -405,7 +418,7 @@ RequestListener::Impl::ReadResult RequestListener::Impl::readEvent(const ClientR
       // The decoded message replaces the frame's bytes; what it costs beyond
       // them is held too. It is admitted work: it may go over the budget.
       if (footprint > event.charge) {
-        budget->force(footprint - event.charge);
+        budget->force(footprint - event.charge, client->uid);
         event.charge = footprint;
       }
       client->touch();
@@ -426,7 +439,7 @@ RequestListener::Impl::ReadResult RequestListener::Impl::readEvent(const ClientR
             serveClient(c, false);
           }
         };
-        if (!budget->takeOrWait(whole - client->reserved, std::move(resume))) {
+        if (!budget->takeOrWait(whole - client->reserved, client->uid, std::move(resume))) {
           const auto& peer = client->connection->peer();
           QRTLog(kLogDebug, "Request buffer budget full: connection of pid %d waits for %zu bytes",
                  peer ? static_cast<int>(peer->pid) : 0, whole);

@@ -20,7 +20,8 @@ namespace platform {
 // Limits of the request socket. Bytes read from clients and not yet served
 // (a frame counts from when its length arrives, its decoded message from when
 // it is decoded) and reply bytes being written share one budget; a connection
-// whose next frame does not fit is not read until the budget frees.
+// whose next frame does not fit is not read until the budget frees. A user
+// other than root holds at most half of it.
 inline constexpr size_t kRequestBufferBudget = size_t{64} << 20;
 // Connections open at once per user id; root is not limited.
 inline constexpr int kMaxConnectionsPerUser = 64;

@@ -196,6 +196,45 @@ TEST_F(ResourcesTest, FloodOfLargestFramesStaysWithinTheBudget) {
   EXPECT_EQ(replyError(request(30)), kNotServed);
 }
 
+// User 501 starts five largest frames and sends no more of them: it holds
+// at most half the budget, so root's largest request is still read.
+TEST_F(ResourcesTest, OneUserCannotHoldTheWholeBudget) {
+  plist::Dictionary big = request(30);
+  big["Pad"] = plist::Data(frame::kMaxLength - 8 - 256, 0x5a);
+  const std::vector<uint8_t> bigFrame = frame::encode(1, big);
+  int ready[2], release[2];
+  ASSERT_EQ(pipe(ready), 0);
+  ASSERT_EQ(pipe(release), 0);
+  ASSERT_EQ(chmod(root.c_str(), 0755), 0);
+  const std::string path = qk::requestSocketPath(root);
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    if (setresgid(501, 501, 501) != 0 || setresuid(501, 501, 501) != 0) _exit(2);
+    std::vector<int> fds;
+    for (int i = 0; i < 5; ++i) {
+      fds.push_back(rawConnect(path));
+      if (fds.back() < 0 || send(fds.back(), bigFrame.data(), 65536, MSG_NOSIGNAL) != 65536) _exit(3);
+    }
+    (void)!write(ready[1], "r", 1);
+    char done;
+    (void)!read(release[0], &done, 1);
+    // Still holding: root was not served only once the daemon gave up on us.
+    for (int fd : fds)
+      if (closedByPeer(fd)) _exit(4);
+    _exit(0);
+  }
+  char byte;
+  ASSERT_EQ(read(ready[0], &byte, 1), 1);
+  EXPECT_TRUE(logContains("Request buffer budget full: connection of pid " + std::to_string(child)));
+  auto connection = connect();
+  ASSERT_TRUE(connection);
+  EXPECT_EQ(codeOf(connection->call(big, 90s)), kNotServed);
+  (void)!write(release[1], "x", 1);
+  EXPECT_EQ(waitFor(child, 30s), 0) << "user 501's connections were closed before root was served";
+  for (int fd : {ready[0], ready[1], release[0], release[1]}) close(fd);
+}
+
 TEST_F(ResourcesTest, RunningOutOfDescriptorsDoesNotSpin) {
   // Too few descriptors for the connections below; the rest wait in the backlog.
   rlimit restored{};
