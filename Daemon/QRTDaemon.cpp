@@ -1,13 +1,17 @@
 #include "Daemon/QRTDaemon.h"
 
 #include <limits.h>
+#include <malloc.h>
+#include <signal.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <syslog.h>
 
 #include <cerrno>
 #include <cstdio>
+#include <mutex>
 #include <string>
 
 #include "Daemon/store/QRTClientConnection.h"
@@ -41,7 +45,11 @@ namespace {
 
 // Starts at "unknown" so that the first call suspends only for a lock.
 int gLastAppliedLockState = 3;
+
+// The listener is made by the main thread and stopped by the SIGTERM thread.
+std::mutex gListenerLock;
 std::unique_ptr<platform::RequestListener> gListener;
+bool gTerminating = false;
 
 struct Options {
   std::string root = "/";
@@ -78,8 +86,38 @@ bool setUpDeviceRoot(const std::string& root) {
     return false;
   }
   platform::setDeviceRoot(resolved);
-  for (const char* dir : {"/run", "/etc"}) mkdir(platform::hostPath(dir).c_str(), 0755);
+  for (const char* dir : {"/run", "/etc"}) {
+    std::string path = platform::hostPath(dir);
+    if (mkdir(path.c_str(), 0755) != 0 && errno != EEXIST)
+      fprintf(stderr, "quarterd: cannot create %s: %s\n", path.c_str(), strerror(errno));
+  }
   return true;
+}
+
+// Every connection costs a descriptor: take all the system lets us have.
+void raiseDescriptorLimit() {
+  rlimit limit{};
+  if (getrlimit(RLIMIT_NOFILE, &limit) != 0) {
+    QRTLog(kLogError, "getrlimit(RLIMIT_NOFILE) failed: %s", strerror(errno));
+    return;
+  }
+  if (limit.rlim_cur == limit.rlim_max) return;
+  limit.rlim_cur = limit.rlim_max;
+  if (setrlimit(RLIMIT_NOFILE, &limit) != 0)
+    QRTLog(kLogError, "Cannot raise RLIMIT_NOFILE to %llu: %s", static_cast<unsigned long long>(limit.rlim_max),
+           strerror(errno));
+}
+
+// One daemon per device root: a second one would run start-up work and
+// replace the socket under the first.
+bool takeInstanceLock() {
+  const std::string path = platform::hostPath("/run/quarterd.lock");
+  if (platform::acquireInstanceLock(path) >= 0) return true;
+  const int error = errno;
+  const std::string why = error == EWOULDBLOCK ? "another quarterd serves this device root" : strerror(error);
+  QRTLog(kLogError, "Cannot lock %s: %s. Exiting.", path.c_str(), why.c_str());
+  fprintf(stderr, "quarterd: cannot lock %s: %s\n", path.c_str(), why.c_str());
+  return false;
 }
 
 void openLog(const Options& options) {
@@ -97,15 +135,25 @@ void openLog(const Options& options) {
   platform::logSetRotation(gQRTLogFileCount, sizeLimit);
 }
 
-void startListener() {
+bool startListener() {
+  std::lock_guard<std::mutex> hold(gListenerLock);
+  if (gTerminating) return true;  // SIGTERM came during start-up: the exit is under way
   auto listenerQueue = platform::makeConcurrentQueue("com.norvane.quarterd.listener");
   gListener = platform::RequestListener::create(platform::hostPath("/run/com.norvane.quarterd"), listenerQueue,
                                                 QRTProcessRelayEvent);
   if (!gListener) {
     QRTLog(kLogError, "unable to start relay service!");
-    return;
+    QRTLog(kLogError, "Request socket: %s", strerror(errno));
+    return false;
   }
   gListener->resume();
+  return true;
+}
+
+void stopListener() {
+  std::lock_guard<std::mutex> hold(gListenerLock);
+  gTerminating = true;
+  if (gListener) gListener->stopAccepting();
 }
 
 }  // namespace
@@ -146,15 +194,22 @@ int QRTDaemonMain(int argc, char** argv) {
     usage();
     return 2;
   }
+  // A client that goes away mid-reply must not end the daemon.
+  if (signal(SIGPIPE, SIG_IGN) == SIG_ERR) fprintf(stderr, "quarterd: cannot ignore SIGPIPE: %s\n", strerror(errno));
   // Before any thread exists, so that every thread inherits the blocked SIGTERM.
-  platform::installTerminationHandler([] {
-    if (gListener) gListener->stopAccepting();
-  });
+  platform::installTerminationHandler(stopListener);
   if (!setUpDeviceRoot(options.root)) return 2;
 
   platform::transactionBegin();
   openLog(options);
+  if (!takeInstanceLock()) return 1;
   QRTLog(kLogDebug, "quarterd built at %s %s started", __DATE__, __TIME__);
+  raiseDescriptorLimit();
+  // Frames and messages of megabytes go straight back to the system when
+  // served, rather than staying in a thread's arena: the request budget then
+  // bounds resident memory, not just what is in use. (Sanitizer allocators
+  // refuse the setting.)
+  if (mallopt(M_MMAP_THRESHOLD, 256 * 1024) != 1) QRTLog(kLogDebug, "mallopt(M_MMAP_THRESHOLD) refused");
 
   // Queue creation cannot fail here short of running out of memory, which
   // ends the process anyway; they are made now so that start-up work finds them.
@@ -186,6 +241,6 @@ int QRTDaemonMain(int argc, char** argv) {
   internal.quarterCleanup();
   platform::transactionEnd();
 
-  startListener();
+  if (!startListener()) return -1;
   return platform::runMainLoop();
 }

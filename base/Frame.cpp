@@ -7,6 +7,8 @@
 namespace frame {
 namespace {
 
+constexpr uint64_t kMoveThreshold = 64 * 1024;
+
 void putLE(std::vector<uint8_t>& out, uint64_t v, int bytes) {
   for (int i = 0; i < bytes; ++i) out.push_back(static_cast<uint8_t>(v >> (8 * i)));
 }
@@ -40,6 +42,10 @@ void Decoder::append(const void* bytes, size_t length) {
     buffer_.erase(buffer_.begin(), buffer_.begin() + static_cast<std::ptrdiff_t>(start_));
     start_ = 0;
   }
+  // A frame whose length is known gets its room at once (and its successor's
+  // header with it) instead of by doubling, so a big frame costs its size.
+  const size_t whole = pendingFrameSize();
+  if (whole && start_ + whole + kHeaderSize > buffer_.capacity()) buffer_.reserve(start_ + whole + kHeaderSize);
   const auto* p = static_cast<const uint8_t*>(bytes);
   buffer_.insert(buffer_.end(), p, p + length);
 }
@@ -58,13 +64,30 @@ std::optional<RawFrame> Decoder::next() {
   if (avail < 4 + n) return std::nullopt;
   RawFrame f;
   f.messageId = getLE(p + 4, 8);
+  const size_t end = start_ + 4 + n;
+  if (start_ == 0 && n >= kMoveThreshold) {
+    // A big frame leaves in the buffer it arrived in: no second copy, and
+    // the decoder keeps nothing of its size.
+    std::vector<uint8_t> rest(buffer_.begin() + static_cast<std::ptrdiff_t>(end), buffer_.end());
+    f.payload = std::move(buffer_);
+    f.payload.resize(end);
+    f.payload.erase(f.payload.begin(), f.payload.begin() + kHeaderSize);
+    buffer_ = std::move(rest);
+    return f;
+  }
   f.payload.assign(p + kHeaderSize, p + 4 + n);
-  start_ += 4 + n;
+  start_ = end;
   return f;
 }
 
-std::optional<plist::Dictionary> decodeMessage(const std::vector<uint8_t>& payload, std::string* error) {
-  auto value = plist::parseBinary(payload.data(), payload.size(), error);
+size_t Decoder::pendingFrameSize() const {
+  if (failed_ || buffered() < 4) return 0;
+  return 4 + static_cast<size_t>(getLE(buffer_.data() + start_, 4));
+}
+
+std::optional<plist::Dictionary> decodeMessage(const std::vector<uint8_t>& payload, std::string* error,
+                                               uint64_t* footprint) {
+  auto value = plist::parseBinary(payload.data(), payload.size(), error, footprint);
   if (!value) return std::nullopt;
   if (!value->isDictionary()) {
     if (error) *error = "top level is not a dictionary";

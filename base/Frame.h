@@ -36,6 +36,9 @@ class Decoder {
   bool failed() const { return failed_; }
   const std::string& failure() const { return failure_; }
   size_t buffered() const { return buffer_.size() - start_; }
+  // The whole size (header included) of the frame that the buffered bytes
+  // begin, once its length field has arrived; 0 before.
+  size_t pendingFrameSize() const;
 
  private:
   std::vector<uint8_t> buffer_;
@@ -45,7 +48,9 @@ class Decoder {
 };
 
 // The payload as a message dictionary; nothing when it is not a property list
-// or its top level is not a dictionary.
-std::optional<plist::Dictionary> decodeMessage(const std::vector<uint8_t>& payload, std::string* error = nullptr);
+// or its top level is not a dictionary. *footprint, when given, receives the
+// message's estimated memory cost.
+std::optional<plist::Dictionary> decodeMessage(const std::vector<uint8_t>& payload, std::string* error = nullptr,
+                                               uint64_t* footprint = nullptr);
 
 }  // namespace frame

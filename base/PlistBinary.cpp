@@ -12,9 +12,10 @@ namespace {
 
 constexpr size_t kHeaderSize = 8;
 constexpr size_t kTrailerSize = 32;
-// Strings and data shared by many references expand too; their expanded size
-// may exceed the input by at most this much.
-constexpr uint64_t kMaxExpandedBytes = 64ull << 20;
+// What one object costs in memory once built, besides its payload: the value
+// itself and its share of a container (a dictionary entry holds two).
+constexpr uint64_t kObjectFootprint = 64;
+static_assert(sizeof(Value) <= kObjectFootprint);
 
 uint64_t readBE(const uint8_t* p, size_t width) {
   uint64_t v = 0;
@@ -77,11 +78,12 @@ class BinaryReader {
  public:
   BinaryReader(const uint8_t* bytes, size_t length) : p_(bytes), n_(length) {}
 
-  std::optional<Value> read(std::string* error) {
+  std::optional<Value> read(std::string* error, uint64_t* footprint) {
     std::optional<Value> result;
     Value top;
     if (readTrailer() && measureTop() && build(top_, top)) result = std::move(top);
     if (!result && error) *error = why_;
+    if (result && footprint) *footprint = meta_[top_].count * kObjectFootprint + meta_[top_].bytes;
     return result;
   }
 
@@ -236,9 +238,11 @@ bool BinaryReader::decodeInteger(const Object& o, Integer& out) const {
 
 bool BinaryReader::checkString(const Object& o, uint64_t& utf8Bytes) {
   const uint8_t* q = p_ + o.start;
+  // NUL is refused as the XML reader refuses it: strings end up in system calls.
   if (o.kind == Kind::Ascii) {
     for (uint64_t i = 0; i < o.count; ++i) {
       if (q[i] >= 0x80) return fail("non-ASCII byte in ASCII string");
+      if (q[i] == 0) return fail("NUL in string");
     }
     utf8Bytes = o.count;
     return true;
@@ -246,6 +250,7 @@ bool BinaryReader::checkString(const Object& o, uint64_t& utf8Bytes) {
   utf8Bytes = 0;
   for (uint64_t i = 0; i < o.count; ++i) {
     const uint32_t u = readBE(q + 2 * i, 2);
+    if (u == 0) return fail("NUL in string");
     if (isHighSurrogate(u)) {
       if (i + 1 >= o.count || !isLowSurrogate(readBE(q + 2 * i + 2, 2))) return fail("invalid UTF-16 string");
       ++i;
@@ -264,7 +269,7 @@ bool BinaryReader::measureTop() {
   if (!measure(top_, 0)) return false;
   const Meta& m = meta_[top_];
   if (m.count > kMaxObjects) return fail("too many objects");
-  if (m.bytes > kMaxExpandedBytes + n_) return fail("too much data");
+  if (m.count * kObjectFootprint + m.bytes > kMaxFootprint) return fail("too much data");
   return true;
 }
 
@@ -317,6 +322,7 @@ bool BinaryReader::measureContainer(uint64_t index, const Object& o, size_t dept
     }
     count = std::min<uint64_t>(count + c.count, kMaxObjects + 1);
     bytes = saturatingAdd(bytes, c.bytes);
+    if (bytes > kMaxFootprint) return fail("too much data");
     height = std::max(height, c.height);
   }
   Meta& m = meta_[index];
@@ -621,8 +627,8 @@ bool startsLikeXML(const uint8_t* p, size_t n) {
 
 }  // namespace
 
-std::optional<Value> parseBinary(const void* bytes, size_t length, std::string* error) {
-  return BinaryReader(static_cast<const uint8_t*>(bytes), length).read(error);
+std::optional<Value> parseBinary(const void* bytes, size_t length, std::string* error, uint64_t* footprint) {
+  return BinaryReader(static_cast<const uint8_t*>(bytes), length).read(error, footprint);
 }
 
 Data writeBinary(const Value& value) { return BinaryWriter().write(value); }

@@ -14,11 +14,18 @@ namespace plist {
 
 constexpr size_t kMaxDepth = 64;
 constexpr size_t kMaxObjects = 1'000'000;  // after expansion of shared references
+// What a binary property list may cost in memory once built: its strings and
+// data as often as they are reached, plus a fixed cost per object. It holds
+// whatever the input's size, so a few kilobytes of shared references cannot
+// become a hundred megabytes.
+constexpr uint64_t kMaxFootprint = 96ull << 20;
 
 // Binary ("bplist00") or XML, chosen by the leading bytes. On failure returns
 // nothing and, when given, puts a short reason into *error.
 std::optional<Value> parse(const void* bytes, size_t length, std::string* error = nullptr);
-std::optional<Value> parseBinary(const void* bytes, size_t length, std::string* error = nullptr);
+// *footprint, when given, receives the built value's estimated memory cost.
+std::optional<Value> parseBinary(const void* bytes, size_t length, std::string* error = nullptr,
+                                 uint64_t* footprint = nullptr);
 std::optional<Value> parseXML(const void* bytes, size_t length, std::string* error = nullptr);
 
 // The binary format, version 00. Unsigned integers above INT64_MAX are written

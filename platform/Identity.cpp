@@ -90,7 +90,7 @@ DirectoryStamp stampOf(const std::string& path) {
   return stamp;
 }
 
-using IdentityMap = std::unordered_map<std::string, CodeIdentity>;
+using IdentityMap = std::unordered_map<std::string, std::shared_ptr<const CodeIdentity>>;
 
 struct Registry {
   std::shared_mutex mutex;
@@ -134,11 +134,11 @@ void addRegistryFile(int dirfd, const std::string& directory, const std::string&
            !value ? error.c_str() : !entry ? "not a dictionary" : "no Executable string");
     return;
   }
-  CodeIdentity identity;
+  auto identity = std::make_shared<CodeIdentity>();
   if (const plist::Value* signing = plist::find(*entry, "SigningIdentifier"); signing && signing->stringIf())
-    identity.signingIdentifier = signing->string();
+    identity->signingIdentifier = signing->string();
   if (const plist::Value* entitlements = plist::find(*entry, "Entitlements"); entitlements && entitlements->dictionaryIf())
-    identity.entitlements = entitlements->dictionary();
+    identity->entitlements = entitlements->dictionary();
   identities[executable->string()] = std::move(identity);
 }
 
@@ -150,9 +150,14 @@ IdentityMap loadRegistry(const std::string& directory) {
   return identities;
 }
 
-CodeIdentity lookUp(const IdentityMap& identities, const std::string& executablePath) {
+std::shared_ptr<const CodeIdentity> noIdentity() {
+  static const auto* none = new std::shared_ptr<const CodeIdentity>(std::make_shared<CodeIdentity>());
+  return *none;
+}
+
+std::shared_ptr<const CodeIdentity> lookUp(const IdentityMap& identities, const std::string& executablePath) {
   auto found = identities.find(executablePath);
-  return found == identities.end() ? CodeIdentity{} : found->second;
+  return found == identities.end() ? noIdentity() : found->second;
 }
 
 }  // namespace
@@ -183,8 +188,8 @@ std::optional<PeerCredentials> peerCredentials(int socketFd) {
   return peer;
 }
 
-CodeIdentity identityForExecutable(const std::string& executablePath) {
-  if (executablePath.empty()) return {};
+std::shared_ptr<const CodeIdentity> identityForExecutable(const std::string& executablePath) {
+  if (executablePath.empty()) return noIdentity();
   Registry& reg = registry();
   DirectoryStamp now = stampOf(hostPath("/etc/quarterd/identities"));
   {

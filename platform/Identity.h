@@ -4,6 +4,7 @@
 
 #include <sys/types.h>
 
+#include <memory>
 #include <optional>
 #include <string>
 
@@ -30,8 +31,9 @@ struct CodeIdentity {
 };
 
 // The registry entry whose Executable equals the path (the file whose name
-// sorts last wins); an empty identity when none does. The registry is re-read
-// when its directory's modification time changes.
-CodeIdentity identityForExecutable(const std::string& executablePath);
+// sorts last wins); an empty identity when none does, never null. Entries are
+// immutable and shared, so a request holds its caller's identity without a
+// copy. The registry is re-read when its directory's modification time changes.
+std::shared_ptr<const CodeIdentity> identityForExecutable(const std::string& executablePath);
 
 }  // namespace platform

@@ -9,6 +9,7 @@
 #include <atomic>
 #include <cerrno>
 #include <condition_variable>
+#include <cstring>
 #include <deque>
 #include <future>
 #include <mutex>
@@ -350,10 +351,16 @@ Transactions& transactions() {
   return *t;
 }
 
+// Set once by the SIGTERM thread, read by writers on any thread.
+std::atomic<std::chrono::steady_clock::rep> gExitDeadline{
+    std::chrono::steady_clock::time_point::max().time_since_epoch().count()};
+
 void terminationThread(sigset_t signals, const std::function<void()>& stopAccepting) {
   int received = 0;
   while (sigwait(&signals, &received) != 0) {
   }
+  const auto deadline = std::chrono::steady_clock::now() + kTerminationGrace;
+  gExitDeadline.store(deadline.time_since_epoch().count());
   QRTLog(kLogNotice, "SIGTERM received; %d transactions open", transactionCount());
   try {
     if (stopAccepting) stopAccepting();
@@ -361,7 +368,8 @@ void terminationThread(sigset_t signals, const std::function<void()>& stopAccept
     QRTLog(kLogError, "Stopping the listener threw: %s", e.what());
   } catch (...) {
   }
-  if (!waitForTransactions(kTerminationGrace))
+  const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+  if (!waitForTransactions(std::max(left, std::chrono::milliseconds(0))))
     QRTLog(kLogError, "Exiting with %d transactions still open", transactionCount());
   logClose();
   _exit(0);
@@ -405,13 +413,18 @@ bool waitForTransactions(std::chrono::milliseconds timeout) {
   return t.zero.wait_for(lock, timeout, [&] { return t.count.load() == 0; });
 }
 
+std::chrono::steady_clock::time_point exitDeadline() {
+  return std::chrono::steady_clock::time_point(std::chrono::steady_clock::duration(gExitDeadline.load()));
+}
+
 void installTerminationHandler(std::function<void()> stopAccepting) {
   static std::once_flag once;
   std::call_once(once, [&] {
     sigset_t signals;
     sigemptyset(&signals);
     sigaddset(&signals, SIGTERM);
-    pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+    if (int error = pthread_sigmask(SIG_BLOCK, &signals, nullptr))
+      QRTLog(kLogError, "Cannot block SIGTERM: %s", strerror(error));
     try {
       std::thread(terminationThread, signals, std::move(stopAccepting)).detach();
     } catch (const std::system_error& e) {

@@ -48,10 +48,14 @@ int transactionCount();
 // Waits until the count is 0 or the timeout passes; true when it reached 0.
 bool waitForTransactions(std::chrono::milliseconds timeout);
 
-// On SIGTERM: calls stopAccepting (from a thread of its own), waits up to 10 s
-// for the transaction count to fall to 0, closes the log and exits with 0.
-// Call it from main before any other thread exists: it blocks SIGTERM in the
-// calling thread, and only threads created afterwards inherit that mask.
+// On SIGTERM: calls stopAccepting (from a thread of its own), waits until 10 s
+// after the signal for the transaction count to fall to 0, closes the log and
+// exits with 0. Call it from main before any other thread exists: it blocks
+// SIGTERM in the calling thread, and only threads created afterwards inherit
+// that mask.
 void installTerminationHandler(std::function<void()> stopAccepting);
+// When the process exits after SIGTERM; time_point::max() until the signal
+// came. Work that may block (a write to a client) waits no longer than this.
+std::chrono::steady_clock::time_point exitDeadline();
 
 }  // namespace platform

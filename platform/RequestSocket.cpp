@@ -4,13 +4,19 @@
 #include <poll.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
+#include <sys/file.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/timerfd.h>
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <condition_variable>
 #include <cstring>
+#include <deque>
+#include <system_error>
 #include <thread>
 #include <unordered_map>
 #include <vector>
@@ -22,13 +28,40 @@ namespace platform {
 
 namespace {
 
+using Clock = std::chrono::steady_clock;
+
 // A client that reads nothing for this long loses its connection rather than
 // holding a request thread.
 constexpr int kWriteStallMs = 10000;
+constexpr int kDrainWriteStallMs = 2000;
 constexpr size_t kReadChunk = 64 * 1024;
 // Requests of one connection queued or running at once; past this the
 // connection is not read until some finish, so a flood cannot grow memory.
 constexpr int kMaxInFlight = 256;
+constexpr auto kIdleSweepInterval = std::chrono::seconds(5);
+
+// Waits for the socket to take more, at most the stall limit. Once SIGTERM
+// came, a client that takes nothing for a shorter while is given up, so that
+// the requests queued behind it finish and the process exits early.
+bool waitWritable(int fd) {
+  const auto start = Clock::now();
+  auto deadline = start + std::chrono::milliseconds(kWriteStallMs);
+  bool draining = false;
+  for (;;) {
+    const auto now = Clock::now();
+    if (!draining && exitDeadline() != Clock::time_point::max()) {
+      draining = true;
+      deadline = std::min({deadline, now + std::chrono::milliseconds(kDrainWriteStallMs), exitDeadline()});
+    }
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - now).count();
+    if (left <= 0) return false;
+    pollfd pfd{fd, POLLOUT, 0};
+    // Short slices, so that a SIGTERM meanwhile is noticed.
+    int r = ::poll(&pfd, 1, static_cast<int>(std::min<long long>(left, 250)));
+    if (r > 0) return !(pfd.revents & (POLLERR | POLLHUP | POLLNVAL));
+    if (r < 0 && errno != EINTR) return false;
+  }
+}
 
 bool writeAll(int fd, const uint8_t* p, size_t n) {
   while (n > 0) {
@@ -39,34 +72,120 @@ bool writeAll(int fd, const uint8_t* p, size_t n) {
       continue;
     }
     if (w < 0 && errno == EINTR) continue;
-    if (w < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
-      pollfd pfd{fd, POLLOUT, 0};
-      int r = ::poll(&pfd, 1, kWriteStallMs);
-      if (r > 0 && !(pfd.revents & (POLLERR | POLLHUP | POLLNVAL))) continue;
-      if (r < 0 && errno == EINTR) continue;
-    }
+    if (w < 0 && (errno == EAGAIN || errno == EWOULDBLOCK) && waitWritable(fd)) continue;
     return false;
   }
   return true;
 }
 
+void wake(int eventFd, const char* what) {
+  uint64_t one = 1;
+  if (::write(eventFd, &one, sizeof one) < 0 && errno != EAGAIN)
+    QRTLog(kLogError, "Cannot wake the %s: %s", what, strerror(errno));
+}
+
+void drain(int fd) {
+  uint64_t value;
+  while (::read(fd, &value, sizeof value) < 0 && errno == EINTR) {
+  }
+}
+
 }  // namespace
 
-RequestConnection::RequestConnection(int fd, std::optional<PeerCredentials> peer)
-    : fd_(fd), peer_(std::move(peer)) {}
+// The bytes buffered from and for clients. A reader takes the whole of a
+// frame once its length is known, so every byte held belongs to a frame
+// that can complete, a request that will finish or a reply being written:
+// whoever waits for room is never waiting on another waiter. A user other
+// than root holds at most half, so that no one user can starve the others.
+class ByteBudget {
+ public:
+  using Waiter = std::function<void()>;
+  static constexpr uint32_t kNoUser = UINT32_MAX - 1;  // replies: counted globally only
+
+  ByteBudget(size_t limit, int wakeFd) : limit_(limit), wakeFd_(wakeFd) {}
+
+  // Takes n bytes for user when they fit; otherwise queues waiter, which a
+  // poller runs once bytes come back.
+  bool takeOrWait(size_t n, uint32_t user, Waiter waiter) {
+    std::lock_guard<std::mutex> hold(lock_);
+    const size_t held = heldBy(user);
+    const bool userRoom = user == 0 || user == kNoUser || held == 0 || held + n <= limit_ / 2;
+    if (userRoom && (used_ == 0 || used_ + n <= limit_)) {
+      addLocked(n, user);
+      return true;
+    }
+    waiters_.push_back(std::move(waiter));
+    return false;
+  }
+  // For work already admitted: a decoded message, a reply.
+  void force(size_t n, uint32_t user = kNoUser) {
+    std::lock_guard<std::mutex> hold(lock_);
+    addLocked(n, user);
+  }
+  void give(size_t n, uint32_t user = kNoUser) {
+    if (n == 0) return;
+    bool signal;
+    {
+      std::lock_guard<std::mutex> hold(lock_);
+      used_ -= std::min(n, used_);
+      if (user != kNoUser) {
+        auto it = perUser_.find(user);
+        if (it != perUser_.end() && (it->second -= std::min(n, it->second)) == 0) perUser_.erase(it);
+      }
+      signal = !waiters_.empty() && !signalled_;
+      signalled_ = signalled_ || signal;
+    }
+    if (signal) wake(wakeFd_, "budget waiters");
+  }
+  // The waiters queued now; each either fits or queues itself again.
+  std::deque<Waiter> takeWaiters() {
+    std::lock_guard<std::mutex> hold(lock_);
+    signalled_ = false;
+    std::deque<Waiter> ready;
+    ready.swap(waiters_);
+    return ready;
+  }
+ private:
+  size_t heldBy(uint32_t user) const {
+    auto it = perUser_.find(user);
+    return it == perUser_.end() ? 0 : it->second;
+  }
+  void addLocked(size_t n, uint32_t user) {
+    used_ += n;
+    if (user != kNoUser) perUser_[user] += n;
+  }
+
+  mutable std::mutex lock_;
+  const size_t limit_;
+  const int wakeFd_;
+  size_t used_ = 0;
+  std::unordered_map<uint32_t, size_t> perUser_;
+  bool signalled_ = false;
+  std::deque<Waiter> waiters_;
+};
+
+RequestConnection::RequestConnection(int fd, std::optional<PeerCredentials> peer, std::shared_ptr<ByteBudget> budget)
+    : fd_(fd), peer_(std::move(peer)), budget_(std::move(budget)) {}
 
 RequestConnection::~RequestConnection() { ::close(fd_); }
 
-bool RequestConnection::send(uint64_t messageId, const plist::Dictionary& reply) {
+SendResult RequestConnection::send(uint64_t messageId, const plist::Dictionary& reply) {
   std::vector<uint8_t> bytes = frame::encode(messageId, reply);
-  std::lock_guard<std::mutex> hold(writeLock_);
-  if (cancelled_) return false;
-  if (!writeAll(fd_, bytes.data(), bytes.size())) {
-    cancelled_ = true;
-    ::shutdown(fd_, SHUT_RDWR);
-    return false;
+  if (bytes.size() - 4 > frame::kMaxLength) return SendResult::TooLarge;
+  if (budget_) budget_->force(bytes.size());
+  bool sent = false;
+  {
+    std::lock_guard<std::mutex> hold(writeLock_);
+    if (!cancelled_) {
+      sent = writeAll(fd_, bytes.data(), bytes.size());
+      if (!sent) {
+        cancelled_ = true;
+        ::shutdown(fd_, SHUT_RDWR);
+      }
+    }
   }
-  return true;
+  if (budget_) budget_->give(bytes.size());
+  return sent ? SendResult::Sent : SendResult::Gone;
 }
 
 void RequestConnection::cancel() {
@@ -83,84 +202,156 @@ void RequestConnection::cancel() {
 // requests (the rest of a pipelined batch, or all of them when every poller
 // is busy) go to the listener queue. Serving inline saves a thread hand-off
 // on every request.
+//
+// A connection is read by whoever holds it: the poller its event woke, the
+// request that brings its load back under the in-flight cap, or the poller
+// that runs it off the budget's waiting list. It is re-armed, paused (load)
+// or parked (budget) by that holder, and by no one else.
 struct RequestListener::Impl {
   static constexpr int kPollers = 4;
 
   struct Client {
     ConnectionRef connection;
-    frame::Decoder decoder;            // touched only by the thread that owns the armed event
+    uint32_t uid = UINT32_MAX;         // UINT32_MAX: credentials unreadable
+    frame::Decoder decoder;            // touched only by the connection's holder
+    size_t reserved = 0;               // budget held for the frame being read; holder only
     std::atomic<int> inFlight{0};
+    std::atomic<bool> parked{false};   // waits for budget
+    std::atomic<Clock::rep> lastActive{0};
     std::mutex pauseLock;
     bool paused = false;               // not armed until its load falls
+
+    void touch() { lastActive.store(Clock::now().time_since_epoch().count()); }
   };
   using ClientRef = std::shared_ptr<Client>;
 
   std::string path;
   int listenFd = -1;
   int epollFd = -1;
-  int wakeFd = -1;
+  int wakeFd = -1;       // stop
+  int budgetFd = -1;     // budget freed with waiters queued
+  int backoffFd = -1;    // timer: accept again after running out of descriptors
+  int sweepFd = -1;      // timer: close idle connections
+  std::shared_ptr<ByteBudget> budget;
   std::shared_ptr<Queue> queue;
   RequestHandler handler;
-  std::vector<std::thread> pollers;
+  // Pollers are detached: after stopAccepting one may still be busy with a
+  // request, and the process does not wait for it. Destruction does.
+  std::mutex pollersLock;
+  std::condition_variable pollersGone;
+  int runningPollers = 0;
+  bool started = false;
   std::atomic<bool> stopping{false};
   std::atomic<int> idlePollers{0};
+  std::atomic<bool> acceptShort{false};  // out of descriptors (or memory) at the last accept
   std::mutex clientsLock;
   std::unordered_map<int, ClientRef> clients;
+  struct UserSlots {
+    int open = 0;
+    bool warned = false;  // a refusal was logged since the user last had room
+  };
+  std::unordered_map<uint32_t, UserSlots> perUser;  // under clientsLock
 
   ~Impl() {
     stop();
-    if (epollFd >= 0) ::close(epollFd);
-    if (wakeFd >= 0) ::close(wakeFd);
+    {
+      std::unique_lock<std::mutex> hold(pollersLock);
+      pollersGone.wait(hold, [&] { return runningPollers == 0; });
+    }
+    // Requests still running may re-arm into the epoll set: it stays open
+    // until no poller or request can use it, which a joined listener means.
+    for (int fd : {listenFd, epollFd, wakeFd, budgetFd, backoffFd, sweepFd})
+      if (fd >= 0) ::close(fd);
   }
 
   void stop() {
-    stopping = true;
-    uint64_t one = 1;
-    if (wakeFd >= 0) (void)!::write(wakeFd, &one, sizeof one);
-    for (std::thread& t : pollers) t.join();
-    pollers.clear();
-    // The epoll set stays open: requests still running may re-arm into it.
-    if (listenFd >= 0) ::close(listenFd);
-    listenFd = -1;
+    if (stopping.exchange(true)) return;
+    if (wakeFd >= 0) wake(wakeFd, "request pollers");
   }
 
   void run();
-  void arm(int fd, bool listening = false);
+  void arm(int fd, uint32_t events);
+  void armClient(int fd) { arm(fd, EPOLLIN | EPOLLRDHUP | EPOLLONESHOT); }
   void acceptClients();
+  bool admit(const std::optional<PeerCredentials>& peer, uint32_t* uid);
   ClientRef findClient(int fd);
   void dropClient(const ClientRef& client);
-  // Reads what the socket holds and serves the whole frames.
+  void serveWaiters();
+  void sweepIdle();
+  // Reads what the socket holds and the budget allows, and serves the whole frames.
   void serveClient(const ClientRef& client, bool mayServeInline);
+  enum class ReadResult { Event, Empty, Parked, Closed };
+  ReadResult readEvent(const ClientRef& client, RequestEvent& event);
   void dispatch(const ClientRef& client, std::vector<RequestEvent>& events, bool mayServeInline);
   void runEvent(const ClientRef& client, RequestEvent& event);
-  void finishEvent(const ClientRef& client);
+  void finishEvent(const ClientRef& client, size_t charge);
 };
 
-void RequestListener::Impl::arm(int fd, bool listening) {
+void RequestListener::Impl::arm(int fd, uint32_t events) {
   epoll_event ev{};
-  ev.events = EPOLLIN | EPOLLONESHOT | (listening ? 0u : static_cast<uint32_t>(EPOLLRDHUP));
+  ev.events = events;
   ev.data.fd = fd;
-  if (::epoll_ctl(epollFd, EPOLL_CTL_MOD, fd, &ev) != 0 && errno == ENOENT) {
-    ::epoll_ctl(epollFd, EPOLL_CTL_ADD, fd, &ev);
+  if (::epoll_ctl(epollFd, EPOLL_CTL_MOD, fd, &ev) == 0) return;
+  if (errno == ENOENT && ::epoll_ctl(epollFd, EPOLL_CTL_ADD, fd, &ev) == 0) return;
+  // Only a connection already dropped (its descriptor gone) gets here in
+  // normal running; anything else leaves it unserved, which the log shows.
+  if (errno != EBADF) QRTLog(kLogError, "epoll_ctl for descriptor %d failed: %s", fd, strerror(errno));
+}
+
+// The per-user connection limit; the caller closes a refused descriptor.
+bool RequestListener::Impl::admit(const std::optional<PeerCredentials>& peer, uint32_t* uid) {
+  *uid = peer ? static_cast<uint32_t>(peer->uid) : UINT32_MAX;
+  std::lock_guard<std::mutex> hold(clientsLock);
+  UserSlots& slots = perUser[*uid];
+  if (*uid != 0 && slots.open >= kMaxConnectionsPerUser) {
+    // One line per burst: the first refusal after the user last had room.
+    if (!slots.warned)
+      QRTLog(kLogError, "Refusing connections from uid %u: %d already open", *uid, kMaxConnectionsPerUser);
+    slots.warned = true;
+    return false;
   }
+  ++slots.open;
+  return true;
 }
 
 void RequestListener::Impl::acceptClients() {
-  for (;;) {
+  while (!stopping.load()) {
     int fd = ::accept4(listenFd, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
     if (fd < 0) {
-      if (errno == EINTR) continue;
-      if (errno != EAGAIN && errno != EWOULDBLOCK) QRTLog(kLogError, "accept failed: %s", strerror(errno));
+      if (errno == EINTR || errno == ECONNABORTED) continue;
+      if (errno == EAGAIN || errno == EWOULDBLOCK) break;
+      const bool exhausted = errno == EMFILE || errno == ENFILE || errno == ENOBUFS || errno == ENOMEM;
+      // Once per shortage, not at every retry.
+      if (!exhausted || !acceptShort.exchange(true)) QRTLog(kLogError, "accept failed: %s", strerror(errno));
+      if (!exhausted) break;
+      // Pending connections keep the listener readable: polling it now would
+      // spin. Accepting resumes when the timer fires.
+      itimerspec once{};
+      once.it_value.tv_nsec = std::chrono::duration_cast<std::chrono::nanoseconds>(kAcceptBackoff).count();
+      if (::timerfd_settime(backoffFd, 0, &once, nullptr) != 0) {
+        QRTLog(kLogError, "Cannot arm the accept back-off timer: %s", strerror(errno));
+        break;
+      }
       return;
     }
+    if (acceptShort.exchange(false)) QRTLog(kLogNotice, "Accepting connections again");
+    std::optional<PeerCredentials> peer = peerCredentials(fd);
+    uint32_t uid;
+    if (!admit(peer, &uid)) {
+      ::close(fd);
+      continue;
+    }
     auto client = std::make_shared<Client>();
-    client->connection = std::make_shared<RequestConnection>(fd, peerCredentials(fd));
+    client->connection = std::make_shared<RequestConnection>(fd, std::move(peer), budget);
+    client->uid = uid;
+    client->touch();
     {
       std::lock_guard<std::mutex> hold(clientsLock);
       clients[fd] = client;
     }
-    arm(fd);
+    armClient(fd);
   }
+  if (!stopping.load()) arm(listenFd, EPOLLIN | EPOLLONESHOT);
 }
 
 RequestListener::Impl::ClientRef RequestListener::Impl::findClient(int fd) {
@@ -169,20 +360,33 @@ RequestListener::Impl::ClientRef RequestListener::Impl::findClient(int fd) {
   return it == clients.end() ? nullptr : it->second;
 }
 
+// Called by the connection's holder, once.
 void RequestListener::Impl::dropClient(const ClientRef& client) {
   int fd = client->connection->fd();
-  ::epoll_ctl(epollFd, EPOLL_CTL_DEL, fd, nullptr);
+  if (::epoll_ctl(epollFd, EPOLL_CTL_DEL, fd, nullptr) != 0 && errno != ENOENT)
+    QRTLog(kLogError, "epoll_ctl(DEL) for descriptor %d failed: %s", fd, strerror(errno));
+  budget->give(client->reserved, client->uid);
+  client->reserved = 0;
   std::lock_guard<std::mutex> hold(clientsLock);
   auto it = clients.find(fd);
-  if (it != clients.end() && it->second == client) clients.erase(it);
+  if (it != clients.end() && it->second == client) {
+    clients.erase(it);
+    auto user = perUser.find(client->uid);
+    if (user != perUser.end() && --user->second.open <= 0) perUser.erase(user);
+    else if (user != perUser.end()) user->second.warned = false;
+  }
 }
 
 void RequestListener::Impl::runEvent(const ClientRef& client, RequestEvent& event) {
+  const size_t charge = event.charge;
   handler(client->connection, event);
-  finishEvent(client);
+  event.message.reset();
+  finishEvent(client, charge);
 }
 
-void RequestListener::Impl::finishEvent(const ClientRef& client) {
+void RequestListener::Impl::finishEvent(const ClientRef& client, size_t charge) {
+  client->touch();
+  budget->give(charge, client->uid);
   if (client->inFlight.fetch_sub(1) == kMaxInFlight) {
     bool resume = false;
     {
@@ -190,61 +394,103 @@ void RequestListener::Impl::finishEvent(const ClientRef& client) {
       resume = client->paused;
       client->paused = false;
     }
-    // This thread now owns the connection's reading until it re-arms it.
+    // This thread now holds the connection until it re-arms it.
     if (resume) serveClient(client, false);
   }
   transactionEnd();
 }
 
-void RequestListener::Impl::serveClient(const ClientRef& client, bool mayServeInline) {
+// Reads toward the next whole frame: the length field alone, then (with the
+// whole frame taken from the budget) the rest of the frame and the next
+// length field, so that no byte is read that the budget has not admitted.
+RequestListener::Impl::ReadResult RequestListener::Impl::readEvent(const ClientRef& client, RequestEvent& event) {
   uint8_t buffer[kReadChunk];
-  int fd = client->connection->fd();
-  bool eof = false;
+  frame::Decoder& decoder = client->decoder;
+  const int fd = client->connection->fd();
   for (;;) {
-    ssize_t n = ::recv(fd, buffer, sizeof buffer, 0);
+    if (auto raw = decoder.next()) {
+      event.messageId = raw->messageId;
+      event.charge = client->reserved;
+      client->reserved = 0;
+      uint64_t footprint = 0;
+      event.message = frame::decodeMessage(raw->payload, &event.failure, &footprint);
+      raw->payload = {};
+      // The decoded message replaces the frame's bytes; what it costs beyond
+      // them is held too. It is admitted work: it may go over the budget.
+      if (footprint > event.charge) {
+        budget->force(footprint - event.charge, client->uid);
+        event.charge = footprint;
+      }
+      client->touch();
+      return ReadResult::Event;
+    }
+    if (decoder.failed()) {
+      event.failure = decoder.failure();
+      return ReadResult::Event;  // no message: the connection closes
+    }
+    size_t want = 4 - std::min<size_t>(decoder.buffered(), 4);
+    if (const size_t whole = decoder.pendingFrameSize()) {
+      if (client->reserved < whole) {
+        client->parked = true;
+        std::weak_ptr<Client> weak = client;
+        auto resume = [this, weak] {
+          if (ClientRef c = weak.lock()) {
+            c->parked = false;
+            serveClient(c, false);
+          }
+        };
+        if (!budget->takeOrWait(whole - client->reserved, client->uid, std::move(resume))) {
+          const auto& peer = client->connection->peer();
+          QRTLog(kLogDebug, "Request buffer budget full: connection of pid %d waits for %zu bytes",
+                 peer ? static_cast<int>(peer->pid) : 0, whole);
+          return ReadResult::Parked;
+        }
+        client->parked = false;
+        client->reserved = whole;
+      }
+      want = whole - decoder.buffered() + 4;
+    }
+    ssize_t n = ::recv(fd, buffer, std::min(want, sizeof buffer), 0);
     if (n > 0) {
-      client->decoder.append(buffer, static_cast<size_t>(n));
-      if (static_cast<size_t>(n) < sizeof buffer) break;
+      decoder.append(buffer, static_cast<size_t>(n));
       continue;
     }
     if (n < 0 && errno == EINTR) continue;
-    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) break;
-    eof = true;
-    break;
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) return ReadResult::Empty;
+    return ReadResult::Closed;
   }
+}
+
+void RequestListener::Impl::serveClient(const ClientRef& client, bool mayServeInline) {
   for (;;) {
     std::vector<RequestEvent> events;
-    bool closing = false;
-    bool capped = false;  // stopped at the load limit: more frames may be buffered
-    for (;;) {
+    bool closing = stopping.load() || client->connection->cancelled();
+    bool capped = false;  // stopped at the load limit: more frames may wait in the socket
+    ReadResult read = ReadResult::Empty;
+    while (!closing) {
       if (client->inFlight.load() + static_cast<int>(events.size()) >= kMaxInFlight) {
         capped = true;
         break;
       }
-      auto raw = client->decoder.next();
-      if (!raw) break;
       RequestEvent event;
-      event.messageId = raw->messageId;
-      event.message = frame::decodeMessage(raw->payload, &event.failure);
-      closing = !event.message;
+      read = readEvent(client, event);
+      if (read != ReadResult::Event) {
+        closing = read == ReadResult::Closed;
+        break;
+      }
+      closing = !event.message;  // nothing after a frame without reply context is served
       events.push_back(std::move(event));
-      if (closing) break;  // nothing after a frame without reply context is served
-    }
-    if (!closing && !capped && client->decoder.failed()) {
-      RequestEvent event;
-      event.failure = client->decoder.failure();
-      events.push_back(std::move(event));
-      closing = true;
     }
     client->inFlight.fetch_add(static_cast<int>(events.size()));
     for (size_t i = 0; i < events.size(); ++i) transactionBegin();
 
-    if (closing || client->connection->cancelled() || (eof && !capped)) {
+    if (closing) {
       dropClient(client);
       return dispatch(client, events, mayServeInline);
     }
     if (!capped) {
-      arm(fd);
+      // Parked: the budget's waiting list holds the connection now.
+      if (read == ReadResult::Empty) armClient(client->connection->fd());
       return dispatch(client, events, mayServeInline);
     }
     {
@@ -256,7 +502,7 @@ void RequestListener::Impl::serveClient(const ClientRef& client, bool mayServeIn
         return dispatch(client, events, mayServeInline);
       }
     }
-    dispatch(client, events, false);  // the load fell meanwhile: serve what is buffered
+    dispatch(client, events, false);  // the load fell meanwhile: read on
   }
 }
 
@@ -270,6 +516,34 @@ void RequestListener::Impl::dispatch(const ClientRef& client, std::vector<Reques
     queue->async([this, client, event = std::move(events[i])]() mutable { runEvent(client, event); });
   }
   if (inlineLast) runEvent(client, events.back());
+}
+
+void RequestListener::Impl::serveWaiters() {
+  drain(budgetFd);
+  arm(budgetFd, EPOLLIN | EPOLLONESHOT);
+  for (ByteBudget::Waiter& waiter : budget->takeWaiters()) waiter();
+}
+
+// Shutting the socket down wakes its armed event with end of file, so the
+// connection's holder drops it as it would any closed one.
+void RequestListener::Impl::sweepIdle() {
+  drain(sweepFd);
+  const auto cutoff = (Clock::now() - kIdleConnectionTimeout).time_since_epoch().count();
+  std::vector<ClientRef> idle;
+  {
+    std::lock_guard<std::mutex> hold(clientsLock);
+    for (auto& [fd, client] : clients) {
+      if (client->inFlight.load() == 0 && client->connection->repliesDue() == 0 && !client->parked.load() &&
+          client->lastActive.load() < cutoff)
+        idle.push_back(client);
+    }
+  }
+  for (const ClientRef& client : idle) {
+    const auto& peer = client->connection->peer();
+    QRTLog(kLogDebug, "Closing connection of pid %d: idle for %lld s", peer ? static_cast<int>(peer->pid) : 0,
+           static_cast<long long>(kIdleConnectionTimeout.count()));
+    client->connection->cancel();
+  }
 }
 
 void RequestListener::Impl::run() {
@@ -286,9 +560,16 @@ void RequestListener::Impl::run() {
     if (n == 0 || stopping) continue;
     int fd = event.data.fd;
     if (fd == wakeFd) continue;
-    if (fd == listenFd) {
+    if (fd == listenFd || fd == backoffFd) {
+      if (fd == backoffFd) {
+        drain(backoffFd);
+        arm(backoffFd, EPOLLIN | EPOLLONESHOT);
+      }
       acceptClients();
-      arm(listenFd, true);
+    } else if (fd == budgetFd) {
+      serveWaiters();
+    } else if (fd == sweepFd) {
+      sweepIdle();
     } else if (ClientRef client = findClient(fd)) {
       serveClient(client, true);
     }
@@ -298,29 +579,65 @@ void RequestListener::Impl::run() {
 std::unique_ptr<RequestListener> RequestListener::create(const std::string& path, std::shared_ptr<Queue> queue,
                                                          RequestHandler handler) {
   auto impl = std::make_unique<Impl>();
+  // The caller reads errno: keep it past the clean-up of what was opened.
+  auto fail = [&impl]() -> std::unique_ptr<RequestListener> {
+    const int error = errno;
+    impl.reset();
+    errno = error;
+    return nullptr;
+  };
   impl->path = path;
   impl->queue = std::move(queue);
   impl->handler = std::move(handler);
+  // Bound under a staging name and renamed into place once listening, so
+  // that a client never finds a socket that refuses it.
+  const std::string staging = path + ".new";
   sockaddr_un addr{};
-  if (path.size() >= sizeof addr.sun_path) {
+  if (staging.size() >= sizeof addr.sun_path) {
     errno = ENAMETOOLONG;
-    return nullptr;
+    return fail();
   }
   addr.sun_family = AF_UNIX;
-  memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+  memcpy(addr.sun_path, staging.c_str(), staging.size() + 1);
   impl->listenFd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
-  if (impl->listenFd < 0) return nullptr;
-  ::unlink(path.c_str());
-  if (::bind(impl->listenFd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) return nullptr;
-  if (::chmod(path.c_str(), 0666) != 0) return nullptr;
-  if (::listen(impl->listenFd, SOMAXCONN) != 0) return nullptr;
+  if (impl->listenFd < 0) return fail();
+  if (::unlink(staging.c_str()) != 0 && errno != ENOENT) return fail();
+  if (::bind(impl->listenFd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) return fail();
+  auto failBound = [&] {
+    const int error = errno;
+    ::unlink(staging.c_str());
+    errno = error;
+    return fail();
+  };
+  // Any process may connect; entitlements decide what it may do.
+  if (::fchmodat(AT_FDCWD, staging.c_str(), 0666, 0) != 0) return failBound();
+  if (::listen(impl->listenFd, SOMAXCONN) != 0) return failBound();
   impl->epollFd = ::epoll_create1(EPOLL_CLOEXEC);
   impl->wakeFd = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
-  if (impl->epollFd < 0 || impl->wakeFd < 0) return nullptr;
+  impl->budgetFd = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  impl->backoffFd = ::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK);
+  impl->sweepFd = ::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK);
+  if (impl->epollFd < 0 || impl->wakeFd < 0 || impl->budgetFd < 0 || impl->backoffFd < 0 || impl->sweepFd < 0)
+    return failBound();
+  impl->budget = std::make_shared<ByteBudget>(kRequestBufferBudget, impl->budgetFd);
+  itimerspec sweep{};
+  sweep.it_value.tv_sec = sweep.it_interval.tv_sec = kIdleSweepInterval.count();
+  if (::timerfd_settime(impl->sweepFd, 0, &sweep, nullptr) != 0) return failBound();
+  // The stop event stays readable, so that it wakes every poller.
   epoll_event ev{};
   ev.events = EPOLLIN;
   ev.data.fd = impl->wakeFd;
-  if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, impl->wakeFd, &ev) != 0) return nullptr;
+  if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, impl->wakeFd, &ev) != 0) return failBound();
+  for (int fd : {impl->budgetFd, impl->backoffFd}) {
+    ev.events = EPOLLIN | EPOLLONESHOT;
+    ev.data.fd = fd;
+    if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, fd, &ev) != 0) return failBound();
+  }
+  // The sweep's readiness is taken by one poller each time it fires.
+  ev.events = EPOLLIN | EPOLLET;
+  ev.data.fd = impl->sweepFd;
+  if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, impl->sweepFd, &ev) != 0) return failBound();
+  if (::rename(staging.c_str(), path.c_str()) != 0) return failBound();
   return std::unique_ptr<RequestListener>(new RequestListener(std::move(impl)));
 }
 
@@ -328,15 +645,61 @@ RequestListener::RequestListener(std::unique_ptr<Impl> impl) : impl_(std::move(i
 RequestListener::~RequestListener() = default;
 
 void RequestListener::resume() {
-  if (!impl_->pollers.empty()) return;
-  impl_->arm(impl_->listenFd, true);
-  for (int i = 0; i < Impl::kPollers; ++i) impl_->pollers.emplace_back([impl = impl_.get()] { impl->run(); });
+  Impl* impl = impl_.get();
+  {
+    std::lock_guard<std::mutex> hold(impl->pollersLock);
+    if (impl->started) return;
+    impl->started = true;
+  }
+  impl->arm(impl->listenFd, EPOLLIN | EPOLLONESHOT);
+  for (int i = 0; i < Impl::kPollers; ++i) {
+    {
+      std::lock_guard<std::mutex> hold(impl->pollersLock);
+      ++impl->runningPollers;
+    }
+    try {
+      std::thread([impl] {
+        impl->run();
+        std::lock_guard<std::mutex> hold(impl->pollersLock);
+        if (--impl->runningPollers == 0) impl->pollersGone.notify_all();
+      }).detach();
+    } catch (const std::system_error& e) {
+      QRTLog(kLogError, "Cannot start a request poller: %s", e.what());
+      std::lock_guard<std::mutex> hold(impl->pollersLock);
+      --impl->runningPollers;
+    }
+  }
 }
 
+// Pollers busy with a request (or a reply to a client that does not read)
+// finish on their own; the process does not wait for them here.
 void RequestListener::stopAccepting() {
-  if (impl_->pollers.empty()) return;
+  if (impl_->stopping.load()) return;
+  if (::epoll_ctl(impl_->epollFd, EPOLL_CTL_DEL, impl_->listenFd, nullptr) != 0 && errno != ENOENT)
+    QRTLog(kLogError, "epoll_ctl(DEL) for the listener failed: %s", strerror(errno));
   impl_->stop();
-  ::unlink(impl_->path.c_str());
+  if (::unlink(impl_->path.c_str()) != 0 && errno != ENOENT)
+    QRTLog(kLogError, "Cannot remove %s: %s", impl_->path.c_str(), strerror(errno));
+}
+
+int acquireInstanceLock(const std::string& path) {
+  int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600);
+  if (fd < 0) return -1;
+  struct stat st;
+  const int statted = ::fstat(fd, &st);
+  if (statted != 0 || !S_ISREG(st.st_mode)) {
+    const int error = statted != 0 ? errno : EINVAL;
+    ::close(fd);
+    errno = error;
+    return -1;
+  }
+  if (::flock(fd, LOCK_EX | LOCK_NB) != 0) {
+    const int error = errno;
+    ::close(fd);
+    errno = error;
+    return -1;
+  }
+  return fd;
 }
 
 }  // namespace platform

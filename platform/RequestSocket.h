@@ -4,6 +4,7 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -16,27 +17,53 @@
 
 namespace platform {
 
+// Limits of the request socket. Bytes read from clients and not yet served
+// (a frame counts from when its length arrives, its decoded message from when
+// it is decoded) and reply bytes being written share one budget; a connection
+// whose next frame does not fit is not read until the budget frees. A user
+// other than root holds at most half of it.
+inline constexpr size_t kRequestBufferBudget = size_t{64} << 20;
+// Connections open at once per user id; root is not limited.
+inline constexpr int kMaxConnectionsPerUser = 64;
+// A connection with nothing in flight that completes no frame for this long
+// is closed.
+inline constexpr std::chrono::seconds kIdleConnectionTimeout{60};
+// How long accepting pauses when the process is out of descriptors.
+inline constexpr std::chrono::milliseconds kAcceptBackoff{100};
+
+class ByteBudget;
+
+enum class SendResult { Sent, Gone, TooLarge };
+
 class RequestConnection {
  public:
-  RequestConnection(int fd, std::optional<PeerCredentials> peer);
+  RequestConnection(int fd, std::optional<PeerCredentials> peer, std::shared_ptr<ByteBudget> budget = nullptr);
   ~RequestConnection();
   RequestConnection(const RequestConnection&) = delete;
   RequestConnection& operator=(const RequestConnection&) = delete;
 
   // Read once when the client connected; nothing when they could not be read.
   const std::optional<PeerCredentials>& peer() const { return peer_; }
-  // Sends a reply frame; false when the connection is gone.
-  bool send(uint64_t messageId, const plist::Dictionary& reply);
+  // Sends a reply frame. TooLarge (nothing sent, the stream intact) when it
+  // would not fit in one frame; Gone when the connection is.
+  SendResult send(uint64_t messageId, const plist::Dictionary& reply);
   // Closes the connection; replies due to it are dropped.
   void cancel();
   bool cancelled() const { return cancelled_; }
+  // Replies promised by work that finishes after its request (a connection
+  // owed one is not idle).
+  void replyDue() { repliesDue_.fetch_add(1); }
+  void replyDone() { repliesDue_.fetch_sub(1); }
+  int repliesDue() const { return repliesDue_.load(); }
   int fd() const { return fd_; }
 
  private:
   int fd_;
   std::optional<PeerCredentials> peer_;
+  std::shared_ptr<ByteBudget> budget_;
   std::mutex writeLock_;
   std::atomic<bool> cancelled_{false};
+  std::atomic<int> repliesDue_{0};
 };
 
 using ConnectionRef = std::shared_ptr<RequestConnection>;
@@ -47,6 +74,7 @@ struct RequestEvent {
   uint64_t messageId = 0;
   std::optional<plist::Dictionary> message;
   std::string failure;  // why message is empty
+  size_t charge = 0;    // budget bytes held until the event is served
 };
 
 using RequestHandler = std::function<void(const ConnectionRef&, RequestEvent&)>;
@@ -60,8 +88,8 @@ class RequestListener {
   ~RequestListener();
   // Starts accepting and serving.
   void resume();
-  // Closes the listening socket and stops reading requests; replies of
-  // requests in flight are still sent.
+  // Stops accepting and reading requests without waiting for the threads
+  // that serve them; replies of requests in flight are still sent.
   void stopAccepting();
 
   struct Impl;
@@ -70,5 +98,10 @@ class RequestListener {
   explicit RequestListener(std::unique_ptr<Impl> impl);
   std::unique_ptr<Impl> impl_;
 };
+
+// Takes an exclusive lock on path (created 0600, never through a symbolic
+// link) for the life of the process. The descriptor, or -1 with errno set
+// (EWOULDBLOCK: another process holds it).
+int acquireInstanceLock(const std::string& path);
 
 }  // namespace platform

@@ -11,7 +11,14 @@ using platform::kLogError;
 
 void QRTReply::send(uint64_t code) {
   dictionary["ReplyError"] = code;
-  connection_->send(messageId_, dictionary);
+  const platform::SendResult sent = connection_->send(messageId_, dictionary);
+  done();
+  if (sent != platform::SendResult::TooLarge) return;
+  // The stream stays whole: the client gets an error in place of the reply.
+  QRTLog(kLogError, "Reply to message %llu with code %llu does not fit in one frame; answering %llu",
+         static_cast<unsigned long long>(messageId_), static_cast<unsigned long long>(code),
+         static_cast<unsigned long long>(QRTErrorException));
+  connection_->send(messageId_, plist::Dictionary{{"ReplyError", static_cast<uint64_t>(QRTErrorException)}});
 }
 
 namespace {
@@ -117,10 +124,9 @@ std::optional<QRTClientConnection> checkEntitlementsAndInitClientObject(const pl
                                                                         const char* entitlement) {
   const auto& peer = connection.peer();
   int pid = peer ? static_cast<int>(peer->pid) : 0;
-  platform::CodeIdentity identity;
-  if (peer && !peer->executable.empty()) {
-    identity = platform::identityForExecutable(peer->executable);
-  } else {
+  std::shared_ptr<const platform::CodeIdentity> caller = platform::identityForExecutable(peer ? peer->executable : "");
+  const platform::CodeIdentity& identity = *caller;
+  if (!peer || peer->executable.empty()) {
     QRTLog(kLogError, "Failed to copy signing ID for pid %d : %@", pid,
            std::string(peer ? "process executable unreadable" : "peer credentials unreadable"));
   }
@@ -128,8 +134,9 @@ std::optional<QRTClientConnection> checkEntitlementsAndInitClientObject(const pl
   const bool requiresNone = requirement == QRTEntitlementNone;
   const uint32_t userId = peer ? peer->uid : UINT32_MAX;
   auto refuse = [&]() -> std::optional<QRTClientConnection> {
-    QRTLog(kLogError, "connection attempt from pid %d (%@) missing required entitlement: %s", pid,
-           identity.signingIdentifier, entitlement);
+    QRTLogAs(kLogError, "checkEntitlementsAndInitClientObject",
+             "connection attempt from pid %d (%@) missing required entitlement: %s", pid, identity.signingIdentifier,
+             entitlement);
     return std::nullopt;
   };
   if (!identity.entitlements || identity.entitlements->empty()) {
@@ -221,6 +228,7 @@ const plist::Value* QRTMessageObject(const plist::Dictionary& message, std::stri
 
 std::optional<std::string> QRTMessageIdentifier(const plist::Dictionary& message,
                                                 const std::optional<std::string>& clientIdentifier) {
-  if (plist::find(message, "Identifier")) return QRTMessageString(message, "Identifier");
+  // A mistyped identifier reads as missing, as every reader treats a wrong type.
+  if (std::optional<std::string> identifier = QRTMessageString(message, "Identifier")) return identifier;
   return clientIdentifier;
 }

@@ -3,6 +3,7 @@
 // the reply with its "ReplyError".
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -28,14 +29,23 @@ inline constexpr const char* QRTEntitlementUserManagedAssets = "com.norvane.priv
 class QRTReply {
  public:
   QRTReply(platform::ConnectionRef connection, uint64_t messageId)
-      : connection_(std::move(connection)), messageId_(messageId) {}
+      : connection_(std::move(connection)), messageId_(messageId) {
+    connection_->replyDue();
+  }
+  ~QRTReply() { done(); }
+  QRTReply(const QRTReply&) = delete;
+  QRTReply& operator=(const QRTReply&) = delete;
   plist::Dictionary dictionary;
   // Stores code under "ReplyError" and sends the reply.
   void send(uint64_t code);
 
  private:
+  void done() {
+    if (!done_.exchange(true)) connection_->replyDone();
+  }
   platform::ConnectionRef connection_;
   uint64_t messageId_;
+  std::atomic<bool> done_{false};
 };
 using QRTReplyRef = std::shared_ptr<QRTReply>;
 
@@ -73,6 +83,6 @@ bool QRTMessageBool(const plist::Dictionary& message, std::string_view key);
 std::optional<std::string> QRTMessageString(const plist::Dictionary& message, std::string_view key);
 std::optional<QRTUUID> QRTMessageUUID(const plist::Dictionary& message, std::string_view key);
 const plist::Value* QRTMessageObject(const plist::Dictionary& message, std::string_view key);
-// "Identifier", or the caller's own identifier when the key is missing.
+// "Identifier", or the caller's own identifier when the key is missing or not a string.
 std::optional<std::string> QRTMessageIdentifier(const plist::Dictionary& message,
                                                 const std::optional<std::string>& clientIdentifier);

@@ -201,6 +201,19 @@ TEST(PlistBinaryReader, BoundsExpansionOfSharedReferences) {
   Data blob{0x4F, 0x10, 100};
   blob.insert(blob.end(), 100, 0x55);
   EXPECT_EQ(refusal(assemble({arrayOf(1000, 1), arrayOf(700, 2), blob})), "too much data");
+
+  // Under 4 KiB that would build 990,000 strings of 64 bytes: within the
+  // object limit and under 64 MB of characters, yet over 100 MiB in memory.
+  Data text{0x5F, 0x10, 64};
+  text.insert(text.end(), 64, 'q');
+  const Data small = assemble({arrayOf(1000, 1), arrayOf(990, 2), text});
+  EXPECT_LT(small.size(), 4096u);
+  EXPECT_EQ(refusal(small), "too much data");
+  uint64_t footprint = 0;
+  auto built = plist::parseBinary(wide(998).data(), wide(998).size(), nullptr, &footprint);
+  ASSERT_TRUE(built);
+  EXPECT_GE(footprint, 999'001u * sizeof(Value));
+  EXPECT_LE(footprint, plist::kMaxFootprint);
 }
 
 TEST(PlistBinaryReader, NestingLimit) {
@@ -271,6 +284,9 @@ TEST(PlistBinaryReader, RefusesUnsupportedOrInvalidObjects) {
       {{{0x61, 0xd8, 0x3d}}, "invalid UTF-16 string"},  // lone high surrogate
       {{{0x61, 0xde, 0x00}}, "invalid UTF-16 string"},  // lone low surrogate
       {{{0x62, 0xd8, 0x3d, 0x00, 0x41}}, "invalid UTF-16 string"},
+      {{{0x53, 'a', 0, 'b'}}, "NUL in string"},
+      {{{0x61, 0, 0}}, "NUL in string"},
+      {{{0xD1, 1, 2}, {0x52, 'k', 0}, {0x10, 1}}, "NUL in string"},  // a key
       {{{0xD1, 1, 1}, {0x10, 1}}, "dictionary key is not a string"},
       {{{0xD2, 1, 2, 3, 3}, {0x51, 'k'}, {0x61, 0, 'k'}, {0x10, 1}}, "duplicate dictionary key"},
   };

@@ -2,7 +2,12 @@
 #include <gtest/gtest.h>
 #include <stdlib.h>
 
+#include <sys/socket.h>
+
 #include <fstream>
+#include <thread>
+
+#include "base/Frame.h"
 
 #include "Daemon/requests/QRTRequestDispatcher.h"
 #include "Daemon/QRTError.h"
@@ -61,29 +66,65 @@ TEST_F(ValidateUserIdTest, SystemCallersNameAnyUserOfAPerUserClass) {
   EXPECT_EQ(result, 38u);
 }
 
+// Each reader against a value of every type: only its own type reads.
 TEST(MessageReaders, MissingOrMistypedValuesReadAsNothing) {
   std::array<uint8_t, 16> bytes{};
   bytes[0] = 0xAB;
-  plist::Dictionary message{{"Big", UINT64_MAX},
-                            {"Neg", -5},
-                            {"Flag", true},
-                            {"Name", "com.example"},
-                            {"UUID", plist::Data(bytes.begin(), bytes.end())},
-                            {"ShortUUID", plist::Data{1, 2, 3}},
-                            {"Identifier", 17}};
-  EXPECT_EQ(QRTMessageU64(message, "Big"), UINT64_MAX);
-  EXPECT_EQ(QRTMessageI64(message, "Neg"), -5);
-  EXPECT_EQ(QRTMessageU64(message, "Name"), 0u);
-  EXPECT_FALSE(QRTMessageBool(message, "Missing"));
-  EXPECT_FALSE(QRTMessageBool(message, "Big"));
-  EXPECT_EQ(QRTMessageString(message, "Name"), "com.example");
-  EXPECT_EQ(QRTMessageString(message, "Flag"), std::nullopt);
-  ASSERT_TRUE(QRTMessageUUID(message, "UUID"));
-  EXPECT_EQ(QRTMessageUUID(message, "UUID")->bytes()[0], 0xAB);
-  EXPECT_EQ(QRTMessageUUID(message, "ShortUUID"), std::nullopt);
-  // A present but mistyped identifier is nil; only a missing one falls back.
-  EXPECT_EQ(QRTMessageIdentifier(message, std::string("own")), std::nullopt);
+  const plist::Data uuid(bytes.begin(), bytes.end());
+  const std::pair<const char*, plist::Value> values[] = {
+      {"u64", UINT64_MAX}, {"i64", -5},       {"bool", true},          {"string", "com.example"},
+      {"uuid", uuid},      {"data", plist::Data{1, 2, 3}},             {"real", 2.5},
+      {"array", plist::Array{"com.example"}}, {"dict", plist::Dictionary{{"k", 1}}},
+  };
+  plist::Dictionary message;
+  for (const auto& [key, value] : values) message[key] = value;
+  for (const auto& [key, value] : values) {
+    const std::string k = key;
+    EXPECT_EQ(QRTMessageU64(message, k), k == "u64" ? UINT64_MAX : k == "i64" ? uint64_t(-5) : 0u) << k;
+    EXPECT_EQ(QRTMessageI64(message, k), k == "u64" ? -1 : k == "i64" ? -5 : 0) << k;
+    EXPECT_EQ(QRTMessageBool(message, k), k == "bool") << k;
+    EXPECT_EQ(QRTMessageString(message, k).has_value(), k == "string") << k;
+    EXPECT_EQ(QRTMessageUUID(message, k).has_value(), k == "uuid") << k;
+    // A present identifier of another type reads as missing: the caller's own.
+    plist::Dictionary withIdentifier{{"Identifier", value}};
+    EXPECT_EQ(QRTMessageIdentifier(withIdentifier, std::string("own")), k == "string" ? "com.example" : "own") << k;
+    EXPECT_EQ(QRTMessageIdentifier(withIdentifier, std::nullopt).has_value(), k == "string") << k;
+  }
+  EXPECT_EQ(QRTMessageUUID(message, "uuid")->bytes()[0], 0xAB);
+  EXPECT_FALSE(QRTMessageBool(message, "missing"));
   EXPECT_EQ(QRTMessageIdentifier(plist::Dictionary{}, std::string("own")), "own");
+}
+
+// A reply too big for one frame becomes a small error reply; the stream
+// stays usable for the next one.
+TEST(ReplySending, OversizedReplyBecomesErrorFortyOnAnIntactStream) {
+  int fds[2];
+  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+  auto connection = std::make_shared<platform::RequestConnection>(fds[0], std::nullopt);
+  std::thread sender([&] {
+    auto big = std::make_shared<QRTReply>(connection, 7);
+    big->dictionary["Blob"] = plist::Data(frame::kMaxLength, 1);
+    big->send(1);
+    auto small = std::make_shared<QRTReply>(connection, 8);
+    small->send(1);
+  });
+  frame::Decoder decoder;
+  std::vector<std::pair<uint64_t, uint64_t>> replies;  // message id, ReplyError
+  uint8_t buffer[4096];
+  while (replies.size() < 2) {
+    ssize_t n = recv(fds[1], buffer, sizeof buffer, 0);
+    ASSERT_GT(n, 0);
+    decoder.append(buffer, static_cast<size_t>(n));
+    while (auto f = decoder.next()) {
+      auto message = frame::decodeMessage(f->payload);
+      ASSERT_TRUE(message);
+      replies.emplace_back(f->messageId, QRTMessageU64(*message, "ReplyError"));
+    }
+  }
+  sender.join();
+  EXPECT_EQ(replies, (std::vector<std::pair<uint64_t, uint64_t>>{{7, QRTErrorException}, {8, 1}}));
+  EXPECT_EQ(connection->repliesDue(), 0);
+  close(fds[1]);
 }
 
 TEST(CommandTable, RowsMatchTheirNumbersAndEntitlements) {

@@ -160,6 +160,35 @@ TEST(KitConnection, ConnectFailureNamesThePath) {
   EXPECT_NE(std::string::npos, error.find("/nonexistent/socket"));
 }
 
+// Frames split at every size, big ones (which leave in their own buffer)
+// between small ones: each comes out whole and in order, and the length of
+// the frame in progress is known as soon as its length field is.
+TEST(FrameDecoder, SplitStreamsOfBigAndSmallFramesComeOutWhole) {
+  std::vector<uint8_t> stream;
+  std::vector<plist::Dictionary> sent;
+  for (size_t size : {0, 200000, 10, 70000, 0}) {
+    sent.push_back(plist::Dictionary{{"Pad", plist::Data(size, static_cast<uint8_t>(size))}});
+    std::vector<uint8_t> bytes = frame::encode(sent.size(), sent.back());
+    stream.insert(stream.end(), bytes.begin(), bytes.end());
+  }
+  for (size_t chunk : {size_t{1}, size_t{3}, size_t{4096}, stream.size()}) {
+    frame::Decoder decoder;
+    std::vector<plist::Dictionary> got;
+    for (size_t at = 0; at < stream.size(); at += chunk) {
+      decoder.append(stream.data() + at, std::min(chunk, stream.size() - at));
+      EXPECT_EQ(decoder.pendingFrameSize() > frame::kHeaderSize, decoder.buffered() >= 4) << chunk;
+      while (auto f = decoder.next()) {
+        EXPECT_EQ(f->messageId, got.size() + 1);
+        auto message = frame::decodeMessage(f->payload);
+        ASSERT_TRUE(message);
+        got.push_back(*message);
+      }
+    }
+    EXPECT_EQ(got, sent) << chunk;
+    EXPECT_EQ(decoder.buffered(), 0u);
+  }
+}
+
 TEST(KitRequest, EncodesValuesTheWayTheDaemonReadsThem) {
   auto uuid = QRTUUID::fromString("0A1B2C3D-4E5F-4061-8293-A4B5C6D7E8F9");
   ASSERT_TRUE(uuid);

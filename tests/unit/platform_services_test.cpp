@@ -206,20 +206,20 @@ TEST_F(DeviceRootTest, IdentityRegistryLastSortedFileWinsAndChangesAreSeen) {
   writePlist(registry / "30-plain.plist", identityEntry("/usr/bin/plain", "com.example.plain", false));
   writePlist(registry / "40-noexec.plist", plist::Dictionary{{"SigningIdentifier", "com.example.none"}});
 
-  CodeIdentity tool = identityForExecutable("/usr/bin/tool");
+  CodeIdentity tool = *identityForExecutable("/usr/bin/tool");
   EXPECT_EQ(tool.signingIdentifier, "com.example.b");
   ASSERT_TRUE(tool.entitlements);
   EXPECT_TRUE(plist::find(*tool.entitlements, "com.norvane.private.QuarterKit.allowed"));
-  CodeIdentity plain = identityForExecutable("/usr/bin/plain");
+  CodeIdentity plain = *identityForExecutable("/usr/bin/plain");
   EXPECT_EQ(plain.signingIdentifier, "com.example.plain");
   EXPECT_FALSE(plain.entitlements);
-  EXPECT_FALSE(identityForExecutable("/usr/bin/other").signingIdentifier);
+  EXPECT_FALSE(identityForExecutable("/usr/bin/other")->signingIdentifier);
 
   // Readers racing a change see the old or the new entry, never anything else.
   std::atomic<int> strange{0};
   auto read = [&] {
     for (int i = 0; i < 200; ++i) {
-      std::optional<std::string> id = identityForExecutable("/usr/bin/tool").signingIdentifier;
+      std::optional<std::string> id = identityForExecutable("/usr/bin/tool")->signingIdentifier;
       strange += id != "com.example.b" && id != "com.example.c";
     }
   };
@@ -228,11 +228,11 @@ TEST_F(DeviceRootTest, IdentityRegistryLastSortedFileWinsAndChangesAreSeen) {
   reader1.join();
   reader2.join();
   EXPECT_EQ(strange, 0);
-  EXPECT_EQ(identityForExecutable("/usr/bin/tool").signingIdentifier, "com.example.c");
+  EXPECT_EQ(identityForExecutable("/usr/bin/tool")->signingIdentifier, "com.example.c");
   fs::remove(registry / "50-c.plist");
-  EXPECT_EQ(identityForExecutable("/usr/bin/tool").signingIdentifier, "com.example.b");
+  EXPECT_EQ(identityForExecutable("/usr/bin/tool")->signingIdentifier, "com.example.b");
   fs::remove_all(registry);
-  EXPECT_FALSE(identityForExecutable("/usr/bin/tool").signingIdentifier);
+  EXPECT_FALSE(identityForExecutable("/usr/bin/tool")->signingIdentifier);
 }
 
 TEST_F(DeviceRootTest, PeerCredentialsAreVerifiedOnlyForALivePeer) {
