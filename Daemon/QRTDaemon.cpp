@@ -23,6 +23,7 @@
 #include "platform/LockState.h"
 #include "platform/Log.h"
 #include "platform/RequestSocket.h"
+#include "platform/SafePath.h"
 
 using platform::kLogDebug;
 using platform::kLogError;
@@ -88,8 +89,9 @@ bool setUpDeviceRoot(const std::string& root) {
   platform::setDeviceRoot(resolved);
   for (const char* dir : {"/run", "/etc"}) {
     std::string path = platform::hostPath(dir);
-    if (mkdir(path.c_str(), 0755) != 0 && errno != EEXIST)
-      fprintf(stderr, "quarterd: cannot create %s: %s\n", path.c_str(), strerror(errno));
+    platform::UniqueFd made;
+    if (int err = platform::safeMakeDirectory(path, 0755, false, platform::kAnyOwner, &made))
+      fprintf(stderr, "quarterd: cannot create %s: %s\n", path.c_str(), strerror(err));
   }
   return true;
 }
