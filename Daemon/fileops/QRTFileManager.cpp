@@ -932,18 +932,21 @@ static bool statFailed(const char* function, const QRTURL& src, int err, QRTErro
   return false;
 }
 
-// The source's parent; with failIfSrcMissing false a missing source is
-// reported as *missing (and true).
-static bool openSource(const char* function, const QRTURL& src, bool failIfSrcMissing, SafeParent* parent,
-                       bool* missing, int* resolveError, QRTErrorRef* error) {
+// The parents of a copy's or move's two ends. With failIfSrcMissing false a
+// missing source is reported as *missing (and true); *resolveError holds what
+// stopped the opening of either parent.
+static bool openEnds(const char* function, const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
+                     SafeParent* from, SafeParent* to, bool* missing, int* resolveError, QRTErrorRef* error) {
   *missing = false;
-  *resolveError = platform::safeOpenParent(src.path(), parent);
-  if (failIfSrcMissing) return true;
-  int err = *resolveError;
-  struct stat st;
-  if (!err && fstatat(parent->fd.get(), parent->name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) err = errno;
-  if (err == ENOENT) *missing = true;
-  return err == 0 || err == ENOENT || statFailed(function, src, err, error);
+  int err = *resolveError = platform::safeOpenParent(src.path(), from);
+  if (!failIfSrcMissing) {
+    struct stat st;
+    if (!err && fstatat(from->fd.get(), from->name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) err = errno;
+    if (err == ENOENT) *missing = true;
+    if (err != 0 && err != ENOENT) return statFailed(function, src, err, error);
+  }
+  if (!*resolveError && !*missing) *resolveError = platform::safeOpenParent(toURL.path(), to);
+  return true;
 }
 
 bool QRTFileManager::_copyItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
@@ -951,9 +954,8 @@ bool QRTFileManager::_copyItemAtURL(const QRTURL& src, const QRTURL& toURL, bool
   SafeParent from, to;
   bool missing;
   int err;
-  if (!openSource(__func__, src, failIfSrcMissing, &from, &missing, &err, error)) return false;
+  if (!openEnds(__func__, src, toURL, failIfSrcMissing, &from, &to, &missing, &err, error)) return false;
   if (missing) return true;
-  if (!err) err = platform::safeOpenParent(toURL.path(), &to);
   if (!err) {
     TreeCloner cloner(false);
     err = cloner.run(from.fd.get(), from.name.c_str(), to.fd.get(), to.name.c_str());
@@ -1011,9 +1013,8 @@ bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool
   SafeParent from, to;
   bool missing;
   int err;
-  if (!openSource(__func__, src, failIfSrcMissing, &from, &missing, &err, error)) return false;
+  if (!openEnds(__func__, src, toURL, failIfSrcMissing, &from, &to, &missing, &err, error)) return false;
   if (missing) return true;
-  if (!err) err = platform::safeOpenParent(toURL.path(), &to);
   if (!err) {
     if (renameat(from.fd.get(), from.name.c_str(), to.fd.get(), to.name.c_str()) != 0) {
       err = errno;
