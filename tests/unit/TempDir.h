@@ -34,6 +34,21 @@ class TempDir {
   std::string path_;
 };
 
+inline struct stat lstatOf(const std::string& path) {
+  struct stat st {};
+  if (lstat(path.c_str(), &st) != 0) throw std::runtime_error("lstat " + path + " failed");
+  return st;
+}
+
+// marker/{file, dir/inner}: stands for what a user may not change; a test
+// compares its treeSnapshot before and after.
+inline void makeMarkerTree(const std::string& marker) {
+  std::filesystem::create_directories(marker + "/dir");
+  std::ofstream(marker + "/file") << "precious";
+  std::ofstream(marker + "/dir/inner") << "inner";
+  if (setxattr((marker + "/file").c_str(), "user.mark", "m", 1, 0) != 0) throw std::runtime_error("setxattr");
+}
+
 inline std::string fileText(const std::string& path) {
   std::stringstream s;
   s << std::ifstream(path).rdbuf();

@@ -31,10 +31,7 @@ std::string nested(size_t levels) {
   return s;
 }
 
-const char kEntitlements[] = R"(<?xml version="1.0" encoding="UTF-8"?>
-<!DOCTYPE plist PUBLIC "-//Norvane//DTD PLIST 1.0//EN" "https://dtd.norvane.example/plist-1.0.dtd">
-<plist version="1.0">
-<dict>
+const std::string kEntitlements = kHeader + std::string(R"(<dict>
 	<!-- written by the signing tool -->
 	<key>DisplayName</key>
 	<string>Notes &amp; Lists</string>
@@ -59,7 +56,7 @@ const char kEntitlements[] = R"(<?xml version="1.0" encoding="UTF-8"?>
 	</dict>
 </dict>
 </plist>
-)";
+)");
 
 TEST(PlistXMLTest, ReadsSigningToolDocument) {
   std::string error;

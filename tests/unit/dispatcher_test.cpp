@@ -1,69 +1,41 @@
 // The request layer's pure rules: user-id validation and message readers.
 #include <gtest/gtest.h>
-#include <stdlib.h>
-
 #include <sys/socket.h>
 
-#include <fstream>
 #include <thread>
 
-#include "base/Frame.h"
-
-#include "Daemon/requests/QRTRequestDispatcher.h"
 #include "Daemon/QRTError.h"
+#include "Daemon/requests/QRTRequestDispatcher.h"
+#include "TempDir.h"
+#include "base/Frame.h"
 #include "platform/DeviceRoot.h"
 
 namespace {
 
 // The mobile account is 502 here, so a rule that hard-codes 501 shows.
-class ValidateUserIdTest : public ::testing::Test {
- protected:
-  static void SetUpTestSuite() {
-    char tmpl[] = "/tmp/qrt-dispatch.XXXXXX";
-    ASSERT_NE(mkdtemp(tmpl), nullptr);
-    std::string root = tmpl;
-    system(("mkdir -p " + root + "/etc").c_str());
-    std::ofstream(root + "/etc/passwd") << "mobile:x:502:502::/private/var/mobile:/bin/sh\n";
-    platform::setDeviceRoot(root);
-  }
-
-  static uint32_t check(uint32_t requested, uint64_t cls, uint32_t caller, uint64_t* result) {
+TEST(ValidateUserId, EffectiveUserByClassAndCaller) {
+  TempDir root("/tmp/qrt-dispatch");
+  std::filesystem::create_directories(root / "etc");
+  std::ofstream(root / "etc/passwd") << "mobile:x:502:502::/private/var/mobile:/bin/sh\n";
+  platform::setDeviceRoot(root.path());
+  constexpr uint32_t kRefused = 0xffffffff;  // with error 38
+  const uint32_t cases[][4] = {
+      // requested user, class, caller, effective user. Global classes belong to their fixed users...
+      {33, 1, 0, 33}, {33, 8, 501, 33}, {501, 1, 0, kRefused}, {499, 12, 0, 499}, {0, 12, 0, kRefused},
+      {1, 13, 0, kRefused},
+      // ...ordinary callers get their own user...
+      {1, 2, 600, 600}, {600, 2, 600, 600}, {501, 2, 600, kRefused}, {0, 7, 600, kRefused},
+      // ...system callers name any user of a per-user class (1: the current mobile user).
+      {1, 2, 33, 502}, {1, 0, 0, 502}, {0, 2, 0, 0}, {777, 11, 500, 777}, {501, 0, 0, kRefused}, {501, 14, 0, kRefused},
+  };
+  for (const auto& [requested, cls, caller, expected] : cases) {
     uint32_t effective = 0xdeadbeef;
-    *result = 1;
-    if (!validateUserId(requested, cls, caller, &effective, result)) return 0xffffffff;
-    return effective;
+    uint64_t result = 1;
+    const bool ok = validateUserId(requested, cls, caller, &effective, &result);
+    EXPECT_EQ(ok ? effective : kRefused, expected) << requested << " " << cls << " " << caller;
+    EXPECT_EQ(result, ok ? 1u : 38u) << requested << " " << cls << " " << caller;
   }
-};
-
-TEST_F(ValidateUserIdTest, GlobalClassesBelongToTheirFixedUsers) {
-  uint64_t result;
-  EXPECT_EQ(check(33, 1, 0, &result), 33u);
-  EXPECT_EQ(check(33, 8, 501, &result), 33u);  // even an ordinary caller names 33 for a bundle
-  EXPECT_EQ(check(501, 1, 0, &result), 0xffffffffu);
-  EXPECT_EQ(result, 38u);
-  EXPECT_EQ(check(499, 12, 0, &result), 499u);
-  EXPECT_EQ(check(0, 12, 0, &result), 0xffffffffu);
-  EXPECT_EQ(check(1, 13, 0, &result), 0xffffffffu);
-}
-
-TEST_F(ValidateUserIdTest, OrdinaryCallersGetTheirOwnUser) {
-  uint64_t result;
-  EXPECT_EQ(check(1, 2, 600, &result), 600u);
-  EXPECT_EQ(check(600, 2, 600, &result), 600u);
-  EXPECT_EQ(check(501, 2, 600, &result), 0xffffffffu);
-  EXPECT_EQ(result, 38u);
-  EXPECT_EQ(check(0, 7, 600, &result), 0xffffffffu);
-}
-
-TEST_F(ValidateUserIdTest, SystemCallersNameAnyUserOfAPerUserClass) {
-  uint64_t result;
-  EXPECT_EQ(check(1, 2, 33, &result), 502u);  // 1 is the current mobile user
-  EXPECT_EQ(check(1, 0, 0, &result), 502u);   // whatever the class
-  EXPECT_EQ(check(0, 2, 0, &result), 0u);
-  EXPECT_EQ(check(777, 11, 500, &result), 777u);
-  EXPECT_EQ(check(501, 0, 0, &result), 0xffffffffu);
-  EXPECT_EQ(check(501, 14, 0, &result), 0xffffffffu);
-  EXPECT_EQ(result, 38u);
+  platform::setDeviceRoot("/");
 }
 
 // Each reader against a value of every type: only its own type reads.
@@ -125,14 +97,6 @@ TEST(ReplySending, OversizedReplyBecomesErrorFortyOnAnIntactStream) {
   EXPECT_EQ(replies, (std::vector<std::pair<uint64_t, uint64_t>>{{7, QRTErrorException}, {8, 1}}));
   EXPECT_EQ(connection->repliesDue(), 0);
   close(fds[1]);
-}
-
-TEST(CommandTable, RowsMatchTheirNumbersAndEntitlements) {
-  for (uint64_t i = 0; i < QRTCommandCount; ++i) EXPECT_EQ(QRTCommandTable[i].command, i);
-  EXPECT_EQ(QRTCommandTable[4].replyOnReturn, 0u);
-  EXPECT_EQ(QRTCommandTable[21].replyOnReturn, 0u);
-  EXPECT_STREQ(QRTCommandTable[11].entitlement, QRTEntitlementWipeContainer);
-  EXPECT_STREQ(QRTCommandTable[26].entitlement, QRTEntitlementStageSharedContent);
 }
 
 }  // namespace

@@ -2,13 +2,9 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/acl.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
-#include <filesystem>
-#include <fstream>
-#include <string>
 
 #include "Daemon/fileops/QRTFileManager.h"
 #include "TempDir.h"
@@ -38,12 +34,6 @@ std::string aclText(const std::string& path, acl_type_t type = ACL_TYPE_ACCESS) 
   }
   acl_free(acl);
   return result;
-}
-
-struct stat lstatOf(const std::string& path) {
-  struct stat st {};
-  EXPECT_EQ(lstat(path.c_str(), &st), 0) << path;
-  return st;
 }
 
 QRTURL dirURL(const std::string& path) { return QRTURL::fileURL(path, true); }

@@ -2,18 +2,12 @@
 // user can plant in a container they own. A marker tree outside the device
 // root stands for what the user may not change: no case may touch it.
 #include <sys/mount.h>
-#include <sys/stat.h>
 #include <sys/sysmacros.h>
-#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
-#include <filesystem>
-#include <fstream>
 #include <functional>
-#include <map>
-#include <string>
 
 #include "Daemon/fileops/QRTFileManager.h"
 #include "TempDir.h"
@@ -24,19 +18,10 @@ namespace fs = std::filesystem;
 
 namespace {
 
-struct stat lstatOf(const std::string& p) {
-  struct stat st {};
-  EXPECT_EQ(lstat(p.c_str(), &st), 0) << p;
-  return st;
-}
-
 class HostileTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    fs::create_directories(marker_ + "/dir");
-    std::ofstream(marker_ + "/file") << "precious";
-    std::ofstream(marker_ + "/dir/inner") << "inner";
-    ASSERT_EQ(setxattr((marker_ + "/file").c_str(), "user.mark", "m", 1, 0), 0);
+    makeMarkerTree(marker_);
     fs::create_directories(root_ + "/etc");
     std::ofstream(root_ + "/etc/group") << "systemusers:x:4242:\n";
     fs::create_directories(c_ + "/own");

@@ -1,15 +1,11 @@
 // Disk usage, protection-class get and set, and the tree dump of
 // QRTFileManager, on a real ext4 scratch directory.
 #include <fcntl.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
 #include <cerrno>
-#include <filesystem>
-#include <fstream>
-#include <string>
 
 #include "Daemon/fileops/QRTFileManager.h"
 #include "TempDir.h"
@@ -33,11 +29,7 @@ class UsageTest : public ::testing::Test {
     fs::create_directories(fs::path(path(rel)).parent_path());
     std::ofstream(path(rel)) << std::string(size, 'x');
   }
-  uint64_t allocated(const std::string& rel) const {
-    struct stat st {};
-    EXPECT_EQ(lstat(path(rel).c_str(), &st), 0) << rel;
-    return static_cast<uint64_t>(st.st_blocks) * 512;
-  }
+  uint64_t allocated(const std::string& rel) const { return static_cast<uint64_t>(lstatOf(path(rel)).st_blocks) * 512; }
   std::string logText() const { return fileText(tmp_ / "quarterd.log"); }
   bool logged(const std::string& line) const { return logText().find(line) != std::string::npos; }
   int32_t classOf(const std::string& rel) {

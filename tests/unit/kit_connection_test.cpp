@@ -154,12 +154,6 @@ TEST(KitConnection, FailedCallsLeaveTheStreamUsable) {
   EXPECT_EQ(2u, numberOf(*reply));
 }
 
-TEST(KitConnection, ConnectFailureNamesThePath) {
-  std::string error;
-  EXPECT_EQ(nullptr, qk::Connection::connect("/nonexistent/socket", &error));
-  EXPECT_NE(std::string::npos, error.find("/nonexistent/socket"));
-}
-
 // Frames split at every size, big ones (which leave in their own buffer)
 // between small ones: each comes out whole and in order, and the length of
 // the frame in progress is known as soon as its length field is.

@@ -2,17 +2,12 @@
 // directory they own. A marker tree outside the device root stands for
 // everything the user may not change; no case may touch it.
 #include <fcntl.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
-#include <filesystem>
-#include <fstream>
 #include <functional>
-#include <map>
 #include <optional>
-#include <string>
 
 #include "TempDir.h"
 #include "platform/DeviceRoot.h"
@@ -27,10 +22,7 @@ namespace {
 class SafePathTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    fs::create_directories(marker_ + "/dir");
-    std::ofstream(marker_ + "/file") << "precious";
-    std::ofstream(marker_ + "/dir/inner") << "inner";
-    ASSERT_EQ(chown((marker_ + "/file").c_str(), 0, 0), 0);
+    makeMarkerTree(marker_);
     fs::create_directories(user_);
     ASSERT_EQ(chown(user_.c_str(), 501, 501), 0);
     setDeviceRoot(root_);
@@ -83,9 +75,7 @@ TEST_F(SafePathTest, HostileArrangementsAreRefusedWithTheirCode) {
     c.arrange();
     EXPECT_EQ(c.act(), c.expected) << c.what;
   }
-  struct stat st {};
-  ASSERT_EQ(lstat(in("other").c_str(), &st), 0);
-  EXPECT_EQ(st.st_uid, 502u) << "a refused directory keeps its owner";
+  EXPECT_EQ(lstatOf(in("other")).st_uid, 502u) << "a refused directory keeps its owner";
 }
 
 TEST_F(SafePathTest, AtomicReplaceSwapsAPlantedLinkAndHardLinkWithoutWritingThrough) {
@@ -93,8 +83,7 @@ TEST_F(SafePathTest, AtomicReplaceSwapsAPlantedLinkAndHardLinkWithoutWritingThro
   ASSERT_EQ(::link((marker_ + "/dir/inner").c_str(), in("hard").c_str()), 0);
   for (const char* rel : {"meta", "hard"}) {
     ASSERT_EQ(safeReplaceFile(in(rel), "new", 0644), 0) << rel;
-    struct stat st {};
-    ASSERT_EQ(lstat(in(rel).c_str(), &st), 0);
+    const struct stat st = lstatOf(in(rel));
     EXPECT_TRUE(S_ISREG(st.st_mode) && st.st_nlink == 1) << rel;
     EXPECT_EQ(fileText(in(rel)), "new");
   }
@@ -122,13 +111,11 @@ TEST_F(SafePathTest, CreationAcceptsOwnOrRootDirectoriesAndGivesThemToTheOwner) 
   ASSERT_EQ(fstat(fd.get(), &st), 0);
   EXPECT_EQ(st.st_uid, 501u);
   EXPECT_EQ(st.st_mode & 0777, 0750u);
-  ASSERT_EQ(lstat(in("a").c_str(), &st), 0);
-  EXPECT_EQ(st.st_uid, 0u) << "levels made on the way stay root's";
+  EXPECT_EQ(lstatOf(in("a")).st_uid, 0u) << "levels made on the way stay root's";
   ASSERT_EQ(safeMakeDirectory(in("a"), 0700, false, 501, &fd, &created), 0);  // root's: handed over
   EXPECT_FALSE(created);
-  ASSERT_EQ(lstat(in("a").c_str(), &st), 0);
-  EXPECT_EQ(st.st_uid, 501u);
-  EXPECT_EQ(st.st_mode & 0777, 0750u) << "an existing directory keeps its mode";
+  EXPECT_EQ(lstatOf(in("a")).st_uid, 501u);
+  EXPECT_EQ(lstatOf(in("a")).st_mode & 0777, 0750u) << "an existing directory keeps its mode";
   EXPECT_EQ(safeMakeDirectory(root_, 0755, false, kAnyOwner, &fd), 0);  // the root itself
   std::string relative;
   EXPECT_EQ(pathBelowDeviceRoot(root_ + "//home/./user/", &relative), 0);

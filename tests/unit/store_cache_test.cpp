@@ -1,15 +1,11 @@
 // The container cache over a real class directory: building, look-ups,
 // vanished containers and the sandbox mappings it pushes.
 #include <gtest/gtest.h>
-#include <stdlib.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <sys/stat.h>
 
-#include <fstream>
 #include <optional>
-#include <stdexcept>
 
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTContainerCache.h"
