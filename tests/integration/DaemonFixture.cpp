@@ -36,6 +36,27 @@ uint64_t codeOf(const std::optional<plist::Dictionary>& reply) {
 
 plist::Data uuidData(const QRTUUID& uuid) { return plist::Data(uuid.bytes().begin(), uuid.bytes().end()); }
 
+std::optional<plist::Value> at(const std::optional<plist::Dictionary>& reply, const char* key) {
+  const plist::Value* v = reply ? plist::find(*reply, key) : nullptr;
+  return v ? std::optional<plist::Value>(*v) : std::nullopt;
+}
+
+std::optional<uint64_t> u64At(const std::optional<plist::Dictionary>& reply, const char* key) {
+  auto v = at(reply, key);
+  return v && v->isInteger() ? std::optional<uint64_t>(v->integer().asUnsigned()) : std::nullopt;
+}
+
+plist::Dictionary byName(uint64_t user, uint64_t cls, const std::string& identifier) {
+  return {{"UserID", user}, {"ContainerClass", cls}, {"Identifier", identifier}};
+}
+plist::Dictionary byName(const Container& c) { return byName(c.user, c.cls, c.identifier); }
+plist::Dictionary selector(const Container& c) { return with(byName(c), {{"UUID", uuidData(c.uuid)}}); }
+plist::Dictionary with(plist::Dictionary keys, plist::Dictionary more) { return more.merge(keys), more; }
+plist::Dictionary without(plist::Dictionary keys, const std::string& key) { return keys.erase(key), keys; }
+
+std::string baseName(const std::string& path) { return path.substr(path.rfind('/') + 1); }
+std::string parentOf(const std::string& path) { return path.substr(0, path.rfind('/')); }
+
 void writeFile(const std::string& path, const std::string& text) {
   std::ofstream out(path, std::ios::binary | std::ios::trunc);
   out << text;
@@ -122,6 +143,11 @@ int DaemonFixture::stopDaemon() {
   return status;
 }
 
+void DaemonFixture::restartDaemon() {
+  ASSERT_EQ(stopDaemon(), 0);
+  startDaemon();
+}
+
 void DaemonFixture::killDaemon() {
   kill(daemon, SIGKILL);
   waitpid(daemon, nullptr, 0);
@@ -161,6 +187,12 @@ Container DaemonFixture::createOrLookup(uint64_t user, const std::string& identi
   if (auto* v = plist::find(*reply, "ReplyUUID"); v && v->isData()) {
     c.uuid = QRTUUID::fromBytes(v->data().data(), v->data().size()).value_or(QRTUUID());
   }
+  return c;
+}
+
+Container DaemonFixture::make(uint64_t user, const std::string& identifier, uint64_t cls, bool transient) {
+  Container c = createOrLookup(user, identifier, cls, true, transient);
+  EXPECT_EQ(c.error, 1u) << identifier;
   return c;
 }
 
