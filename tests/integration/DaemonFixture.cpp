@@ -57,6 +57,12 @@ plist::Dictionary without(plist::Dictionary keys, const std::string& key) { retu
 std::string baseName(const std::string& path) { return path.substr(path.rfind('/') + 1); }
 std::string parentOf(const std::string& path) { return path.substr(0, path.rfind('/')); }
 
+std::pair<uint32_t, uint32_t> ownerAndMode(const std::string& path) {
+  struct stat st;
+  if (stat(path.c_str(), &st) != 0) return {UINT32_MAX, UINT32_MAX};
+  return {st.st_uid, st.st_mode & 07777};
+}
+
 void writeFile(const std::string& path, const std::string& text) {
   std::ofstream out(path, std::ios::binary | std::ios::trunc);
   out << text;
@@ -214,10 +220,7 @@ void DaemonFixture::setOwnIdentity(const std::string& signingIdentifier, const p
 void DaemonFixture::clearOwnIdentity() { unlink((root + "/etc/quarterd/identities/self.plist").c_str()); }
 
 std::string DaemonFixture::logText() const {
-  std::ifstream in(root + "/private/var/root/Library/Logs/QuarterKit/quarterd.log");
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
+  return readFile(root + "/private/var/root/Library/Logs/QuarterKit/quarterd.log");
 }
 
 bool DaemonFixture::logContains(const std::string& text) const {

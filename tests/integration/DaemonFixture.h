@@ -7,6 +7,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -94,6 +95,8 @@ plist::Dictionary without(plist::Dictionary keys, const std::string& key);
 inline const char* const kMetadataFile = ".com.norvane.quarter_kit.metadata.plist";
 std::string baseName(const std::string& path);
 std::string parentOf(const std::string& path);
+// The owner and permission bits (stat follows links); all ones when missing.
+std::pair<uint32_t, uint32_t> ownerAndMode(const std::string& path);
 
 // File helpers; a missing file reads as empty, a missing directory lists nothing.
 void writeFile(const std::string& path, const std::string& text);

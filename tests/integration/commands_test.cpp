@@ -160,12 +160,8 @@ TEST_F(CommandTest, RecreateBringsBackRemovedDefaultDirectories) {
   for (uint64_t command : {8, 22}) {
     ASSERT_EQ(system(("rm -rf " + app.path + "/Library/Caches " + app.path + "/tmp").c_str()), 0);
     ASSERT_EQ(codeOf(call(command, selector(app))), 1u) << command;
-    for (const char* sub : {"/Library/Caches", "/tmp"}) {
-      struct stat st {};
-      ASSERT_EQ(stat((app.path + sub).c_str(), &st), 0) << command << sub;
-      EXPECT_EQ(st.st_uid, 501u) << command << sub;
-      EXPECT_EQ(st.st_mode & 07777, 0755u) << command << sub;
-    }
+    for (const char* sub : {"/Library/Caches", "/tmp"})
+      EXPECT_EQ(ownerAndMode(app.path + sub), std::pair(501u, 0755u)) << command << sub;
     EXPECT_TRUE(exists(app.path + "/Documents/keep.txt")) << command;
   }
 
@@ -174,11 +170,9 @@ TEST_F(CommandTest, RecreateBringsBackRemovedDefaultDirectories) {
   const std::string caches = system.path + "/Library/Caches";
   ASSERT_EQ(rmdir(caches.c_str()), 0);
   ASSERT_EQ(codeOf(call(8, selector(system))), 1u);
-  struct stat st{};
-  ASSERT_EQ(stat(caches.c_str(), &st), 0);
   // The group bits show the ACL mask, which leaves the systemusers entry whole.
-  EXPECT_EQ(st.st_mode & 0707, 0u);
-  EXPECT_EQ(st.st_uid, 4294967294u);
+  EXPECT_EQ(ownerAndMode(caches).first, 4294967294u);
+  EXPECT_EQ(ownerAndMode(caches).second & 0707, 0u);
   EXPECT_GT(getxattr(caches.c_str(), "system.posix_acl_access", nullptr, 0), 0);
   EXPECT_GT(getxattr(caches.c_str(), "system.posix_acl_default", nullptr, 0), 0);
 

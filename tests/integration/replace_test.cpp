@@ -19,10 +19,7 @@ namespace fs = std::filesystem;
 
 const char* kMarkerFile = "replace-marker";
 
-std::string markerAt(const std::string& containerPath) {
-  std::string path = containerPath + "/" + kMarkerFile;
-  return exists(path) ? readFile(path) : std::string();
-}
+std::string markerAt(const std::string& containerPath) { return readFile(containerPath + "/" + kMarkerFile); }
 
 plist::Dictionary replaceKeys(const Container* old, const Container& fresh) {
   plist::Dictionary keys{{"NewContainerUUID", uuidData(fresh.uuid)}, {"NewContainerClass", 2},
@@ -60,8 +57,7 @@ class ReplaceTest : public DaemonFixture {
 
   // A class 2 container of user 501 holding a marker file with the given text.
   Container make(const std::string& identifier, bool transient, const std::string& marker) {
-    Container made = createOrLookup(501, identifier, 2, true, transient);
-    EXPECT_EQ(made.error, 1u) << identifier;
+    Container made = DaemonFixture::make(501, identifier, 2, transient);
     if (!made.path.empty()) writeFile(made.path + "/" + kMarkerFile, marker);
     return made;
   }

@@ -12,7 +12,9 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
+#include <climits>
 #include <fstream>
 #include <future>
 #include <sstream>
@@ -119,13 +121,9 @@ TEST_F(ResourcesTest, ConnectionsPerUserAreCappedAndOtherUsersAreStillServed) {
       if (fd >= 0) fds.push_back(fd);
     }
     // The daemon closes what is over the limit; wait until it has.
-    int open = 0;
-    for (int tries = 0; tries < 500; ++tries) {
-      open = 0;
-      for (int fd : fds) open += closedByPeer(fd) ? 0 : 1;
-      if (open <= kPerUserLimit) break;
-      usleep(20000);
-    }
+    int open = INT_MAX;
+    for (int tries = 0; tries < 500 && open > kPerUserLimit; ++tries, usleep(20000))
+      open = static_cast<int>(std::count_if(fds.begin(), fds.end(), [](int fd) { return !closedByPeer(fd); }));
     (void)!write(report[1], &open, sizeof open);
     char done;
     (void)!read(release[0], &done, 1);
@@ -140,8 +138,7 @@ TEST_F(ResourcesTest, ConnectionsPerUserAreCappedAndOtherUsersAreStillServed) {
   EXPECT_EQ(replyError(request(30)), kNotServed);
   (void)!write(release[1], "x", 1);
   EXPECT_EQ(waitFor(child, 30s), 0);
-  close(report[0]);
-  close(release[1]);
+  for (int fd : {report[0], release[1]}) close(fd);
 }
 
 TEST_F(ResourcesTest, FloodOfLargestFramesStaysWithinTheBudget) {
@@ -218,9 +215,7 @@ TEST_F(ResourcesTest, OneUserCannotHoldTheWholeBudget) {
     char done;
     (void)!read(release[0], &done, 1);
     // Still holding: root was not served only once the daemon gave up on us.
-    for (int fd : fds)
-      if (closedByPeer(fd)) _exit(4);
-    _exit(0);
+    _exit(std::any_of(fds.begin(), fds.end(), closedByPeer) ? 4 : 0);
   }
   char byte;
   ASSERT_EQ(read(ready[0], &byte, 1), 1);

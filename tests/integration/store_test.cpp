@@ -38,12 +38,8 @@ TEST_F(StoreTest, NewDataContainerIsCompleteOnDiskAndMapped) {
   auto entries = listDirectory(made.path);
   EXPECT_EQ(std::set<std::string>(entries.begin(), entries.end()),
             (std::set<std::string>{kMetadataFile, "Documents", "Library", "tmp"}));
-  for (const char* sub : {"", "/Documents", "/Library", "/Library/Caches", "/Library/Preferences", "/tmp"}) {
-    struct stat st {};
-    ASSERT_EQ(stat((made.path + sub).c_str(), &st), 0) << sub;
-    EXPECT_EQ(st.st_uid, 501u) << sub;
-    EXPECT_EQ(st.st_mode & 07777, 0755u) << sub;
-  }
+  for (const char* sub : {"", "/Documents", "/Library", "/Library/Caches", "/Library/Preferences", "/tmp"})
+    EXPECT_EQ(ownerAndMode(made.path + sub), std::pair(501u, 0755u)) << sub;
 
   EXPECT_EQ(readLink(root + "/run/sandbox/mappings/501/1/com.example.app"), made.path);
 
@@ -84,9 +80,7 @@ TEST_F(StoreTest, BundleAndWellKnownSystemContainers) {
   ASSERT_EQ(bundle.error, 1u);
   EXPECT_EQ(bundle.path.rfind(root + "/private/var/containers/Bundle/Application/", 0), 0u);
   EXPECT_EQ(listDirectory(bundle.path), std::vector<std::string>{kMetadataFile});
-  struct stat st {};
-  ASSERT_EQ(stat(bundle.path.c_str(), &st), 0);
-  EXPECT_EQ(st.st_uid, 33u);
+  EXPECT_EQ(ownerAndMode(bundle.path).first, 33u);
 
   // Any caller reaches a well-known system container, under its own name.
   Container system = createOrLookup(0, "com.norvane.mapsd", 12, true, false, 15);
@@ -94,9 +88,7 @@ TEST_F(StoreTest, BundleAndWellKnownSystemContainers) {
   EXPECT_EQ(system.path, root + "/private/var/containers/Data/System/com.norvane.mapsd");
   EXPECT_GT(getxattr(system.path.c_str(), "system.posix_acl_access", nullptr, 0), 0);
   EXPECT_GT(getxattr(system.path.c_str(), "system.posix_acl_default", nullptr, 0), 0);
-  ASSERT_EQ(stat((system.path + "/Library").c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 07777, 0u);
-  EXPECT_EQ(st.st_uid, 4294967294u);
+  EXPECT_EQ(ownerAndMode(system.path + "/Library"), std::pair(4294967294u, 0u));
 }
 
 TEST_F(StoreTest, ContainerDeletedByHandIsForgotten) {
