@@ -245,15 +245,12 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
   Snapshot snapshot() const {
     Snapshot s;
     for (const std::string& tree : {outside, root + "/etc", otherHome()}) addItem(s, tree, true);
-    const std::string daemonHome = root + "/private/var/root";
+    const std::string var = root + "/private/var", lib = var + "/root/Library", caches = daemonCaches();
     for (const std::string& item :
-         {root, root + "/private", root + "/private/var", daemonHome, daemonHome + "/Library",
-          daemonHome + "/Library/Caches", daemonCaches(), daemonCaches() + "/Dead", daemonCaches() + "/Staging",
-          daemonCaches() + "/Temp", daemonHome + "/Library/QuarterKit", daemonHome + "/Library/QuarterKit/Replace",
-          daemonHome + "/Library/Logs/QuarterKit", root + "/private/var/emplacerd", root + "/run",
-          root + "/run/sandbox/mappings"}) {
+         {root, root + "/private", var, var + "/root", lib, lib + "/Caches", caches, caches + "/Dead",
+          caches + "/Staging", caches + "/Temp", lib + "/QuarterKit", lib + "/QuarterKit/Replace",
+          lib + "/Logs/QuarterKit", var + "/emplacerd", root + "/run", root + "/run/sandbox/mappings"})
       addItem(s, item, false);
-    }
     return s;
   }
 

@@ -14,16 +14,6 @@
 
 #include "base/PlistCodec.h"
 
-namespace {
-
-std::string ownExecutable() {
-  char buffer[4096];
-  ssize_t n = readlink("/proc/self/exe", buffer, sizeof buffer - 1);
-  return n > 0 ? std::string(buffer, static_cast<size_t>(n)) : std::string();
-}
-
-}  // namespace
-
 plist::Dictionary request(uint64_t command, plist::Dictionary keys) {
   keys["Command"] = command;
   return keys;
@@ -214,7 +204,7 @@ void DaemonFixture::setIdentity(const std::string& name, const std::string& exec
 }
 
 void DaemonFixture::setOwnIdentity(const std::string& signingIdentifier, const plist::Dictionary& entitlements) {
-  setIdentity("self", ownExecutable(), signingIdentifier, entitlements);
+  setIdentity("self", readLink("/proc/self/exe"), signingIdentifier, entitlements);
 }
 
 void DaemonFixture::clearOwnIdentity() { unlink((root + "/etc/quarterd/identities/self.plist").c_str()); }

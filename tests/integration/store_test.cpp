@@ -21,10 +21,9 @@ TEST_F(StoreTest, NewDataContainerIsCompleteOnDiskAndMapped) {
   ASSERT_EQ(made.error, 1u);
   EXPECT_FALSE(made.existed);
   EXPECT_EQ(made.identifier, "com.example.app");
-  const std::string classDir = appClassDir();
-  ASSERT_EQ(made.path.rfind(classDir + "/", 0), 0u) << made.path;
+  ASSERT_EQ(parentOf(made.path), appClassDir());
   // The directory is named by a fresh upper-case UUID of its own.
-  std::string name = made.path.substr(classDir.size() + 1);
+  const std::string name = baseName(made.path);
   auto directoryUUID = QRTUUID::fromString(name);
   ASSERT_TRUE(directoryUUID);
   EXPECT_EQ(directoryUUID->UUIDString(), name);
