@@ -74,11 +74,8 @@ TEST_F(ConcurrencyTest, ReadsSeeWholeMetadataWhileItChangesAndOneCreatorMakesEac
     int64_t seen = 0;
     auto check = [&](const std::optional<plist::Value>& value) {
       if (!value) return;
-      if (!value->isInteger() || value->integer().asSigned() < seen || value->integer().asSigned() > kSets) {
-        ++badReads;
-      } else {
-        seen = value->integer().asSigned();
-      }
+      if (!value->isInteger() || value->integer().asSigned() < seen || value->integer().asSigned() > kSets) ++badReads;
+      else seen = value->integer().asSigned();
     };
     while (!setterDone) {
       auto got = call(6, with(selector(app), {{"Key", "counter"}}));

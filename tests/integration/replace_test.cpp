@@ -240,13 +240,8 @@ TEST_F(ReplaceTest, KilledReplaceOrWipeLeavesExactlyOneContentLive) {
 TEST_F(ReplaceTest, StartUpRecoveryActsOnlyOnValidJournals) {
   const std::string filled = root + "/filled-destination";
   ASSERT_EQ(mkdir(filled.c_str(), 0755), 0);
-  struct Journal {
-    const char* name;
-    bool movesBack;
-    const char* raw;  // bytes written instead of the valid journal
-    const char* key;  // a key of the valid journal set to `to`, or erased
-    std::optional<plist::Value> to;
-  };
+  // raw: bytes written instead of the valid journal; key: one of its keys set to `to`, or erased.
+  struct Journal { const char* name; bool movesBack; const char* raw; const char* key; std::optional<plist::Value> to; };
   const Journal journals[] = {
       {"valid", true, nullptr, nullptr, std::nullopt},
       {"garbage", false, "not a property list", nullptr, std::nullopt},

@@ -73,15 +73,12 @@ long statusKiB(pid_t pid, const std::string& field) {
 
 // User plus system CPU time in seconds.
 double cpuSeconds(pid_t pid) {
-  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
-  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+  const std::string text = readFile("/proc/" + std::to_string(pid) + "/stat");
   std::istringstream fields(text.substr(text.rfind(')') + 2));
-  std::string field;
+  std::string skipped;
   unsigned long long utime = 0, stime = 0;
-  for (int i = 3; i <= 15 && fields >> field; ++i) {
-    if (i == 14) utime = std::stoull(field);
-    if (i == 15) stime = std::stoull(field);
-  }
+  for (int i = 3; i < 14; ++i) fields >> skipped;  // fields 14 and 15 follow
+  fields >> utime >> stime;
   return static_cast<double>(utime + stime) / static_cast<double>(sysconf(_SC_CLK_TCK));
 }
 
