@@ -20,12 +20,12 @@
 #include <map>
 #include <new>
 #include <sstream>
+#include <utility>
 
 #include "DaemonFixture.h"
 
 namespace {
 
-const char* kMetadataFile = ".com.norvane.quarter_kit.metadata.plist";
 constexpr uid_t kUser = 501, kOtherUser = 502;
 constexpr auto kRequestTimeout = std::chrono::seconds(10);
 constexpr auto kRaceLimit = std::chrono::seconds(5);
@@ -33,11 +33,10 @@ constexpr auto kRaceLimit = std::chrono::seconds(5);
 // Whatever a write, chown, chmod, setxattr, unlink or create through a
 // followed link would change; times and link counts are left out.
 struct Item {
-  uid_t uid = 0;
-  gid_t gid = 0;
+  uid_t uid = 0, gid = 0;
   mode_t mode = 0;
   off_t size = 0;
-  size_t content = 0;
+  size_t content = 0;  // a hash
   std::string link;
   std::map<std::string, std::string> xattrs;
   bool operator==(const Item&) const = default;
@@ -64,9 +63,8 @@ void addItem(Snapshot& snapshot, const std::string& path, bool recursive) {
   auto item = itemAt(path);
   if (!item) return;
   snapshot[path] = *item;
-  if (recursive && S_ISDIR(item->mode)) {
+  if (recursive && S_ISDIR(item->mode))
     for (const std::string& name : listDirectory(path)) addItem(snapshot, path + "/" + name, true);
-  }
 }
 
 std::string describe(const Item& i) {
@@ -79,21 +77,17 @@ std::string describe(const Item& i) {
 
 // The first few differences, one a line; empty when there are none.
 std::string differences(const Snapshot& before, const Snapshot& after) {
-  std::vector<std::string> lines;
+  std::string text;
+  int count = 0;
+  auto note = [&](const std::string& line) { text += ++count <= 8 ? "\n  " + line : ""; };
   for (const auto& [path, item] : before) {
     auto now = after.find(path);
-    if (now == after.end())
-      lines.push_back("removed " + path);
-    else if (!(now->second == item))
-      lines.push_back("changed " + path + ": " + describe(item) + "  =>  " + describe(now->second));
+    if (now == after.end()) note("removed " + path);
+    else if (!(now->second == item)) note("changed " + path + ": " + describe(item) + "  =>  " + describe(now->second));
   }
-  for (const auto& [path, item] : after) {
-    if (!before.count(path)) lines.push_back("created " + path + ": " + describe(item));
-  }
-  std::string text;
-  for (size_t i = 0; i < lines.size() && i < 8; ++i) text += "\n  " + lines[i];
-  if (lines.size() > 8) text += "\n  ... and " + std::to_string(lines.size() - 8) + " more";
-  return text;
+  for (const auto& [path, item] : after)
+    if (!before.count(path)) note("created " + path + ": " + describe(item));
+  return count > 8 ? text + "\n  ... and " + std::to_string(count - 8) + " more" : text;
 }
 
 void becomeUser(uid_t uid) {
@@ -120,26 +114,21 @@ class Racer {
     void* shared = mmap(nullptr, sizeof(Shared), PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
     if (shared == MAP_FAILED) abort();
     shared_ = new (shared) Shared();
-    pid_ = fork();
-    if (pid_ != 0) return;
+    if ((pid_ = fork()) != 0) return;
     becomeUser(uid);
-    const auto deadline = std::chrono::steady_clock::now() + kRaceLimit;
-    while (!shared_->stop.load() && std::chrono::steady_clock::now() < deadline) {
+    for (auto end = std::chrono::steady_clock::now() + kRaceLimit;
+         !shared_->stop && std::chrono::steady_clock::now() < end; ++shared_->rounds)
       step();
-      shared_->rounds.fetch_add(1);
-    }
     _exit(0);
   }
-  ~Racer() {
-    if (shared_) finish();
-  }
+  ~Racer() { finish(); }
   // Stops the child once it has put everything back; the rounds it ran.
   long finish() {
-    shared_->stop.store(true);
+    if (!shared_) return 0;
+    shared_->stop = true;
     waitpid(pid_, nullptr, 0);
-    long rounds = shared_->rounds.load();
-    munmap(shared_, sizeof(Shared));
-    shared_ = nullptr;
+    long rounds = shared_->rounds;
+    munmap(std::exchange(shared_, nullptr), sizeof(Shared));
     return rounds;
   }
 
@@ -182,7 +171,7 @@ struct Case {
 
 class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterface<Case> {
  public:
-  using DaemonFixture::root;
+  using DaemonFixture::deadDirectory, DaemonFixture::make, DaemonFixture::restartDaemon, DaemonFixture::root;
   void SetUp() override {
     DaemonFixture::SetUp();
     if (HasFatalFailure()) return;
@@ -196,9 +185,8 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
       writeFile(outside + name, std::string("marker ") + name);
       ASSERT_EQ(chmod((outside + name).c_str(), static_cast<mode_t>(mode)), 0) << name;
     }
-    for (const char* name : {"", "/secret", "/sub"}) {
+    for (const char* name : {"", "/secret", "/sub"})
       ASSERT_EQ(setxattr((outside + name).c_str(), "user.marker", name, strlen(name), 0), 0) << name;
-    }
 
     ASSERT_EQ(chown(home().c_str(), kUser, kUser), 0);
     std::ofstream(root + "/etc/passwd", std::ios::app) << "other:x:502:502::/private/var/other:/bin/sh\n";
@@ -221,12 +209,6 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
     DaemonFixture::TearDown();
   }
 
-  Container make(uid_t user, const std::string& identifier, uint64_t cls, bool transient = false) {
-    Container c = createOrLookup(user, identifier, cls, true, transient);
-    EXPECT_EQ(c.error, 1u) << identifier;
-    return c;
-  }
-
   // One request, bounded in time; its code (or its silence) goes into the trace.
   uint64_t send(uint64_t command, const plist::Dictionary& keys = {}) {
     auto connection = qk::Connection::connect(qk::requestSocketPath(root));
@@ -235,60 +217,40 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
     if (!reply) stuck_ = true;
     return codeOf(reply);
   }
+  void sends(std::initializer_list<std::pair<uint64_t, plist::Dictionary>> requests) {
+    for (const auto& [command, keys] : requests) send(command, keys);
+  }
 
   void plant(const std::function<bool()>& step) { ASSERT_EQ(asUser(kUser, step), 0) << "the user could not plant"; }
-  void restart() {
-    ASSERT_EQ(stopDaemon(), 0);
-    startDaemon();
-  }
 
-  // The keys with more added; a key in both takes its value from more.
-  static plist::Dictionary with(plist::Dictionary keys, plist::Dictionary more) { return more.merge(keys), more; }
-  static plist::Dictionary selector(const Container& c) {
-    return {{"UserID", c.user}, {"ContainerClass", c.cls}, {"Identifier", c.identifier}, {"UUID", uuidData(c.uuid)}};
-  }
   static plist::Dictionary stage(const Container& c) {
-    return {{"ContainerClassesArray", plist::Array{c.cls}},
-            {"UserIDsArray", plist::Array{c.user}},
-            {"UUIDsArray", plist::Array{uuidData(c.uuid)}},
-            {"IdentifiersArray", plist::Array{c.identifier}}};
+    return {{"ContainerClassesArray", plist::Array{c.cls}}, {"UserIDsArray", plist::Array{c.user}},
+            {"UUIDsArray", plist::Array{uuidData(c.uuid)}}, {"IdentifiersArray", plist::Array{c.identifier}}};
   }
   static plist::Dictionary replace(const Container& old, const Container& fresh) {
-    return {{"OldContainerUUID", uuidData(old.uuid)},   {"OldContainerClass", old.cls},
-            {"OldContainerUserID", old.user},           {"OldIdentifier", old.identifier},
-            {"NewContainerUUID", uuidData(fresh.uuid)}, {"NewContainerClass", fresh.cls},
-            {"NewContainerUserID", fresh.user},         {"NewIdentifier", fresh.identifier}};
-  }
-  static plist::Dictionary byName(const Container& c) {
-    return {{"UserID", c.user}, {"ContainerClass", c.cls}, {"Identifier", c.identifier}};
+    return {{"OldContainerUUID", uuidData(old.uuid)}, {"OldContainerClass", old.cls}, {"OldContainerUserID", old.user},
+            {"OldIdentifier", old.identifier}, {"NewContainerUUID", uuidData(fresh.uuid)},
+            {"NewContainerClass", fresh.cls}, {"NewContainerUserID", fresh.user}, {"NewIdentifier", fresh.identifier}};
   }
   static plist::Dictionary creation(const std::string& identifier, bool transient = false) {
-    return {{"UserID", kUser},
-            {"ContainerClass", 2},
-            {"Identifier", identifier},
-            {"CreateIfNecessary", true},
-            {"Transient", transient}};
+    return with(byName(kUser, 2, identifier), {{"CreateIfNecessary", true}, {"Transient", transient}});
   }
 
   std::string home() const { return root + "/private/var/mobile"; }
   std::string otherHome() const { return root + "/private/var/other"; }
   std::string containers() const { return home() + "/Containers"; }
-  std::string daemonCaches() const { return root + "/private/var/root/Library/Caches/com.norvane.quarterd"; }
   std::string in(const Container& c, const std::string& sub) const { return c.path + "/" + sub; }
 
   // Everything outside the user's reach that a request could be steered at.
   Snapshot snapshot() const {
     Snapshot s;
     for (const std::string& tree : {outside, root + "/etc", otherHome()}) addItem(s, tree, true);
-    const std::string daemonHome = root + "/private/var/root";
+    const std::string var = root + "/private/var", lib = var + "/root/Library", caches = daemonCaches();
     for (const std::string& item :
-         {root, root + "/private", root + "/private/var", daemonHome, daemonHome + "/Library",
-          daemonHome + "/Library/Caches", daemonCaches(), daemonCaches() + "/Dead", daemonCaches() + "/Staging",
-          daemonCaches() + "/Temp", daemonHome + "/Library/QuarterKit", daemonHome + "/Library/QuarterKit/Replace",
-          daemonHome + "/Library/Logs/QuarterKit", root + "/private/var/emplacerd", root + "/run",
-          root + "/run/sandbox/mappings"}) {
+         {root, root + "/private", var, var + "/root", lib, lib + "/Caches", caches, caches + "/Dead",
+          caches + "/Staging", caches + "/Temp", lib + "/QuarterKit", lib + "/QuarterKit/Replace",
+          lib + "/Logs/QuarterKit", var + "/emplacerd", root + "/run", root + "/run/sandbox/mappings"})
       addItem(s, item, false);
-    }
     return s;
   }
 
@@ -306,9 +268,7 @@ TEST_P(AdversarialTest, NothingOutsideTheUsersReachChanges) {
   std::optional<Racer> racer;
   if (c.race) racer.emplace(kUser, [&] { c.race(*this); });
   c.requests(*this);
-  if (racer) {
-    EXPECT_GT(racer->finish(), 0) << "the race never ran";
-  }
+  if (racer) { EXPECT_GT(racer->finish(), 0) << "the race never ran"; }
 
   RecordProperty("replies", trace_);
   const std::string changed = differences(before, snapshot());
@@ -316,20 +276,34 @@ TEST_P(AdversarialTest, NothingOutsideTheUsersReachChanges) {
   auto connection = qk::Connection::connect(qk::requestSocketPath(root));
   auto reply = connection ? connection->call(request(0, byName(other)), kRequestTimeout) : std::nullopt;
   EXPECT_EQ(codeOf(reply), 1u) << "the daemon no longer serves; replies (command:code):" << trace_;
-  const plist::Value* path = reply ? plist::find(*reply, "ReplyPath") : nullptr;
-  EXPECT_TRUE(path && path->isString() && path->string() == other.path) << "the other user's container moved";
+  EXPECT_EQ(at(reply, "ReplyPath"), plist::Value(other.path)) << "the other user's container moved";
   if (!reply) stuck_ = true;
 }
 
 void PrintTo(const Case& c, std::ostream* out) { *out << c.name; }
 
 using T = AdversarialTest;
-// The user's own container swapped for a link to target, then the requests.
-Case containerLink(const char* name, std::string (*target)(const T&), std::function<void(T&)> requests) {
-  return {name, [target](T& t) { t.plant([&] { return swapForLink(t.app.path, target(t)); }); }, std::move(requests)};
+using Requests = std::function<void(T&)>;
+using PathOf = std::function<std::string(const T&)>;
+// The user's item at path swapped for a link to target, then the requests.
+Case swapped(const char* name, PathOf path, PathOf target, Requests requests) {
+  return {name, [=](T& t) { t.plant([&] { return swapForLink(path(t), target(t)); }); }, std::move(requests)};
 }
+PathOf appItem(const std::string& sub) {
+  return [sub](const T& t) { return t.in(t.app, sub); };
+}
+std::string appPath(const T& t) { return t.app.path; }
 std::string outsideDir(const T& t) { return t.outside; }
 std::string otherContainer(const T& t) { return t.other.path; }
+// Each command on the app container's selector.
+Requests onApp(std::vector<uint64_t> commands) {
+  return [=](T& t) { for (uint64_t c : commands) t.send(c, selector(t.app)); };
+}
+// The command on a container by name, then a death-row pass.
+Requests byNameThenPass(uint64_t command, Container T::*c = &T::app) {
+  return [=](T& t) { t.sends({{command, byName(t.*c)}, {4, {}}}); };
+}
+const plist::Dictionary kSet{{"Key", "k"}, {"Value", "v"}};
 // As the user: a directory that passes for the container (it has a copy of
 // its metadata file), with links to targets where its default directories belong.
 bool plantDecoy(const T& t, const Container& c, const std::string& dir) {
@@ -340,7 +314,6 @@ bool plantDecoy(const T& t, const Container& c, const std::string& dir) {
          symlink(t.outside.c_str(), (dir + "/Library").c_str()) == 0 &&
          symlink((t.root + "/etc").c_str(), (dir + "/tmp").c_str()) == 0;
 }
-std::string baseName(const std::string& path) { return path.substr(path.rfind('/') + 1); }
 
 // Hard links in the container to root-owned files outside, made by root: the
 // kernel's protected_hardlinks keeps users from linking files they do not
@@ -349,33 +322,27 @@ void hardLinks(T& t) {
   ASSERT_EQ(link((t.outside + "/secret").c_str(), t.in(t.app, "Documents/secret").c_str()), 0);
   ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/suid").c_str()), 0);
 }
+void freshApp(T& t) { t.fresh = t.make(kUser, "com.example.app", 2, true); }
 
 const Case kCases[] = {
     // The metadata file.
-    {"MetadataLinkToDevicePasswd_SetInfo",
-     [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, kMetadataFile), t.root + "/etc/passwd"); }); },
-     [](T& t) {
-       t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", "v"}}));
-     }},
+    swapped("MetadataLinkToDevicePasswd_SetInfo", appItem(kMetadataFile), [](const T& t) { return t.root + "/etc/passwd"; },
+            [](T& t) { t.send(5, with(selector(t.app), kSet)); }),
     {"MetadataHardLinkToOutsideFile_SetInfo",
      [](T& t) {
        ASSERT_EQ(unlink(t.in(t.app, kMetadataFile).c_str()), 0);
        ASSERT_EQ(link((t.outside + "/public").c_str(), t.in(t.app, kMetadataFile).c_str()), 0);
      },
-     [](T& t) {
-       t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", "v"}}));
-     }},
+     [](T& t) { t.send(5, with(selector(t.app), kSet)); }},
     {"MetadataLinkToOtherUsersMetadata_Restart_ReadAndSet",
      [](T& t) {
        t.plant([&] { return swapForLink(t.in(t.app, kMetadataFile), t.in(t.other, kMetadataFile)); });
-       t.restart();
+       t.restartDaemon();
      },
      [](T& t) {
-       for (const Container* c : {&t.app, &t.other}) {
-         t.send(7, T::with(T::selector(*c), {{"InfoDictRequested", true}}));
-         t.send(6, T::with(T::selector(*c), {{"Key", "k"}}));
-       }
-       t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", "v"}}));
+       for (const Container* c : {&t.app, &t.other})
+         t.sends({{7, with(selector(*c), {{"InfoDictRequested", true}})}, {6, with(selector(*c), {{"Key", "k"}})}});
+       t.send(5, with(selector(t.app), kSet));
      }},
     {"MetadataFifo_Restart_LookupAndRead",
      [](T& t) {
@@ -383,27 +350,18 @@ const Case kCases[] = {
          const std::string metadata = t.in(t.app, kMetadataFile);
          return unlink(metadata.c_str()) == 0 && mkfifo(metadata.c_str(), 0644) == 0;
        });
-       t.restart();
+       t.restartDaemon();
      },
      [](T& t) {
-       t.send(0, T::byName(t.app));
-       t.send(7, T::selector(t.app));
-       t.send(6, T::with(T::selector(t.app), {{"Key", "k"}}));
-       t.send(23, T::selector(t.app));
+       t.sends({{0, byName(t.app)}, {7, selector(t.app)}, {6, with(selector(t.app), {{"Key", "k"}})},
+                {23, selector(t.app)}});
      }},
     // Default sub-directories: recreated and given to the user.
-    {"DocumentsLinkToOutside_Recreate",
-     [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, "Documents"), t.outside); }); },
-     [](T& t) { t.send(8, T::selector(t.app)); }},
-    {"LibraryLinkToOutside_RecreateMissing",
-     [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, "Library"), t.outside); }); },
-     [](T& t) { t.send(22, T::selector(t.app)); }},
-    {"TmpLinkToDeviceEtc_Recreate",
-     [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, "tmp"), t.root + "/etc"); }); },
-     [](T& t) { t.send(8, T::selector(t.app)); }},
-    {"DocumentsLinkToOtherUsersDocuments_RecreateMissing",
-     [](T& t) { t.plant([&] { return swapForLink(t.in(t.app, "Documents"), t.in(t.other, "Documents")); }); },
-     [](T& t) { t.send(22, T::selector(t.app)); }},
+    swapped("DocumentsLinkToOutside_Recreate", appItem("Documents"), outsideDir, onApp({8})),
+    swapped("LibraryLinkToOutside_RecreateMissing", appItem("Library"), outsideDir, onApp({22})),
+    swapped("TmpLinkToDeviceEtc_Recreate", appItem("tmp"), [](const T& t) { return t.root + "/etc"; }, onApp({8})),
+    swapped("DocumentsLinkToOtherUsersDocuments_RecreateMissing", appItem("Documents"),
+            [](const T& t) { return t.in(t.other, "Documents"); }, onApp({22})),
     {"TmpAndCachesHardLinkedToOutsideFiles_Recreate",
      [](T& t) {
        t.plant(
@@ -411,10 +369,7 @@ const Case kCases[] = {
        ASSERT_EQ(link((t.outside + "/secret").c_str(), t.in(t.app, "tmp").c_str()), 0);
        ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/Caches").c_str()), 0);
      },
-     [](T& t) {
-       t.send(8, T::selector(t.app));
-       t.send(22, T::selector(t.app));
-     }},
+     onApp({8, 22})},
     // Where new containers are made.
     {"ClassDirectoryLinkToOutside_Create",
      [](T& t) {
@@ -425,89 +380,44 @@ const Case kCases[] = {
        });
      },
      [](T& t) { t.send(0, T::creation("com.example.new")); }},
-    {"ContainersLinkToOutside_Create", [](T& t) { t.plant([&] { return swapForLink(t.containers(), t.outside); }); },
-     [](T& t) {
-       t.send(0, T::creation("com.example.new"));
-       t.send(0, T::with(T::creation("com.example.new"), {{"ContainerClass", 6}}));
-     }},
-    {"HomeLibraryLinkToOutside_CreateTransient",
-     [](T& t) { t.plant([&] { return swapForLink(t.home() + "/Library", t.outside); }); },
-     [](T& t) { t.send(0, T::creation("com.example.new", true)); }},
-    {"HomeLibraryLinkToDaemonLibrary_CreateTransient",
-     [](T& t) { t.plant([&] { return swapForLink(t.home() + "/Library", t.root + "/private/var/root/Library"); }); },
-     [](T& t) { t.send(0, T::creation("com.example.new", true)); }},
+    swapped("ContainersLinkToOutside_Create", [](const T& t) { return t.containers(); }, outsideDir,
+            [](T& t) {
+              t.sends({{0, T::creation("com.example.new")},
+                       {0, with(T::creation("com.example.new"), {{"ContainerClass", 6}})}});
+            }),
+    swapped("HomeLibraryLinkToOutside_CreateTransient", [](const T& t) { return t.home() + "/Library"; }, outsideDir,
+            [](T& t) { t.send(0, T::creation("com.example.new", true)); }),
+    swapped("HomeLibraryLinkToDaemonLibrary_CreateTransient", [](const T& t) { return t.home() + "/Library"; },
+            [](const T& t) { return t.root + "/private/var/root/Library"; },
+            [](T& t) { t.send(0, T::creation("com.example.new", true)); }),
     // The container directory itself.
-    containerLink("ContainerLinkToOutside_StageAndPass", outsideDir,
-                  [](T& t) {
-                    t.send(3, T::stage(t.app));
-                    t.send(4);
-                  }),
-    containerLink("ContainerLinkToOtherUsersContainer_DeleteAndPass", otherContainer,
-                  [](T& t) {
-                    t.send(10, T::byName(t.app));
-                    t.send(4);
-                  }),
-    containerLink("ContainerLinkToOtherUsersContainer_RegenerateUUID", otherContainer,
-                  [](T& t) {
-                    t.send(9, T::selector(t.app));
-                    t.send(8, T::selector(t.app));
-                  }),
-    containerLink("ContainerLinkToOtherUsersContainer_DiskUsage", otherContainer,
-                  [](T& t) { t.send(23, T::selector(t.app)); }),
-    containerLink("ContainerLinkToOtherUsersContainer_Wipe", otherContainer,
-                  [](T& t) {
-                    t.send(12, T::byName(t.app));
-                    t.send(4);
-                  }),
-    {"AddonContainerLinkToOtherUsersContainer_WipeAddon",
-     [](T& t) { t.plant([&] { return swapForLink(t.addon.path, t.other.path); }); },
-     [](T& t) {
-       t.send(11, T::byName(t.addon));
-       t.send(4);
-     }},
+    swapped("ContainerLinkToOutside_StageAndPass", appPath, outsideDir,
+            [](T& t) { t.sends({{3, T::stage(t.app)}, {4, {}}}); }),
+    swapped("ContainerLinkToOtherUsersContainer_DeleteAndPass", appPath, otherContainer, byNameThenPass(10)),
+    swapped("ContainerLinkToOtherUsersContainer_RegenerateUUID", appPath, otherContainer, onApp({9, 8})),
+    swapped("ContainerLinkToOtherUsersContainer_DiskUsage", appPath, otherContainer, onApp({23})),
+    swapped("ContainerLinkToOtherUsersContainer_Wipe", appPath, otherContainer, byNameThenPass(12)),
+    swapped("AddonContainerLinkToOtherUsersContainer_WipeAddon", [](const T& t) { return t.addon.path; },
+            otherContainer, byNameThenPass(11, &T::addon)),
     {"OldContainerLinkToOtherUsersContainer_Replace",
      [](T& t) {
-       t.fresh = t.make(kUser, "com.example.app", 2, true);
+       freshApp(t);
        t.plant([&] { return swapForLink(t.app.path, t.other.path); });
      },
-     [](T& t) {
-       t.send(2, T::replace(t.app, t.fresh));
-       t.send(4);
-     }},
+     [](T& t) { t.sends({{2, T::replace(t.app, t.fresh)}, {4, {}}}); }},
     {"NewContainerLinkToOtherUsersContainer_Replace",
      [](T& t) {
-       t.fresh = t.make(kUser, "com.example.app", 2, true);
+       freshApp(t);
        t.plant([&] { return swapForLink(t.fresh.path, t.other.path); });
      },
-     [](T& t) {
-       t.send(2, T::replace(t.app, t.fresh));
-       t.send(8, T::selector(t.app));
-       t.send(4);
-     }},
+     [](T& t) { t.sends({{2, T::replace(t.app, t.fresh)}, {8, selector(t.app)}, {4, {}}}); }},
     // Hard links to files outside, inside a container that is then worked on.
-    {"HardLinksInContainer_DeleteAndPass", hardLinks,
-     [](T& t) {
-       t.send(10, T::byName(t.app));
-       t.send(4);
-     }},
-    {"HardLinksInContainer_WipeAndPass", hardLinks,
-     [](T& t) {
-       t.send(12, T::byName(t.app));
-       t.send(4);
-     }},
-    {"HardLinksInContainer_UsageRegenerateRecreate", hardLinks,
-     [](T& t) {
-       t.send(23, T::selector(t.app));
-       t.send(9, T::selector(t.app));
-       t.send(22, T::selector(t.app));
-     }},
+    {"HardLinksInContainer_DeleteAndPass", hardLinks, byNameThenPass(10)},
+    {"HardLinksInContainer_WipeAndPass", hardLinks, byNameThenPass(12)},
+    {"HardLinksInContainer_UsageRegenerateRecreate", hardLinks, onApp({23, 9, 22})},
     {"FifoInContainer_UsageAndDelete",
      [](T& t) { t.plant([&] { return mkfifo(t.in(t.app, "Documents/pipe").c_str(), 0644) == 0; }); },
-     [](T& t) {
-       t.send(23, T::selector(t.app));
-       t.send(10, T::byName(t.app));
-       t.send(4);
-     }},
+     [](T& t) { t.sends({{23, selector(t.app)}, {10, byName(t.app)}, {4, {}}}); }},
     // Swaps while requests run.
     // A link to a decoy that passes for the container (it has the metadata
     // file), with links to targets where the default directories belong.
@@ -515,14 +425,14 @@ const Case kCases[] = {
      [](T& t) { t.plant([&] { return plantDecoy(t, t.app, t.home() + "/decoy"); }); },
      [](T& t) {
        for (int i = 0; i < 20; ++i) {
-         for (uint64_t command : {8, 22, 23}) t.send(command, T::selector(t.app));
-         t.send(5, T::with(T::selector(t.app), {{"Key", "k"}, {"Value", i}}));
+         onApp({8, 22, 23})(t);
+         t.send(5, with(selector(t.app), {{"Key", "k"}, {"Value", i}}));
        }
      },
      [](const T& t) { flip(t.app.path, t.home() + "/decoy"); }},
     {"RaceLibraryAndLink_Recreate", [](T&) {},
      [](T& t) {
-       for (int i = 0; i < 30; ++i) t.send(i % 2 ? 8 : 22, T::selector(t.app));
+       for (int i = 0; i < 30; ++i) t.send(i % 2 ? 8 : 22, selector(t.app));
      },
      [](const T& t) {
        rmdir(t.in(t.app, "Library/Caches").c_str());
@@ -537,16 +447,11 @@ const Case kCases[] = {
        }
        ASSERT_EQ(system(("chown -R 501:501 " + t.in(t.app, "Documents")).c_str()), 0);
      },
-     [](T& t) {
-       t.send(3, T::stage(t.app));
-       t.send(4);
-     },
+     [](T& t) { t.sends({{3, T::stage(t.app)}, {4, {}}}); },
      // The staged container stays the user's, and reachable, inside the death-row directory.
      [](const T& t) {
        static int i = 0;
-       const std::string dir =
-           t.daemonCaches() + "/Dead/" + baseName(t.app.path) + "/Documents/d" + std::to_string(i++ % 40);
-       flip(dir, t.outside);
+       flip(t.deadDirectory() + "/" + baseName(t.app.path) + "/Documents/d" + std::to_string(i++ % 40), t.outside);
      }},
     {"RaceClassDirectoryAndLink_Create",
      [](T& t) {
@@ -567,13 +472,11 @@ const Case kCases[] = {
        });
      },
      [](T& t) {
-       t.send(12, T::byName(t.app));
-       t.send(2, T::replace(t.app, t.make(kUser, "com.example.app", 2, true)));
-       t.send(3, T::stage(t.addon));
+       t.send(12, byName(t.app));
+       t.sends({{2, T::replace(t.app, t.make(kUser, "com.example.app", 2, true))}, {3, T::stage(t.addon)}});
        // Last: a new directory name lives in one of the two trees only.
-       for (int i = 0; i < 3; ++i) t.send(9, T::selector(t.app));
-       t.send(10, T::byName(t.app));
-       t.send(4);
+       onApp({9, 9, 9})(t);
+       byNameThenPass(10)(t);
      },
      [](const T& t) { flip(t.containers(), t.home() + "/decoys"); }},
 };

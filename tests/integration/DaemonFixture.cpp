@@ -14,16 +14,6 @@
 
 #include "base/PlistCodec.h"
 
-namespace {
-
-std::string ownExecutable() {
-  char buffer[4096];
-  ssize_t n = readlink("/proc/self/exe", buffer, sizeof buffer - 1);
-  return n > 0 ? std::string(buffer, static_cast<size_t>(n)) : std::string();
-}
-
-}  // namespace
-
 plist::Dictionary request(uint64_t command, plist::Dictionary keys) {
   keys["Command"] = command;
   return keys;
@@ -35,6 +25,33 @@ uint64_t codeOf(const std::optional<plist::Dictionary>& reply) {
 }
 
 plist::Data uuidData(const QRTUUID& uuid) { return plist::Data(uuid.bytes().begin(), uuid.bytes().end()); }
+
+std::optional<plist::Value> at(const std::optional<plist::Dictionary>& reply, const char* key) {
+  const plist::Value* v = reply ? plist::find(*reply, key) : nullptr;
+  return v ? std::optional<plist::Value>(*v) : std::nullopt;
+}
+
+std::optional<uint64_t> u64At(const std::optional<plist::Dictionary>& reply, const char* key) {
+  auto v = at(reply, key);
+  return v && v->isInteger() ? std::optional<uint64_t>(v->integer().asUnsigned()) : std::nullopt;
+}
+
+plist::Dictionary byName(uint64_t user, uint64_t cls, const std::string& identifier) {
+  return {{"UserID", user}, {"ContainerClass", cls}, {"Identifier", identifier}};
+}
+plist::Dictionary byName(const Container& c) { return byName(c.user, c.cls, c.identifier); }
+plist::Dictionary selector(const Container& c) { return with(byName(c), {{"UUID", uuidData(c.uuid)}}); }
+plist::Dictionary with(plist::Dictionary keys, plist::Dictionary more) { return more.merge(keys), more; }
+plist::Dictionary without(plist::Dictionary keys, const std::string& key) { return keys.erase(key), keys; }
+
+std::string baseName(const std::string& path) { return path.substr(path.rfind('/') + 1); }
+std::string parentOf(const std::string& path) { return path.substr(0, path.rfind('/')); }
+
+std::pair<uint32_t, uint32_t> ownerAndMode(const std::string& path) {
+  struct stat st;
+  if (stat(path.c_str(), &st) != 0) return {UINT32_MAX, UINT32_MAX};
+  return {st.st_uid, st.st_mode & 07777};
+}
 
 void writeFile(const std::string& path, const std::string& text) {
   std::ofstream out(path, std::ios::binary | std::ios::trunc);
@@ -122,6 +139,11 @@ int DaemonFixture::stopDaemon() {
   return status;
 }
 
+void DaemonFixture::restartDaemon() {
+  ASSERT_EQ(stopDaemon(), 0);
+  startDaemon();
+}
+
 void DaemonFixture::killDaemon() {
   kill(daemon, SIGKILL);
   waitpid(daemon, nullptr, 0);
@@ -164,6 +186,12 @@ Container DaemonFixture::createOrLookup(uint64_t user, const std::string& identi
   return c;
 }
 
+Container DaemonFixture::make(uint64_t user, const std::string& identifier, uint64_t cls, bool transient) {
+  Container c = createOrLookup(user, identifier, cls, true, transient);
+  EXPECT_EQ(c.error, 1u) << identifier;
+  return c;
+}
+
 void DaemonFixture::setIdentity(const std::string& name, const std::string& executable,
                                 const std::string& signingIdentifier, const plist::Dictionary& entitlements) {
   plist::Dictionary identity{
@@ -176,16 +204,13 @@ void DaemonFixture::setIdentity(const std::string& name, const std::string& exec
 }
 
 void DaemonFixture::setOwnIdentity(const std::string& signingIdentifier, const plist::Dictionary& entitlements) {
-  setIdentity("self", ownExecutable(), signingIdentifier, entitlements);
+  setIdentity("self", readLink("/proc/self/exe"), signingIdentifier, entitlements);
 }
 
 void DaemonFixture::clearOwnIdentity() { unlink((root + "/etc/quarterd/identities/self.plist").c_str()); }
 
 std::string DaemonFixture::logText() const {
-  std::ifstream in(root + "/private/var/root/Library/Logs/QuarterKit/quarterd.log");
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
+  return readFile(root + "/private/var/root/Library/Logs/QuarterKit/quarterd.log");
 }
 
 bool DaemonFixture::logContains(const std::string& text) const {

@@ -7,6 +7,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -38,6 +39,9 @@ class DaemonFixture : public ::testing::Test {
   int stopDaemon();
   void killDaemon();
 
+  // SIGTERM (expecting exit 0), then start again.
+  void restartDaemon();
+
   std::unique_ptr<qk::Connection> connect();
   // One request on a fresh connection; the reply's "ReplyError", or 0 when
   // no reply came.
@@ -48,6 +52,14 @@ class DaemonFixture : public ::testing::Test {
   // Command 0, or 15 for a well-known system container.
   Container createOrLookup(uint64_t user, const std::string& identifier, uint64_t cls, bool create = true,
                            bool transient = false, uint64_t command = 0);
+
+  // createOrLookup that expects a success.
+  Container make(uint64_t user, const std::string& identifier, uint64_t cls, bool transient = false);
+
+  std::string daemonCaches() const { return root + "/private/var/root/Library/Caches/com.norvane.quarterd"; }
+  std::string deadDirectory() const { return daemonCaches() + "/Dead"; }
+  // User 501's application class directory.
+  std::string appClassDir() const { return root + "/private/var/mobile/Containers/Data/Application"; }
 
   // Registers (or replaces) the identity file name.plist for an executable.
   void setIdentity(const std::string& name, const std::string& executable, const std::string& signingIdentifier,
@@ -68,6 +80,23 @@ plist::Dictionary request(uint64_t command, plist::Dictionary keys = {});
 // The reply's "ReplyError", or 0 when there is none.
 uint64_t codeOf(const std::optional<plist::Dictionary>& reply);
 plist::Data uuidData(const QRTUUID& uuid);
+// Lenient readers: a missing or mistyped key fails the check that uses it.
+std::optional<plist::Value> at(const std::optional<plist::Dictionary>& reply, const char* key);
+std::optional<uint64_t> u64At(const std::optional<plist::Dictionary>& reply, const char* key);
+
+// Request keys naming a container, and the keys with more added (a key in
+// both takes its value from more) or with one erased.
+plist::Dictionary byName(uint64_t user, uint64_t cls, const std::string& identifier);
+plist::Dictionary byName(const Container& c);
+plist::Dictionary selector(const Container& c);
+plist::Dictionary with(plist::Dictionary keys, plist::Dictionary more);
+plist::Dictionary without(plist::Dictionary keys, const std::string& key);
+
+inline const char* const kMetadataFile = ".com.norvane.quarter_kit.metadata.plist";
+std::string baseName(const std::string& path);
+std::string parentOf(const std::string& path);
+// The owner and permission bits (stat follows links); all ones when missing.
+std::pair<uint32_t, uint32_t> ownerAndMode(const std::string& path);
 
 // File helpers; a missing file reads as empty, a missing directory lists nothing.
 void writeFile(const std::string& path, const std::string& text);

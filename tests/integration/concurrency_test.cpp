@@ -16,13 +16,6 @@
 
 namespace {
 
-const char* kMetadataFile = ".com.norvane.quarter_kit.metadata.plist";
-
-std::optional<plist::Value> at(const std::optional<plist::Dictionary>& reply, const char* key) {
-  const plist::Value* v = reply ? plist::find(*reply, key) : nullptr;
-  return v ? std::optional<plist::Value>(*v) : std::nullopt;
-}
-
 // Runs each body on a thread of its own and waits for all of them.
 void together(const std::vector<std::function<void()>>& bodies) {
   std::vector<std::thread> threads;
@@ -36,11 +29,6 @@ class ConcurrencyTest : public DaemonFixture {
     DaemonFixture::SetUp();
     if (!HasFatalFailure()) setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true}});
   }
-
-  static plist::Dictionary selector(const Container& c) {
-    return {{"UserID", c.user}, {"ContainerClass", c.cls}, {"Identifier", c.identifier}, {"UUID", uuidData(c.uuid)}};
-  }
-  static plist::Dictionary with(plist::Dictionary keys, plist::Dictionary more) { return more.merge(keys), more; }
 
   // Command 1's UUIDs for user 501, class 2.
   std::set<std::string> listedUUIDs(bool transient) {
@@ -66,13 +54,10 @@ class ConcurrencyTest : public DaemonFixture {
     }
     return uuids;
   }
-
-  std::string deadDirectory() const { return root + "/private/var/root/Library/Caches/com.norvane.quarterd/Dead"; }
 };
 
 TEST_F(ConcurrencyTest, ReadsSeeWholeMetadataWhileItChangesAndOneCreatorMakesEachContainer) {
-  const Container app = createOrLookup(501, "com.example.shared", 2);
-  ASSERT_EQ(app.error, 1u);
+  const Container app = make(501, "com.example.shared", 2);
   constexpr int kSets = 60, kReaders = 2, kRounds = 4, kCreators = 6;
   std::atomic<bool> setterDone{false};
   std::atomic<int> badSets{0}, badReads{0};
@@ -89,11 +74,8 @@ TEST_F(ConcurrencyTest, ReadsSeeWholeMetadataWhileItChangesAndOneCreatorMakesEac
     int64_t seen = 0;
     auto check = [&](const std::optional<plist::Value>& value) {
       if (!value) return;
-      if (!value->isInteger() || value->integer().asSigned() < seen || value->integer().asSigned() > kSets) {
-        ++badReads;
-      } else {
-        seen = value->integer().asSigned();
-      }
+      if (!value->isInteger() || value->integer().asSigned() < seen || value->integer().asSigned() > kSets) ++badReads;
+      else seen = value->integer().asSigned();
     };
     while (!setterDone) {
       auto got = call(6, with(selector(app), {{"Key", "counter"}}));
@@ -139,10 +121,8 @@ TEST_F(ConcurrencyTest, ReadsSeeWholeMetadataWhileItChangesAndOneCreatorMakesEac
 }
 
 TEST_F(ConcurrencyTest, TransientRecreationDeletionAndPassesLoseNoContainer) {
-  const Container probe = createOrLookup(501, "com.example.probe", 2, true, true);
-  ASSERT_EQ(probe.error, 1u);
-  const std::string transientDirectory = probe.path.substr(0, probe.path.rfind('/'));
-  const std::string liveDirectory = root + "/private/var/mobile/Containers/Data/Application";
+  const Container probe = make(501, "com.example.probe", 2, true);
+  const std::string transientDirectory = parentOf(probe.path);
   constexpr int kIterations = 25;
   auto id = [](int i) { return "com.example.t" + std::to_string(i % 3); };
 
@@ -152,7 +132,7 @@ TEST_F(ConcurrencyTest, TransientRecreationDeletionAndPassesLoseNoContainer) {
   auto remove = [&] {
     for (int i = 0; i < kIterations; ++i) {
       if (i % 2) {
-        call(10, {{"UserID", 501u}, {"ContainerClass", 2u}, {"Identifier", id(i)}, {"Transient", i % 4 == 1}});
+        call(10, with(byName(501, 2, id(i)), {{"Transient", i % 4 == 1}}));
         continue;
       }
       // Stage whatever the listing shows, by its UUIDs.
@@ -171,7 +151,7 @@ TEST_F(ConcurrencyTest, TransientRecreationDeletionAndPassesLoseNoContainer) {
 
   // Every container in a class directory is one the daemon lists.
   EXPECT_EQ(uuidsOnDisk(transientDirectory), listedUUIDs(true));
-  EXPECT_EQ(uuidsOnDisk(liveDirectory), listedUUIDs(false));
+  EXPECT_EQ(uuidsOnDisk(appClassDir()), listedUUIDs(false));
   // A pass answers once it has run, after every pass queued before it.
   std::vector<std::string> dead;
   for (int i = 0; i < 50; ++i) {
@@ -188,15 +168,13 @@ TEST_F(ConcurrencyTest, PassDuringAHandOverLeavesNothingBehind) {
 #ifndef QRT_TEST_HOOKS
   GTEST_SKIP() << "pause points need a build with test hooks";
 #endif
-  const Container first = createOrLookup(501, "com.example.handover", 2, true, true);
-  ASSERT_EQ(first.error, 1u);
+  const Container first = make(501, "com.example.handover", 2, true);
   ASSERT_EQ(codeOf(call(4)), 1u);
   writeFile(root + "/run/quarterd.pausepoint", "deathrow-hand-over\n");
   Container second;
   std::thread recreate([&] { second = createOrLookup(501, "com.example.handover", 2, true, true); });
-  for (int i = 0; i < 500 && listDirectory(deadDirectory()).empty(); ++i) {
+  for (int i = 0; i < 500 && listDirectory(deadDirectory()).empty(); ++i)
     std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  }
   EXPECT_EQ(codeOf(call(4)), 1u);
   recreate.join();
   unlink((root + "/run/quarterd.pausepoint").c_str());

@@ -22,43 +22,25 @@ bool isNoneCommand(uint64_t c) { return c == 0 || c == 13 || c == 15 || c == 16 
 using DispatcherTest = DaemonFixture;
 
 TEST_F(DispatcherTest, CommandsOutsideTheTableAnswer49) {
-  for (uint64_t command : {uint64_t{30}, uint64_t{1} << 32, UINT64_MAX}) {
+  for (uint64_t command : {uint64_t{30}, uint64_t{1} << 32, UINT64_MAX})
     EXPECT_EQ(replyError(request(command)), kNotServed) << command;
-  }
-  EXPECT_TRUE(logContains("Invalid command index: 30"));
-  EXPECT_TRUE(logContains("Invalid command index: 4294967296"));
 }
 
-TEST_F(DispatcherTest, CallerWithoutEntitlementsReachesOnlyTheOpenCommands) {
-  for (uint64_t command = 0; command < 30; ++command) {
-    uint64_t code = replyError(request(command));
-    if (isNoneCommand(command)) {
-      EXPECT_NE(code, kNotEntitled) << command;
+// Without entitlements only the open commands pass; the master entitlement passes every row.
+TEST_F(DispatcherTest, EntitlementsOpenTheCommandTable) {
+  for (bool allowed : {false, true}) {
+    if (allowed) setOwnIdentity("com.example.installer", {{kAllowed, true}});
+    for (uint64_t command = 0; command < 30; ++command) {
+      uint64_t code = replyError(request(command));
       EXPECT_NE(code, 0u) << command;
-    } else {
-      EXPECT_EQ(code, kNotEntitled) << command;
+      EXPECT_EQ(code == kNotEntitled, !allowed && !isNoneCommand(command)) << command << ": " << code;
     }
   }
-  EXPECT_TRUE(logContains("missing required entitlement: com.norvane.private.QuarterKit.allowed"));
-  EXPECT_TRUE(logContains("missing required entitlement: com.norvane.private.QuarterKit.wipeContainer"));
 }
 
 TEST_F(DispatcherTest, MessageWithoutCommandIsCommandZero) {
   // Command 0 checks the user against the class first: class 0 fits nobody.
   EXPECT_EQ(replyError(plist::Dictionary{{"Identifier", "com.example.app"}}), 38u);
-  EXPECT_TRUE(logContains("Invalid userId 0 for class 0 from client 0"));
-}
-
-TEST_F(DispatcherTest, AllowedEntitlementPassesEveryRow) {
-  setOwnIdentity("com.example.installer", {{kAllowed, true}});
-  for (uint64_t command = 0; command < 30; ++command) {
-    uint64_t code = replyError(request(command));
-    EXPECT_NE(code, kNotEntitled) << command;
-    EXPECT_NE(code, 0u) << command;
-  }
-  // The wipe row logs that the entitlement is not an array, yet lets the
-  // master entitlement through.
-  EXPECT_TRUE(logContains("No entitled containers to wipe"));
 }
 
 TEST_F(DispatcherTest, NamedEntitlementsOpenTheirOwnRowsOnly) {
@@ -66,13 +48,8 @@ TEST_F(DispatcherTest, NamedEntitlementsOpenTheirOwnRowsOnly) {
                                           {"com.norvane.private.QuarterKit.userManagedAssets", false},
                                           {"com.norvane.private.QuarterKit.wipeContainer",
                                            plist::Array{"com.example.addon"}}});
-  EXPECT_NE(replyError(request(24)), kNotEntitled);
-  EXPECT_NE(replyError(request(11)), kNotEntitled);
-  EXPECT_EQ(replyError(request(28)), kNotEntitled);
-  EXPECT_EQ(replyError(request(1)), kNotEntitled);
-  EXPECT_TRUE(logContains("connection attempt from pid"));
-  EXPECT_TRUE(logContains("(com.example.migrator) missing required entitlement: "
-                          "com.norvane.private.QuarterKit.userManagedAssets"));
+  for (uint64_t command : {24, 11}) EXPECT_NE(replyError(request(command)), kNotEntitled) << command;
+  for (uint64_t command : {28, 1}) EXPECT_EQ(replyError(request(command)), kNotEntitled) << command;
 
   // A wipe entitlement that is not an array refuses without the master one.
   setOwnIdentity("com.example.wiper", {{"com.norvane.private.QuarterKit.wipeContainer", true}});
@@ -89,7 +66,6 @@ TEST_F(DispatcherTest, UnreadableFrameClosesOnlyItsConnection) {
   auto lost = bad->send(request(30));
   EXPECT_EQ(lost.get(), std::nullopt);
   EXPECT_TRUE(bad->closed());
-  EXPECT_TRUE(logContains("Dictionary does not have reply context"));
 
   // A property list whose top level is not a dictionary, and a length out of range.
   for (std::vector<uint8_t> frameBytes :
@@ -100,9 +76,7 @@ TEST_F(DispatcherTest, UnreadableFrameClosesOnlyItsConnection) {
     EXPECT_EQ(conn->send(request(30)).get(), std::nullopt);
   }
 
-  auto reply = healthy->call(request(30));
-  ASSERT_TRUE(reply);
-  EXPECT_EQ(plist::find(*reply, "ReplyError")->integer().asUnsigned(), kNotServed);
+  EXPECT_EQ(codeOf(healthy->call(request(30))), kNotServed);
 }
 
 TEST_F(DispatcherTest, SixtyFourClientsAtOnceAllGetTheirReplies) {
@@ -114,11 +88,7 @@ TEST_F(DispatcherTest, SixtyFourClientsAtOnceAllGetTheirReplies) {
       if (!connection) return;
       for (int j = 0; j < 10; ++j) {
         uint64_t command = (i + j) % 2 ? 1 : 30;
-        auto reply = connection->call(request(command));
-        if (reply && plist::find(*reply, "ReplyError")->integer().asUnsigned() ==
-                         (command == 1 ? kNotEntitled : kNotServed)) {
-          ++answered;
-        }
+        answered += codeOf(connection->call(request(command))) == (command == 1 ? kNotEntitled : kNotServed);
       }
     });
   }
@@ -136,19 +106,8 @@ TEST_F(DispatcherTest, PipelinedRequestsAreMatchedByMessageId) {
     inFlight.emplace_back(command, connection->send(request(command)));
   }
   for (auto& [command, future] : inFlight) {
-    auto reply = future.get();
-    ASSERT_TRUE(reply);
-    EXPECT_EQ(plist::find(*reply, "ReplyError")->integer().asUnsigned(),
-              command == 1 ? kNotEntitled : (command == 30 ? kNotServed : 38u));
+    EXPECT_EQ(codeOf(future.get()), command == 1 ? kNotEntitled : (command == 30 ? kNotServed : 38u));
   }
-}
-
-TEST_F(DispatcherTest, SigtermEndsTheDaemonWithStatusZero) {
-  auto connection = connect();
-  ASSERT_TRUE(connection->call(request(30)));
-  int status = stopDaemon();
-  EXPECT_TRUE(WIFEXITED(status));
-  EXPECT_EQ(WEXITSTATUS(status), 0);
 }
 
 TEST_F(DispatcherTest, StartsInOrderAndMarksTheFirstBoot) {

@@ -80,9 +80,8 @@ TEST_F(QuarterctlTest, CreateListInfoJsonAndDelete) {
   EXPECT_EQ(json.out.front(), '{');
   EXPECT_EQ(json.out.substr(json.out.size() - 2), "}\n");
   for (const std::string& part : {std::string("\"ReplyError\":1"), std::string("\"ReplyExisted\":true"),
-                                 "\"ReplyUUID\":\"" + uuid + "\""}) {
+                                 "\"ReplyUUID\":\"" + uuid + "\""})
     EXPECT_TRUE(contains(json.out, part)) << json.out;
-  }
   json = run("--json list --class 2");
   EXPECT_TRUE(contains(json.out, "\"ReplyIdsArray\":[\"com.example.ctl\"]")) << json.out;
   EXPECT_TRUE(contains(json.out, "\"ReplyUUIDsArray\":[\"" + uuid + "\"]")) << json.out;

@@ -19,18 +19,11 @@ namespace fs = std::filesystem;
 
 const char* kMarkerFile = "replace-marker";
 
-std::string baseName(const std::string& path) { return path.substr(path.rfind('/') + 1); }
-
-std::string markerAt(const std::string& containerPath) {
-  std::string path = containerPath + "/" + kMarkerFile;
-  return exists(path) ? readFile(path) : std::string();
-}
+std::string markerAt(const std::string& containerPath) { return readFile(containerPath + "/" + kMarkerFile); }
 
 plist::Dictionary replaceKeys(const Container* old, const Container& fresh) {
-  plist::Dictionary keys{{"NewContainerUUID", uuidData(fresh.uuid)},
-                         {"NewContainerClass", 2},
-                         {"NewContainerUserID", 501},
-                         {"NewIdentifier", fresh.identifier}};
+  plist::Dictionary keys{{"NewContainerUUID", uuidData(fresh.uuid)}, {"NewContainerClass", 2},
+                         {"NewContainerUserID", 501}, {"NewIdentifier", fresh.identifier}};
   if (old) {
     keys["OldContainerUUID"] = uuidData(old->uuid);
     keys["OldContainerClass"] = 2;
@@ -47,10 +40,6 @@ plist::Dictionary changed(plist::Dictionary keys, const char* key, const std::op
   return keys;
 }
 
-plist::Dictionary wipeKeys(const std::string& identifier) {
-  return {{"UserID", 501}, {"ContainerClass", 2}, {"Identifier", identifier}};
-}
-
 class ReplaceTest : public DaemonFixture {
  protected:
   void SetUp() override {
@@ -58,11 +47,9 @@ class ReplaceTest : public DaemonFixture {
     setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true}});
   }
 
-  std::string classDir() const { return root + "/private/var/mobile/Containers/Data/Application"; }
-  std::string daemonCaches() const { return root + "/private/var/root/Library/Caches/com.norvane.quarterd"; }
   std::string replaceDir() const { return root + "/private/var/root/Library/QuarterKit/Replace"; }
   std::string stagingDir() const { return daemonCaches() + "/Staging"; }
-  std::string movedIn(const Container& fresh) const { return classDir() + "/" + baseName(fresh.path); }
+  std::string movedIn(const Container& fresh) const { return appClassDir() + "/" + baseName(fresh.path); }
 
   Container lookup(const std::string& identifier, bool transient = false) {
     return createOrLookup(501, identifier, 2, false, transient);
@@ -70,8 +57,7 @@ class ReplaceTest : public DaemonFixture {
 
   // A class 2 container of user 501 holding a marker file with the given text.
   Container make(const std::string& identifier, bool transient, const std::string& marker) {
-    Container made = createOrLookup(501, identifier, 2, true, transient);
-    EXPECT_EQ(made.error, 1u) << identifier;
+    Container made = DaemonFixture::make(501, identifier, 2, transient);
     if (!made.path.empty()) writeFile(made.path + "/" + kMarkerFile, marker);
     return made;
   }
@@ -81,7 +67,7 @@ class ReplaceTest : public DaemonFixture {
   int liveCopies(const std::string& marker) const {
     int count = 0;
     std::error_code ec;
-    const fs::path deathRow = daemonCaches() + "/Dead";
+    const fs::path deathRow = deadDirectory();
     for (auto it = fs::recursive_directory_iterator(root, ec); it != fs::recursive_directory_iterator();
          it.increment(ec)) {
       if (it->path() == deathRow) {
@@ -103,6 +89,13 @@ class ReplaceTest : public DaemonFixture {
     daemon = -1;
     unlink((root + "/run/quarterd.crashpoint").c_str());
     startDaemon();
+  }
+
+  // The identifier's permanent container is c, at its path.
+  void expectLive(const std::string& id, const Container& c) {
+    Container live = lookup(id);
+    EXPECT_EQ(live.path, c.path);
+    EXPECT_EQ(live.uuid, c.uuid);
   }
 
   void expectNothingInFlight() {
@@ -141,7 +134,7 @@ TEST_F(ReplaceTest, ReplaceAndWipeTakeOverAndSurviveRestart) {
   expectLiveAcrossRestart("com.example.app", movedIn(fresh), fresh.uuid, "app-new");
 
   Container wiped = make("com.example.wiped", false, "wiped-old");
-  ASSERT_EQ(codeOf(call(12, wipeKeys("com.example.wiped"))), 1u);
+  ASSERT_EQ(codeOf(call(12, byName(501, 2, "com.example.wiped"))), 1u);
   EXPECT_EQ(liveCopies("wiped-old"), 0);
   expectLiveAcrossRestart("com.example.wiped", wiped.path, wiped.uuid, "");
 }
@@ -165,9 +158,7 @@ TEST_F(ReplaceTest, RefusalsChangeNothing) {
     EXPECT_EQ(codeOf(call(2, changed(replaceKeys(&old, fresh), refusal.key, refusal.value))), refusal.code);
     EXPECT_EQ(markerAt(old.path), "keep-old");
     EXPECT_EQ(markerAt(fresh.path), "keep-new");
-    Container live = lookup("com.example.keep");
-    EXPECT_EQ(live.path, old.path);
-    EXPECT_EQ(live.uuid, old.uuid);
+    expectLive("com.example.keep", old);
     expectNothingInFlight();
   }
 }
@@ -185,9 +176,7 @@ TEST_F(ReplaceTest, FailedMoveOfNewContainerPutsOldOneBack) {
   const uint64_t code = codeOf(call(2, replaceKeys(&old, fresh)));
   ASSERT_EQ(system(("chattr -i " + fresh.path).c_str()), 0);
   EXPECT_EQ(code, 15u);
-  Container live = lookup("com.example.back");
-  EXPECT_EQ(live.path, old.path);
-  EXPECT_EQ(live.uuid, old.uuid);
+  expectLive("com.example.back", old);
   EXPECT_EQ(markerAt(old.path), "back-old");
   EXPECT_EQ(markerAt(fresh.path), "back-new");
   expectNothingInFlight();
@@ -242,7 +231,7 @@ TEST_F(ReplaceTest, KilledReplaceOrWipeLeavesExactlyOneContentLive) {
     // memory and in its metadata file.
     const std::string wipeId = id + ".wipe";
     Container wiped = make(wipeId, false, wipeId + "-old");
-    crashAndRestart(12, wipeKeys(wipeId), point);
+    crashAndRestart(12, byName(501, 2, wipeId), point);
     expectLiveAcrossRestart(wipeId, wiped.path, wiped.uuid, newInPlace ? "" : wipeId + "-old", newInPlace);
     EXPECT_EQ(liveCopies(wipeId + "-old"), newInPlace ? 0 : 1);
   }
@@ -251,13 +240,8 @@ TEST_F(ReplaceTest, KilledReplaceOrWipeLeavesExactlyOneContentLive) {
 TEST_F(ReplaceTest, StartUpRecoveryActsOnlyOnValidJournals) {
   const std::string filled = root + "/filled-destination";
   ASSERT_EQ(mkdir(filled.c_str(), 0755), 0);
-  struct Journal {
-    const char* name;
-    bool movesBack;
-    const char* raw;  // bytes written instead of the valid journal
-    const char* key;  // a key of the valid journal set to `to`, or erased
-    std::optional<plist::Value> to;
-  };
+  // raw: bytes written instead of the valid journal; key: one of its keys set to `to`, or erased.
+  struct Journal { const char* name; bool movesBack; const char* raw; const char* key; std::optional<plist::Value> to; };
   const Journal journals[] = {
       {"valid", true, nullptr, nullptr, std::nullopt},
       {"garbage", false, "not a property list", nullptr, std::nullopt},
@@ -281,7 +265,7 @@ TEST_F(ReplaceTest, StartUpRecoveryActsOnlyOnValidJournals) {
     plist::Dictionary journal{{"QRTReplaceOperationOldURL", containers[i].path},
                               {"QRTReplaceOperationNewURL", "/nonexistent/new"},
                               {"QRTReplaceOperationStagingURL", staging},
-                              {"QRTReplaceOperationDestURL", classDir() + "/" + QRTUUID::random().UUIDString()}};
+                              {"QRTReplaceOperationDestURL", appClassDir() + "/" + QRTUUID::random().UUIDString()}};
     plist::Data bytes = plist::writeBinary(j.key ? changed(journal, j.key, j.to) : journal);
     writeFile(replaceDir() + "/" + name + ".plist", j.raw ? j.raw : std::string(bytes.begin(), bytes.end()));
   }

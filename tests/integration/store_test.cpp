@@ -14,8 +14,6 @@
 
 namespace {
 
-const char* kMetadataFile = ".com.norvane.quarter_kit.metadata.plist";
-
 using StoreTest = DaemonFixture;
 
 TEST_F(StoreTest, NewDataContainerIsCompleteOnDiskAndMapped) {
@@ -23,10 +21,9 @@ TEST_F(StoreTest, NewDataContainerIsCompleteOnDiskAndMapped) {
   ASSERT_EQ(made.error, 1u);
   EXPECT_FALSE(made.existed);
   EXPECT_EQ(made.identifier, "com.example.app");
-  std::string classDir = root + "/private/var/mobile/Containers/Data/Application";
-  ASSERT_EQ(made.path.rfind(classDir + "/", 0), 0u) << made.path;
+  ASSERT_EQ(parentOf(made.path), appClassDir());
   // The directory is named by a fresh upper-case UUID of its own.
-  std::string name = made.path.substr(classDir.size() + 1);
+  const std::string name = baseName(made.path);
   auto directoryUUID = QRTUUID::fromString(name);
   ASSERT_TRUE(directoryUUID);
   EXPECT_EQ(directoryUUID->UUIDString(), name);
@@ -37,31 +34,24 @@ TEST_F(StoreTest, NewDataContainerIsCompleteOnDiskAndMapped) {
             (plist::Dictionary{{"QRTMetadataIdentifier", "com.example.app"}, {"QRTMetadataUUID", made.uuid.UUIDString()},
                                {"QRTMetadataContentClass", 2u}, {"QRTMetadataPersona", 501u}}));
 
-  std::set<std::string> expected{kMetadataFile, "Documents", "Library", "tmp"};
   auto entries = listDirectory(made.path);
-  EXPECT_EQ(std::set<std::string>(entries.begin(), entries.end()), expected);
-  for (const char* sub : {"", "/Documents", "/Library", "/Library/Caches", "/Library/Preferences", "/tmp"}) {
-    struct stat st {};
-    ASSERT_EQ(stat((made.path + sub).c_str(), &st), 0) << sub;
-    EXPECT_EQ(st.st_uid, 501u) << sub;
-    EXPECT_EQ(st.st_mode & 07777, 0755u) << sub;
-  }
+  EXPECT_EQ(std::set<std::string>(entries.begin(), entries.end()),
+            (std::set<std::string>{kMetadataFile, "Documents", "Library", "tmp"}));
+  for (const char* sub : {"", "/Documents", "/Library", "/Library/Caches", "/Library/Preferences", "/tmp"})
+    EXPECT_EQ(ownerAndMode(made.path + sub), std::pair(501u, 0755u)) << sub;
 
   EXPECT_EQ(readLink(root + "/run/sandbox/mappings/501/1/com.example.app"), made.path);
 
-  Container again = createOrLookup(501, "com.example.app", 2);
-  EXPECT_EQ(again.error, 1u);
+  Container again = make(501, "com.example.app", 2);
   EXPECT_TRUE(again.existed);
   EXPECT_EQ(again.path, made.path);
   EXPECT_EQ(again.uuid, made.uuid);
 }
 
 TEST_F(StoreTest, TransientContainerIsReplacedOnEveryCall) {
-  Container first = createOrLookup(501, "com.example.tmp", 2, true, true);
-  ASSERT_EQ(first.error, 1u);
+  Container first = make(501, "com.example.tmp", 2, true);
   EXPECT_NE(first.path.find("/Library/Caches/com.norvane.quarterd/Temp/Data/Application/"), std::string::npos);
-  Container second = createOrLookup(501, "com.example.tmp", 2, true, true);
-  ASSERT_EQ(second.error, 1u);
+  Container second = make(501, "com.example.tmp", 2, true);
   EXPECT_FALSE(second.existed);
   EXPECT_NE(second.path, first.path);
   EXPECT_NE(second.uuid, first.uuid);
@@ -73,8 +63,8 @@ TEST_F(StoreTest, RefusalsLeaveNothingOnDisk) {
   Container missing = createOrLookup(501, "com.example.none", 2, false);
   EXPECT_EQ(missing.error, 21u);
   EXPECT_TRUE(missing.path.empty());
-  EXPECT_TRUE(listDirectory(root + "/private/var/mobile/Containers/Data/Application").empty());
-  EXPECT_TRUE(listDirectory(root + "/private/var/root/Library/Caches/com.norvane.quarterd/Staging").empty());
+  EXPECT_TRUE(listDirectory(appClassDir()).empty());
+  EXPECT_TRUE(listDirectory(daemonCaches() + "/Staging").empty());
 
   EXPECT_EQ(createOrLookup(501, "com.example.app", 1).error, 38u);
   // A system container of another program needs look-up rights.
@@ -89,9 +79,7 @@ TEST_F(StoreTest, BundleAndWellKnownSystemContainers) {
   ASSERT_EQ(bundle.error, 1u);
   EXPECT_EQ(bundle.path.rfind(root + "/private/var/containers/Bundle/Application/", 0), 0u);
   EXPECT_EQ(listDirectory(bundle.path), std::vector<std::string>{kMetadataFile});
-  struct stat st {};
-  ASSERT_EQ(stat(bundle.path.c_str(), &st), 0);
-  EXPECT_EQ(st.st_uid, 33u);
+  EXPECT_EQ(ownerAndMode(bundle.path).first, 33u);
 
   // Any caller reaches a well-known system container, under its own name.
   Container system = createOrLookup(0, "com.norvane.mapsd", 12, true, false, 15);
@@ -99,14 +87,11 @@ TEST_F(StoreTest, BundleAndWellKnownSystemContainers) {
   EXPECT_EQ(system.path, root + "/private/var/containers/Data/System/com.norvane.mapsd");
   EXPECT_GT(getxattr(system.path.c_str(), "system.posix_acl_access", nullptr, 0), 0);
   EXPECT_GT(getxattr(system.path.c_str(), "system.posix_acl_default", nullptr, 0), 0);
-  ASSERT_EQ(stat((system.path + "/Library").c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 07777, 0u);
-  EXPECT_EQ(st.st_uid, 4294967294u);
+  EXPECT_EQ(ownerAndMode(system.path + "/Library"), std::pair(4294967294u, 0u));
 }
 
 TEST_F(StoreTest, ContainerDeletedByHandIsForgotten) {
-  Container made = createOrLookup(501, "com.example.gone", 2);
-  ASSERT_EQ(made.error, 1u);
+  Container made = make(501, "com.example.gone", 2);
   ASSERT_EQ(system(("rm -rf " + made.path).c_str()), 0);
   EXPECT_EQ(createOrLookup(501, "com.example.gone", 2, false).error, 44u);
   EXPECT_EQ(createOrLookup(501, "com.example.gone", 2, false).error, 21u);
@@ -117,8 +102,7 @@ TEST_F(StoreTest, RestartFindsEveryContainerAgain) {
   std::map<std::string, Container> made;
   for (int i = 0; i < 5; ++i) {
     std::string id = "com.example.app" + std::to_string(i);
-    made[id] = createOrLookup(501, id, i % 2 ? 2 : 4);
-    ASSERT_EQ(made[id].error, 1u);
+    made[id] = make(501, id, i % 2 ? 2 : 4);
   }
   // A container whose metadata names class 2 but lies among class 4 is ignored.
   std::string stray = root + "/private/var/mobile/Containers/Data/AddonPlugin/" + QRTUUID::random().UUIDString();
@@ -140,25 +124,23 @@ TEST_F(StoreTest, RestartFindsEveryContainerAgain) {
 TEST_F(StoreTest, KillDuringCreationsLeavesNoIncompleteContainer) {
   std::atomic<bool> stop{false};
   std::vector<std::thread> clients;
-  for (int t = 0; t < 4; ++t) {
+  for (int t = 0; t < 4; ++t)
     clients.emplace_back([&, t] {
       for (int i = 0; !stop && i < 1000; ++i) createOrLookup(501, "com.example.burst" + std::to_string(t * 1000 + i), 2);
     });
-  }
   std::this_thread::sleep_for(std::chrono::milliseconds(400));
   killDaemon();
   stop = true;
   for (auto& t : clients) t.join();
 
-  std::string classDir = root + "/private/var/mobile/Containers/Data/Application";
+  const std::string classDir = appClassDir();
   auto containers = listDirectory(classDir);
   EXPECT_FALSE(containers.empty());
   for (const std::string& name : containers) {
     std::string path = classDir + "/" + name;
     EXPECT_TRUE(readPlist(path + "/" + kMetadataFile)) << path;
-    for (const char* sub : {"/Documents", "/Library/Caches", "/Library/Preferences", "/tmp"}) {
+    for (const char* sub : {"/Documents", "/Library/Caches", "/Library/Preferences", "/tmp"})
       EXPECT_EQ(access((path + sub).c_str(), F_OK), 0) << path << sub;
-    }
   }
   startDaemon();  // the fixture's tear-down checks a clean exit
 }
