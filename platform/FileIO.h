@@ -46,9 +46,11 @@ int readAll(int fd, std::string* out, size_t limit);
 // fsync of a directory; file systems that cannot (EINVAL) count as done.
 int syncDirectory(int fd);
 
-// The regular file dirfd/name whole. A link, a directory (EISDIR) or a
-// special file (EINVAL) is refused without being opened for reading.
+// The regular file dirfd/name whole. A link (ELOOP), a directory (EISDIR) or
+// a special file (EINVAL) is refused before anything is read.
 int readFileAt(int dirfd, const char* name, std::string* out, size_t limit);
+// The same for a descriptor already open for reading.
+int readOpened(int fd, std::string* out, size_t limit);
 
 // Replaces dirfd/name atomically: a hidden temporary in the same directory
 // (exclusive, no link followed), written, flushed, renamed over the name, the

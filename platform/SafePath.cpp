@@ -261,9 +261,9 @@ int safeMakeDirectory(std::string_view hostPath, mode_t mode, bool withParents, 
 }
 
 int safeReadFile(std::string_view hostPath, std::string* out, size_t limit) {
-  SafeParent parent;
-  if (int err = safeOpenParent(hostPath, &parent)) return err;
-  return readFileAt(parent.fd.get(), parent.name.c_str(), out, limit);
+  UniqueFd fd;
+  if (int err = safeOpen(hostPath, O_RDONLY | O_NONBLOCK | O_NOCTTY, &fd)) return err;
+  return readOpened(fd.get(), out, limit);
 }
 
 int safeReplaceFile(std::string_view hostPath, std::string_view content, mode_t mode) {
