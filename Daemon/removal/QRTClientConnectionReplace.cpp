@@ -117,6 +117,9 @@ struct ReplaceJob {
   QRTURL staging{};
   bool destinationTransient = false;
   bool oldLeftCache = false;
+  // A move back failed (a user can make one fail by swapping a directory of
+  // theirs for a link): journal and staging stay for the start-up recovery.
+  bool leftForRecovery = false;
 };
 
 // Everything that can be refused before the lock is taken.
@@ -238,8 +241,8 @@ QRTErrorRef adoptNewContainer(ReplaceJob& job) {
 
 // With preserveOldUUID the new content takes the old UUID, on disk first. If
 // that write fails the new content goes back where it came from, so that the
-// restore can put the old one back; if even that fails the process ends with
-// the journal in place and the start-up recovery writes the UUID.
+// restore can put the old one back; if even that fails the journal stays and
+// the start-up recovery writes the UUID.
 QRTErrorRef keepOldUUID(ReplaceJob& job, bool* restore) {
   job.adopted = job.newContainer->withUrl(job.destination, job.destinationTransient);
   if (!job.preserveOldUUID) return nullptr;
@@ -250,7 +253,9 @@ QRTErrorRef keepOldUUID(ReplaceJob& job, bool* restore) {
   if (!QRTFileManager::defaultManager().moveItemAtURL(job.destination, job.newURL, &moveError)) {
     QRTLogAs(kLogError, kReplace, "Failed to keep UUID %@ at %@ (%@) nor move the new content back: %@", job.oldUUID,
              job.destination, writeError, moveError);
-    std::_Exit(EXIT_FAILURE);
+    job.leftForRecovery = true;
+    return QRT_ERROR_AS(kReplace, QRTErrorReplaceJournalFailed, moveError, "Failed to recover replace move: %@ to %@",
+                        job.destination, job.newURL);
   }
   *restore = true;
   return writeError;
@@ -311,10 +316,10 @@ bool moveStagingBackIfAside(const QRTURL& old, const QRTURL& staging, const QRTU
   return true;
 }
 
-// After a failure or an exception. A failed move back ends the process before
-// the clean-up could send the old content to death row: the journal stays
-// and the start-up recovery finishes the restore. (A throw in here ends it
-// too, through noexcept.)
+// After a failure or an exception. A failed move back keeps the clean-up from
+// sending the old content to death row: the journal and staging stay and the
+// start-up recovery finishes the restore. (A throw in here ends the process,
+// through noexcept.)
 void restoreOldContainer(ReplaceJob& job, bool afterException) noexcept {
   if (job.oldURL.empty() || job.destination.empty() || job.staging.empty()) return;
   bool moved = false;
@@ -322,7 +327,9 @@ void restoreOldContainer(ReplaceJob& job, bool afterException) noexcept {
   if (!moveStagingBackIfAside(job.oldURL, job.staging, job.destination, kReplace,
                               afterException ? "Recovering from exception by moving: %@ to %@" : nullptr, &moved,
                               &error)) {
-    std::_Exit(EXIT_FAILURE);
+    QRTLogAs(kLogError, kReplace, "Leaving replace journal %@ for the next start: %@", job.journal, error);
+    job.leftForRecovery = true;
+    return;
   }
   // Re-added so that the restored container does not answer "not found"
   // until the next start rebuilds the cache from disk.
@@ -338,7 +345,7 @@ void restoreOldContainer(ReplaceJob& job, bool afterException) noexcept {
 // Hands staging and journal to death row. Its error, if any, replaces the
 // operation's.
 QRTErrorRef cleanUpReplace(QRTClientConnection& client, const ReplaceJob& job, bool startDeletionThread) {
-  if (job.journal.empty()) return nullptr;
+  if (job.journal.empty() || job.leftForRecovery) return nullptr;
   QRT_CRASH_POINT("replace-before-cleanup");
   QRTErrorRef result;
   QRTErrorRef underlying;
