@@ -1,0 +1,78 @@
+// The process-wide record of each program's code-signing information, and
+// what its entitlements grant: group containers and a system container. All
+// database work runs on one serial queue; the operations that change entries
+// hold the all-identifiers lock around it, taken before entering the queue.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "base/PlistValue.h"
+#include "Daemon/QRTError.h"
+#include "Daemon/codesign/QRTCodeSigningEntry.h"
+#include "platform/Queue.h"
+
+class QRTSQLiteDB;
+
+inline constexpr const char* QRTCodeSigningEntitlementsKey = "com.norvane.QuarterKit.Entitlements";
+inline constexpr const char* QRTCodeSigningDataContainerClassKey = "com.norvane.QuarterKit.DataContainerClass";
+inline constexpr const char* QRTCodeSigningParentBundleIDKey = "com.norvane.QuarterKit.ParentBundleID";
+inline constexpr const char* QRTCodeSigningPlaceholderKey = "com.norvane.QuarterKit.PlaceholderEntitlements";
+inline constexpr const char* QRTCodeSigningRegByCallerKey = "RegByCaller";
+inline constexpr const char* QRTCachedCodeSigningInfoKey = "com.norvane.Emplacer.CachedCodeSigningInfo";
+inline constexpr const char* QRTApplicationGroupsEntitlement = "com.norvane.security.application-groups";
+inline constexpr const char* QRTSystemGroupsEntitlement = "com.norvane.security.system-groups";
+inline constexpr const char* QRTSystemGroupContainersEntitlement = "com.norvane.security.system-group-containers";
+inline constexpr const char* QRTSystemContainerEntitlement = "com.norvane.security.system-container";
+
+using QRTGroupList = std::optional<std::vector<std::string>>;
+
+class QRTCodeSigningMapping {
+ public:
+  // Made on first use; null when the database can't be opened (logged
+  // "Failed to initialize database.").
+  static QRTCodeSigningMapping* sharedInstance();
+
+  // Each returns a code of the daemon's error table (1 = success). A null
+  // dictionary means "no code-signing information", which deletes the entry.
+  uint64_t processCodeSigningInfo(const plist::Dictionary* codeSigningInfo,
+                                  const std::optional<std::string>& forIdentifier,
+                                  const plist::Dictionary* withOptions);
+  uint64_t processCallerRegisteredEntitlements(const plist::Dictionary& entitlements,
+                                               const std::string& forIdentifier);
+  // The external view: placeholder and invalid entries read as none.
+  std::optional<plist::Dictionary> getCodeSigningInfoForIdentifier(const std::optional<std::string>& identifier);
+  uint64_t invalidateCodeSigningInfoForAppsWithoutBundleContainer();
+  void performAllCodeSigningMigrationAndReconciliation();
+  bool invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier, QRTErrorRef* withError);
+  void removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier);
+
+  // The internal view.
+  bool codeSigningInfoExistForIdentifier(const std::string& identifier);
+  bool identifierHasCallerRegisteredEntitlements(const std::string& identifier);
+  bool identifierHasSystemContainer(const std::string& identifier);
+  uint64_t dataContainerTypeForIdentifier(const std::string& identifier);
+  QRTGroupList appGroupIdentifiersForIdentifier(const std::string& identifier);
+  QRTGroupList systemGroupIdentifiersForIdentifier(const std::string& identifier);
+
+  // Must be called on the queue (the group manager's counting runs there).
+  void iterateGroupIdsWithKey(const std::string& key, const std::optional<std::string>& fallBackKey,
+                              const std::function<void(const std::string& identifier, const QRTGroupList& groups)>& block);
+
+  // Counts the writes to the database, so that callers may remember an
+  // answer for as long as nothing was written.
+  uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
+
+ private:
+  explicit QRTCodeSigningMapping(std::unique_ptr<QRTSQLiteDB> db);
+  ~QRTCodeSigningMapping();
+
+  std::shared_ptr<platform::Queue> codeSignQueue;
+  std::unique_ptr<QRTSQLiteDB> codeSigningMappingDB;
+  std::atomic<uint64_t> generation_{0};
+};
