@@ -1,0 +1,161 @@
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+
+#include "base/PlistCodec.h"
+#include "Daemon/codesign/QRTSQLiteDB.h"
+#include "TempDir.h"
+
+namespace {
+
+QRTCodeSigningEntry entryWith(const std::string& marker, std::optional<std::vector<std::string>> children = {}) {
+  QRTCodeSigningEntry entry(plist::Dictionary{{"com.norvane.QuarterKit.Entitlements", plist::Dictionary{{"m", marker}}}});
+  entry.childBundleIdentifiers = std::move(children);
+  return entry;
+}
+
+class CodeSigningDBTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    db = QRTSQLiteDB::initWithParentDirectoryURL(QRTURL::fileURL(dir.path(), true));
+    ASSERT_TRUE(db);
+  }
+  // Reads the file through a second connection, after the daemon's is closed.
+  int64_t count(const std::string& sql) {
+    db.reset();
+    sqlite3* raw = nullptr;
+    sqlite3_open((dir / "containers.sqlite3").c_str(), &raw);
+    sqlite3_stmt* st = nullptr;
+    sqlite3_prepare_v2(raw, sql.c_str(), -1, &st, nullptr);
+    int64_t n = sqlite3_step(st) == SQLITE_ROW ? sqlite3_column_int64(st, 0) : -1;
+    sqlite3_finalize(st);
+    sqlite3_close(raw);
+    return n;
+  }
+  bool add(const std::string& id, const QRTCodeSigningEntry& entry) {
+    return db->addCodeSigningEntry(&entry, id, nullptr);
+  }
+  std::optional<QRTCodeSigningEntry> get(const std::string& id, int32_t* code = nullptr) {
+    QRTErrorRef error;
+    auto entry = db->codeSigningEntryWithIdentifier(id, &error);
+    if (code) *code = error ? error->code() : 1;
+    return entry;
+  }
+
+  TempDir dir;
+  std::unique_ptr<QRTSQLiteDB> db;
+};
+
+TEST_F(CodeSigningDBTest, AddKeepsRowIdReplacesDataAndNeverDropsChildren) {
+  ASSERT_TRUE(add("parent", entryWith("one", std::vector<std::string>{"a", "b"})));
+  ASSERT_TRUE(add("other", entryWith("x", std::vector<std::string>{"c"})));
+  // Again with new data, child "b" no longer listed and "c" taken from "other".
+  QRTCodeSigningEntry second = entryWith("two", std::vector<std::string>{"a", "c"});
+  second.invalid = true;
+  second.dataContainerClass = 4;
+  ASSERT_TRUE(add("parent", second));
+  auto stored = get("parent");
+  ASSERT_TRUE(stored);
+  EXPECT_EQ(stored->codeSigningInfo, second.codeSigningInfo);
+  EXPECT_TRUE(stored->invalid);
+  EXPECT_EQ(stored->dataContainerClass, 4u);
+  std::vector<std::string> children = *stored->childBundleIdentifiers;
+  std::sort(children.begin(), children.end());
+  EXPECT_EQ(children, (std::vector<std::string>{"a", "b", "c"}));
+  int32_t code = 0;
+  EXPECT_FALSE(get("other")->childBundleIdentifiers);
+  EXPECT_FALSE(get("a", &code));  // a child without an entry of its own
+  EXPECT_EQ(code, QRTErrorNotInDatabase);
+  EXPECT_EQ(count("SELECT id FROM code_signing_info WHERE code_signing_id_text='parent'"), 1);
+  EXPECT_EQ(count("SELECT count(*) FROM code_signing_data"), 2);
+}
+
+TEST_F(CodeSigningDBTest, DeleteCascadesAndCountsRows) {
+  ASSERT_TRUE(add("parent", entryWith("one", std::vector<std::string>{"a", "b"})));
+  QRTErrorRef error;
+  EXPECT_FALSE(db->deleteCodeSigningEntryWithIdentifier("unknown", &error));
+  EXPECT_EQ(error->code(), QRTErrorDatabase);
+  EXPECT_EQ(error->underlying()->code(), QRTErrorUnexpectedChangeCount);
+  EXPECT_FALSE(db->deleteCodeSigningEntryWithIdentifier(std::nullopt, &error));
+  EXPECT_EQ(error->code(), QRTErrorInvalidArgument);
+  EXPECT_TRUE(db->deleteCodeSigningEntryWithIdentifier("parent", nullptr));
+  EXPECT_EQ(count("SELECT (SELECT count(*) FROM code_signing_info) + (SELECT count(*) FROM code_signing_data) + "
+                  "(SELECT count(*) FROM child_bundles)"), 0);
+}
+
+TEST_F(CodeSigningDBTest, InvalidateMarksParentAndChildrenAndToleratesUnknown) {
+  ASSERT_TRUE(add("parent", entryWith("p", std::vector<std::string>{"kid"})));
+  ASSERT_TRUE(add("kid", entryWith("k")));
+  ASSERT_TRUE(add("alone", entryWith("a")));
+  EXPECT_TRUE(db->invalidateCodeSigningWithIdentifier("unknown", nullptr));
+  EXPECT_TRUE(db->invalidateCodeSigningForIdentifierAndAllChildren("parent", nullptr));
+  EXPECT_TRUE(db->invalidateCodeSigningForIdentifierAndAllChildren("alone", nullptr));
+  for (const char* id : {"parent", "kid", "alone"}) EXPECT_TRUE(get(id)->invalid) << id;
+}
+
+TEST_F(CodeSigningDBTest, UndecodableRowsFailLookupAndVanishFromEnumeration) {
+  ASSERT_TRUE(add("good", entryWith("g")));
+  ASSERT_TRUE(add("array", entryWith("a")));
+  ASSERT_TRUE(add("garbage", entryWith("x")));
+  ASSERT_TRUE(add("nodata", entryWith("n")));
+  db.reset();
+  sqlite3* raw = nullptr;
+  sqlite3_open((dir / "containers.sqlite3").c_str(), &raw);
+  const plist::Data array = plist::writeBinary(plist::Array{"not", "a", "dictionary"});
+  sqlite3_stmt* st = nullptr;
+  sqlite3_prepare_v2(raw, "UPDATE code_signing_data SET data=? WHERE cs_info_id=(SELECT id FROM code_signing_info "
+                          "WHERE code_signing_id_text='array')", -1, &st, nullptr);
+  sqlite3_bind_blob(st, 1, array.data(), static_cast<int>(array.size()), SQLITE_TRANSIENT);
+  sqlite3_step(st);
+  sqlite3_finalize(st);
+  sqlite3_exec(raw, "UPDATE code_signing_data SET data=x'00ff' WHERE cs_info_id=(SELECT id FROM code_signing_info "
+                    "WHERE code_signing_id_text='garbage'); DELETE FROM code_signing_data WHERE cs_info_id=(SELECT id "
+                    "FROM code_signing_info WHERE code_signing_id_text='nodata');", nullptr, nullptr, nullptr);
+  sqlite3_close(raw);
+  db = QRTSQLiteDB::initWithParentDirectoryURL(QRTURL::fileURL(dir.path(), true));
+  ASSERT_TRUE(db);
+  for (auto [id, code] : std::vector<std::pair<const char*, int32_t>>{
+           {"array", QRTErrorDatabase}, {"garbage", QRTErrorDatabase}, {"nodata", QRTErrorNotInDatabase}}) {
+    int32_t got = 0;
+    EXPECT_FALSE(get(id, &got)) << id;
+    EXPECT_EQ(got, code) << id;
+  }
+  std::vector<std::string> seen;
+  EXPECT_FALSE(db->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+      [&](const std::string& id, const QRTCodeSigningEntry&) { seen.push_back(id); }));
+  EXPECT_EQ(seen, std::vector<std::string>{"good"});
+}
+
+TEST_F(CodeSigningDBTest, SecondConnectionIsLockedOutWhileOpen) {
+  ASSERT_TRUE(add("x", entryWith("x")));
+  sqlite3* raw = nullptr;
+  ASSERT_EQ(sqlite3_open((dir / "containers.sqlite3").c_str(), &raw), SQLITE_OK);
+  const int rc = sqlite3_exec(raw, "SELECT count(*) FROM code_signing_info;", nullptr, nullptr, nullptr);
+  sqlite3_close(raw);
+  EXPECT_EQ(rc, SQLITE_BUSY);
+  // Reopening keeps what was written.
+  db.reset();
+  db = QRTSQLiteDB::initWithParentDirectoryURL(QRTURL::fileURL(dir.path(), true));
+  ASSERT_TRUE(db && get("x"));
+}
+
+TEST(CodeSigningEntryTest, EqualityHashAndDictionaryForm) {
+  QRTCodeSigningEntry a = entryWith("m", std::vector<std::string>{"x", "y"});
+  QRTCodeSigningEntry reordered = entryWith("m", std::vector<std::string>{"y", "x"});
+  EXPECT_FALSE(a == reordered);
+  QRTCodeSigningEntry small = entryWith("m"), wide = entryWith("m");
+  small.dataContainerClass = 5;
+  wide.dataContainerClass = 5 + (1ull << 32);
+  EXPECT_FALSE(small == wide);
+  EXPECT_EQ(small.hash(), wide.hash());
+  EXPECT_EQ(QRTCodeSigningEntry::fromSerializedDictionary(a.serialize()), a);
+  EXPECT_EQ(QRTCodeSigningEntry::fromSerializedDictionary(wide.serialize()), wide);
+  const QRTCodeSigningEntry bare = QRTCodeSigningEntry::fromSerializedDictionary({{"CodeSigningInfo", plist::Dictionary{}}});
+  EXPECT_EQ(bare, QRTCodeSigningEntry(plist::Dictionary{}));
+  QRTCodeSigningEntry flagged = entryWith("m");
+  flagged.invalid = flagged.registeredByCaller = true;
+  flagged.dataContainerClass = 2;
+  EXPECT_NE(flagged.description().find("invalid: Y, placeholder: N, regByCaller: Y, dataClass: 2,"), std::string::npos)
+      << flagged.description();
+}
+
+}  // namespace
