@@ -72,6 +72,47 @@ class QRTCodeSigningMapping {
   explicit QRTCodeSigningMapping(std::unique_ptr<QRTSQLiteDB> db);
   ~QRTCodeSigningMapping();
 
+  // Runs body on the queue and returns its value.
+  template <typename F>
+  auto onQueue(F&& body) -> decltype(body());
+
+  uint64_t _onQueue_processCodeSigningInfo(const plist::Dictionary* codeSigningInfo,
+                                           const std::optional<std::string>& forIdentifier,
+                                           const plist::Dictionary* withOptions);
+  std::optional<plist::Dictionary> _onQueue_codeSigningInfoForIdentifier(const std::string& identifier,
+                                                                         bool externalRequest);
+  std::optional<plist::Dictionary> _onQueue_codeSigningInfoForCodeSigningEntry(
+      const std::optional<QRTCodeSigningEntry>& entry, const std::string& identifier, bool externalRequest);
+  std::optional<plist::Value> _onQueue_entitlementsForIdentifier(const std::string& identifier);
+  std::optional<plist::Value> _onQueue_entitlementsCodeSigningEntry(const std::optional<QRTCodeSigningEntry>& entry,
+                                                                   const std::string& identifier);
+  bool _onQueue_codeSigningInfoExistForIdentifier(const std::string& identifier);
+  bool _onQueue_identifierHasCallerRegisteredEntitlements(const std::string& identifier);
+  bool _onQueue_identifierHasSystemContainer(const std::string& identifier);
+  uint64_t _onQueue_dataContainerTypeForIdentifier(const std::string& identifier);
+  QRTGroupList _onQueue_appGroupIdentifiersForIdentifier(const std::string& identifier);
+  QRTGroupList _onQueue_systemGroupIdentifiersForIdentifier(const std::string& identifier);
+  uint64_t _onQueue_invalidateCodeSigningInfoForAppsWithoutBundleContainer();
+  bool _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
+                                                                     QRTErrorRef* error);
+  void _onQueue_removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier);
+
+  // The stored entry; no entry and no error when there is none (67).
+  std::optional<QRTCodeSigningEntry> _onQueue_storedEntry(const std::string& identifier, QRTErrorRef* error);
+  // Parallel arrays; an entry without a code-signing dictionary deletes.
+  QRTErrorRef _setCodeSigningDictionaryValues(const std::vector<QRTCodeSigningEntry>& values,
+                                              const std::vector<std::string>& forIdentifiers);
+  void _onQueue_deleteSystemContainerIfWithdrawn(const std::optional<plist::Value>& oldEntitlements,
+                                                 const std::optional<plist::Value>& newEntitlements,
+                                                 const std::string& identifier);
+  static QRTGroupList _copyApplicationGroupEntitlementForIdentifier(const std::string& identifier,
+                                                                    const std::optional<plist::Value>& entitlements,
+                                                                    const std::string& groupKey);
+  // The system-groups list, or the fall-back key's when that is none or empty.
+  static QRTGroupList _systemGroupList(const std::string& identifier, const std::optional<plist::Value>& entitlements);
+  // Drops, with a log line, every identifier without the "systemgroup." prefix.
+  static QRTGroupList _withSystemGroupPrefix(QRTGroupList groups);
+
   std::shared_ptr<platform::Queue> codeSignQueue;
   std::unique_ptr<QRTSQLiteDB> codeSigningMappingDB;
   std::atomic<uint64_t> generation_{0};

@@ -35,5 +35,16 @@ class QRTGroupManager {
                                                                           uint64_t* withError);
 
  private:
+  // Group identifier to the number of stored programs naming it.
+  using ReferenceCounts = std::map<std::string, int64_t>;
+
   QRTGroupManager() = default;
+  std::optional<ReferenceCounts> _copyReferenceCountSetOfType(QRTGroupType type);
+  void _removeReferenceForGroupIdentifiers(const std::vector<std::string>& removed, QRTGroupType ofType);
+  // Works on its own copy of the counts.
+  void _removeGroupContainersIfNeededforUser(uint32_t user, uint64_t groupContainerClass,
+                                             const std::vector<std::string>& identifiers,
+                                             ReferenceCounts referenceCounts);
+  void _cleanupUnreferencedGroupContainersForUser(uint32_t user, uint64_t containerClass,
+                                                  const ReferenceCounts& referenceCounts);
 };
