@@ -1,5 +1,10 @@
 #include "Daemon/requests/QRTRequestDispatcher.h"
 
+#include <mutex>
+#include <unordered_map>
+
+#include "Daemon/codesign/QRTCodeSigningMapping.h"
+#include "Daemon/requests/QRTCodeSigningCommands.h"
 #include "Daemon/requests/QRTContainerCommands.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTError.h"
@@ -50,14 +55,15 @@ const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
     SERVED(10, "deleteContainer", QRTHandleDeleteContainer, QRTEntitlementAllowed, 1),
     SERVED(11, "wipeAddonDataContainer", QRTHandleWipeAddonDataContainer, QRTEntitlementWipeContainer, 1),
     SERVED(12, "deleteDataContainerContent", QRTHandleDeleteDataContainerContent, QRTEntitlementAllowed, 1),
-    ROW(13, "groupContainerPaths", QRTEntitlementNone, 1),
-    ROW(14, "groupContainerIdentifiers", QRTEntitlementAllowed, 1),
+    SERVED(13, "groupContainerPaths", QRTHandleGroupContainerPaths, QRTEntitlementNone, 1),
+    SERVED(14, "groupContainerIdentifiers", QRTHandleGroupContainerIdentifiers, QRTEntitlementAllowed, 1),
     SERVED(15, "systemContainerPath", QRTHandleSystemContainerPath, QRTEntitlementNone, 1),
-    ROW(16, "systemGroupContainerPaths", QRTEntitlementNone, 1),
-    ROW(17, "systemGroupContainerPath", QRTEntitlementNone, 1),
-    ROW(18, "processCodeSigningInfo", QRTEntitlementAllowed, 1),
-    ROW(19, "codeSigningInfoForIdentifier", QRTEntitlementAllowed, 1),
-    ROW(20, "invalidateCodeSigningInfoForAppsWithoutBundleContainer", QRTEntitlementAllowed, 1),
+    SERVED(16, "systemGroupContainerPaths", QRTHandleSystemGroupContainerPaths, QRTEntitlementNone, 1),
+    SERVED(17, "systemGroupContainerPath", QRTHandleSystemGroupContainerPath, QRTEntitlementNone, 1),
+    SERVED(18, "processCodeSigningInfo", QRTHandleProcessCodeSigningInfo, QRTEntitlementAllowed, 1),
+    SERVED(19, "codeSigningInfoForIdentifier", QRTHandleCodeSigningInfoForIdentifier, QRTEntitlementAllowed, 1),
+    SERVED(20, "invalidateCodeSigningInfoForAppsWithoutBundleContainer",
+           QRTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, QRTEntitlementAllowed, 1),
     ROW(21, "setDataProtection", QRTEntitlementAllowed, 0),
     SERVED(22, "recreateContainerStructure", QRTHandleRecreateDefaultStructure, QRTEntitlementAllowed, 1),
     SERVED(23, "diskUsage", QRTHandleDiskUsage, QRTEntitlementAllowed, 1),
@@ -106,6 +112,50 @@ bool entitlementTrue(const plist::Dictionary& entitlements, const char* name) {
   const plist::Value* v = plist::find(entitlements, name);
   const bool* b = v ? v->booleanIf() : nullptr;
   return b && *b;
+}
+
+// Registration runs on every request of an entitled caller; its answer stays
+// the same while neither the caller's identity nor the database changes.
+struct RegistrationMemo {
+  std::shared_ptr<const platform::CodeIdentity> identity;
+  uint64_t generation = 0;
+};
+std::mutex gRegistrationMemoLock;
+std::unordered_map<std::string, RegistrationMemo>& registrationMemo() {
+  static auto* memo = new std::unordered_map<std::string, RegistrationMemo>();
+  return *memo;
+}
+// Signing identifiers come from the identity registry, but the memo is
+// dropped whole rather than grow without bound.
+constexpr size_t kRegistrationMemoLimit = 4096;
+
+void registerCallerEntitlements(const std::shared_ptr<const platform::CodeIdentity>& caller) {
+  QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
+  if (!mapping || !caller->signingIdentifier || !caller->entitlements) return;
+  const std::string& identifier = *caller->signingIdentifier;
+  {
+    std::lock_guard<std::mutex> hold(gRegistrationMemoLock);
+    auto it = registrationMemo().find(identifier);
+    if (it != registrationMemo().end() && it->second.identity == caller &&
+        it->second.generation == mapping->generation()) {
+      return;
+    }
+  }
+  // Read before the look-ups: a write that lands while they run makes the
+  // next request look again.
+  const uint64_t generation = mapping->generation();
+  if (mapping->identifierHasCallerRegisteredEntitlements(identifier) ||
+      !mapping->codeSigningInfoExistForIdentifier(identifier)) {
+    uint64_t code = mapping->processCallerRegisteredEntitlements(*caller->entitlements, identifier);
+    if (code != QRTErrorNone) {
+      QRTLogAs(kLogError, "checkEntitlementsAndInitClientObject", "Error processing entitlements for %@ : %llu",
+               identifier, static_cast<unsigned long long>(code));
+      return;
+    }
+  }
+  std::lock_guard<std::mutex> hold(gRegistrationMemoLock);
+  if (registrationMemo().size() >= kRegistrationMemoLimit) registrationMemo().clear();
+  registrationMemo()[identifier] = RegistrationMemo{caller, generation};
 }
 
 std::optional<std::vector<std::string>> stringArray(const plist::Value& value) {
@@ -157,8 +207,7 @@ std::optional<QRTClientConnection> checkEntitlementsAndInitClientObject(const pl
   } else if (!requiresNone && !allowed && !entitlementTrue(entitlements, entitlement)) {
     return refuse();
   }
-  // Registration of caller-held entitlements with the code-signing mapping
-  // joins here once that service exists.
+  registerCallerEntitlements(caller);
   return QRTClientConnection(identity.signingIdentifier, userId, otherIdLookup, std::move(wipeIdentifiers));
 }
 

@@ -1,0 +1,149 @@
+#include "Daemon/requests/QRTCodeSigningCommands.h"
+
+#include <algorithm>
+
+#include "Daemon/codesign/QRTCodeSigningMapping.h"
+#include "Daemon/groups/QRTGroupManager.h"
+#include "Daemon/store/QRTContentClass.h"
+#include "Daemon/store/QRTMetadata.h"
+#include "Daemon/store/QRTWhitelist.h"
+#include "platform/Log.h"
+
+using platform::kLogError;
+
+namespace {
+
+constexpr const char* kQuietSystemGroup = "systemgroup.com.norvane.sharedpclogging";
+
+// The service, or nothing with result 66 when its database could not be opened.
+QRTCodeSigningMapping* mappingOr66(uint64_t* result) {
+  QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
+  if (!mapping) *result = QRTErrorDatabase;
+  return mapping;
+}
+
+plist::Dictionary pathDictionary(const std::map<std::string, std::string>& paths) {
+  plist::Dictionary dictionary;
+  for (const auto& [group, path] : paths) dictionary.emplace(group, path);
+  return dictionary;
+}
+
+void replyGroupPaths(uint32_t userId, const plist::Dictionary& request, const QRTReplyRef& reply,
+                     QRTClientConnection& client, uint64_t* result) {
+  auto paths = QRTGroupManager::defaultManager().groupContainerPathsForUser(
+      userId, client, QRTMessageIdentifier(request, client.clientBundleIdentifier()), result);
+  if (paths) reply->dictionary["ReplyGroupContainerDict"] = pathDictionary(*paths);
+}
+
+// A key that is present must hold a dictionary: a mistyped info read as
+// "none" would delete the program's entry.
+bool dictionaryOrAbsent(const plist::Dictionary& request, const char* key, const plist::Dictionary** out) {
+  const plist::Value* value = QRTMessageObject(request, key);
+  *out = value ? value->dictionaryIf() : nullptr;
+  if (!value || *out) return true;
+  QRTLog(kLogError, "%s of %@ is not a dictionary; nothing changed", key, QRTMessageString(request, "Identifier"));
+  return false;
+}
+
+}  // namespace
+
+void QRTHandleGroupContainerPaths(const plist::Dictionary& request, const QRTReplyRef& reply,
+                                  QRTClientConnection& client, uint64_t* result) {
+  uint32_t userId = 0;
+  auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));
+  if (!validateUserId(requested, QRTClassAppGroup, client.clientUserId(), &userId, result)) return;
+  if (!mappingOr66(result)) return;
+  replyGroupPaths(userId, request, reply, client, result);
+}
+
+void QRTHandleGroupContainerIdentifiers(const plist::Dictionary& request, const QRTReplyRef& reply,
+                                        QRTClientConnection& client, uint64_t* result) {
+  uint32_t userId = 0;
+  auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));
+  if (!validateUserId(requested, QRTClassAppGroup, client.clientUserId(), &userId, result)) return;
+  if (!mappingOr66(result)) return;
+  auto identifiers = QRTGroupManager::defaultManager().groupContainerIdentifiersForUser(
+      userId, QRTMessageIdentifier(request, client.clientBundleIdentifier()), result);
+  if (identifiers) reply->dictionary["ReplyGroupIdentifiersArray"] = plist::Array(identifiers->begin(), identifiers->end());
+}
+
+void QRTHandleSystemGroupContainerPaths(const plist::Dictionary& request, const QRTReplyRef& reply,
+                                        QRTClientConnection& client, uint64_t* result) {
+  if (!mappingOr66(result)) return;
+  replyGroupPaths(QRTSystemContainerUserId, request, reply, client, result);
+}
+
+void QRTHandleSystemGroupContainerPath(const plist::Dictionary& request, const QRTReplyRef& reply,
+                                       QRTClientConnection& client, uint64_t* result) {
+  QRTCodeSigningMapping* mapping = mappingOr66(result);
+  if (!mapping) return;
+  const std::optional<std::string>& caller = client.clientBundleIdentifier();
+  const std::optional<std::string> identifier = QRTMessageIdentifier(request, caller);
+  const std::optional<std::string> group = QRTMessageString(request, "GroupIdentifier");
+  // Entitlement is judged by the caller's own identifier, whatever it names.
+  const QRTGroupList entitled = caller ? mapping->systemGroupIdentifiersForIdentifier(*caller) : std::nullopt;
+  std::optional<std::string> path;
+  if (group && entitled && std::find(entitled->begin(), entitled->end(), *group) != entitled->end()) {
+    auto paths = QRTGroupManager::defaultManager().groupContainerPathsForUser(QRTSystemContainerUserId, client,
+                                                                              identifier, result);
+    if (paths) {
+      if (auto it = paths->find(*group); it != paths->end()) path = it->second;
+    }
+  } else if ((group && QRTWhitelist::sharedWhitelist().systemGroupContainerIdIsWellknown(*group)) ||
+             client.allowGroupIdLookup()) {
+    client.setAllowGroupIdLookup(true);
+    auto metadata = client.createOrLookupContainerForUser(QRTSystemContainerUserId, group, true, QRTClassSystemGroup,
+                                                          false, true, result);
+    if (metadata) path = metadata->url().path();
+  } else {
+    if (group != kQuietSystemGroup) {
+      plist::Array list;
+      if (entitled) list.assign(entitled->begin(), entitled->end());
+      QRTLog(kLogError, "%@ is not entitled for system group identifier: %@.  Only entitled for: %@", caller, group,
+             plist::Value(std::move(list)));
+    }
+    *result = QRTErrorNotEntitled;
+    return;
+  }
+  if (!path) {
+    QRTLog(kLogError, "Did not find system group container with identifier: %@ for %@", group, identifier);
+    *result = QRTErrorNotFound;
+    return;
+  }
+  reply->dictionary["ReplyPath"] = *path;
+}
+
+void QRTHandleProcessCodeSigningInfo(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection&,
+                                     uint64_t* result) {
+  QRTCodeSigningMapping* mapping = mappingOr66(result);
+  if (!mapping) return;
+  const plist::Dictionary* info = nullptr;
+  const plist::Dictionary* options = nullptr;
+  if (!dictionaryOrAbsent(request, "CodeSigningInfo", &info) ||
+      !dictionaryOrAbsent(request, "OptionsDictionary", &options)) {
+    *result = QRTErrorInvalidArgument;
+    return;
+  }
+  uint64_t code = mapping->processCodeSigningInfo(info, QRTMessageString(request, "Identifier"), options);
+  if (code != QRTErrorNone) *result = code;
+}
+
+void QRTHandleCodeSigningInfoForIdentifier(const plist::Dictionary& request, const QRTReplyRef& reply,
+                                           QRTClientConnection&, uint64_t* result) {
+  QRTCodeSigningMapping* mapping = mappingOr66(result);
+  if (!mapping) return;
+  std::optional<plist::Dictionary> info = mapping->getCodeSigningInfoForIdentifier(QRTMessageString(request, "Identifier"));
+  if (!info) {
+    *result = QRTErrorNotFound;
+    return;
+  }
+  reply->dictionary["ReplyInfoDictionary"] = std::move(*info);
+}
+
+void QRTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer(const plist::Dictionary&, const QRTReplyRef&,
+                                                                     QRTClientConnection&, uint64_t* result) {
+  QRTCodeSigningMapping* mapping = mappingOr66(result);
+  if (!mapping) return;
+  uint64_t code = mapping->invalidateCodeSigningInfoForAppsWithoutBundleContainer();
+  if (code != QRTErrorNone) *result = code;
+}
