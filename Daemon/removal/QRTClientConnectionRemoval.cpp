@@ -8,6 +8,7 @@
 #include <iterator>
 
 #include "base/QRTUUID.h"
+#include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTCrashPoint.h"
@@ -147,8 +148,12 @@ void QRTClientConnection::stageForDeleteContainersWithUsers(const std::vector<ui
       if (!metadata) continue;
       QRTURL target = QRTGlobalConfiguration::sharedInstance().deathrowDirectory().URLByAppendingPathComponent(
           metadata->url().lastPathComponent(), true);
-      // Code-signing information of bundles is dropped here once the
-      // code-signing mapping exists.
+      // Dropped whether or not the move succeeds: a bundle on its way out grants nothing.
+      if (QRTIsBundleClass(containerClass)) {
+        if (QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance()) {
+          mapping->removeCodeSigningDictionariesForIdentifierAndItsChildren(*identifiers[i]);
+        }
+      }
       QRTErrorRef moveError;
       if (!files.moveItemAtURL(metadata->url(), target, &moveError)) {
         QRTLog(platform::kLogDebug, "Couldn't stage for deletion from %@ to %@: %@", metadata->url(), target, moveError);

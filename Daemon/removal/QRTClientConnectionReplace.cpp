@@ -6,6 +6,7 @@
 #include <iterator>
 
 #include "base/QRTUUID.h"
+#include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTCrashPoint.h"
@@ -280,7 +281,14 @@ QRTErrorRef swapContainers(ReplaceJob& job, bool* restore) {
     }
     job.oldLeftCache = true;
     QRT_CRASH_POINT("replace-after-cache-remove");
-    // Bundle classes drop the old identifier's code-signing information here, once the mapping service exists.
+    if (QRTIsBundleClass(job.classOld)) {
+      QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
+      if (mapping && !mapping->invalidateCodeSigningInfoForIdentifierAndItsChildren(job.oldContainer->identifier(),
+                                                                                           &underlying)) {
+        QRTLogAs(kLogError, kReplace, "Failed to invalidate code signing info for %@", job.identifierOld);
+        return underlying;
+      }
+    }
   }
   if (!files.moveItemAtURL(job.newURL, job.destination, &underlying)) {
     return QRT_ERROR_AS(kReplace, QRTErrorReplaceFailed, underlying, "Failed to replace: %@ with: %@ at: %@",

@@ -7,6 +7,7 @@
 #include <iterator>
 
 #include "base/QRTUUID.h"
+#include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTCrashPoint.h"
@@ -42,9 +43,11 @@ QRTClientConnection& QRTClientConnection::sharedClientConnection() {
 // transient and orphan clean-up) joins with those subsystems.
 namespace {
 
-// The code-signing mapping will say which programs hold a system container;
-// until it exists no program is known to hold one.
-bool codeSigningGrantsSystemContainer(const std::string&) { return false; }
+// Without its database no program is known to hold a system container.
+bool codeSigningGrantsSystemContainer(const std::string& identifier) {
+  QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
+  return mapping && mapping->identifierHasSystemContainer(identifier);
+}
 
 constexpr const char* kDataSubDirectories[] = {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"};
 constexpr const char* kGroupSubDirectories[] = {"Library", "Library/Caches"};
