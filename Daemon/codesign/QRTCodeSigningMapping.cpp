@@ -365,10 +365,13 @@ uint64_t QRTCodeSigningMapping::_onQueue_processCodeSigningInfo(const plist::Dic
           return;
         }
         children.push_back(identifier);
-        if (!parentEntry) parentEntry.emplace();
-        parentEntry->childBundleIdentifiers = children;
         QRTLog(kLogDebug, "Staging Child Bundles: %@ for parent ID: %@ by appending: %@", listValue(children), *parent,
                identifier);
+        // Adding keeps the children already stored, so the write names only
+        // the new one: rewriting the whole list made each registration cost
+        // as much as the family is large.
+        if (!parentEntry) parentEntry.emplace();
+        parentEntry->childBundleIdentifiers = std::vector<std::string>{identifier};
         values.push_back(std::move(*parentEntry));
         identifiers.push_back(*parent);
       }
