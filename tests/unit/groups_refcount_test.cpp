@@ -1,0 +1,111 @@
+// Group container reference counting against the real mapping and store: a
+// group's container goes exactly when the last program naming it drops it.
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <map>
+#include <optional>
+#include <random>
+#include <set>
+
+#include "Daemon/codesign/QRTCodeSigningMapping.h"
+#include "Daemon/groups/QRTGroupManager.h"
+#include "Daemon/store/QRTClientConnection.h"
+#include "Daemon/store/QRTContainerCache.h"
+#include "Daemon/store/QRTMetadata.h"
+#include "TempDir.h"
+#include "platform/DeviceRoot.h"
+
+namespace {
+
+std::optional<TempDir> gTmp;
+
+class GroupRefcountTest : public ::testing::Test {
+ protected:
+  static void SetUpTestSuite() {
+    const std::string root = gTmp.emplace("/tmp/qrt-groups").path();
+    std::string script = std::string(QRT_TEST_SOURCE_DIR) + "/../scripts/make-device-root";
+    ASSERT_EQ(system((script + " " + root).c_str()), 0);
+    platform::setDeviceRoot(root);
+    ASSERT_NE(QRTCodeSigningMapping::sharedInstance(), nullptr);
+  }
+  static void TearDownTestSuite() { gTmp.reset(); }
+
+  static uint64_t registerGroups(const std::string& program, const std::vector<std::string>& groups) {
+    plist::Dictionary info{{QRTCodeSigningEntitlementsKey,
+                            plist::Dictionary{{QRTApplicationGroupsEntitlement, plist::Array(groups.begin(), groups.end())}}}};
+    return mapping().processCodeSigningInfo(&info, program, nullptr);
+  }
+  static uint64_t drop(const std::string& program) { return mapping().processCodeSigningInfo(nullptr, program, nullptr); }
+  static QRTCodeSigningMapping& mapping() { return *QRTCodeSigningMapping::sharedInstance(); }
+
+  // Makes the program's group containers the way command 13 does.
+  static std::map<std::string, std::string> paths(const std::string& program) {
+    QRTClientConnection client(program, 0, false, std::nullopt);
+    uint64_t code = 1;
+    auto found = QRTGroupManager::defaultManager().groupContainerPathsForUser(501, client, program, &code);
+    EXPECT_EQ(code, 1u);
+    return found ? *found : std::map<std::string, std::string>{};
+  }
+  static bool present(const std::string& group) {
+    QRTErrorRef error;
+    return QRTContainerCache::sharedInstance().containerForUser(501, 7, group, false, &error) != nullptr;
+  }
+};
+
+TEST_F(GroupRefcountTest, ContainerGoesWithTheLastProgramNamingIt) {
+  std::mt19937 random(20261123);
+  std::map<std::string, std::vector<std::string>> named;
+  for (int p = 0; p < 50; ++p) {
+    std::vector<std::string> groups;
+    for (int g = 0; g < 10; ++g) {
+      if (random() % 3 == 0) groups.push_back("group.shared." + std::to_string(g));
+    }
+    const std::string program = "com.example.member." + std::to_string(p);
+    named[program] = groups;
+    ASSERT_EQ(registerGroups(program, groups), 1u);
+    EXPECT_EQ(paths(program).size(), groups.size()) << program;
+  }
+  std::vector<std::string> order;
+  for (const auto& [program, groups] : named) order.push_back(program);
+  std::shuffle(order.begin(), order.end(), random);
+  for (const std::string& program : order) {
+    const uint64_t before = mapping().generation();
+    ASSERT_EQ(drop(program), 1u);
+    EXPECT_GT(mapping().generation(), before);
+    named.erase(program);
+    std::set<std::string> stillNamed;
+    for (const auto& [remaining, groups] : named) stillNamed.insert(groups.begin(), groups.end());
+    for (int g = 0; g < 10; ++g) {
+      const std::string group = "group.shared." + std::to_string(g);
+      EXPECT_EQ(present(group), stillNamed.count(group) == 1) << group << " after dropping " << program;
+    }
+  }
+}
+
+TEST_F(GroupRefcountTest, ReorderingOrRepeatingChangesNothing) {
+  ASSERT_EQ(registerGroups("com.example.order", {"group.order.a", "group.order.b"}), 1u);
+  ASSERT_EQ(paths("com.example.order").size(), 2u);
+  const uint64_t before = mapping().generation();
+  ASSERT_EQ(registerGroups("com.example.order", {"group.order.a", "group.order.b"}), 1u);
+  EXPECT_EQ(mapping().generation(), before);  // the same registration writes nothing
+  ASSERT_EQ(registerGroups("com.example.order", {"group.order.b", "group.order.a", "group.order.b"}), 1u);
+  QRTGroupManager::defaultManager().handleChangeFromOldGroupContainerIds(
+      std::vector<std::string>{"group.order.a", "group.order.b"},
+      std::vector<std::string>{"group.order.b", "group.order.a"}, QRTGroupTypeApplication);
+  EXPECT_TRUE(present("group.order.a"));
+  EXPECT_TRUE(present("group.order.b"));
+}
+
+TEST_F(GroupRefcountTest, ReconcileRemovesOnlyUnnamedGroups) {
+  uint64_t code = 1;
+  ASSERT_TRUE(QRTClientConnection::sharedClientConnection().createOrLookupContainerForUser(
+      501, std::string("group.nobody"), true, 7, false, true, &code));
+  ASSERT_EQ(registerGroups("com.example.keeper", {"group.kept"}), 1u);
+  ASSERT_EQ(paths("com.example.keeper").size(), 1u);
+  mapping().performAllCodeSigningMigrationAndReconciliation();
+  EXPECT_FALSE(present("group.nobody"));
+  EXPECT_TRUE(present("group.kept"));
+}
+
+}  // namespace
