@@ -31,7 +31,10 @@ TEST_F(DispatcherTest, EntitlementsOpenTheCommandTable) {
   for (bool allowed : {false, true}) {
     if (allowed) setOwnIdentity("com.example.installer", {{kAllowed, true}});
     for (uint64_t command = 0; command < 30; ++command) {
-      uint64_t code = replyError(request(command));
+      // Command 17 itself refuses (55) a group the caller may not reach; a well-known one it may.
+      plist::Dictionary keys;
+      if (command == 17) keys = {{"GroupIdentifier", "systemgroup.com.norvane.policysets"}};
+      uint64_t code = replyError(request(command, keys));
       EXPECT_NE(code, 0u) << command;
       EXPECT_EQ(code == kNotEntitled, !allowed && !isNoneCommand(command)) << command << ": " << code;
     }
