@@ -6,6 +6,9 @@
 
 #include <cerrno>
 #include <cstring>
+#include <memory>
+#include <string>
+#include <vector>
 
 #include "Daemon/QRTCrashPoint.h"
 #include "Daemon/QRTDaemon.h"
@@ -15,6 +18,7 @@
 #include "Daemon/store/QRTLocks.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
+#include "platform/SafePath.h"
 
 using platform::kLogDebug;
 using platform::kLogError;
@@ -52,100 +56,213 @@ QRTClientConnection& internalClient() { return QRTClientConnection::sharedClient
 
 // ---- the walk -----------------------------------------------------------
 
-struct TreeChange {
-  int32_t newClass;
-  uint32_t changeType;
-  dev_t device = 0;
-  bool locked = false;
-  size_t changed = 0;
+// A physical walk on the root's file system through descriptors: each item is
+// opened relative to its parent's descriptor without following a link,
+// checked with fstat, and read and changed only through that descriptor.
+// Entry types come from the directory listing, so an item costs one open,
+// one fstat, one class read and, when it changes, one class write.
+// Directories are changed after their contents. At most kOpenWindow
+// ancestors stay open; a closed one is reopened through ".." and checked.
+class ProtectionWalk {
+ public:
+  ProtectionWalk(const QRTURL& root, int32_t newClass, uint32_t changeType)
+      : root_(root), newClass_(newClass), changeType_(changeType) {}
+  // False with *error when the walk stopped; locked() when the file system
+  // refused a change because the device is locked.
+  bool run(QRTErrorRef* error);
+  bool locked() const { return locked_; }
+
+ private:
+  static constexpr size_t kOpenWindow = 64;
+  struct Child {
+    std::string name;
+    unsigned char type;
+  };
+  struct Frame {
+    platform::UniqueFd fd;
+    dev_t device;
+    ino_t inode;
+    size_t pathLength;  // of the parent's path
+    std::vector<Child> children;
+    size_t next = 0;
+  };
+
+  bool openRoot(QRTErrorRef* error);
+  bool visitChild(const Child& child, QRTErrorRef* error);
+  bool enter(platform::UniqueFd fd, const struct stat& st, size_t pathLength, QRTErrorRef* error);
+  bool leave(QRTErrorRef* error);
+  // The conditional setter on an open, checked item.
+  bool change(int fd, bool directory, QRTErrorRef* error);
+  void logEntryError(int err) const {
+    QRTLogAs(kLogError, "_runChangeOperationNeedToRetry", "FTS returned error for %s : %s", path_.c_str(),
+             errorText(err));
+  }
+
+  const QRTURL& root_;
+  const int32_t newClass_;
+  const uint32_t changeType_;
+  dev_t device_ = 0;
+  bool locked_ = false;
+  size_t changed_ = 0;
+  std::string path_;
+  std::vector<Frame> stack_;
+  std::unique_ptr<platform::DirectoryBatch> batch_;
 };
 
-// Opens the entry relative to its parent and checks that it is still the
-// item the walk saw; false (and nothing opened) when it is gone or swapped.
-int openEntry(const QRTTraversalEntry& entry, bool directory, platform::UniqueFd* fd, bool* same) {
-  const int flags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC | (directory ? O_DIRECTORY : 0);
-  fd->reset(openat(entry.parentFd, entry.name, flags | O_NOATIME));
-  if (!fd->valid() && errno == EPERM) fd->reset(openat(entry.parentFd, entry.name, flags));
-  *same = false;
-  if (!fd->valid()) {
-    // Gone, or swapped for a link or a special file since the listing.
-    if (errno == ENOENT || errno == ELOOP || errno == ENXIO || errno == ENOTDIR) return 0;
-    return errno;
-  }
-  struct stat st;
-  if (fstat(fd->get(), &st) != 0) return errno;
-  *same = st.st_dev == entry.st.st_dev && st.st_ino == entry.st.st_ino &&
-          (st.st_mode & S_IFMT) == (entry.st.st_mode & S_IFMT);
-  return 0;
+constexpr int kOpenFlags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
+
+// openat that does not touch access times (root may; fall back if not).
+int openAt(int dirfd, const char* name, int flags) {
+  int fd = openat(dirfd, name, flags | O_NOATIME);
+  if (fd < 0 && errno == EPERM) fd = openat(dirfd, name, flags);
+  return fd;
 }
 
-// The conditional setter: the class is read from and set on the one open
-// item. A failure is a POSIX error with the setter's messages.
-bool setEntryClass(TreeChange& change, const QRTTraversalEntry& entry, bool directory, QRTErrorRef* error) {
-  if (entry.st.st_dev != change.device) return true;  // another file system: never touched
-  const int32_t target =
-      directory ? change.newClass : (change.newClass == 0 ? kDefaultFileClass : change.newClass);
-  platform::UniqueFd fd;
-  bool same = false;
-  int err = openEntry(entry, directory, &fd, &same);
-  if (err) {
-    QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to open %s : %s", entry.path, errorText(err)));
-    return false;
+// Gone, or swapped for a link or a special file since it was listed.
+bool vanished(int err) { return err == ENOENT || err == ELOOP || err == ENXIO || err == ENOTDIR; }
+
+bool ProtectionWalk::run(QRTErrorRef* error) {
+  path_ = root_.path();
+  if (!openRoot(error)) return false;
+  while (!stack_.empty()) {
+    Frame& top = stack_.back();
+    bool ok = top.next < top.children.size() ? visitChild(top.children[top.next++], error) : leave(error);
+    if (!ok) return false;
   }
-  if (!same) return true;
-  int32_t current = 0;
-  if ((err = platform::getProtectionClass(fd.get(), &current))) {
-    QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to getclass of file %s: %s", entry.path, errorText(err)));
-    return false;
-  }
-  if (current == kUntouchableClass) return true;
-  if (!directory) {
-    if (current == target) return true;
-    if ((change.changeType & QRTDataProtectionChangeOperation::QRTChangeFilesOnlyToLowerClass) && target >= current)
-      return true;
-  }
-  QRTLog(kLogDebug, "Setting protection class of %s to %d", entry.path, target);
-  if ((err = platform::setProtectionClass(fd.get(), target, current))) {
-    QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to setclass(%d) on file %s: %s", target, entry.path,
-                                       errorText(err)));
-    return false;
-  }
-  if (++change.changed == 10) QRT_CRASH_POINT("protection-mid-walk");
   return true;
 }
 
-// The visitor's answer for one entry: false ends the walk.
-bool visitEntry(TreeChange& change, QRTTraversalEntry& entry, QRTErrorRef* error) {
-  using Kind = QRTTraversalEntry::Kind;
-  if (entry.level == 0) change.device = entry.st.st_dev;
-  bool directory = false;
-  switch (entry.kind) {
-    case Kind::DirectoryPre:
-    case Kind::Symlink:
-      return true;
-    case Kind::Other:
-      if (entry.error != 0)
-        QRTLogAs(kLogError, "_runChangeOperationNeedToRetry", "FTS returned error for %s : %s", entry.path,
-                 errorText(entry.error));
-      return true;
-    case Kind::DirectoryPost:
-      if (!(change.changeType & QRTDataProtectionChangeOperation::QRTChangeDirectories)) return true;
-      directory = true;
-      break;
-    case Kind::File:
-      if (!(change.changeType & QRTDataProtectionChangeOperation::QRTChangeFiles)) return true;
-      break;
+bool ProtectionWalk::openRoot(QRTErrorRef* error) {
+  platform::SafeParent parent;
+  struct stat st;
+  int err = platform::safeOpenParent(root_.path(), &parent);
+  if (!err && fstatat(parent.fd.get(), parent.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) err = errno;
+  if (err == ENOENT || err == ELOOP) return true;  // gone meanwhile, or a link: nothing of ours to walk
+  const bool directory = !err && S_ISDIR(st.st_mode);
+  if (!err && !directory && !S_ISREG(st.st_mode)) return true;
+  platform::UniqueFd fd;
+  if (!err) {
+    fd.reset(openAt(parent.fd.get(), parent.name.c_str(), kOpenFlags | (directory ? O_DIRECTORY : 0)));
+    if (!fd.valid()) err = errno;
+    if (vanished(err)) return true;
   }
-  QRTErrorRef setError;
-  if (setEntryClass(change, entry, directory, &setError)) return true;
-  if (setError && setError->code() == EBADF) {
+  struct stat opened;
+  if (!err && fstat(fd.get(), &opened) != 0) err = errno;
+  if (err) {
+    QRTSetError(error, QRT_POSIX_ERROR(err, "fts_open failed for %@ : %s", root_, errorText(err)));
+    return false;
+  }
+  if (opened.st_ino != st.st_ino || opened.st_dev != st.st_dev) return true;  // swapped since
+  device_ = opened.st_dev;
+  if (!directory) return !(changeType_ & QRTDataProtectionChangeOperation::QRTChangeFiles) || change(fd.get(), false, error);
+  return enter(std::move(fd), opened, path_.size(), error);
+}
+
+bool ProtectionWalk::visitChild(const Child& child, QRTErrorRef* error) {
+  Frame& parent = stack_.back();
+  const size_t parentLength = path_.size();
+  path_ += '/';
+  path_ += child.name;
+  unsigned char type = child.type;
+  if (type == DT_UNKNOWN) {
+    struct stat st;
+    if (fstatat(parent.fd.get(), child.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0)
+      type = S_ISDIR(st.st_mode) ? DT_DIR : S_ISREG(st.st_mode) ? DT_REG : DT_UNKNOWN;
+  }
+  const bool directory = type == DT_DIR;
+  bool ok = true;
+  if (directory || (type == DT_REG && (changeType_ & QRTDataProtectionChangeOperation::QRTChangeFiles))) {
+    platform::UniqueFd fd(openAt(parent.fd.get(), child.name.c_str(), kOpenFlags | (directory ? O_DIRECTORY : 0)));
+    struct stat st;
+    int err = fd.valid() ? (fstat(fd.get(), &st) == 0 ? 0 : errno) : errno;
+    if (err) {
+      // An unreadable item is reported and passed over, as the walk goes on.
+      if (!vanished(err)) logEntryError(err);
+    } else if (st.st_dev != device_ || (directory ? !S_ISDIR(st.st_mode) : !S_ISREG(st.st_mode))) {
+      // Another file system, never entered or changed; or swapped since listed.
+    } else if (directory) {
+      return enter(std::move(fd), st, parentLength, error);
+    } else {
+      ok = change(fd.get(), false, error);
+    }
+  }
+  path_.resize(parentLength);
+  return ok;
+}
+
+bool ProtectionWalk::enter(platform::UniqueFd fd, const struct stat& st, size_t pathLength, QRTErrorRef*) {
+  Frame frame{std::move(fd), st.st_dev, st.st_ino, pathLength, {}, 0};
+  if (!batch_) batch_ = std::make_unique<platform::DirectoryBatch>();
+  for (;;) {
+    ssize_t n = platform::readDirectoryBatch(frame.fd.get(), batch_.get());
+    if (n == 0) break;
+    if (n < 0) {
+      // Unreadable: reported, neither entered nor changed.
+      logEntryError(static_cast<int>(-n));
+      path_.resize(pathLength);
+      return true;
+    }
+    platform::forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t, unsigned char type, const char* name) {
+      if (name && type != DT_LNK) frame.children.push_back({name, type});
+    });
+  }
+  if (stack_.size() >= kOpenWindow) stack_[stack_.size() - kOpenWindow].fd.reset();
+  stack_.push_back(std::move(frame));
+  return true;
+}
+
+bool ProtectionWalk::leave(QRTErrorRef* error) {
+  Frame& top = stack_.back();
+  if ((changeType_ & QRTDataProtectionChangeOperation::QRTChangeDirectories) && !change(top.fd.get(), true, error))
+    return false;
+  if (stack_.size() >= 2 && !stack_[stack_.size() - 2].fd.valid()) {
+    Frame& parent = stack_[stack_.size() - 2];
+    platform::UniqueFd fd(openAt(top.fd.get(), "..", kOpenFlags | O_DIRECTORY));
+    struct stat st;
+    int err = !fd.valid() ? errno : fstat(fd.get(), &st) != 0 ? errno : 0;
+    if (!err && (st.st_dev != parent.device || st.st_ino != parent.inode)) err = ESTALE;  // moved meanwhile
+    if (err) {
+      QRTSetError(error, QRT_POSIX_ERROR(err, "Error for path %s: %s", path_.c_str(), errorText(err)));
+      return false;
+    }
+    parent.fd = std::move(fd);
+  }
+  path_.resize(top.pathLength);
+  stack_.pop_back();
+  return true;
+}
+
+bool ProtectionWalk::change(int fd, bool directory, QRTErrorRef* error) {
+  const int32_t target = directory ? newClass_ : (newClass_ == 0 ? kDefaultFileClass : newClass_);
+  int32_t current = 0;
+  QRTErrorRef failure;
+  int err = platform::getProtectionClass(fd, &current);
+  if (err) {
+    failure = QRT_POSIX_ERROR(err, "Failed to getclass of file %s: %s", path_.c_str(), errorText(err));
+  } else {
+    if (current == kUntouchableClass) return true;
+    if (!directory) {
+      if (current == target) return true;
+      if ((changeType_ & QRTDataProtectionChangeOperation::QRTChangeFilesOnlyToLowerClass) && target >= current)
+        return true;
+    }
+    QRTLog(kLogDebug, "Setting protection class of %s to %d", path_.c_str(), target);
+    if (!(err = platform::setProtectionClass(fd, target, current))) {
+      if (++changed_ == 10) QRT_CRASH_POINT("protection-mid-walk");
+      return true;
+    }
+    failure = QRT_POSIX_ERROR(err, "Failed to setclass(%d) on file %s: %s", target, path_.c_str(), errorText(err));
+  }
+  if (err == EBADF) {
+    struct stat st {};
+    fstat(fd, &st);
     QRTLogAs(kLogError, "_runChangeOperationNeedToRetry",
-             "Ignoring failure to set protection class to %d on %@ (mode 0%o): %@", change.newClass,
-             std::string(entry.path), static_cast<unsigned>(entry.st.st_mode), setError);
+             "Ignoring failure to set protection class to %d on %@ (mode 0%o): %@", newClass_, path_,
+             static_cast<unsigned>(st.st_mode), failure);
     return true;
   }
-  if (setError && setError->code() == EPERM) change.locked = true;
-  QRTSetError(error, std::move(setError));
+  if (err == EPERM) locked_ = true;
+  QRTSetError(error, std::move(failure));
   return false;
 }
 
@@ -154,25 +271,10 @@ bool visitEntry(TreeChange& change, QRTTraversalEntry& entry, QRTErrorRef* error
 bool QRTDataProtectionChangeOperation::setProtectionClassOfTreeAtURL(const QRTURL& root, int32_t newClass,
                                                                      uint32_t changeType, bool* locked,
                                                                      QRTErrorRef* error) {
-  TreeChange change{newClass, changeType};
-  bool visitorFailed = false;
-  QRTErrorRef walkError;
-  bool ok = QRTFileManager::defaultManager()._traverseDirectory(
-      root, &walkError, [&](QRTTraversalEntry& entry, QRTErrorRef* entryError) {
-        bool go = visitEntry(change, entry, entryError);
-        visitorFailed = !go;
-        return go;
-      });
-  if (locked) *locked = change.locked;
-  if (ok || change.locked) return true;
-  if (!visitorFailed) {
-    // The walk itself could not start or go on.
-    const int err = walkError && walkError->domain() == QRTPOSIXErrorDomain ? walkError->code() : EIO;
-    if (err == ENOENT) return true;  // the root went away meanwhile
-    walkError = QRT_POSIX_ERROR(err, "fts_open failed for %@ : %s", root, errorText(err));
-  }
-  QRTSetError(error, walkError);
-  return false;
+  ProtectionWalk walk(root, newClass, changeType);
+  bool ok = walk.run(error);
+  if (locked) *locked = walk.locked();
+  return ok || walk.locked();
 }
 
 // ---- pending-update files ---------------------------------------------------
