@@ -727,6 +727,46 @@ int runSubcommand(const Subcommand& row, size_t words, const Options& options) {
   return finish(*connection, row.send(*connection, a), options, row.output, row.keys);
 }
 
+// ---- protect (command 21) -------------------------------------------------
+
+const char kProtectUsage[] = R"(  protect --identifier ID --protection-class N [--class N] [--user N] [--third-party]
+          [--retry-if-locked]
+      (command 21) Sets the protection class of every item of a data container's Documents,
+      Library, tmp and Purchases (--class defaults to 2). The reply comes when the change is
+      done; with --retry-if-locked a locked device holds it until the next unlock.
+)";
+
+int runProtect(const Options& options) {
+  std::optional<std::string> identifier;
+  std::optional<int64_t> protectionClass;
+  uint64_t containerClass = 2;
+  std::optional<uint64_t> userId;
+  bool thirdParty = false, retryIfLocked = false;
+  const auto& args = options.args;
+  for (size_t i = 1; i < args.size(); ++i) {
+    const std::string& flag = args[i];
+    auto value = [&]() -> const std::string& {
+      if (i + 1 == args.size()) throw UsageError{flag + " needs a value"};
+      return args[++i];
+    };
+    if (flag == "--identifier") identifier = value();
+    else if (flag == "--protection-class") protectionClass = parseSigned(value(), flag);
+    else if (flag == "--class") containerClass = parseUnsigned(value(), flag);
+    else if (flag == "--user") userId = parseUnsigned(value(), flag);
+    else if (flag == "--third-party") thirdParty = true;
+    else if (flag == "--retry-if-locked") retryIfLocked = true;
+    else throw UsageError{"unknown argument to protect: " + flag};
+  }
+  if (!identifier) throw UsageError{"protect needs --identifier"};
+  if (!protectionClass) throw UsageError{"protect needs --protection-class"};
+  auto connection = connectOrExplain(options);
+  if (!connection) return kExitUsage;
+  return finish(*connection,
+                qk::setDataProtection(*connection, userId.value_or(ownerFor(containerClass)), identifier,
+                                      containerClass, *protectionClass, thirdParty, retryIfLocked),
+                options);
+}
+
 std::string usageText() {
   std::string out = kUsageHead;
   for (const Subcommand& row : kSubcommands) {
@@ -744,7 +784,7 @@ std::string usageText() {
     }
     out += line + "\n      (command " + std::to_string(row.command) + ") " + row.help + '\n';
   }
-  return out + kUsageTail;
+  return out + kProtectUsage + kUsageTail;
 }
 
 // Global options stop at the first word that is not one.
@@ -781,6 +821,7 @@ int run(int argc, char** argv) {
     return kExitOK;
   }
   if (command == "raw") return runRaw(options);
+  if (command == "protect") return runProtect(options);
   size_t words = 0;
   if (const Subcommand* row = findSubcommand(options.args, &words)) return runSubcommand(*row, words, options);
   if (command == "info") throw UsageError{"info needs get or set"};

@@ -1,6 +1,7 @@
 #include "Daemon/requests/QRTRequestDispatcher.h"
 
 #include "Daemon/requests/QRTContainerCommands.h"
+#include "Daemon/requests/QRTDataProtectionCommands.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTError.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
@@ -58,7 +59,7 @@ const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
     ROW(18, "processCodeSigningInfo", QRTEntitlementAllowed, 1),
     ROW(19, "codeSigningInfoForIdentifier", QRTEntitlementAllowed, 1),
     ROW(20, "invalidateCodeSigningInfoForAppsWithoutBundleContainer", QRTEntitlementAllowed, 1),
-    ROW(21, "setDataProtection", QRTEntitlementAllowed, 0),
+    SERVED(21, "setDataProtection", QRTHandleSetDataProtection, QRTEntitlementAllowed, 0),
     SERVED(22, "recreateContainerStructure", QRTHandleRecreateDefaultStructure, QRTEntitlementAllowed, 1),
     SERVED(23, "diskUsage", QRTHandleDiskUsage, QRTEntitlementAllowed, 1),
     ROW(24, "performDataMigration", QRTEntitlementDataMigration, 1),
