@@ -219,6 +219,13 @@ int getClass(const ClassTarget& target, int32_t* cls) {
   return 0;
 }
 
+int writeClass(const ClassTarget& target, int32_t cls) {
+  const uint32_t v = static_cast<uint32_t>(cls);
+  const uint8_t b[4] = {static_cast<uint8_t>(v), static_cast<uint8_t>(v >> 8), static_cast<uint8_t>(v >> 16),
+                        static_cast<uint8_t>(v >> 24)};
+  return target.set(b, sizeof b);
+}
+
 int setClass(const ClassTarget& target, int32_t cls) {
   if (deviceLockState() == 1) {
     if (cls == 1) return EPERM;
@@ -226,10 +233,7 @@ int setClass(const ClassTarget& target, int32_t cls) {
     if (int err = getClass(target, &current)) return err;
     if (current == 1) return EPERM;
   }
-  const uint32_t v = static_cast<uint32_t>(cls);
-  const uint8_t b[4] = {static_cast<uint8_t>(v), static_cast<uint8_t>(v >> 8), static_cast<uint8_t>(v >> 16),
-                        static_cast<uint8_t>(v >> 24)};
-  return target.set(b, sizeof b);
+  return writeClass(target, cls);
 }
 
 // Files and directories are reopened for reading; other items never are.
@@ -249,6 +253,11 @@ int classTarget(const Item& item, UniqueFd* keep, ClassTarget* target) {
 int getProtectionClass(int fd, int32_t* cls) { return getClass(ClassTarget{fd, {}}, cls); }
 
 int setProtectionClass(int fd, int32_t cls) { return setClass(ClassTarget{fd, {}}, cls); }
+
+int setProtectionClass(int fd, int32_t cls, int32_t current) {
+  if ((cls == 1 || current == 1) && deviceLockState() == 1) return EPERM;
+  return writeClass(ClassTarget{fd, {}}, cls);
+}
 
 int itemProtectionClass(const Item& item, int32_t* cls) {
   UniqueFd keep;

@@ -117,6 +117,10 @@ int clearImmutableFlag(int fd);
 // the new class is 1.
 int getProtectionClass(int fd, int32_t* cls);
 int setProtectionClass(int fd, int32_t cls);
+// The same when the caller has just read the current class from fd: the lock
+// state is read only when the current or the new class is 1, which saves a
+// file read per item in tree walks.
+int setProtectionClass(int fd, int32_t cls, int32_t current);
 // The same on a pinned item (a link is ELOOP); FIFOs and sockets are
 // reached without being opened.
 int itemProtectionClass(const Item& item, int32_t* cls);

@@ -493,15 +493,19 @@ void RequestListener::Impl::serveClient(const ClientRef& client, bool mayServeIn
       if (read == ReadResult::Empty) armClient(client->connection->fd());
       return dispatch(client, events, mayServeInline);
     }
+    bool paused = false;
     {
       // Checked under the lock that finishEvent takes, so a request finishing
       // meanwhile either sees the pause or leaves a load this check sees fall.
       std::lock_guard<std::mutex> hold(client->pauseLock);
       if (client->inFlight.load() >= kMaxInFlight) {
         client->paused = true;  // the request that brings the load down serves it again
-        return dispatch(client, events, mayServeInline);
+        paused = true;
       }
     }
+    // Dispatched with the lock released: a request served inline here may be
+    // the one that brings the load down, and finishEvent takes the lock.
+    if (paused) return dispatch(client, events, mayServeInline);
     dispatch(client, events, false);  // the load fell meanwhile: read on
   }
 }

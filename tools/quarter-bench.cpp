@@ -5,7 +5,7 @@
 // directory.
 //
 //   quarter-bench [--socket PATH | --daemon QUARTERD] [--seconds N] [--clients 1,8]
-//                 [--op create|lookup|info-set|info-get|all] [--prefill N] [--lookup-first]
+//                 [--op create|lookup|info-set|info-get|cs-set|cs-get|all] [--prefill N] [--lookup-first]
 #include <limits.h>
 #include <signal.h>
 #include <stdlib.h>
@@ -177,6 +177,21 @@ bool prepareInfoContainer(Client& c) {
   return c.container.uuid && succeeded(qk::setInfoValue(*c.connection, c.container, "bench", plist::Value(0)));
 }
 
+// A program's code-signing registration, changed by every call of cs-set.
+plist::Dictionary codeSigningInfo(uint64_t sequence) {
+  plist::Dictionary entitlements{{"com.norvane.bench.sequence", plist::Value(plist::Integer{sequence, false})},
+                                 {"com.norvane.private.QuarterKit.none", true}};
+  return {{"com.norvane.QuarterKit.Entitlements", entitlements}};
+}
+
+std::string codeSigningIdentifier(const Client& c) { return kPrefix + std::string("cs.") + std::to_string(c.index); }
+
+bool registerCodeSigning(Client& c) {
+  plist::Dictionary options{{"com.norvane.QuarterKit.DataContainerClass", 2}};
+  return succeeded(qk::processCodeSigningInfo(*c.connection, codeSigningIdentifier(c),
+                                              plist::Value(codeSigningInfo(c.sequence++)), plist::Value(options)));
+}
+
 struct Operation {
   const char* name;
   bool (*prepare)(Client&);
@@ -201,6 +216,9 @@ const Operation kOperations[] = {
      }},
     {"info-get", prepareInfoContainer,
      [](Client& c) { return succeeded(qk::infoValueForKey(*c.connection, c.container, "bench")); }},
+    {"cs-set", registerCodeSigning, registerCodeSigning},
+    {"cs-get", registerCodeSigning,
+     [](Client& c) { return succeeded(qk::codeSigningInfoForIdentifier(*c.connection, codeSigningIdentifier(c))); }},
 };
 
 // ---- measuring ------------------------------------------------------------------
@@ -354,12 +372,14 @@ struct Options {
 
 const char kUsage[] =
     "usage: quarter-bench [--socket PATH | --daemon QUARTERD] [--seconds N] [--clients 1,8]\n"
-    "                     [--op create|lookup|info-set|info-get|all] [--prefill N] [--lookup-first]\n"
+    "                     [--op create|lookup|info-set|info-get|cs-set|cs-get|all] [--prefill N] [--lookup-first]\n"
     "  --daemon QUARTERD  run QUARTERD on a temporary device root in which this program holds\n"
     "                     the master entitlement (with --socket, register it yourself)\n"
     "  --seconds N        seconds per operation and client count (default 3)\n"
     "  --clients LIST     client counts, one connection and thread each (default 1,8)\n"
-    "  --op OP            the operation to load (default all); every request is class 2, user 501\n"
+    "  --op OP            the operation to load (default all); every container request is class 2,\n"
+    "                     user 501; cs-set registers (command 18) and cs-get reads (command 19)\n"
+    "                     one program's code-signing information per client\n"
     "  --prefill N        create N containers first\n"
     "  --lookup-first     with --daemon: prefill (default 10000), restart the daemon and time the\n"
     "                     first look-up, which builds the cache over the whole class directory\n";

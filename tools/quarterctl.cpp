@@ -64,9 +64,10 @@ internal UUID, as create and lookup print it. create, lookup and system-path tak
 caller's own identifier when --identifier is missing.
 
 Output: create, lookup, system-path and metadata print "Key: value" lines for the reply keys
-they are about; list prints "IDENTIFIER UUID" per container; info get and du print the value
-alone; the others, and raw, print every reply key, sorted. 16-byte data is shown as a UUID and
-nested values in the old-style property-list text form.
+they are about; list prints "IDENTIFIER UUID" per container; info get, du, system-group-path
+and codesign get print the value alone; groups prints one line per group; the others, and raw,
+print every reply key, sorted. 16-byte data is shown as a UUID and nested values in the
+old-style property-list text form.
 
 Exit status: 0 when the reply's ReplyError is 1, 1 when it is another value, 2 on usage
 errors, connection failures and when no reply came.
@@ -321,6 +322,7 @@ enum class Output {
   Keys,   // only the listed keys the reply has
   List,   // "IDENTIFIER UUID" per container
   Value,  // the first listed key's value alone, on success
+  Lines,  // the first listed key's array, one element a line, or dictionary, "KEY VALUE" a line
 };
 
 void printList(const qk::Reply& reply) {
@@ -352,6 +354,12 @@ void printReply(const qk::Reply& reply, const Options& options, Output output,
       return;
     case Output::Value:
       if (const plist::Value* v = reply.value(keys.front()); v && reply.ok()) std::cout << plainText(*v) << '\n';
+      return;
+    case Output::Lines:
+      if (const plist::Array* a = reply.array(keys.front()); a && reply.ok())
+        for (const plist::Value& e : *a) std::cout << plainText(e) << '\n';
+      if (const plist::Dictionary* d = reply.dictionary(keys.front()); d && reply.ok())
+        for (const auto& [k, e] : *d) std::cout << k << ' ' << plainText(e) << '\n';
       return;
   }
 }
@@ -417,6 +425,10 @@ enum OptionBit : unsigned {
   kEntry = 1u << 9,
   kReplace = 1u << 10,  // every --old-* and --new-* option of replace but --new-class
   kNewClass = 1u << 11,
+  kGroup = 1u << 12,
+  kSystem = 1u << 13,
+  kCodeSigning = 1u << 14,  // --entitlements, --cs-info or --remove
+  kCodeSigningOptions = 1u << 15,
   kOne = kClass | kUser | kIdentifier | kUUID,  // one existing container
   kOneRequired = kClass | kIdentifier | kUUID,
 };
@@ -445,7 +457,17 @@ struct Args {
   bool info = false;
   bool addon = false;
   std::vector<StageEntry> entries;
+  std::optional<std::string> group;
+  bool system = false;
+  std::optional<plist::Value> codeSigningInfo;  // absent with --remove
+  plist::Dictionary codeSigningOptions;
 };
+
+plist::Value readDictionaryFile(const std::string& path) {
+  plist::Value v = readPlistFile(path);
+  if (!v.isDictionary()) throw UsageError{path + " does not hold a dictionary"};
+  return v;
+}
 
 // The only user id the daemon accepts for bundle and system classes; for
 // the others 1, which it reads as the current mobile user.
@@ -513,6 +535,24 @@ const OptionRow kOptionTable[] = {
      [](Args& a, Text v) { a.replacement.containerClass = parseUnsigned(v, "--new-class"); }},
     {"--new-user", "N", kReplace, [](Args& a, Text v) { a.replacement.userId = parseUnsigned(v, "--new-user"); }},
     {"--new-identifier", "ID", kReplace, [](Args& a, Text v) { a.replacement.identifier = v; }},
+    {"--group", "GROUP", kGroup, [](Args& a, Text v) { a.group = v; }},
+    {"--system", nullptr, kSystem, [](Args& a, Text) { a.system = true; }},
+    {"--entitlements", "PLIST", kCodeSigning,
+     [](Args& a, Text v) {
+       a.codeSigningInfo = plist::Dictionary{{"com.norvane.QuarterKit.Entitlements", readDictionaryFile(v)}};
+     }},
+    {"--cs-info", "PLIST", kCodeSigning, [](Args& a, Text v) { a.codeSigningInfo = readDictionaryFile(v); }},
+    {"--remove", nullptr, kCodeSigning, [](Args& a, Text) { a.codeSigningInfo.reset(); }},
+    {"--data-class", "N", kCodeSigningOptions,
+     [](Args& a, Text v) {
+       a.codeSigningOptions["com.norvane.QuarterKit.DataContainerClass"] = parseUnsigned(v, "--data-class");
+     }},
+    {"--parent", "ID", kCodeSigningOptions,
+     [](Args& a, Text v) { a.codeSigningOptions["com.norvane.QuarterKit.ParentBundleID"] = v; }},
+    {"--placeholder", nullptr, kCodeSigningOptions,
+     [](Args& a, Text) { a.codeSigningOptions["com.norvane.QuarterKit.PlaceholderEntitlements"] = true; }},
+    {"--by-caller", nullptr, kCodeSigningOptions,
+     [](Args& a, Text) { a.codeSigningOptions["RegByCaller"] = true; }},
 };
 
 qk::Result createOrLookup(qk::Connection& c, const Args& a, bool create) {
@@ -607,6 +647,35 @@ const Subcommand kSubcommands[] = {
      {"ReplyDiskUsage"}, "Prints the bytes a container uses."},
     {"system-path", 15, kIdentifier, 0, [](C c, A a) { return qk::systemContainerPath(c, a.self.identifier); },
      Output::Keys, kContainerKeys, "Creates or looks up a system container (class 12, user 499)."},
+    {"groups paths", 13, kUser | kIdentifier | kSystem, 0,
+     [](C c, A a) {
+       return a.system ? qk::systemGroupContainerPaths(c, a.self.identifier)
+                       : qk::groupContainerPaths(c, a.self.userId.value_or(1), a.self.identifier);
+     },
+     Output::Lines, {"ReplyGroupContainerDict"},
+     "Prints \"GROUP PATH\" for each group container of a program, creating them;\n"
+     "      --system for its system group containers (command 16, user 499)."},
+    {"groups ids", 14, kUser | kIdentifier, 0,
+     [](C c, A a) { return qk::groupContainerIdentifiers(c, a.self.userId.value_or(1), a.self.identifier); },
+     Output::Lines, {"ReplyGroupIdentifiersArray"}, "Prints the application group identifiers of a program."},
+    {"system-group-path", 17, kGroup | kIdentifier, kGroup,
+     [](C c, A a) { return qk::systemGroupContainerPath(c, *a.group, a.self.identifier); }, Output::Value,
+     {"ReplyPath"}, "Creates or looks up a system group container the caller is entitled to."},
+    {"codesign set", 18, kIdentifier | kCodeSigning | kCodeSigningOptions, kIdentifier | kCodeSigning,
+     [](C c, A a) {
+       return qk::processCodeSigningInfo(c, a.self.identifier, a.codeSigningInfo,
+                                         plist::Value(a.codeSigningOptions));
+     },
+     Output::Whole, {},
+     "Registers a program's code-signing information, given by one of: --entitlements, which\n"
+     "      wraps an entitlements dictionary; --cs-info, a whole code-signing dictionary; --remove,\n"
+     "      which deletes the entry and what only it kept alive."},
+    {"codesign get", 19, kIdentifier, kIdentifier,
+     [](C c, A a) { return qk::codeSigningInfoForIdentifier(c, a.self.identifier); }, Output::Value,
+     {"ReplyInfoDictionary"}, "Prints a program's registered code-signing information."},
+    {"codesign invalidate-missing", 20, 0, 0,
+     [](C c, A) { return qk::invalidateCodeSigningInfoForAppsWithoutBundleContainer(c); }, Output::Whole, {},
+     "Invalidates the entries of programs that have no bundle container."},
 };
 
 const OptionRow* findOption(const std::string& flag) {
@@ -658,6 +727,46 @@ int runSubcommand(const Subcommand& row, size_t words, const Options& options) {
   return finish(*connection, row.send(*connection, a), options, row.output, row.keys);
 }
 
+// ---- protect (command 21) -------------------------------------------------
+
+const char kProtectUsage[] = R"(  protect --identifier ID --protection-class N [--class N] [--user N] [--third-party]
+          [--retry-if-locked]
+      (command 21) Sets the protection class of every item of a data container's Documents,
+      Library, tmp and Purchases (--class defaults to 2). The reply comes when the change is
+      done; with --retry-if-locked a locked device holds it until the next unlock.
+)";
+
+int runProtect(const Options& options) {
+  std::optional<std::string> identifier;
+  std::optional<int64_t> protectionClass;
+  uint64_t containerClass = 2;
+  std::optional<uint64_t> userId;
+  bool thirdParty = false, retryIfLocked = false;
+  const auto& args = options.args;
+  for (size_t i = 1; i < args.size(); ++i) {
+    const std::string& flag = args[i];
+    auto value = [&]() -> const std::string& {
+      if (i + 1 == args.size()) throw UsageError{flag + " needs a value"};
+      return args[++i];
+    };
+    if (flag == "--identifier") identifier = value();
+    else if (flag == "--protection-class") protectionClass = parseSigned(value(), flag);
+    else if (flag == "--class") containerClass = parseUnsigned(value(), flag);
+    else if (flag == "--user") userId = parseUnsigned(value(), flag);
+    else if (flag == "--third-party") thirdParty = true;
+    else if (flag == "--retry-if-locked") retryIfLocked = true;
+    else throw UsageError{"unknown argument to protect: " + flag};
+  }
+  if (!identifier) throw UsageError{"protect needs --identifier"};
+  if (!protectionClass) throw UsageError{"protect needs --protection-class"};
+  auto connection = connectOrExplain(options);
+  if (!connection) return kExitUsage;
+  return finish(*connection,
+                qk::setDataProtection(*connection, userId.value_or(ownerFor(containerClass)), identifier,
+                                      containerClass, *protectionClass, thirdParty, retryIfLocked),
+                options);
+}
+
 std::string usageText() {
   std::string out = kUsageHead;
   for (const Subcommand& row : kSubcommands) {
@@ -675,7 +784,7 @@ std::string usageText() {
     }
     out += line + "\n      (command " + std::to_string(row.command) + ") " + row.help + '\n';
   }
-  return out + kUsageTail;
+  return out + kProtectUsage + kUsageTail;
 }
 
 // Global options stop at the first word that is not one.
@@ -712,6 +821,7 @@ int run(int argc, char** argv) {
     return kExitOK;
   }
   if (command == "raw") return runRaw(options);
+  if (command == "protect") return runProtect(options);
   size_t words = 0;
   if (const Subcommand* row = findSubcommand(options.args, &words)) return runSubcommand(*row, words, options);
   if (command == "info") throw UsageError{"info needs get or set"};

@@ -206,6 +206,19 @@ struct QRTSQLiteDBStatements {
     return entry;
   }
 
+  // BEGIN, body, COMMIT; a body that fails or throws (error 40) is rolled
+  // back, and a failing ROLLBACK's error replaces the body's.
+  static QRTErrorRef transaction(sqlite3* db, const std::function<QRTErrorRef()>& body) {
+    if (QRTErrorRef failed = exec(db, "BEGIN;", "failed _sqliteExec begin")) return failed;
+    QRTErrorRef result;
+    if (QRTErrorRef thrown = QRT_GUARD([&] { result = body(); })) result = thrown;
+    if (!result) result = exec(db, "COMMIT;", "failed _sqliteExec commit");
+    if (result && sqlite3_get_autocommit(db) == 0) {
+      if (QRTErrorRef rollback = exec(db, "ROLLBACK;", "failed _sqliteExec rollback")) result = rollback;
+    }
+    return result;
+  }
+
   static QRTErrorRef exec(sqlite3* db, const char* sql, const char* failure) {
     char* message = nullptr;
     if (sqlite3_exec(db, sql, nullptr, nullptr, &message) == SQLITE_OK) return nullptr;
@@ -272,25 +285,15 @@ bool QRTSQLiteDB::addCodeSigningEntry(const QRTCodeSigningEntry* entry, const st
                                  entry ? QRTFormatArg(*entry) : QRTFormatArg(nullptr), withIdentifier));
     return false;
   }
-  if (QRTErrorRef failed = S::exec(db_, "BEGIN;", "failed _sqliteExec begin")) {
-    QRTSetError(error, failed);
-    return false;
-  }
-  QRTErrorRef result;
-  QRTErrorRef thrown = QRT_GUARD([&] {
-    result = S::insertCodeSigningInfo(db_, url_, *entry, *withIdentifier);
-    if (!result) result = S::insertCodeSigningData(db_, url_, *entry, *withIdentifier);
-    if (result) return;
+  QRTErrorRef result = S::transaction(db_, [&]() -> QRTErrorRef {
+    if (QRTErrorRef failed = S::insertCodeSigningInfo(db_, url_, *entry, *withIdentifier)) return failed;
+    if (QRTErrorRef failed = S::insertCodeSigningData(db_, url_, *entry, *withIdentifier)) return failed;
     // A child that can't be written doesn't fail the parent.
     for (const std::string& child : entry->childBundleIdentifiers.value_or(std::vector<std::string>{})) {
       S::performTwoParameterQuery(db_, url_, kInsertChild, child, *withIdentifier, -1);
     }
-    result = S::exec(db_, "COMMIT;", "failed _sqliteExec commit");
+    return nullptr;
   });
-  if (thrown) result = thrown;
-  if (result && sqlite3_get_autocommit(db_) == 0) {
-    if (QRTErrorRef rollback = S::exec(db_, "ROLLBACK;", "failed _sqliteExec rollback")) result = rollback;
-  }
   QRTSetError(error, result);
   return !result;
 }
@@ -367,12 +370,7 @@ bool QRTSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::st
   }
   std::vector<std::string> all{identifier};
   if (children) all.insert(all.end(), children->begin(), children->end());
-  if (QRTErrorRef failed = S::exec(db_, "BEGIN;", "failed _sqliteExec begin")) {
-    QRTSetError(error, failed);
-    return false;
-  }
-  QRTErrorRef result;
-  QRTErrorRef thrown = QRT_GUARD([&] {
+  QRTErrorRef result = S::transaction(db_, [&]() -> QRTErrorRef {
     for (const std::string& item : all) {
       QRTErrorRef failed;
       if (invalidateCodeSigningWithIdentifier(item, &failed)) {
@@ -381,12 +379,8 @@ bool QRTSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::st
         QRTLog(kLogError, "Failed to invalidate code signing info for %@ child %@ : %@", identifier, item, failed);
       }
     }
-    result = S::exec(db_, "COMMIT;", "failed _sqliteExec commit");
+    return nullptr;
   });
-  if (thrown) result = thrown;
-  if (result && sqlite3_get_autocommit(db_) == 0) {
-    if (QRTErrorRef rollback = S::exec(db_, "ROLLBACK;", "failed _sqliteExec rollback")) result = rollback;
-  }
   QRTSetError(error, result);
   return !result;
 }

@@ -11,6 +11,7 @@
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTCrashPoint.h"
 #include "Daemon/QRTDaemon.h"
+#include "Daemon/dataprotection/QRTDataProtectionManager.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTLocks.h"
@@ -36,6 +37,10 @@ void QRTClientConnection::quarterSetup() {
   if (!_recoverFromReplaceOperationsWithError(&error)) {
     QRTLog(platform::kLogError, "Failed recovering from replace operations: %@", error);
     gReplaceRecoveryIncomplete = true;
+  }
+  QRTErrorRef protectionError;
+  if (!QRTDataProtectionManager::defaultManager().restartPendingDataProtectionOperationsWithError(&protectionError)) {
+    QRTLog(platform::kLogError, "Failed restarting pending data protection operations: %@", protectionError);
   }
 }
 

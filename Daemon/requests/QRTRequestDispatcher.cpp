@@ -6,6 +6,7 @@
 #include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/requests/QRTCodeSigningCommands.h"
 #include "Daemon/requests/QRTContainerCommands.h"
+#include "Daemon/requests/QRTDataProtectionCommands.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTError.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
@@ -64,7 +65,7 @@ const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
     SERVED(19, "codeSigningInfoForIdentifier", QRTHandleCodeSigningInfoForIdentifier, QRTEntitlementAllowed, 1),
     SERVED(20, "invalidateCodeSigningInfoForAppsWithoutBundleContainer",
            QRTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, QRTEntitlementAllowed, 1),
-    ROW(21, "setDataProtection", QRTEntitlementAllowed, 0),
+    SERVED(21, "setDataProtection", QRTHandleSetDataProtection, QRTEntitlementAllowed, 0),
     SERVED(22, "recreateContainerStructure", QRTHandleRecreateDefaultStructure, QRTEntitlementAllowed, 1),
     SERVED(23, "diskUsage", QRTHandleDiskUsage, QRTEntitlementAllowed, 1),
     ROW(24, "performDataMigration", QRTEntitlementDataMigration, 1),

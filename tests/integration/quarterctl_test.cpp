@@ -8,6 +8,7 @@
 #include <string>
 
 #include "DaemonFixture.h"
+#include "base/PlistCodec.h"
 
 namespace {
 
@@ -133,6 +134,31 @@ TEST_F(QuarterctlTest, StageWipeAndSystemPath) {
   CtlRun sys = run("system-path --identifier com.example.daemon");
   EXPECT_EQ(sys.status, 0) << sys.err;
   EXPECT_TRUE(std::filesystem::is_directory(field(sys.out, "ReplyPath"))) << sys.out;
+}
+
+TEST_F(QuarterctlTest, CodeSigningAndGroups) {
+  const plist::Data entitlements = plist::writeBinary(plist::Dictionary{
+      {"com.norvane.security.application-groups", plist::Array{"group.one", "group.two"}},
+      {"com.norvane.security.system-groups", "systemgroup.com.example.shared"}});
+  writeFile(root + "/ents.plist", std::string(entitlements.begin(), entitlements.end()));
+  EXPECT_EQ(run("codesign set --identifier com.example.app --entitlements " + root + "/ents.plist --data-class 2").status, 0);
+  EXPECT_TRUE(contains(run("codesign get --identifier com.example.app").out, "group.two"));
+  const std::string ids = run("groups ids --identifier com.example.app").out;
+  EXPECT_TRUE(contains(ids, "group.one\n") && contains(ids, "group.two\n") && ids.size() == 20) << ids;
+  CtlRun paths = run("groups paths --identifier com.example.app");
+  ASSERT_EQ(paths.status, 0) << paths.err;
+  const std::string two = paths.out.substr(paths.out.find("group.two ") + 10);
+  EXPECT_TRUE(std::filesystem::is_directory(two.substr(0, two.find('\n')))) << paths.out;
+  // quarterctl itself is not entitled to the system group.
+  EXPECT_EQ(run("system-group-path --group systemgroup.com.example.shared").status, 1);
+  EXPECT_TRUE(contains(run("groups paths --system --identifier com.example.app").out, "systemgroup.com.example.shared "));
+
+  EXPECT_EQ(run("codesign set --identifier com.example.app --remove").status, 0);
+  CtlRun gone = run("codesign get --identifier com.example.app");
+  EXPECT_EQ(gone.status, 1);
+  EXPECT_TRUE(contains(gone.err, "ReplyError 21")) << gone.err;
+  EXPECT_EQ(run("codesign invalidate-missing").status, 0);
+  EXPECT_EQ(run("codesign set --identifier com.example.app").status, 2) << "one of the three is required";
 }
 
 }  // namespace

@@ -1,0 +1,8 @@
+// Request handler of the protection-class change (command 21): its reply is
+// sent by the change's completion, possibly after the next unlock.
+#pragma once
+
+#include "Daemon/requests/QRTRequestDispatcher.h"
+
+void QRTHandleSetDataProtection(const plist::Dictionary& request, const QRTReplyRef& reply,
+                                QRTClientConnection& client, uint64_t* result);

@@ -1,0 +1,340 @@
+// Protection-class changes of data containers (command 21) against the real
+// daemon: what the walk touches, the locked device, kills at each step of a
+// change, the termination assertion, and that each request gets one reply.
+#include <limits.h>
+#include <stdlib.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
+#include <filesystem>
+#include <future>
+#include <map>
+#include <string>
+#include <thread>
+
+#include "DaemonFixture.h"
+#include "base/PlistCodec.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+constexpr const char* kClassAttribute = "trusted.com.norvane.protection-class";
+constexpr uint64_t kSetDataProtection = 21;
+
+int32_t classOf(const std::string& path) {
+  uint8_t b[4];
+  if (lgetxattr(path.c_str(), kClassAttribute, b, sizeof b) != sizeof b) return 0;
+  return static_cast<int32_t>(b[0] | b[1] << 8 | b[2] << 16 | static_cast<uint32_t>(b[3]) << 24);
+}
+
+void setClassOf(const std::string& path, int32_t cls) {
+  const auto v = static_cast<uint32_t>(cls);
+  const uint8_t b[4] = {uint8_t(v), uint8_t(v >> 8), uint8_t(v >> 16), uint8_t(v >> 24)};
+  ASSERT_EQ(lsetxattr(path.c_str(), kClassAttribute, b, sizeof b, 0), 0) << path << ": " << strerror(errno);
+}
+
+// Count of items (files and directories, the top included) by class; links are not followed.
+std::map<int32_t, int> classesUnder(const std::string& top) {
+  std::map<int32_t, int> counts;
+  if (!fs::is_directory(fs::symlink_status(top))) return counts;
+  ++counts[classOf(top)];
+  for (const auto& entry : fs::recursive_directory_iterator(top)) {
+    if (!entry.is_symlink()) ++counts[classOf(entry.path().string())];
+  }
+  return counts;
+}
+
+// One framed request on a raw socket, then a second one: the next frame must
+// answer the second, so the first got exactly one reply. The first reply's code.
+uint64_t codeOfOnlyReply(const std::string& socketPath, const plist::Dictionary& first) {
+  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  strncpy(address.sun_path, socketPath.c_str(), sizeof address.sun_path - 1);
+  EXPECT_EQ(connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  auto send = [&](uint64_t id, const plist::Dictionary& message) {
+    plist::Data body = plist::writeBinary(plist::Value(message));
+    std::string frame(12, '\0');
+    const uint32_t length = static_cast<uint32_t>(body.size() + 8);
+    memcpy(frame.data(), &length, 4);
+    memcpy(frame.data() + 4, &id, 8);
+    frame.append(body.begin(), body.end());
+    EXPECT_EQ(write(fd, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+  };
+  auto receive = [&](uint64_t* id) -> std::optional<plist::Dictionary> {
+    auto readAll = [&](void* into, size_t size) {
+      for (size_t done = 0; done < size;) {
+        ssize_t n = read(fd, static_cast<char*>(into) + done, size - done);
+        if (n <= 0) return false;
+        done += static_cast<size_t>(n);
+      }
+      return true;
+    };
+    uint32_t length = 0;
+    if (!readAll(&length, 4) || length < 8) return std::nullopt;
+    std::string payload(length, '\0');
+    if (!readAll(payload.data(), length)) return std::nullopt;
+    memcpy(id, payload.data(), 8);
+    auto value = plist::parse(payload.data() + 8, length - 8);
+    if (!value || !value->isDictionary()) return std::nullopt;
+    return value->dictionary();
+  };
+  send(1, first);
+  uint64_t id = 0;
+  auto reply = receive(&id);
+  EXPECT_EQ(id, 1u);
+  send(2, request(7, {{"UserID", 501}, {"ContainerClass", 2}, {"Identifier", "com.example.nothing"}}));
+  uint64_t nextId = 0;
+  EXPECT_TRUE(receive(&nextId));
+  EXPECT_EQ(nextId, 2u) << "a second reply to the first request";
+  close(fd);
+  return codeOf(reply);
+}
+
+class DataProtectionTest : public DaemonFixture {
+ protected:
+  void SetUp() override {
+    DaemonFixture::SetUp();
+    if (!HasFatalFailure()) setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true}});
+  }
+
+  void TearDown() override {
+    setLocked(false);  // a held change would keep the daemon from stopping at once
+    DaemonFixture::TearDown();
+  }
+
+  // Written atomically, as the platform's writers do.
+  void setLocked(bool locked) {
+    writeFile(root + "/run/device/lockstate.tmp", locked ? "1\n" : "0\n");
+    ASSERT_EQ(rename((root + "/run/device/lockstate.tmp").c_str(), (root + "/run/device/lockstate").c_str()), 0);
+  }
+
+  std::string pendingDir() const { return root + "/private/var/root/Library/QuarterKit/PendingUpdates"; }
+  std::string assertionFile(const std::string& id) const { return root + "/run/quarterd/assertions/" + id; }
+
+  // A data container whose user data holds files in sub-directories (Documents
+  // and Library), every item of the container given class `initial`.
+  Container makeApp(const std::string& id, int files, int32_t initial = 3) {
+    Container c = make(501, id, 2);
+    for (int i = 0; i < files; ++i) {
+      const std::string dir = c.path + (i % 2 ? "/Library/d" : "/Documents/d") + std::to_string(i % 20);
+      fs::create_directories(dir);
+      writeFile(dir + "/f" + std::to_string(i), "x");
+    }
+    writeFile(c.path + "/tmp/t", "x");
+    for (const auto& entry : fs::recursive_directory_iterator(c.path)) setClassOf(entry.path().string(), initial);
+    return c;
+  }
+
+  static plist::Dictionary protect(const std::string& id, int64_t cls, bool retry, bool thirdParty = false) {
+    return {{"UserID", 501},       {"ContainerClass", 2},          {"Identifier", id},
+            {"DataProtectionClass", cls}, {"IsThirdParty", thirdParty}, {"RetryIfLocked", retry}};
+  }
+
+  // The user data items of c by class.
+  std::map<int32_t, int> userData(const Container& c) {
+    std::map<int32_t, int> all;
+    for (const char* item : {"/Documents", "/Library", "/tmp"})
+      for (auto [cls, n] : classesUnder(c.path + item)) all[cls] += n;
+    return all;
+  }
+
+  std::optional<uint64_t> recordedClass(const Container& c) {
+    return u64At(call(6, with(selector(c), {{"Key", "com.norvane.Emplacer.ContentProtectionClass"}})),
+                 "ReplyInfoValue");
+  }
+
+  // Sends command 21 on a connection of its own and returns the reply to come.
+  std::future<std::optional<plist::Dictionary>> protectLater(const plist::Dictionary& keys) {
+    return std::async(std::launch::async, [this, keys] { return call(kSetDataProtection, keys); });
+  }
+
+  static std::string retrying(const std::string& id, int32_t cls) {
+    return "Retrying container protection update to " + std::to_string(cls) + " on next unlock for user: 501, id: " + id;
+  }
+
+  size_t occurrences(const std::string& text) const {
+    const std::string log = logText();
+    size_t count = 0;
+    for (size_t at = log.find(text); at != std::string::npos; at = log.find(text, at + 1)) ++count;
+    return count;
+  }
+
+  // Waits (up to 5 s) for the path to exist or not.
+  static bool waitFor(const std::string& path, bool present) {
+    for (int i = 0; i < 500 && exists(path) != present; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    return exists(path) == present;
+  }
+};
+
+TEST_F(DataProtectionTest, ChangeReachesEveryUserDataItemAndNothingElse) {
+  Container c = makeApp("com.example.thousand", 1000);
+  // Outside the user data items, and outside the container through planted links.
+  writeFile(c.path + "/SystemData.txt", "x");
+  setClassOf(c.path + "/SystemData.txt", 3);
+  const std::string outside = root + "/outside";
+  fs::create_directories(outside);
+  writeFile(outside + "/secret", "x");
+  setClassOf(outside + "/secret", 4);
+  fs::create_symlink(outside + "/secret", c.path + "/Documents/d0/link");
+  fs::create_symlink(outside, c.path + "/Purchases");
+
+  const int items = userData(c)[3];
+  ASSERT_GT(items, 1000);
+  EXPECT_EQ(codeOfOnlyReply(qk::requestSocketPath(root), request(kSetDataProtection, protect(c.identifier, 1, false))),
+            1u);
+  EXPECT_EQ(userData(c), (std::map<int32_t, int>{{1, items}}));
+  EXPECT_EQ(classOf(c.path + "/SystemData.txt"), 3);
+  EXPECT_EQ(classOf(outside + "/secret"), 4) << "a link was followed";
+  EXPECT_EQ(classOf(outside), 0) << "a link was followed";
+  EXPECT_EQ(recordedClass(c), 1u);
+  EXPECT_TRUE(listDirectory(pendingDir()).empty());
+
+  // Towards a higher class only directories change; files keep theirs.
+  EXPECT_EQ(codeOf(call(kSetDataProtection, protect(c.identifier, 3, false))), 1u);
+  EXPECT_EQ(classOf(c.path + "/Documents/d0"), 3);
+  EXPECT_EQ(classOf(c.path + "/Documents/d0/f0"), 1);
+  EXPECT_EQ(recordedClass(c), 3u);
+}
+
+TEST_F(DataProtectionTest, EveryRequestGetsOneReply) {
+  Container c = makeApp("com.example.checked", 4);
+  const struct {
+    const char* what;
+    plist::Dictionary keys;
+    uint64_t code;
+  } cases[] = {
+      {"user check fails", with(protect(c.identifier, 1, false), {{"ContainerClass", 1}}), 38},
+      {"bundle class", with(protect(c.identifier, 1, false), {{"ContainerClass", 1}, {"UserID", 33}}), 11},
+      {"no identifier", without(protect(c.identifier, 1, false), "Identifier"), 11},
+      {"no such container", protect("com.example.absent", 1, false), 21},
+      {"class 2", protect(c.identifier, 2, false), 38},
+      {"class 4 for a third party", protect(c.identifier, 4, false, true), 38},
+      {"class out of range", protect(c.identifier, 1ll << 32 | 1, false), 38},
+      {"the class it has", protect(c.identifier, 0, false), 1},
+  };
+  for (const auto& test : cases) {
+    SCOPED_TRACE(test.what);
+    EXPECT_EQ(codeOfOnlyReply(qk::requestSocketPath(root), request(kSetDataProtection, test.keys)), test.code);
+  }
+  EXPECT_EQ(userData(c), (std::map<int32_t, int>{{3, userData(c)[3]}})) << "a refused request changed something";
+  EXPECT_TRUE(listDirectory(pendingDir()).empty());
+}
+
+TEST_F(DataProtectionTest, LockedDeviceHoldsOrRefusesTheChange) {
+  const struct {
+    const char* what;
+    int32_t from, to;  // the recorded class before, the requested one
+    bool retry;
+    uint64_t code;
+    int32_t files, dirs;  // the classes afterwards
+  } cases[] = {
+      {"to class 1, held", 3, 1, true, 1, 1, 1},
+      {"from class 1, held", 1, 3, true, 1, 1, 3},
+      {"to class 1, refused", 3, 1, false, 61, 3, 3},
+  };
+  for (const auto& test : cases) {
+    SCOPED_TRACE(test.what);
+    const std::string id = std::string("com.example.locked") + std::to_string(&test - cases);
+    Container c = makeApp(id, 20, test.from);
+    ASSERT_EQ(codeOf(call(5, with(selector(c), {{"Key", "com.norvane.Emplacer.ContentProtectionClass"},
+                                                 {"Value", test.from}}))),
+              1u);
+    setLocked(true);
+    auto reply = protectLater(protect(id, test.to, test.retry));
+    if (test.retry) {
+      EXPECT_TRUE(logContains(retrying(id, test.to)));
+      EXPECT_EQ(reply.wait_for(std::chrono::milliseconds(200)), std::future_status::timeout) << "answered while locked";
+      EXPECT_EQ(listDirectory(pendingDir()).size(), 1u);
+      setLocked(false);
+    }
+    EXPECT_EQ(codeOf(reply.get()), test.code);
+    setLocked(false);
+    EXPECT_EQ(classOf(c.path + "/Documents/d0/f0"), test.files);
+    EXPECT_EQ(classOf(c.path + "/Documents/d0"), test.dirs);
+    EXPECT_EQ(classOf(c.path + "/Library"), test.dirs);
+    EXPECT_EQ(recordedClass(c), static_cast<uint64_t>(test.code == 1 ? test.to : test.from));
+    EXPECT_TRUE(listDirectory(pendingDir()).empty());
+  }
+}
+
+TEST_F(DataProtectionTest, KilledChangeIsCompletedAtStart) {
+#ifndef QRT_TEST_HOOKS
+  GTEST_SKIP() << "crash points need a build with test hooks";
+#endif
+  // An unreadable pending-update file stays where it is; the others are still carried out.
+  fs::create_directories(pendingDir());
+  writeFile(pendingDir() + "/com.example.garbage-2-501.plist", "garbage");
+  const std::vector<std::string> garbageOnly{"com.example.garbage-2-501.plist"};
+  for (const char* point : {"protection-after-pending-write", "protection-mid-walk", "protection-before-pending-delete"}) {
+    SCOPED_TRACE(point);
+    const std::string id = std::string("com.example.") + point;
+    Container c = makeApp(id, 40);
+    writeFile(root + "/run/quarterd.crashpoint", std::string(point) + "\n");
+    EXPECT_FALSE(call(kSetDataProtection, protect(id, 1, true))) << "answered instead of dying";
+    int status = 0;
+    ASSERT_EQ(waitpid(daemon, &status, 0), daemon);
+    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL) << "status " << status;
+    daemon = -1;
+    unlink((root + "/run/quarterd.crashpoint").c_str());
+    EXPECT_EQ(listDirectory(pendingDir()).size(), 2u);
+    startDaemon();
+    EXPECT_EQ(listDirectory(pendingDir()), garbageOnly);
+    EXPECT_EQ(userData(c).count(3), 0u) << "an item kept the old class";
+    EXPECT_EQ(recordedClass(c), 1u);
+  }
+}
+
+TEST_F(DataProtectionTest, ApplicationIsHeldWhileTheChangeRunsAfterUnlock) {
+#ifndef QRT_TEST_HOOKS
+  GTEST_SKIP() << "pause points need a build with test hooks";
+#endif
+  for (bool refuse : {false, true}) {
+    SCOPED_TRACE(refuse ? "assertions refused" : "assertions granted");
+    const std::string id = refuse ? "com.example.refused" : "com.example.held";
+    Container c = makeApp(id, 20);
+    plist::Dictionary props{{"RefuseTerminationAssertions", refuse}};
+    plist::Data bytes = plist::writeBinary(plist::Value(props));
+    writeFile(root + "/etc/device-properties.plist", std::string(bytes.begin(), bytes.end()));
+
+    setLocked(true);
+    auto reply = protectLater(protect(id, 1, true));
+    ASSERT_TRUE(logContains(retrying(id, 1)));
+    const std::string paused = "Pause point protection-walk reached";
+    const size_t pausesBefore = occurrences(paused);
+    writeFile(root + "/run/quarterd.pausepoint", "protection-walk\n");
+    setLocked(false);
+    // The pause comes on the run after the unlock, with the assertion held.
+    for (int i = 0; i < 500 && occurrences(paused) == pausesBefore; ++i)
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    EXPECT_GT(occurrences(paused), pausesBefore);
+    EXPECT_EQ(exists(assertionFile(id)), !refuse);
+    unlink((root + "/run/quarterd.pausepoint").c_str());
+    EXPECT_EQ(codeOf(reply.get()), 1u);
+    EXPECT_TRUE(waitFor(assertionFile(id), false)) << "the assertion outlived the change";
+    EXPECT_EQ(userData(c).count(3), 0u);
+    if (refuse) { EXPECT_TRUE(logContains("Failed to acquire termination assertion for " + id)); }
+  }
+}
+
+TEST_F(DataProtectionTest, QuarterctlProtect) {
+  Container c = makeApp("com.example.ctl", 4);
+  const std::string ctl = root + "/quarterctl";
+  fs::copy_file(QRT_QUARTERCTL_PATH, ctl);
+  char resolved[PATH_MAX];
+  ASSERT_NE(realpath(ctl.c_str(), resolved), nullptr);
+  setIdentity("quarterctl", resolved, "com.norvane.quarterctl", {{"com.norvane.private.QuarterKit.allowed", true}});
+  const std::string command = ctl + " --root " + root + " protect --identifier com.example.ctl ";
+  EXPECT_EQ(WEXITSTATUS(system((command + "--protection-class 1 >/dev/null").c_str())), 0);
+  EXPECT_EQ(classOf(c.path + "/Documents/d0/f0"), 1);
+  EXPECT_EQ(WEXITSTATUS(system((command + "--protection-class 2 >/dev/null").c_str())), 1);
+  EXPECT_EQ(WEXITSTATUS(system((command + ">/dev/null 2>&1").c_str())), 2);
+}
+
+}  // namespace
