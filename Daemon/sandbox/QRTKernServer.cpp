@@ -234,7 +234,10 @@ bool packAnswer(sb_packbuff* pb, const Resolved& r) {
 
 int32_t server_get_process_containers(const uint8_t* request, size_t requestSize, pid_t senderPid,
                                       std::vector<uint8_t>* reply) {
-  if (senderPid != 0) return 5;
+  if (senderPid != 0) {
+    QRTLog(kLogError, "Refusing an upcall from pid %d: only the kernel may ask", static_cast<int>(senderPid));
+    return 5;
+  }
   QRTLog(kLogDebug, "request size: %u (%p)", static_cast<unsigned>(requestSize), static_cast<const void*>(request));
   // The reader never writes through the buffer. An empty region may come
   // without an address; it is still read, and refused, as a buffer.
