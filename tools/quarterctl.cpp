@@ -417,6 +417,10 @@ enum OptionBit : unsigned {
   kEntry = 1u << 9,
   kReplace = 1u << 10,  // every --old-* and --new-* option of replace but --new-class
   kNewClass = 1u << 11,
+  kCrashes = 1u << 12,
+  kSource = 1u << 13,
+  kDest = 1u << 14,
+  kRelative = 1u << 15,
   kOne = kClass | kUser | kIdentifier | kUUID,  // one existing container
   kOneRequired = kClass | kIdentifier | kUUID,
 };
@@ -445,6 +449,9 @@ struct Args {
   bool info = false;
   bool addon = false;
   std::vector<StageEntry> entries;
+  uint64_t crashes = 0;
+  std::optional<std::string> source, dest;
+  bool relative = false;
 };
 
 // The only user id the daemon accepts for bundle and system classes; for
@@ -513,6 +520,10 @@ const OptionRow kOptionTable[] = {
      [](Args& a, Text v) { a.replacement.containerClass = parseUnsigned(v, "--new-class"); }},
     {"--new-user", "N", kReplace, [](Args& a, Text v) { a.replacement.userId = parseUnsigned(v, "--new-user"); }},
     {"--new-identifier", "ID", kReplace, [](Args& a, Text v) { a.replacement.identifier = v; }},
+    {"--crashes", "N", kCrashes, [](Args& a, Text v) { a.crashes = parseUnsigned(v, "--crashes"); }},
+    {"--source", "PATH", kSource, [](Args& a, Text v) { a.source = v; }},
+    {"--dest", "PATH", kDest, [](Args& a, Text v) { a.dest = v; }},
+    {"--relative", nullptr, kRelative, [](Args& a, Text) { a.relative = true; }},
 };
 
 qk::Result createOrLookup(qk::Connection& c, const Args& a, bool create) {
@@ -607,6 +618,21 @@ const Subcommand kSubcommands[] = {
      {"ReplyDiskUsage"}, "Prints the bytes a container uses."},
     {"system-path", 15, kIdentifier, 0, [](C c, A a) { return qk::systemContainerPath(c, a.self.identifier); },
      Output::Keys, kContainerKeys, "Creates or looks up a system container (class 12, user 499)."},
+    {"retry-test", 25, kUser | kCrashes, 0,
+     [](C c, A a) { return qk::retryTest(c, a.self.userId.value_or(ownerFor(2)), a.crashes); }, Output::Whole, {},
+     "Internal builds: ends the daemon --crashes times, then removes the test container."},
+    {"stage-shared", 26, kIdentifier | kSource | kDest, kIdentifier | kSource | kDest,
+     [](C c, A a) { return qk::stageSharedContent(c, a.self.identifier, a.source, a.dest); }, Output::Keys,
+     {"ReplyPath"}, "Moves --source to --dest inside a system group container."},
+    {"network-extension", 27, kIdentifier | kClass, kIdentifier | kClass,
+     [](C c, A a) { return qk::setNetworkExtension(c, a.self.identifier, a.self.containerClass.value_or(0)); },
+     Output::Whole, {}, "Makes a VPN plug-in's data container and maps it for the tunnel worker."},
+    {"assets-path", 28, kIdentifier | kRelative, kIdentifier,
+     [](C c, A a) { return qk::userManagedAssetsPath(c, a.self.identifier, a.relative); }, Output::Keys,
+     {"ReplyPath"}, "Prints (making it on first use) an application's user-managed assets directory."},
+    {"assets-delete", 29, kIdentifier | kSource, kIdentifier | kSource,
+     [](C c, A a) { return qk::deleteUserManagedAsset(c, a.self.identifier, a.source); }, Output::Whole, {},
+     "Moves one user-managed asset (--source, relative to the assets directory) to death row."},
 };
 
 const OptionRow* findOption(const std::string& flag) {
