@@ -198,9 +198,11 @@ bool QRTKernServerStart() {
     return false;
   }
   // The upcall server looks up other programs' and group containers through
-  // the internal client; set here, before any request thread reads it.
-  QRTClientConnection::sharedClientConnection().setAllowOtherIdLookup(true);
-  QRTClientConnection::sharedClientConnection().setAllowGroupIdLookup(true);
+  // the internal client; set here, before any request thread exists, and
+  // only written when off, so that readers elsewhere never race a write.
+  QRTClientConnection& internal = QRTClientConnection::sharedClientConnection();
+  if (!internal.allowOtherIdLookup()) internal.setAllowOtherIdLookup(true);
+  if (!internal.allowGroupIdLookup()) internal.setAllowGroupIdLookup(true);
   listener->resume();
   return true;
 }
