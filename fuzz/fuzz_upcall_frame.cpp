@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "Daemon/sandbox/QRTKernServer.h"
+#include "platform/Log.h"
 #include "platform/UpcallSocket.h"
 
 namespace {
@@ -21,6 +22,13 @@ uint32_t nextRandom(uint32_t& state) {
 }
 
 }  // namespace
+
+extern "C" int LLVMFuzzerInitialize(int*, char***) {
+  // The server logs every refusal; without an open log each line would go
+  // to the system log.
+  if (!platform::logOpen("/dev/null", "fuzz_upcall_frame", 0)) abort();
+  return 0;
+}
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (size < 4) return 0;
