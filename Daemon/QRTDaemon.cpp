@@ -189,10 +189,12 @@ void set_first_boot_work_completed() {
 }
 
 bool QRTKernServerStart() {
-  // Served only from the main queue, which runs once start-up is over.
-  static std::unique_ptr<platform::UpcallListener> listener;
+  // Served only from the main queue, which runs once start-up is over. Kept
+  // for the life of the process and never destroyed, not even by exit: its
+  // threads may still be running then.
+  static platform::UpcallListener* listener = nullptr;
   const std::string path = platform::hostPath("/run/com.norvane.quarterd.upcall");
-  listener = platform::UpcallListener::create(path, platform::mainQueue(), demux_server);
+  listener = platform::UpcallListener::create(path, platform::mainQueue(), demux_server).release();
   if (!listener) {
     QRTLog(kLogError, "Failed to check in %s: %s", path.c_str(), strerror(errno));
     return false;
