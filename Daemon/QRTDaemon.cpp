@@ -17,6 +17,7 @@
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/requests/QRTRequestDispatcher.h"
+#include "Daemon/sandbox/QRTKernServer.h"
 #include "platform/DeviceProperties.h"
 #include "platform/DeviceRoot.h"
 #include "platform/FirstBoot.h"
@@ -24,6 +25,7 @@
 #include "platform/Log.h"
 #include "platform/RequestSocket.h"
 #include "platform/SafePath.h"
+#include "platform/UpcallSocket.h"
 
 using platform::kLogDebug;
 using platform::kLogError;
@@ -186,9 +188,26 @@ void set_first_boot_work_completed() {
   }
 }
 
-// The kernel upcall server joins with the sandbox integration; until then
-// there is no upcall service to check in.
-bool QRTKernServerStart() { return true; }
+bool QRTKernServerStart() {
+  // Served only from the main queue, which runs once start-up is over. Kept
+  // for the life of the process and never destroyed, not even by exit: its
+  // threads may still be running then.
+  static platform::UpcallListener* listener = nullptr;
+  const std::string path = platform::hostPath("/run/com.norvane.quarterd.upcall");
+  listener = platform::UpcallListener::create(path, platform::mainQueue(), demux_server).release();
+  if (!listener) {
+    QRTLog(kLogError, "Failed to check in %s: %s", path.c_str(), strerror(errno));
+    return false;
+  }
+  // The upcall server looks up other programs' and group containers through
+  // the internal client; set here, before any request thread exists, and
+  // only written when off, so that readers elsewhere never race a write.
+  QRTClientConnection& internal = QRTClientConnection::sharedClientConnection();
+  if (!internal.allowOtherIdLookup()) internal.setAllowOtherIdLookup(true);
+  if (!internal.allowGroupIdLookup()) internal.setAllowGroupIdLookup(true);
+  listener->resume();
+  return true;
+}
 
 int QRTDaemonMain(int argc, char** argv) {
   Options options;

@@ -429,6 +429,10 @@ enum OptionBit : unsigned {
   kSystem = 1u << 13,
   kCodeSigning = 1u << 14,  // --entitlements, --cs-info or --remove
   kCodeSigningOptions = 1u << 15,
+  kCrashes = 1u << 16,
+  kSource = 1u << 17,
+  kDest = 1u << 18,
+  kRelative = 1u << 19,
   kOne = kClass | kUser | kIdentifier | kUUID,  // one existing container
   kOneRequired = kClass | kIdentifier | kUUID,
 };
@@ -461,6 +465,9 @@ struct Args {
   bool system = false;
   std::optional<plist::Value> codeSigningInfo;  // absent with --remove
   plist::Dictionary codeSigningOptions;
+  uint64_t crashes = 0;
+  std::optional<std::string> source, dest;
+  bool relative = false;
 };
 
 plist::Value readDictionaryFile(const std::string& path) {
@@ -553,6 +560,10 @@ const OptionRow kOptionTable[] = {
      [](Args& a, Text) { a.codeSigningOptions["com.norvane.QuarterKit.PlaceholderEntitlements"] = true; }},
     {"--by-caller", nullptr, kCodeSigningOptions,
      [](Args& a, Text) { a.codeSigningOptions["RegByCaller"] = true; }},
+    {"--crashes", "N", kCrashes, [](Args& a, Text v) { a.crashes = parseUnsigned(v, "--crashes"); }},
+    {"--source", "PATH", kSource, [](Args& a, Text v) { a.source = v; }},
+    {"--dest", "PATH", kDest, [](Args& a, Text v) { a.dest = v; }},
+    {"--relative", nullptr, kRelative, [](Args& a, Text) { a.relative = true; }},
 };
 
 qk::Result createOrLookup(qk::Connection& c, const Args& a, bool create) {
@@ -676,6 +687,21 @@ const Subcommand kSubcommands[] = {
     {"codesign invalidate-missing", 20, 0, 0,
      [](C c, A) { return qk::invalidateCodeSigningInfoForAppsWithoutBundleContainer(c); }, Output::Whole, {},
      "Invalidates the entries of programs that have no bundle container."},
+    {"retry-test", 25, kUser | kCrashes, 0,
+     [](C c, A a) { return qk::retryTest(c, a.self.userId.value_or(ownerFor(2)), a.crashes); }, Output::Whole, {},
+     "Internal builds: ends the daemon --crashes times, then removes the test container."},
+    {"stage-shared", 26, kIdentifier | kSource | kDest, kIdentifier | kSource | kDest,
+     [](C c, A a) { return qk::stageSharedContent(c, a.self.identifier, a.source, a.dest); }, Output::Keys,
+     {"ReplyPath"}, "Moves --source to --dest inside a system group container."},
+    {"network-extension", 27, kIdentifier | kClass, kIdentifier | kClass,
+     [](C c, A a) { return qk::setNetworkExtension(c, a.self.identifier, a.self.containerClass.value_or(0)); },
+     Output::Whole, {}, "Makes a VPN plug-in's data container and maps it for the tunnel worker."},
+    {"assets-path", 28, kIdentifier | kRelative, kIdentifier,
+     [](C c, A a) { return qk::userManagedAssetsPath(c, a.self.identifier, a.relative); }, Output::Keys,
+     {"ReplyPath"}, "Prints (making it on first use) an application's user-managed assets directory."},
+    {"assets-delete", 29, kIdentifier | kSource, kIdentifier | kSource,
+     [](C c, A a) { return qk::deleteUserManagedAsset(c, a.self.identifier, a.source); }, Output::Whole, {},
+     "Moves one user-managed asset (--source, relative to the assets directory) to death row."},
 };
 
 const OptionRow* findOption(const std::string& flag) {

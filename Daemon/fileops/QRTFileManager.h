@@ -143,6 +143,22 @@ class QRTFileManager {
   // Logs every item of the tree, for diagnosing orphaned containers.
   void printDirectoryStructureAtURL(const QRTURL& url);
 
+  // Path containment (QRTFileManagerContainment.cpp). The path a client named
+  // inside base, resolved, or nothing (with a log line) when it could lead
+  // out of base: a ".." component, a link at any component on the way, an
+  // absolute link, or a relative link that climbs out. A relative link as the
+  // last component is followed (lexically, a few hops at most) and its target
+  // judged again. "/var" and "/private/var" name the same place. Nothing on
+  // disk changes.
+  std::optional<QRTURL> realPathForURL(const std::optional<QRTURL>& url, const std::optional<QRTURL>& ifChildOfURL);
+  // The path with no link at any component (ELOOP otherwise); with
+  // allowNonExistentPathComponents a missing tail is appended to what exists.
+  std::optional<QRTURL> _realPathForURL(const QRTURL& url, bool allowNonExistentPathComponents);
+  std::optional<QRTURL> _realPathWhatExistsInPath(const std::string& path);
+  // ".." lowers the depth, any other named component raises it; false as soon
+  // as it falls below the starting depth.
+  bool _validateSymlink(const std::optional<std::string>& path, int32_t withStartingDepth, int32_t* andEndingDepth);
+
  private:
   QRTFileManager() = default;
 };

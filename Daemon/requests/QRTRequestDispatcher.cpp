@@ -7,6 +7,7 @@
 #include "Daemon/requests/QRTCodeSigningCommands.h"
 #include "Daemon/requests/QRTContainerCommands.h"
 #include "Daemon/requests/QRTDataProtectionCommands.h"
+#include "Daemon/requests/QRTSpecialCommands.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTError.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
@@ -69,11 +70,11 @@ const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
     SERVED(22, "recreateContainerStructure", QRTHandleRecreateDefaultStructure, QRTEntitlementAllowed, 1),
     SERVED(23, "diskUsage", QRTHandleDiskUsage, QRTEntitlementAllowed, 1),
     ROW(24, "performDataMigration", QRTEntitlementDataMigration, 1),
-    ROW(25, "retryTest", QRTEntitlementAllowed, 1),
-    ROW(26, "stageSharedContent", QRTEntitlementStageSharedContent, 1),
-    ROW(27, "setNetworkExtension", QRTEntitlementNetworkExtension, 1),
-    ROW(28, "userManagedAssetsPath", QRTEntitlementUserManagedAssets, 1),
-    ROW(29, "deleteUserManagedAsset", QRTEntitlementUserManagedAssets, 1),
+    SERVED(25, "retryTest", QRTHandleRetryTest, QRTEntitlementAllowed, 1),
+    SERVED(26, "stageSharedContent", QRTHandleStageSharedContent, QRTEntitlementStageSharedContent, 1),
+    SERVED(27, "setNetworkExtension", QRTHandleSetNetworkExtension, QRTEntitlementNetworkExtension, 1),
+    SERVED(28, "userManagedAssetsPath", QRTHandleUserManagedAssetsPath, QRTEntitlementUserManagedAssets, 1),
+    SERVED(29, "deleteUserManagedAsset", QRTHandleDeleteUserManagedAsset, QRTEntitlementUserManagedAssets, 1),
 };
 #undef ROW
 #undef SERVED

@@ -94,6 +94,21 @@ class QRTClientConnection {
                         uint64_t* withError);
   bool _recoverFromReplaceOperationsWithError(QRTErrorRef* error);
 
+  // Operations inside existing containers (QRTClientConnectionAssets.cpp).
+  // Paths a client names are kept inside their container (realPathForURL).
+  std::optional<QRTURL> userManagedAssetsPathForUser(uint32_t userId, const std::optional<std::string>& identifier,
+                                                     bool isRelative, uint64_t* withError);
+  void deleteUserManagedAssetForUser(uint32_t userId, const std::optional<std::string>& identifier,
+                                     const std::optional<std::string>& relativePath, uint64_t* withError);
+  std::optional<QRTURL> stageSharedContentForIdentifier(const std::optional<std::string>& identifier,
+                                                        const std::optional<std::string>& sourceRelativePath,
+                                                        const std::optional<std::string>& destRelativePath,
+                                                        uint64_t* withError);
+  void setNetworkExtensionForUser(uint32_t userId, const std::optional<std::string>& identifier,
+                                  uint64_t containerClass, uint64_t* withError);
+  // Ends the process (exit status 0, no reply) while crashes remain.
+  void retryTestForUser(uint32_t userId, uint64_t withNumCrashes, uint64_t* withError);
+
   // Start-up work of the container store, run through the internal client.
   void rebootQuarterSetup();
   void quarterSetup();

@@ -120,7 +120,7 @@ TEST_F(QuarterctlTest, ExitStatusTellsDaemonErrorsFromUsageErrors) {
   }
 }
 
-TEST_F(QuarterctlTest, StageWipeAndSystemPath) {
+TEST_F(QuarterctlTest, StageWipeSystemPathAndAssets) {
   const std::string staged = field(run("create --class 2 --identifier com.example.staged").out, "ReplyUUID");
   EXPECT_EQ(run("stage --entry 501:2:" + staged + ":com.example.staged").status, 0);
   EXPECT_FALSE(contains(run("list --class 2").out, "com.example.staged"));
@@ -134,6 +134,11 @@ TEST_F(QuarterctlTest, StageWipeAndSystemPath) {
   CtlRun sys = run("system-path --identifier com.example.daemon");
   EXPECT_EQ(sys.status, 0) << sys.err;
   EXPECT_TRUE(std::filesystem::is_directory(field(sys.out, "ReplyPath"))) << sys.out;
+
+  ASSERT_EQ(run("create --class 2 --identifier com.example.assets").status, 0);
+  CtlRun assets = run("assets-path --identifier com.example.assets --relative");
+  EXPECT_TRUE(field(assets.out, "ReplyPath").starts_with("Library/com.norvane.UserManagedAssets.")) << assets.err;
+  EXPECT_EQ(run("assets-delete --identifier com.example.assets --source ../x").status, 1);
 }
 
 TEST_F(QuarterctlTest, CodeSigningAndGroups) {

@@ -1,0 +1,54 @@
+#include "Daemon/requests/QRTSpecialCommands.h"
+
+#include "Daemon/store/QRTGlobalConfiguration.h"
+#include "platform/DeviceProperties.h"
+#include "platform/Log.h"
+
+using platform::kLogError;
+
+namespace {
+
+// Commands 27 to 29 act for the current mobile user whatever "UserID" says.
+uint32_t mobileUser() { return QRTGlobalConfiguration::sharedInstance().currentMobileUserId(); }
+
+}  // namespace
+
+void QRTHandleRetryTest(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
+                        uint64_t* result) {
+  if (!platform::deviceIsInternalBuild()) {
+    QRTLogAs(kLogError, "retryTest", "People really shouldn't be calling this on non-internal installs!");
+    return;
+  }
+  uint32_t userId = 0;
+  if (!validateUserId(static_cast<uint32_t>(QRTMessageU64(request, "UserID")), 2, client.clientUserId(), &userId,
+                      result))
+    return;
+  client.retryTestForUser(userId, QRTMessageU64(request, "NumRetryCrashes"), result);
+}
+
+void QRTHandleStageSharedContent(const plist::Dictionary& request, const QRTReplyRef& reply,
+                                 QRTClientConnection& client, uint64_t* result) {
+  auto url = client.stageSharedContentForIdentifier(QRTMessageString(request, "Identifier"),
+                                                    QRTMessageString(request, "SourcePath"),
+                                                    QRTMessageString(request, "DestPath"), result);
+  if (url) reply->dictionary["ReplyPath"] = url->path();
+}
+
+void QRTHandleSetNetworkExtension(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
+                                  uint64_t* result) {
+  client.setNetworkExtensionForUser(mobileUser(), QRTMessageString(request, "Identifier"),
+                                    QRTMessageU64(request, "ContainerClass"), result);
+}
+
+void QRTHandleUserManagedAssetsPath(const plist::Dictionary& request, const QRTReplyRef& reply,
+                                    QRTClientConnection& client, uint64_t* result) {
+  auto url = client.userManagedAssetsPathForUser(mobileUser(), QRTMessageString(request, "Identifier"),
+                                                 QRTMessageBool(request, "IsRelative"), result);
+  if (url) reply->dictionary["ReplyPath"] = url->path();
+}
+
+void QRTHandleDeleteUserManagedAsset(const plist::Dictionary& request, const QRTReplyRef&,
+                                     QRTClientConnection& client, uint64_t* result) {
+  client.deleteUserManagedAssetForUser(mobileUser(), QRTMessageString(request, "Identifier"),
+                                       QRTMessageString(request, "SourcePath"), result);
+}

@@ -1,0 +1,115 @@
+// Commands 25 to 29: the retry test, shared content, the network extension
+// and user-managed assets, with paths and links a container's owner plants.
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "DaemonFixture.h"
+
+namespace {
+
+constexpr const char* kAssets = "com.norvane.private.QuarterKit.userManagedAssets";
+
+class SpecialCommandsTest : public DaemonFixture {};
+
+std::string replyPath(const std::optional<plist::Dictionary>& reply) {
+  auto v = at(reply, "ReplyPath");
+  return v && v->stringIf() ? *v->stringIf() : "";
+}
+
+TEST_F(SpecialCommandsTest, UserManagedAssetsStayInsideTheirDirectory) {
+  setOwnIdentity("com.example.caller", plist::Dictionary{{kAssets, true}});
+  Container app = make(501, "com.example.app", 2);
+  // "UserID" is ignored: the mobile user's container is meant.
+  auto first = call(28, {{"Identifier", "com.example.app"}, {"UserID", uint64_t{777}}});
+  ASSERT_EQ(codeOf(first), 1u);
+  const std::string assets = replyPath(first);
+  EXPECT_EQ(parentOf(assets), app.path + "/Library");
+  EXPECT_TRUE(baseName(assets).starts_with("com.norvane.UserManagedAssets."));
+  EXPECT_EQ(ownerAndMode(assets), std::make_pair(501u, 0755u));
+  auto relative = call(28, {{"Identifier", "com.example.app"}, {"IsRelative", true}});
+  EXPECT_EQ(replyPath(relative), "Library/" + baseName(assets));
+
+  // What the owner plants, as the owner.
+  const std::string outside = root + "/outside";
+  ASSERT_EQ(mkdir(outside.c_str(), 0755), 0);
+  writeFile(outside + "/file", "not yours");
+  pid_t pid = fork();
+  if (pid == 0) {
+    if (setresgid(501, 501, 501) != 0 || setresuid(501, 501, 501) != 0) _exit(2);
+    bool ok = mkdir((assets + "/sub").c_str(), 0755) == 0 && symlink(outside.c_str(), (assets + "/out_dir").c_str()) == 0 &&
+              symlink((outside + "/file").c_str(), (assets + "/out_file").c_str()) == 0 &&
+              symlink("sub", (assets + "/mid").c_str()) == 0 &&
+              symlink("../../../../../../outside", (assets + "/up").c_str()) == 0;
+    FILE* f = fopen((assets + "/sub/file").c_str(), "w");
+    _exit(ok && f && fclose(f) == 0 ? 0 : 1);
+  }
+  int status = 0;
+  ASSERT_EQ(waitpid(pid, &status, 0), pid);
+  ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+
+  struct Case {
+    const char* path;
+    uint64_t code;
+  };
+  for (Case c : {Case{"../../Library", 10}, Case{"sub/../sub/file", 10}, Case{"out_dir/file", 10},
+                 Case{"out_dir", 10}, Case{"out_file", 10}, Case{"mid/file", 10}, Case{"up", 10},
+                 Case{"/etc/passwd", 10}, Case{"", 10}}) {
+    EXPECT_EQ(codeOf(call(29, {{"Identifier", "com.example.app"}, {"SourcePath", c.path}})), c.code) << c.path;
+  }
+  EXPECT_EQ(readFile(outside + "/file"), "not yours");
+  EXPECT_TRUE(exists(root + "/etc/passwd"));
+  EXPECT_EQ(listDirectory(outside).size(), 1u);
+  EXPECT_EQ(codeOf(call(29, {{"Identifier", "com.example.app"}, {"SourcePath", "sub/file"}})), 1u);
+  EXPECT_FALSE(exists(assets + "/sub/file"));
+
+  // The directory removed by hand is not made again.
+  ASSERT_EQ(system(("rm -rf " + assets).c_str()), 0);
+  EXPECT_EQ(codeOf(call(28, {{"Identifier", "com.example.app"}})), 11u);
+  EXPECT_FALSE(exists(assets));
+}
+
+TEST_F(SpecialCommandsTest, NetworkExtensionOnlyForTheBroker) {
+  setOwnIdentity("com.example.other", plist::Dictionary{{"com.norvane.private.QuarterKit.networkExtension", true}});
+  plist::Dictionary keys{{"Identifier", "com.example.vpn"}, {"ContainerClass", uint64_t{6}}};
+  EXPECT_EQ(codeOf(call(27, keys)), 49u);
+  EXPECT_TRUE(listDirectory(root + "/private/var/mobile/Containers/Data/VPNPlugin").empty());
+  setOwnIdentity("com.norvane.tunnelbroker", plist::Dictionary{{"com.norvane.private.QuarterKit.networkExtension", true}});
+  EXPECT_EQ(codeOf(call(27, with(keys, {{"ContainerClass", uint64_t{4}}}))), 11u);
+  ASSERT_EQ(codeOf(call(27, with(keys, {{"UserID", uint64_t{0}}}))), 1u);
+  Container vpn = createOrLookup(501, "com.example.vpn", 6, false);
+  EXPECT_EQ(vpn.error, 1u);
+  EXPECT_EQ(readLink(root + "/run/sandbox/mappings/501/1/com.norvane.tunnelworker"), vpn.path);
+}
+
+TEST_F(SpecialCommandsTest, SharedContentRefusesDotsAndTheUnentitled) {
+  setOwnIdentity("com.example.caller", plist::Dictionary{{"com.norvane.private.QuarterKit.stageSharedContent", true}});
+  plist::Dictionary keys{{"Identifier", "systemgroup.com.example"}, {"SourcePath", "a"}, {"DestPath", "b"}};
+  EXPECT_EQ(codeOf(call(26, with(keys, {{"SourcePath", "x/../a"}}))), 38u);
+  EXPECT_EQ(codeOf(call(26, with(keys, {{"DestPath", ".."}}))), 38u);
+  EXPECT_EQ(codeOf(call(26, without(keys, "Identifier"))), 11u);
+  EXPECT_EQ(codeOf(call(26, keys)), 55u);
+}
+
+TEST_F(SpecialCommandsTest, RetryTestOnlyOnInternalBuilds) {
+  setOwnIdentity("com.example.caller", plist::Dictionary{{"com.norvane.private.QuarterKit.allowed", true}});
+  plist::Dictionary keys{{"NumRetryCrashes", uint64_t{1}}, {"UserID", uint64_t{501}}};
+  EXPECT_EQ(codeOf(call(25, keys)), 1u);
+  EXPECT_TRUE(logContains("People really shouldn't be calling this on non-internal installs!"));
+  EXPECT_TRUE(listDirectory(appClassDir()).empty());
+
+  writeFile(root + "/etc/device-properties.plist",
+            "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
+            "<key>InternalBuild</key><true/></dict></plist>\n");
+  // One crash: the daemon ends without a reply, then the next call cleans up.
+  EXPECT_FALSE(call(25, keys));
+  int status = -1;
+  ASSERT_EQ(waitpid(daemon, &status, 0), daemon);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+  daemon = -1;
+  startDaemon();
+  EXPECT_EQ(codeOf(call(25, keys)), 1u);
+  EXPECT_EQ(createOrLookup(501, "com.norvane.retryTest", 2, false).error, 21u);
+}
+
+}  // namespace
