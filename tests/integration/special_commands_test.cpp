@@ -89,6 +89,31 @@ TEST_F(SpecialCommandsTest, SharedContentRefusesDotsAndTheUnentitled) {
   EXPECT_EQ(codeOf(call(26, with(keys, {{"DestPath", ".."}}))), 38u);
   EXPECT_EQ(codeOf(call(26, without(keys, "Identifier"))), 11u);
   EXPECT_EQ(codeOf(call(26, keys)), 55u);
+
+  // Entitled through its own entitlements: the content moves inside the
+  // container, and never through a link the owner planted.
+  setOwnIdentity("com.example.caller", plist::Dictionary{{"com.norvane.private.QuarterKit.stageSharedContent", true},
+                                                         {"com.norvane.security.system-groups",
+                                                          plist::Array{"systemgroup.com.example"}}});
+  EXPECT_EQ(codeOf(call(26, keys)), 21u) << "the system group container is made on demand, not here";
+  auto group = at(call(16), "ReplyGroupContainerDict");
+  ASSERT_TRUE(group && group->dictionaryIf() && plist::find(*group->dictionaryIf(), "systemgroup.com.example"));
+  const std::string container = plist::find(*group->dictionaryIf(), "systemgroup.com.example")->string();
+  const std::string outside = root + "/outside";
+  writeFile(outside, "keep");
+  writeFile(container + "/a", "shared");
+  ASSERT_EQ(symlink(outside.c_str(), (container + "/link").c_str()), 0);
+  ASSERT_EQ(symlink(root.c_str(), (container + "/dir").c_str()), 0);
+  for (const auto& [source, dest] : std::vector<std::pair<std::string, std::string>>{
+           {"link", "b"}, {"a", "dir/b"}, {"/etc/passwd", "b"}, {"dir/outside", "b"}}) {
+    EXPECT_EQ(codeOf(call(26, with(keys, {{"SourcePath", source}, {"DestPath", dest}}))), 10u) << source << " " << dest;
+  }
+  EXPECT_EQ(readFile(outside), "keep");
+  EXPECT_FALSE(exists(root + "/b"));
+  auto moved = call(26, keys);
+  EXPECT_EQ(codeOf(moved), 1u);
+  EXPECT_EQ(replyPath(moved), container + "/b");
+  EXPECT_EQ(readFile(container + "/b"), "shared");
 }
 
 TEST_F(SpecialCommandsTest, RetryTestOnlyOnInternalBuilds) {

@@ -41,10 +41,17 @@ TEST_F(UpcallTest, StartingProcessGetsItsContainers) {
   plugin.containerType = 1;
   qk::UpcallRequest personaOnly;
   personaOnly.personaId = 0;
+  // The installer's registration says the program's data container is a plug-in's.
+  setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true}});
+  EXPECT_EQ(codeOf(call(18, {{"Identifier", "com.example.mapped"},
+                             {"CodeSigningInfo", plist::Dictionary{{"com.norvane.QuarterKit.Entitlements", plist::Dictionary{}}}},
+                             {"OptionsDictionary", plist::Dictionary{{"com.norvane.QuarterKit.DataContainerClass", 4}}}})),
+            1u);
   const Case cases[] = {
       {"application", app("com.example.app"), "com.example.app", 2},
       {"container id wins", both, "com.example.container", 2},
       {"unmapped plug-in", plugin, "com.example.plugin", 4},
+      {"mapped plug-in started as an application", app("com.example.mapped"), "com.example.mapped", 4},
       {"persona only", personaOnly, nullptr, 0},
   };
   for (const Case& c : cases) {
