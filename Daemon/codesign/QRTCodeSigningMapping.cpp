@@ -167,6 +167,72 @@ void QRTCodeSigningMapping::iterateGroupIdsWithKey(
   if (error) QRTLog(kLogError, "Failed to enumerate code signing info: %@", error);
 }
 
+// ---- group reference counts ----
+
+bool QRTCodeSigningMapping::_onQueue_writeEntry(const std::string& identifier,
+                                                const std::optional<QRTCodeSigningEntry>& stored,
+                                                const QRTCodeSigningEntry* wanted, QRTErrorRef* error) {
+  generation_.fetch_add(1, std::memory_order_acq_rel);
+  const bool written = wanted ? codeSigningMappingDB->addCodeSigningEntry(wanted, identifier, error)
+                              : codeSigningMappingDB->deleteCodeSigningEntryWithIdentifier(identifier, error);
+  for (QRTGroupType type : {QRTGroupTypeApplication, QRTGroupTypeSystem}) {
+    std::optional<QRTGroupReferenceCounts>& counts = groupCounts_[type];
+    if (!counts) continue;
+    if (!written) {
+      counts.reset();  // what the database holds now is not known: count it again at the next need
+      continue;
+    }
+    auto add = [&](const QRTCodeSigningEntry& entry, int64_t delta) {
+      for (const std::string& group : _groupsOfEntry(entry, identifier, type).value_or(std::vector<std::string>{})) {
+        if ((((*counts)[group] += delta)) == 0) counts->erase(group);
+      }
+    };
+    if (stored) add(*stored, -1);
+    if (wanted) add(*wanted, 1);
+  }
+  return written;
+}
+
+QRTGroupList QRTCodeSigningMapping::_groupsOfEntry(const QRTCodeSigningEntry& entry, const std::string& identifier,
+                                                   QRTGroupType type) {
+  std::optional<plist::Value> entitlements = _onQueue_entitlementsCodeSigningEntry(entry, identifier);
+  if (type == QRTGroupTypeApplication) {
+    return _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, QRTApplicationGroupsEntitlement);
+  }
+  QRTGroupList groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, QRTSystemGroupsEntitlement);
+  if (groups && !groups->empty()) return groups;
+  return _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, QRTSystemGroupContainersEntitlement);
+}
+
+std::optional<QRTGroupReferenceCounts> QRTCodeSigningMapping::_onQueue_countGroupReferences(QRTGroupType type) {
+  QRTGroupReferenceCounts counts;
+  const bool system = type == QRTGroupTypeSystem;
+  iterateGroupIdsWithKey(system ? QRTSystemGroupsEntitlement : QRTApplicationGroupsEntitlement,
+                         system ? std::optional<std::string>(QRTSystemGroupContainersEntitlement) : std::nullopt,
+                         [&](const std::string& identifier, const QRTGroupList& groups) {
+                           if (!groups) return;
+                           QRTLog(kLogDebug, "Entitlements for identifier %@ references container IDs: %@", identifier,
+                                  listValue(*groups));
+                           for (const std::string& group : *groups) ++counts[group];
+                         });
+  return counts;
+}
+
+std::optional<QRTGroupReferenceCounts> QRTCodeSigningMapping::_onQueue_groupReferenceCounts(QRTGroupType type) {
+  std::optional<QRTGroupReferenceCounts>& counts = groupCounts_[type];
+  if (!counts) counts = _onQueue_countGroupReferences(type);
+  return counts;
+}
+
+bool QRTCodeSigningMapping::groupReferenceCountsMatchDatabase() {
+  return onQueue([&] {
+    for (QRTGroupType type : {QRTGroupTypeApplication, QRTGroupTypeSystem}) {
+      if (_onQueue_groupReferenceCounts(type) != _onQueue_countGroupReferences(type)) return false;
+    }
+    return true;
+  });
+}
+
 // ---- reading ----
 
 std::optional<QRTCodeSigningEntry> QRTCodeSigningMapping::_onQueue_storedEntry(const std::string& identifier,
@@ -213,8 +279,7 @@ std::optional<plist::Dictionary> QRTCodeSigningMapping::_onQueue_codeSigningInfo
   }
   QRTCodeSigningEntry migrated(info, QRTClassAppData);
   QRTErrorRef addError;
-  generation_.fetch_add(1, std::memory_order_acq_rel);
-  if (!codeSigningMappingDB->addCodeSigningEntry(&migrated, identifier, &addError)) {
+  if (!_onQueue_writeEntry(identifier, std::nullopt, &migrated, &addError)) {
     QRTLog(kLogError, "Failed to write code signing info to DB for %@ : %@", identifier, addError);
   }
   return info;
@@ -452,15 +517,14 @@ QRTErrorRef QRTCodeSigningMapping::_setCodeSigningDictionaryValues(const std::ve
     const bool wanted = values[i].codeSigningInfo.has_value();
     if (!wanted && !stored) continue;
     if (wanted && stored && values[i] == *stored) continue;
-    generation_.fetch_add(1, std::memory_order_acq_rel);
     if (!wanted) {
-      if (codeSigningMappingDB->deleteCodeSigningEntryWithIdentifier(identifier, &error)) {
+      if (_onQueue_writeEntry(identifier, stored, nullptr, &error)) {
         QRTLog(kLogDebug, "Deleted Code Signing Mapping for ID: %@", identifier);
       } else {
         QRTLog(kLogError, "Failed to delete code signing info from DB for %@ : %@", identifier, error);
         result = error;
       }
-    } else if (codeSigningMappingDB->addCodeSigningEntry(&values[i], identifier, &error)) {
+    } else if (_onQueue_writeEntry(identifier, stored, &values[i], &error)) {
       QRTLog(kLogDebug, "Set Code Signing Mapping for ID: %@ : %@", identifier, values[i]);
     } else {
       QRTLog(kLogError, "Failed to write code signing info to DB for %@ : %@", identifier, error);

@@ -7,6 +7,7 @@
 #include <atomic>
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -31,6 +32,9 @@ inline constexpr const char* QRTSystemGroupContainersEntitlement = "com.norvane.
 inline constexpr const char* QRTSystemContainerEntitlement = "com.norvane.security.system-container";
 
 using QRTGroupList = std::optional<std::vector<std::string>>;
+// Group identifier to the number of stored programs naming it.
+using QRTGroupReferenceCounts = std::map<std::string, int64_t>;
+enum QRTGroupType : int64_t;
 
 class QRTCodeSigningMapping {
  public:
@@ -63,6 +67,13 @@ class QRTCodeSigningMapping {
   // Must be called on the queue (the group manager's counting runs there).
   void iterateGroupIdsWithKey(const std::string& key, const std::optional<std::string>& fallBackKey,
                               const std::function<void(const std::string& identifier, const QRTGroupList& groups)>& block);
+
+  // How many stored programs (invalid and placeholder ones included) name
+  // each group of the type. Counted from the database at the first need,
+  // then kept up to date by every write of an entry. Call on the queue.
+  std::optional<QRTGroupReferenceCounts> _onQueue_groupReferenceCounts(QRTGroupType type);
+  // Whether the kept counts of both types equal a fresh count (tests).
+  bool groupReferenceCountsMatchDatabase();
 
   // Counts the writes to the database, so that callers may remember an
   // answer for as long as nothing was written.
@@ -97,6 +108,13 @@ class QRTCodeSigningMapping {
                                                                      QRTErrorRef* error);
   void _onQueue_removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier);
 
+  // Every write of an entry goes through here, so that the kept group
+  // counts follow the database. No wanted entry deletes the stored one.
+  bool _onQueue_writeEntry(const std::string& identifier, const std::optional<QRTCodeSigningEntry>& stored,
+                           const QRTCodeSigningEntry* wanted, QRTErrorRef* error);
+  QRTGroupList _groupsOfEntry(const QRTCodeSigningEntry& entry, const std::string& identifier, QRTGroupType type);
+  std::optional<QRTGroupReferenceCounts> _onQueue_countGroupReferences(QRTGroupType type);
+
   // The stored entry; no entry and no error when there is none (67).
   std::optional<QRTCodeSigningEntry> _onQueue_storedEntry(const std::string& identifier, QRTErrorRef* error);
   // Parallel arrays; an entry without a code-signing dictionary deletes.
@@ -116,4 +134,5 @@ class QRTCodeSigningMapping {
   std::shared_ptr<platform::Queue> codeSignQueue;
   std::unique_ptr<QRTSQLiteDB> codeSigningMappingDB;
   std::atomic<uint64_t> generation_{0};
+  std::optional<QRTGroupReferenceCounts> groupCounts_[2];  // by group type; on the queue only
 };

@@ -20,8 +20,6 @@ using platform::kLogNotice;
 
 namespace {
 
-plist::Value listValue(const std::vector<std::string>& list) { return plist::Array(list.begin(), list.end()); }
-
 bool mobileUserHasBase(uint32_t user) {
   return QRTGlobalConfiguration::sharedInstance().getPerUserConfigurationForUserId(user)->existsUserBaseDirectory();
 }
@@ -47,18 +45,7 @@ QRTGroupManager& QRTGroupManager::defaultManager() {
 std::optional<QRTGroupManager::ReferenceCounts> QRTGroupManager::_copyReferenceCountSetOfType(QRTGroupType type) {
   QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
   if (!mapping) return std::nullopt;
-  ReferenceCounts counts;
-  const bool system = type == QRTGroupTypeSystem;
-  mapping->iterateGroupIdsWithKey(
-      system ? QRTSystemGroupsEntitlement : QRTApplicationGroupsEntitlement,
-      system ? std::optional<std::string>(QRTSystemGroupContainersEntitlement) : std::nullopt,
-      [&](const std::string& identifier, const QRTGroupList& groups) {
-        if (!groups) return;
-        QRTLog(kLogDebug, "Entitlements for identifier %@ references container IDs: %@", identifier,
-               listValue(*groups));
-        for (const std::string& group : *groups) ++counts[group];
-      });
-  return counts;
+  return mapping->_onQueue_groupReferenceCounts(type);
 }
 
 void QRTGroupManager::handleChangeFromOldGroupContainerIds(

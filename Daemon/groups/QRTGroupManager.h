@@ -35,7 +35,6 @@ class QRTGroupManager {
                                                                           uint64_t* withError);
 
  private:
-  // Group identifier to the number of stored programs naming it.
   using ReferenceCounts = std::map<std::string, int64_t>;
 
   QRTGroupManager() = default;

@@ -66,6 +66,16 @@ TEST_F(GroupRefcountTest, ContainerGoesWithTheLastProgramNamingIt) {
     ASSERT_EQ(registerGroups(program, groups), 1u);
     EXPECT_EQ(paths(program).size(), groups.size()) << program;
   }
+  // Some programs change their groups; the kept counts follow every write.
+  for (int p = 0; p < 50; p += 5) {
+    const std::string program = "com.example.member." + std::to_string(p);
+    std::vector<std::string>& groups = named[program];
+    if (!groups.empty()) groups.erase(groups.begin());
+    groups.push_back("group.shared." + std::to_string(p % 10));
+    ASSERT_EQ(registerGroups(program, groups), 1u);
+    paths(program);
+  }
+  EXPECT_TRUE(mapping().groupReferenceCountsMatchDatabase());
   std::vector<std::string> order;
   for (const auto& [program, groups] : named) order.push_back(program);
   std::shuffle(order.begin(), order.end(), random);
@@ -80,6 +90,7 @@ TEST_F(GroupRefcountTest, ContainerGoesWithTheLastProgramNamingIt) {
       const std::string group = "group.shared." + std::to_string(g);
       EXPECT_EQ(present(group), stillNamed.count(group) == 1) << group << " after dropping " << program;
     }
+    ASSERT_TRUE(mapping().groupReferenceCountsMatchDatabase()) << "after dropping " << program;
   }
 }
 
