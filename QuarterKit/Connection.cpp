@@ -93,18 +93,7 @@ void Connection::Impl::forget(uint64_t id) {
   promise.set_value(std::nullopt);
 }
 
-bool Connection::Impl::writeAll(const uint8_t* p, size_t length) {
-  while (length > 0) {
-    ssize_t n = ::send(fd, p, length, MSG_NOSIGNAL);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return false;
-    }
-    p += n;
-    length -= static_cast<size_t>(n);
-  }
-  return true;
-}
+bool Connection::Impl::writeAll(const uint8_t* p, size_t length) { return frame::sendAll(fd, p, length); }
 
 void Connection::Impl::readLoop() {
   frame::Decoder decoder;

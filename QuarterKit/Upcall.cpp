@@ -9,6 +9,7 @@
 
 #include <cstring>
 
+#include "base/Frame.h"
 #include "packbuff/packbuff.h"
 
 namespace qk {
@@ -24,27 +25,7 @@ void appendU32(std::vector<uint8_t>& out, uint32_t v) {
   out.insert(out.end(), b, b + 4);
 }
 
-bool readAll(int fd, uint8_t* data, size_t size) {
-  while (size > 0) {
-    ssize_t n = ::recv(fd, data, size, 0);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    data += n;
-    size -= static_cast<size_t>(n);
-  }
-  return true;
-}
 
-bool writeAll(int fd, const uint8_t* data, size_t size) {
-  while (size > 0) {
-    ssize_t n = ::send(fd, data, size, MSG_NOSIGNAL);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    data += n;
-    size -= static_cast<size_t>(n);
-  }
-  return true;
-}
 
 void readAnswerItems(std::vector<uint8_t>& bytes, UpcallAnswer* answer) {
   sb_packbuff* pb = sb_packbuff_init_with_buffer(bytes.data(), bytes.size(), true, SB_PACKBUFF_DEALLOC_NONE);
@@ -133,12 +114,12 @@ bool UpcallClient::send(const UpcallFrame& frame, std::span<const uint8_t> regio
                      frame.requestSize.value_or(size)})
     appendU32(out, v);
   out.insert(out.end(), region.begin(), region.end());
-  return writeAll(fd_, out.data(), out.size());
+  return frame::sendAll(fd_, out.data(), out.size());
 }
 
 std::optional<UpcallAnswer> UpcallClient::receive() {
   uint8_t header[12];
-  if (!readAll(fd_, header, sizeof header)) return std::nullopt;
+  if (!frame::recvAll(fd_, header, sizeof header)) return std::nullopt;
   UpcallAnswer answer;
   uint32_t size = 0;
   memcpy(&answer.replyId, header, 4);
@@ -146,7 +127,7 @@ std::optional<UpcallAnswer> UpcallClient::receive() {
   memcpy(&size, header + 8, 4);
   if (size > kMaxAnswer) return std::nullopt;
   std::vector<uint8_t> bytes(size);
-  if (!readAll(fd_, bytes.data(), size)) return std::nullopt;
+  if (!frame::recvAll(fd_, bytes.data(), size)) return std::nullopt;
   if (answer.returnCode == 0) readAnswerItems(bytes, &answer);
   return answer;
 }

@@ -1,5 +1,8 @@
 #include "base/Frame.h"
 
+#include <sys/socket.h>
+
+#include <cerrno>
 #include <cstring>
 
 #include "base/PlistCodec.h"
@@ -94,6 +97,30 @@ std::optional<plist::Dictionary> decodeMessage(const std::vector<uint8_t>& paylo
     return std::nullopt;
   }
   return std::move(value->dictionary());
+}
+
+bool sendAll(int fd, const void* data, size_t size) {
+  const uint8_t* p = static_cast<const uint8_t*>(data);
+  while (size > 0) {
+    ssize_t n = ::send(fd, p, size, MSG_NOSIGNAL);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return false;
+    p += n;
+    size -= static_cast<size_t>(n);
+  }
+  return true;
+}
+
+bool recvAll(int fd, void* data, size_t size) {
+  uint8_t* p = static_cast<uint8_t*>(data);
+  while (size > 0) {
+    ssize_t n = ::recv(fd, p, size, 0);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return false;
+    p += n;
+    size -= static_cast<size_t>(n);
+  }
+  return true;
 }
 
 }  // namespace frame

@@ -53,4 +53,9 @@ class Decoder {
 std::optional<plist::Dictionary> decodeMessage(const std::vector<uint8_t>& payload, std::string* error = nullptr,
                                                uint64_t* footprint = nullptr);
 
+// Whole buffers over a blocking stream socket (no SIGPIPE); false when the
+// peer went away or the socket failed.
+bool sendAll(int fd, const void* data, size_t size);
+bool recvAll(int fd, void* data, size_t size);
+
 }  // namespace frame

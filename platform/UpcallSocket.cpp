@@ -13,6 +13,7 @@
 #include <system_error>
 #include <thread>
 
+#include "base/Frame.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
 
@@ -32,16 +33,6 @@ void appendU32(std::vector<uint8_t>& out, uint32_t v) {
   out.insert(out.end(), b, b + 4);
 }
 
-bool writeAll(int fd, const uint8_t* data, size_t size) {
-  while (size > 0) {
-    ssize_t n = ::send(fd, data, size, MSG_NOSIGNAL);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    data += n;
-    size -= static_cast<size_t>(n);
-  }
-  return true;
-}
 
 }  // namespace
 
@@ -156,7 +147,7 @@ void UpcallListener::Impl::serve(int fd) {
     if (!answer) return;
     start += consumed;
     std::vector<uint8_t> frame = encodeUpcallReply(reply);
-    if (!writeAll(fd, frame.data(), frame.size())) return;
+    if (!frame::sendAll(fd, frame.data(), frame.size())) return;
   }
 }
 
