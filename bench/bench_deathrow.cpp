@@ -14,6 +14,7 @@
 #include <string>
 #include <vector>
 
+#include "bench/BenchTree.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
@@ -32,39 +33,8 @@ constexpr int kRounds = 3;
   std::exit(1);
 }
 
-void makeDirectory(const std::string& path) {
-  if (mkdir(path.c_str(), 0755) != 0) fail("mkdir " + path);
-}
 
-void buildTree(const std::string& root) {
-  const std::string content(kFileSize, 'x');
-  makeDirectory(root);
-  for (int d = 0; d < kDirectories; ++d) {
-    const std::string dir = root + "/dir" + std::to_string(d);
-    makeDirectory(dir);
-    for (int f = 0; f < kFilesPerDirectory; ++f) {
-      const std::string file = dir + "/file" + std::to_string(f);
-      int fd = open(file.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-      if (fd < 0 || write(fd, content.data(), content.size()) != static_cast<ssize_t>(content.size())) fail(file);
-      close(fd);
-    }
-  }
-}
 
-// Written-back pages of the trees just built, and the discards of earlier
-// removals, would otherwise land on whichever run comes next.
-void settle() {
-  sync();
-  sleep(3);
-  sync();
-}
-
-double timed(const std::function<void()>& work) {
-  settle();
-  auto start = std::chrono::steady_clock::now();
-  work();
-  return std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-}
 
 void deathRowPass() {
   std::promise<uint64_t> done;
@@ -74,10 +44,6 @@ void deathRowPass() {
   if (uint64_t code = result.get(); code != QRTErrorNone) fail("death-row pass returned " + std::to_string(code));
 }
 
-double median(std::vector<double> v) {
-  std::sort(v.begin(), v.end());
-  return v[v.size() / 2];
-}
 
 }  // namespace
 
@@ -86,7 +52,7 @@ int main(int argc, char** argv) {
   std::string scratch = parent + "/qrt-bench-deathrow.XXXXXX";
   if (!mkdtemp(scratch.data())) fail("mkdtemp in " + parent);
   const std::string deviceRoot = scratch + "/root";
-  makeDirectory(deviceRoot);
+  if (mkdir(deviceRoot.c_str(), 0755) != 0) fail("mkdir " + deviceRoot);
   platform::setDeviceRoot(deviceRoot);  // before the configuration computes any path
   platform::logOpen(scratch + "/quarterd.log", "bench_deathrow", platform::kLogNotice);
   const std::string deathRow = QRTGlobalConfiguration::sharedInstance().deathrowDirectory().path();
@@ -95,13 +61,13 @@ int main(int argc, char** argv) {
   for (int round = 0; round < kRounds; ++round) {
     // Laid out as staging leaves it: a holding directory with the container inside.
     const std::string holding = deathRow + "/temp.bench" + std::to_string(round);
-    makeDirectory(holding);
-    buildTree(holding + "/container");
+    if (mkdir(holding.c_str(), 0755) != 0) fail("mkdir " + holding);
+    bench::buildTree(holding + "/container", kDirectories, kFilesPerDirectory, kFileSize);
     const std::string other = scratch + "/rm" + std::to_string(round);
-    buildTree(other);
-    auto ours = [&] { pass.push_back(timed(deathRowPass)); };
+    bench::buildTree(other, kDirectories, kFilesPerDirectory, kFileSize);
+    auto ours = [&] { pass.push_back(bench::timed(deathRowPass)); };
     auto theirs = [&] {
-      rmRf.push_back(timed([&] {
+      rmRf.push_back(bench::timed([&] {
         if (std::system(("rm -rf '" + other + "'").c_str()) != 0) fail("rm -rf " + other);
       }));
     };
@@ -118,7 +84,7 @@ int main(int argc, char** argv) {
     std::printf("round %d: death-row pass %.3f s, rm -rf %.3f s\n", round + 1, pass.back(), rmRf.back());
   }
 
-  const double ourMedian = median(pass), rmMedian = median(rmRf);
+  const double ourMedian = bench::median(pass), rmMedian = bench::median(rmRf);
   std::printf("\n%d files of %zu bytes in %d directories, median of %d rounds\n\n", kDirectories * kFilesPerDirectory,
               kFileSize, kDirectories, kRounds);
   std::printf("%-30s %10s\n", "operation", "seconds");

@@ -14,6 +14,7 @@
 #include <string>
 #include <vector>
 
+#include "bench/BenchTree.h"
 #include "Daemon/fileops/QRTFileManager.h"
 
 namespace {
@@ -23,37 +24,7 @@ int gFilesPerDirectory = 200;
 constexpr size_t kFileSize = 100;
 constexpr int kRounds = 3;
 
-void buildTree(const std::string& root) {
-  const std::string content(kFileSize, 'x');
-  if (mkdir(root.c_str(), 0755) != 0) std::perror(root.c_str()), std::exit(1);
-  for (int d = 0; d < gDirectories; ++d) {
-    std::string dir = root + "/dir" + std::to_string(d);
-    mkdir(dir.c_str(), 0755);
-    for (int f = 0; f < gFilesPerDirectory; ++f) {
-      std::string file = dir + "/file" + std::to_string(f);
-      int fd = open(file.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-      if (fd < 0 || write(fd, content.data(), content.size()) != static_cast<ssize_t>(content.size()))
-        std::perror(file.c_str()), std::exit(1);
-      close(fd);
-    }
-  }
-}
 
-// Written-back pages of the trees just built, and the discards of earlier
-// removals (the disk is mounted with online discard), would otherwise land
-// on whichever run comes next.
-void settle() {
-  sync();
-  sleep(3);
-  sync();
-}
-
-double timed(const std::function<void()>& work) {
-  settle();
-  auto start = std::chrono::steady_clock::now();
-  work();
-  return std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-}
 
 void shell(const std::string& command) {
   if (std::system(command.c_str()) != 0) std::fprintf(stderr, "failed: %s\n", command.c_str()), std::exit(1);
@@ -63,13 +34,9 @@ void mustSucceed(bool ok, const QRTErrorRef& error) {
   if (!ok) std::fprintf(stderr, "failed: %s\n", error ? error->description().c_str() : "?"), std::exit(1);
 }
 
-double median(std::vector<double> v) {
-  std::sort(v.begin(), v.end());
-  return v[v.size() / 2];
-}
 
 void report(const char* ours, const std::vector<double>& a, const char* theirs, const std::vector<double>& b) {
-  double ma = median(a), mb = median(b);
+  double ma = bench::median(a), mb = bench::median(b);
   std::printf("%-34s %9.3f s\n%-34s %9.3f s\n%-34s %9.3f\n\n", ours, ma, theirs, mb, "ratio (ours / theirs)", ma / mb);
 }
 
@@ -98,14 +65,14 @@ int main(int argc, char** argv) {
   // Copies first, all kept until the end, so that no removal runs between them.
   std::vector<double> ourCopy, cpA;
   const std::string source = scratch + "/source";
-  buildTree(source);
+  bench::buildTree(source, gDirectories, gFilesPerDirectory, kFileSize);
   for (int round = 0; round < kRounds; ++round) {
     const QRTURL to = QRTURL::fileURL(scratch + "/ours" + std::to_string(round));
     const std::string cpTo = scratch + "/cp" + std::to_string(round);
     pair(
         round,
-        [&] { ourCopy.push_back(timed([&] { mustSucceed(fm._copyItemAtURL(QRTURL::fileURL(source), to, true, &error), error); })); },
-        [&] { cpA.push_back(timed([&] { shell("cp -a '" + source + "' '" + cpTo + "'"); })); });
+        [&] { ourCopy.push_back(bench::timed([&] { mustSucceed(fm._copyItemAtURL(QRTURL::fileURL(source), to, true, &error), error); })); },
+        [&] { cpA.push_back(bench::timed([&] { shell("cp -a '" + source + "' '" + cpTo + "'"); })); });
     std::printf("round %d: copy %.3f s, cp -a %.3f s\n", round + 1, ourCopy.back(), cpA.back());
   }
   shell("rm -rf '" + scratch + "'/*");
@@ -113,12 +80,12 @@ int main(int argc, char** argv) {
   std::vector<double> ourRemove, rmRf;
   for (int round = 0; round < kRounds; ++round) {
     const std::string a = scratch + "/a", b = scratch + "/b";
-    buildTree(a);
-    buildTree(b);
+    bench::buildTree(a, gDirectories, gFilesPerDirectory, kFileSize);
+    bench::buildTree(b, gDirectories, gFilesPerDirectory, kFileSize);
     pair(
         round,
-        [&] { ourRemove.push_back(timed([&] { mustSucceed(fm.removeItemAtURL(QRTURL::fileURL(a), &error), error); })); },
-        [&] { rmRf.push_back(timed([&] { shell("rm -rf '" + b + "'"); })); });
+        [&] { ourRemove.push_back(bench::timed([&] { mustSucceed(fm.removeItemAtURL(QRTURL::fileURL(a), &error), error); })); },
+        [&] { rmRf.push_back(bench::timed([&] { shell("rm -rf '" + b + "'"); })); });
     std::printf("round %d: remove %.3f s, rm -rf %.3f s\n", round + 1, ourRemove.back(), rmRf.back());
   }
   shell("rm -rf '" + scratch + "'");

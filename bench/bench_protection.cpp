@@ -19,6 +19,7 @@
 #include <string>
 #include <vector>
 
+#include "bench/BenchTree.h"
 #include "Daemon/dataprotection/QRTDataProtectionChangeOperation.h"
 #include "platform/Log.h"
 
@@ -29,19 +30,6 @@ int gFilesPerDirectory = 200;
 constexpr int kRounds = 5;
 constexpr const char* kAttribute = "trusted.com.norvane.protection-class";
 
-void buildTree(const std::string& root) {
-  if (mkdir(root.c_str(), 0755) != 0) std::perror(root.c_str()), std::exit(1);
-  for (int d = 0; d < gDirectories; ++d) {
-    std::string dir = root + "/dir" + std::to_string(d);
-    mkdir(dir.c_str(), 0755);
-    for (int f = 0; f < gFilesPerDirectory; ++f) {
-      std::string file = dir + "/file" + std::to_string(f);
-      int fd = open(file.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-      if (fd < 0) std::perror(file.c_str()), std::exit(1);
-      close(fd);
-    }
-  }
-}
 
 bool setClass(int fd, int32_t cls) {
   const auto v = static_cast<uint32_t>(cls);
@@ -80,23 +68,7 @@ void ourWalk(const std::string& root, int32_t cls) {
     std::fprintf(stderr, "failed: %s\n", error ? error->description().c_str() : "locked"), std::exit(1);
 }
 
-void settle() {
-  sync();
-  sleep(2);
-  sync();
-}
 
-double timed(const std::function<void()>& work) {
-  settle();
-  auto start = std::chrono::steady_clock::now();
-  work();
-  return std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-}
-
-double median(std::vector<double> v) {
-  std::sort(v.begin(), v.end());
-  return v[v.size() / 2];
-}
 
 }  // namespace
 
@@ -110,13 +82,13 @@ int main(int argc, char** argv) {
   platform::logOpen(scratch + "/bench.log", "com.norvane.quarterd", platform::kLogNotice);
 
   const std::string ours = scratch + "/ours", theirs = scratch + "/floor";
-  buildTree(ours);
-  buildTree(theirs);
+  bench::buildTree(ours, gDirectories, gFilesPerDirectory, 0);
+  bench::buildTree(theirs, gDirectories, gFilesPerDirectory, 0);
   std::vector<double> ourTimes, floorTimes;
   for (int round = 0; round < kRounds; ++round) {
     const int32_t cls = round % 2 ? 4 : 3;
-    auto a = [&] { ourTimes.push_back(timed([&] { ourWalk(ours, cls); })); };
-    auto b = [&] { floorTimes.push_back(timed([&] { floorWalk(AT_FDCWD, theirs.c_str(), cls); })); };
+    auto a = [&] { ourTimes.push_back(bench::timed([&] { ourWalk(ours, cls); })); };
+    auto b = [&] { floorTimes.push_back(bench::timed([&] { floorWalk(AT_FDCWD, theirs.c_str(), cls); })); };
     if (round % 2) a(), b();
     else b(), a();
     std::printf("round %d: protection walk %.3f s, openat/fsetxattr floor %.3f s\n", round + 1, ourTimes.back(),
@@ -124,7 +96,7 @@ int main(int argc, char** argv) {
   }
   if (std::system(("rm -rf '" + scratch + "'").c_str()) != 0) std::fprintf(stderr, "cannot remove %s\n", scratch.c_str());
 
-  const double a = median(ourTimes), b = median(floorTimes);
+  const double a = bench::median(ourTimes), b = bench::median(floorTimes);
   std::printf("\n%d files in %d directories, median of %d rounds\n\n", gDirectories * gFilesPerDirectory, gDirectories,
               kRounds);
   std::printf("%-34s %9.3f s\n%-34s %9.3f s\n%-34s %9.3f (target <= 1.2)\n", "protection walk", a,
