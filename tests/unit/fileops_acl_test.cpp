@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <tuple>
 
 #include "Daemon/fileops/QRTFileManager.h"
 #include "TempDir.h"
@@ -38,6 +39,11 @@ std::string aclText(const std::string& path, acl_type_t type = ACL_TYPE_ACCESS) 
 
 QRTURL dirURL(const std::string& path) { return QRTURL::fileURL(path, true); }
 
+std::tuple<uid_t, gid_t, mode_t> ownerAndMode(const std::string& path) {
+  const struct stat st = lstatOf(path);
+  return {st.st_uid, st.st_gid, st.st_mode & 07777};
+}
+
 // Each test has a device root of its own: etc/{passwd,group} and
 // tree/{meta, a/{b/{file}, tool}, link -> outside}.
 class FileManagerACLTest : public ::testing::Test {
@@ -70,14 +76,10 @@ TEST_F(FileManagerACLTest, StampedTreeGivesTheGroupEverythingAndOthersNothing) {
   EXPECT_FALSE(error);
   for (const char* item : {"", "/a", "/a/b", "/a/b/file", "/a/tool"}) {
     std::string path = root_ + item;
-    struct stat st = lstatOf(path);
     EXPECT_EQ(aclText(path), kFullList) << item;
-    if (S_ISDIR(st.st_mode)) {
-      EXPECT_EQ(aclText(path, ACL_TYPE_DEFAULT), kFullList) << item;
-    }
-    EXPECT_EQ(st.st_uid, kNobody) << item;
-    EXPECT_EQ(st.st_gid, kNobody) << item;
-    EXPECT_EQ(st.st_mode & 07777, 0070u) << item;  // only the mask shows in the mode
+    const bool directory = S_ISDIR(lstatOf(path).st_mode);
+    EXPECT_EQ(aclText(path, ACL_TYPE_DEFAULT), directory ? kFullList : "error 13") << item;
+    EXPECT_EQ(ownerAndMode(path), std::tuple(kNobody, kNobody, 0070u)) << item;  // only the mask shows in the mode
   }
 
   // Items made later inherit the group's entry without the daemon.
@@ -94,22 +96,16 @@ TEST_F(FileManagerACLTest, SystemContainerKeepsItsTopOwnerAndLeavesMetadataAndLi
   std::string meta = root_ + "/" + kMetadataName, metaACL = aclText(meta);
   ASSERT_TRUE(fm.standardizeACLsForSystemContainerAtURL(dirURL(root_), &error));
 
-  struct stat st = lstatOf(root_);
-  EXPECT_EQ(st.st_uid, 499u);
-  EXPECT_EQ(st.st_gid, 499u);
+  EXPECT_EQ(ownerAndMode(root_), std::tuple(499u, 499u, 0770u));
   EXPECT_EQ(aclText(root_), "user::rwx,group::r-x,group:4242:-wx,mask::rwx,other::---");
   EXPECT_EQ(aclText(root_, ACL_TYPE_DEFAULT), kFullList);
   EXPECT_EQ(aclText(root_ + "/a"), kFullList);
   EXPECT_EQ(lstatOf(root_ + "/a/b/file").st_uid, kNobody);
 
-  st = lstatOf(meta);
-  EXPECT_EQ(st.st_uid, 0u);
-  EXPECT_EQ(st.st_mode & 07777, 0600u);
+  EXPECT_EQ(ownerAndMode(meta), std::tuple(0u, 0u, 0600u));
   EXPECT_EQ(aclText(meta), metaACL);
   EXPECT_EQ(lstatOf(root_ + "/link").st_uid, 0u);
-  st = lstatOf(base_ + "/outside");
-  EXPECT_EQ(st.st_uid, 0u);
-  EXPECT_EQ(st.st_mode & 07777, 0644u);
+  EXPECT_EQ(ownerAndMode(base_ + "/outside"), std::tuple(0u, 0u, 0644u));
   EXPECT_EQ(aclText(base_ + "/outside"), "user::rw-,group::r--,other::r--");
 }
 
@@ -139,8 +135,7 @@ TEST_F(FileManagerACLTest, StampingEveryContainerOfAClass) {
 
 TEST_F(FileManagerACLTest, WithoutTheGroupNothingIsChanged) {
   writeGroups(false);
-  std::string before = aclText(root_ + "/a/b/file");
-  struct stat old = lstatOf(root_ + "/a/b/file");
+  const auto before = std::tuple(aclText(root_ + "/a/b/file"), ownerAndMode(root_ + "/a/b/file"));
   EXPECT_FALSE(fm.standardizeACLsAtURL(dirURL(root_), false, &error));
   ASSERT_TRUE(error);
   EXPECT_EQ(error->domain(), QRTErrorDomain);
@@ -153,27 +148,22 @@ TEST_F(FileManagerACLTest, WithoutTheGroupNothingIsChanged) {
   EXPECT_FALSE(fm.standardizeAllSystemContainerACLsAtURL(dirURL(base_), &error));
   EXPECT_EQ(error->code(), 63);
 
-  EXPECT_EQ(aclText(root_ + "/a/b/file"), before);
+  EXPECT_EQ(std::tuple(aclText(root_ + "/a/b/file"), ownerAndMode(root_ + "/a/b/file")), before);
   EXPECT_EQ(aclText(root_, ACL_TYPE_DEFAULT), "none");
-  struct stat now = lstatOf(root_ + "/a/b/file");
-  EXPECT_EQ(now.st_mode, old.st_mode);
-  EXPECT_EQ(now.st_uid, old.st_uid);
 }
 
 TEST_F(FileManagerACLTest, OwnershipResetChangesLinksThemselvesAndSetsModesByKind) {
   ASSERT_EQ(chmod((root_ + "/a/b").c_str(), 0700), 0);
   ASSERT_EQ(chmod((root_ + "/a/b/file").c_str(), 0666), 0);
   ASSERT_TRUE(fm.standardizeOwnershipAtURL(dirURL(root_), 501, 502, &error));
-  for (const char* item : {"", "/a", "/a/b", "/a/b/file", "/a/tool", "/link"}) {
-    struct stat st = lstatOf(root_ + item);
-    EXPECT_EQ(st.st_uid, 501u) << item;
-    EXPECT_EQ(st.st_gid, 502u) << item;
+  // Directories and executables 0755, other files 0644; the link itself changes hands.
+  for (const auto& [item, mode] : {std::pair("/a/b", 0755u), {"/a/tool", 0755u}, {"/a/b/file", 0644u}})
+    EXPECT_EQ(ownerAndMode(root_ + item), std::tuple(501u, 502u, mode)) << item;
+  for (const char* item : {"", "/a", "/link"}) {
+    const struct stat st = lstatOf(root_ + item);
+    EXPECT_EQ(std::pair(st.st_uid, st.st_gid), std::pair(501u, 502u)) << item;
   }
-  EXPECT_EQ(lstatOf(root_ + "/a/b").st_mode & 07777, 0755u);
-  EXPECT_EQ(lstatOf(root_ + "/a/tool").st_mode & 07777, 0755u);
-  EXPECT_EQ(lstatOf(root_ + "/a/b/file").st_mode & 07777, 0644u);
-  EXPECT_EQ(lstatOf(base_ + "/outside").st_uid, 0u);
-  EXPECT_EQ(lstatOf(base_ + "/outside").st_mode & 07777, 0644u);
+  EXPECT_EQ(ownerAndMode(base_ + "/outside"), std::tuple(0u, 0u, 0644u));
   EXPECT_EQ(lstatOf(root_ + "/" + kMetadataName).st_uid, 0u);
 
   EXPECT_FALSE(fm.standardizeOwnershipAtURL(dirURL(base_ + "/missing"), 501, 501, &error));

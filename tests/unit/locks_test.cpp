@@ -148,19 +148,6 @@ TEST_F(IdentifierLockTest, DuplicatesInAListAreLockedAndUnlockedOnce) {
   EXPECT_EQ(counts(), (Counts{2, 0, 0, 2}));
 }
 
-TEST_F(IdentifierLockTest, OppositeOrderListsDoNotDeadlock) {
-  int counter = 0;  // plain: the sanitizer sees any overlap of the holders
-  auto worker = [&](const std::vector<std::string>& list) {
-    for (int i = 0; i < 1000; ++i) {
-      _lock_identifier(list, true);
-      ++counter;
-      unlock_identifier(list);
-    }
-  };
-  runConcurrently({[&] { worker({"a", "b"}); }, [&] { worker({"b", "a"}); }});
-  EXPECT_EQ(counter, 2000);
-}
-
 TEST_F(IdentifierLockTest, AllReaderAdmitsIdentifierReadersButNotWriters) {
   // It waits for held and awaited identifier writers...
   auto reader = holdIdentifier("a", false);
@@ -298,7 +285,8 @@ TEST_F(IdentifierLockDeathTest, UnpairedUnlocksStopTheProcess) {
 
 // Mixed traffic on few identifiers. Each holder announces itself and then
 // checks for anyone it must exclude: of two conflicting holders at least one
-// sees the other. The plain values are also checked by ThreadSanitizer.
+// sees the other. The plain values are also checked by ThreadSanitizer. Lists
+// come in random order, so locking them as given would deadlock the run.
 class LockStressTest : public ::testing::Test {
  protected:
   static constexpr int kIdentifiers = 16, kThreads = 8, kOperations = 10000;

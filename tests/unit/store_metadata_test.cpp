@@ -53,16 +53,6 @@ class MetadataTest : public ::testing::Test {
   TempDir root_{"/tmp/qrt-metadata"};
 };
 
-TEST_F(MetadataTest, WriteWithoutOptionalsHasExactlyFourKeys) {
-  QRTURL url = container("Data/Application");
-  plist::Dictionary old = validDictionary();
-  old["Unknown"] = "dropped";
-  writeRaw(url, old);
-  QRTMetadata metadata(501, *QRTUUID::fromString(kUUID), 2, "com.example.app", std::nullopt, url, std::nullopt);
-  ASSERT_TRUE(metadata.writeMetadataToDiskWithError(nullptr));
-  EXPECT_EQ(QRT_dictionaryWithContentsOfURL(metadataFile(url), nullptr), validDictionary());
-}
-
 TEST_F(MetadataTest, RoundTripKeepsInfoAndAssetsDirectoryButNotTheFlags) {
   QRTURL url = container("Data/Application");
   plist::Dictionary info{{"com.norvane.Emplacer.ContentProtectionClass", 3}, {"tags", plist::Array{"a", "b"}}};
@@ -160,7 +150,9 @@ TEST_F(MetadataTest, ChecksRunInOrder) {
   EXPECT_EQ(read->info(), plist::Dictionary{});
 }
 
-TEST_F(MetadataTest, MissingPersonaIsTheExpectedUser) {
+// A missing persona is the user asked for; a wrong class directory is refused
+// at the end of the checks above, and so is one level too deep.
+TEST_F(MetadataTest, MissingPersonaIsTheExpectedUserAndClassPathMustBeTheParent) {
   plist::Dictionary d = validDictionary();
   d.erase("QRTMetadataPersona");
   QRTURL data = container("Data/Application");
@@ -170,10 +162,6 @@ TEST_F(MetadataTest, MissingPersonaIsTheExpectedUser) {
   QRTURL system = container("Data/System");
   writeRaw(system, d);
   EXPECT_EQ(expectSuccess(system, 499)->uid(), 499u);
-}
-
-// A wrong class directory is refused at the end of the checks above; so is one level too deep.
-TEST_F(MetadataTest, ClassPathMustBeTheParent) {
   QRTURL nested = container("Data/Application/extra");
   writeRaw(nested, validDictionary(2));
   expectFailure(nested, 501, 29, urlMismatch(nested, "Data/Data/Application"));
