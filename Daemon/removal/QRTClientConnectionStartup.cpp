@@ -3,7 +3,10 @@
 // Nothing here stops the daemon from starting: failures are logged and the
 // next step runs.
 
+#include <fcntl.h>
+
 #include <cerrno>
+#include <cstring>
 
 #include "Daemon/QRTCrashPoint.h"
 #include "Daemon/fileops/QRTFileManager.h"
@@ -18,6 +21,7 @@
 #include "base/QRTUUID.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Log.h"
+#include "platform/SafePath.h"
 
 using platform::kLogError;
 
@@ -75,7 +79,6 @@ void _moveSystemContainerIntoPlace(const QRTURL& restored, uint64_t containerCla
              item, destination, step);
       _moveFailedPathAside(item, failedDirectory, name);
     }
-    QRT_CRASH_POINT("startup-system-container-item-restored");
   }
   client.recreateDefaultStructureForUser(container->uid(), container->uuid(), identifier, containerClass, &code);
   if (code != QRTErrorNone) {
@@ -165,13 +168,28 @@ void QRTClientConnection::_cleanupOrphanedDataForUser(uint32_t userId, uint64_t 
     if (!isMissing(error)) QRTLog(kLogError, "Failed to get items at %@ : %@", *directory, error);
     return;
   }
+  // One resolution of the class directory for all its entries: a start-up
+  // after a reboot looks at every container of the store.
+  platform::UniqueFd classFd;
+  const int openError = platform::safeOpen(directory->path(), O_RDONLY | O_DIRECTORY, &classFd);
+  auto metadataMissing = [&](const QRTURL& entry) {
+    if (openError) return fm.itemDoesNotExistAtURL(entry.URLByAppendingPathComponent(QRTMetadataFileName));
+    platform::UniqueFd file;
+    const std::string relative = entry.lastPathComponent() + "/" + QRTMetadataFileName;
+    const int err = platform::openBeneath(classFd.get(), relative.c_str(), O_PATH, &file);
+    if (err == 0) return false;
+    if (err == ENOENT) return true;
+    QRTLog(kLogError, "Failed to determine if %@ exists: %s", entry.URLByAppendingPathComponent(QRTMetadataFileName),
+           strerror(err));
+    return false;
+  };
   const QRTWhitelist& whitelist = QRTWhitelist::sharedWhitelist();
   for (const QRTURL& entry : *entries) {
     const std::string name = entry.lastPathComponent();
     const bool wellFormed = QRTUUID::fromString(name).has_value() || whitelist.containerIdIsWellknown(name, containerClass);
     if (wellFormed) {
       // Only a metadata file known to be missing orphans a well-named container.
-      if (!fm.itemDoesNotExistAtURL(entry.URLByAppendingPathComponent(QRTMetadataFileName))) continue;
+      if (!metadataMissing(entry)) continue;
       QRTLog(kLogError, "Deleting orphaned data missing a metadata file at: %@", entry);
     }
     if (platform::deviceIsInternalBuild()) {
