@@ -687,6 +687,8 @@ const Subcommand kSubcommands[] = {
     {"codesign invalidate-missing", 20, 0, 0,
      [](C c, A) { return qk::invalidateCodeSigningInfoForAppsWithoutBundleContainer(c); }, Output::Whole, {},
      "Invalidates the entries of programs that have no bundle container."},
+    {"migrate", 24, 0, 0, [](C c, A) { return qk::performDataMigration(c); }, Output::Whole, {},
+     "Runs the data migration: ACLs, bundle ownership and the code-signing imports, each once."},
     {"retry-test", 25, kUser | kCrashes, 0,
      [](C c, A a) { return qk::retryTest(c, a.self.userId.value_or(ownerFor(2)), a.crashes); }, Output::Whole, {},
      "Internal builds: ends the daemon --crashes times, then removes the test container."},

@@ -77,7 +77,8 @@ QRTCodeSigningMapping* QRTCodeSigningMapping::sharedInstance() {
 }
 
 QRTCodeSigningMapping::QRTCodeSigningMapping(std::unique_ptr<QRTSQLiteDB> db) : codeSigningMappingDB(std::move(db)) {
-  // The legacy mapping file is imported into the database here (migrations).
+  // Before the queue exists: nothing else can reach the database yet.
+  _migrateFromMappingFileToDBIfNecessary();
   codeSignQueue = platform::makeSerialQueue("com.norvane.QuarterKit.EntitlementQueue");
 }
 
@@ -114,7 +115,15 @@ uint64_t QRTCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleCon
 void QRTCodeSigningMapping::performAllCodeSigningMigrationAndReconciliation() {
   QRTAllIdentifiersLock lock(true);
   onQueue([&] {
-    // The three migrations of older stores join here, before the reconcile.
+    // Each step is guarded on its own, so that one that throws leaves the others to run.
+    for (void (QRTCodeSigningMapping::*step)() :
+         {&QRTCodeSigningMapping::_onQueue_migrateAppGroupIdsFromDataContainersToFile,
+          &QRTCodeSigningMapping::_onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile,
+          &QRTCodeSigningMapping::_onQueue_migrateCachedCodeSigningInfoFromBundleContainersToMapping}) {
+      if (QRTErrorRef error = QRT_GUARD([&] { (this->*step)(); })) {
+        QRTLog(kLogError, "Code signing migration failed: %@", error);
+      }
+    }
     QRTGroupManager::defaultManager().reconcileGroupContainersOfType(QRTGroupTypeApplication);
   });
 }

@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "base/PlistValue.h"
+#include "base/QRTURL.h"
 #include "Daemon/QRTError.h"
 #include "Daemon/codesign/QRTCodeSigningEntry.h"
 #include "platform/Queue.h"
@@ -130,6 +131,14 @@ class QRTCodeSigningMapping {
   static QRTGroupList _systemGroupList(const std::string& identifier, const std::optional<plist::Value>& entitlements);
   // Drops, with a log line, every identifier without the "systemgroup." prefix.
   static QRTGroupList _withSystemGroupPrefix(QRTGroupList groups);
+
+  // One-time imports of older stores (QRTCodeSigningMigrations.cpp).
+  void _migrateFromMappingFileToDBIfNecessary();
+  std::optional<plist::Dictionary> _readCodeSigningMappingFromDiskAtURL(const QRTURL& url, QRTErrorRef* error);
+  void _onQueue_migrateAppGroupIdsFromDataContainersToFile();
+  void _onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
+  void _onQueue_migrateCachedCodeSigningInfoFromBundleContainersToMapping();
+  bool _addMigratedEntry(const QRTCodeSigningEntry& entry, const std::string& identifier, QRTErrorRef* error);
 
   std::shared_ptr<platform::Queue> codeSignQueue;
   std::unique_ptr<QRTSQLiteDB> codeSigningMappingDB;

@@ -22,9 +22,6 @@
 #include "platform/Log.h"
 #include "Daemon/store/QRTClientConnectionInternal.h"
 
-void QRTClientConnection::rebootQuarterSetup() {}
-void QRTClientConnection::rebootQuarterCleanup() {}
-
 namespace {
 // A replace whose old container could not be moved back out of staging keeps
 // its journal; staging must then survive until a later start completes it.

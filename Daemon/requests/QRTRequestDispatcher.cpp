@@ -28,20 +28,6 @@ void QRTReply::send(uint64_t code) {
   connection_->send(messageId_, plist::Dictionary{{"ReplyError", static_cast<uint64_t>(QRTErrorException)}});
 }
 
-namespace {
-
-// Rows whose operation is not built yet answer 49, so a client can tell an
-// unserved command from a failed one.
-void QRTHandleNotServed(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection&,
-                        uint64_t* result) {
-  uint64_t command = QRTMessageU64(request, "Command");
-  QRTLog(kLogError, "Command %llu (%s) is not served yet", command, QRTCommandTable[command].name);
-  *result = QRTErrorInvalidRequest;
-}
-
-}  // namespace
-
-#define ROW(n, name, entitlement, flag) {n, name, QRTHandleNotServed, entitlement, flag}
 #define SERVED(n, name, handler, entitlement, flag) {n, name, handler, entitlement, flag}
 const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
     SERVED(0, "createOrLookupContainer", QRTHandleCreateOrLookupContainer, QRTEntitlementNone, 1),
@@ -69,14 +55,13 @@ const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
     SERVED(21, "setDataProtection", QRTHandleSetDataProtection, QRTEntitlementAllowed, 0),
     SERVED(22, "recreateContainerStructure", QRTHandleRecreateDefaultStructure, QRTEntitlementAllowed, 1),
     SERVED(23, "diskUsage", QRTHandleDiskUsage, QRTEntitlementAllowed, 1),
-    ROW(24, "performDataMigration", QRTEntitlementDataMigration, 1),
+    SERVED(24, "performDataMigration", QRTHandlePerformDataMigration, QRTEntitlementDataMigration, 1),
     SERVED(25, "retryTest", QRTHandleRetryTest, QRTEntitlementAllowed, 1),
     SERVED(26, "stageSharedContent", QRTHandleStageSharedContent, QRTEntitlementStageSharedContent, 1),
     SERVED(27, "setNetworkExtension", QRTHandleSetNetworkExtension, QRTEntitlementNetworkExtension, 1),
     SERVED(28, "userManagedAssetsPath", QRTHandleUserManagedAssetsPath, QRTEntitlementUserManagedAssets, 1),
     SERVED(29, "deleteUserManagedAsset", QRTHandleDeleteUserManagedAsset, QRTEntitlementUserManagedAssets, 1),
 };
-#undef ROW
 #undef SERVED
 
 void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::RequestEvent& event) {

@@ -1,5 +1,6 @@
 #include "Daemon/requests/QRTSpecialCommands.h"
 
+#include "Daemon/migration/QRTContainerMigrator.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Log.h"
@@ -12,6 +13,15 @@ namespace {
 uint32_t mobileUser() { return QRTGlobalConfiguration::sharedInstance().currentMobileUserId(); }
 
 }  // namespace
+
+void QRTHandlePerformDataMigration(const plist::Dictionary&, const QRTReplyRef&, QRTClientConnection&,
+                                   uint64_t* result) {
+  QRTErrorRef error;
+  if (!QRTContainerMigrator::sharedInstance().performDataMigratorMigrationWithError(&error)) {
+    QRTLogAs(kLogError, "performDataMigration", "Failed to perform data migration : %@", error);
+    *result = error ? error->resultCode() : static_cast<uint64_t>(QRTErrorException);
+  }
+}
 
 void QRTHandleRetryTest(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
                         uint64_t* result) {

@@ -114,6 +114,9 @@ class QRTClientConnection {
   void quarterSetup();
   void rebootQuarterCleanup();
   void quarterCleanup();
+  // Hands every entry of the class directory without a valid name or a
+  // metadata file to death row.
+  void _cleanupOrphanedDataForUser(uint32_t userId, uint64_t containerClass);
 
  private:
   bool _createTopLevelContainerDirectory(const QRTURL& url, uint64_t containerClass, uint32_t owner,

@@ -1,0 +1,234 @@
+// The work of the first start after a boot: upgrade migrations, system
+// containers restored from a backup, and clearing what no container owns.
+// Nothing here stops the daemon from starting: failures are logged and the
+// next step runs.
+
+#include <fcntl.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "Daemon/QRTCrashPoint.h"
+#include "Daemon/fileops/QRTFileManager.h"
+#include "Daemon/migration/QRTContainerMigrator.h"
+#include "Daemon/migration/QRTMigrationStatus.h"
+#include "Daemon/store/QRTClientConnection.h"
+#include "Daemon/store/QRTContentClass.h"
+#include "Daemon/store/QRTGlobalConfiguration.h"
+#include "Daemon/store/QRTMetadata.h"
+#include "Daemon/store/QRTPerUserConfiguration.h"
+#include "Daemon/store/QRTWhitelist.h"
+#include "base/QRTUUID.h"
+#include "platform/DeviceProperties.h"
+#include "platform/Log.h"
+#include "platform/SafePath.h"
+
+using platform::kLogError;
+
+namespace {
+
+bool isMissing(const QRTErrorRef& error) {
+  return error && error->domain() == QRTPOSIXErrorDomain && error->code() == ENOENT;
+}
+
+QRTURL withExtension(const QRTURL& url, const char* extension) {
+  return url.URLByDeletingLastPathComponent().URLByAppendingPathComponent(url.lastPathComponent() + "." + extension,
+                                                                          true);
+}
+
+// Keeps an item that could not be restored, rather than losing it.
+void _moveFailedPathAside(const QRTURL& item, const QRTURL& directory, const std::string& name) {
+  QRTFileManager& fm = QRTFileManager::defaultManager();
+  QRTErrorRef error;
+  if (!fm.createDirectoryAtURL(directory, true, 0777, &error)) {
+    QRTLog(kLogError, "Failed to create %@: %@", directory, error);
+  }
+  const QRTURL target = directory.URLByAppendingPathComponent(name);
+  if (!fm.moveItemAtURL(item, target, &error)) QRTLog(kLogError, "Failed to move %@ to %@: %@", item, target, error);
+}
+
+void _moveSystemContainerIntoPlace(const QRTURL& restored, uint64_t containerClass, QRTClientConnection& client) {
+  const std::string identifier = restored.lastPathComponent();
+  const QRTURL failedDirectory =
+      withExtension(restored.URLByDeletingLastPathComponent(), "failed").URLByAppendingPathComponent(identifier, true);
+  uint64_t code = QRTErrorNone;
+  QRTMetadataRef container = client.createOrLookupContainerForUser(QRTSystemContainerUserId, identifier, true,
+                                                                   containerClass, false, true, &code);
+  if (code != QRTErrorNone || !container) {
+    QRTLog(kLogError, "Failed to create system container %@: %llu", identifier, static_cast<unsigned long long>(code));
+    return;
+  }
+  QRTLog(kLogError, "Restoring container for %@ at %@ to %@", identifier, restored, container->url());
+  QRTFileManager& fm = QRTFileManager::defaultManager();
+  QRTErrorRef error;
+  auto items = fm.urlsForItemsInDirectoryAtURL(restored, &error);
+  if (!items) {
+    QRTLog(kLogError, "Failed to enumerate contents of restored system container %@ at %@: %@", identifier, restored,
+           error);
+    return;
+  }
+  for (const QRTURL& item : *items) {
+    const std::string name = item.lastPathComponent();
+    const QRTURL destination = container->url().URLByAppendingPathComponent(name);
+    QRTErrorRef step;
+    if (!fm.removeItemAtURL(destination, &step)) {
+      QRTLog(kLogError, "Failed to remove destination %@:%@: %@", identifier, destination, step);
+      _moveFailedPathAside(item, failedDirectory, name);
+    } else if (!fm.moveItemAtURL(item, destination, &step)) {
+      QRTLog(kLogError, "Failed to move file in restored system container %@:%@ to destination %@: %@", identifier,
+             item, destination, step);
+      _moveFailedPathAside(item, failedDirectory, name);
+    }
+  }
+  client.recreateDefaultStructureForUser(container->uid(), container->uuid(), identifier, containerClass, &code);
+  if (code != QRTErrorNone) {
+    QRTLog(kLogError, "Error processing restored system container %@: %llu", identifier,
+           static_cast<unsigned long long>(code));
+  }
+}
+
+// Moves the backup's subdirectory to ".inprogress"; only what this start
+// moved there is installed, so an interrupted install is never repeated.
+bool takeBackupDirectory(const std::optional<QRTURL>& directory, const char* moveFailure) {
+  QRTFileManager& fm = QRTFileManager::defaultManager();
+  if (!directory || !fm.itemExistsAtURL(*directory)) return false;
+  const QRTURL inProgress = withExtension(*directory, "inprogress");
+  QRTErrorRef error;
+  if (!fm.removeItemAtURL(inProgress, &error)) {
+    QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace", "Failed to remove existing inprogress system containers: %@",
+             error);
+  }
+  if (!fm.moveItemAtURL(*directory, inProgress, &error)) {
+    QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace", moveFailure, error);
+    return false;
+  }
+  return true;
+}
+
+void installBackupDirectory(const QRTURL& directory, uint64_t containerClass, const char* listFailure,
+                            QRTClientConnection& client) {
+  const QRTURL inProgress = withExtension(directory, "inprogress");
+  QRTErrorRef error;
+  auto entries = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(inProgress, &error);
+  if (!entries) {
+    QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace", listFailure, inProgress, error);
+    return;
+  }
+  for (const QRTURL& entry : *entries) _moveSystemContainerIntoPlace(entry, containerClass, client);
+}
+
+void QRTMoveSystemContainersIntoPlace(QRTClientConnection& client) {
+  auto user = QRTGlobalConfiguration::sharedInstance().getPerUserConfigurationForCurrentMobileUser();
+  const auto data = user->systemContainerBackupDirectory();
+  const auto shared = user->systemGroupContainerBackupDirectory();
+  const bool dataMoved = takeBackupDirectory(data, "Failed to move system containers to inprogress: %@");
+  const bool sharedMoved = takeBackupDirectory(shared, "Failed to move shared system containers to inprogress: %@");
+  if (dataMoved) {
+    QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace", "Installing system containers");
+    installBackupDirectory(*data, QRTClassSystemData, "Couldn't find any system containers at %@: %@", client);
+  }
+  if (sharedMoved) {
+    QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace", "Installing system group containers");
+    installBackupDirectory(*shared, QRTClassSystemGroup, "Couldn't find any system shared containers at %@: %@",
+                           client);
+  }
+  // Internal builds keep the backup, ".inprogress" and ".failed" included, for diagnosis.
+  if (platform::deviceIsInternalBuild()) return;
+  const auto base = user->systemContainerBackupBaseDirectory();
+  QRTErrorRef error;
+  if (base && !QRTFileManager::defaultManager().removeItemAtURL(*base, &error)) {
+    QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace", "Failed to remove system container base dir %@: %@", *base,
+             error);
+  }
+}
+
+}  // namespace
+
+void QRTClientConnection::rebootQuarterSetup() {
+  if (auto status = QRTMigrationStatus::init(); status && status->isBuildUpgrade()) {
+    _regenerateAllSystemContainerPaths();
+    QRTErrorRef error;
+    if (!QRTContainerMigrator::sharedInstance().performSynchronousBuildUpgradeMigration(status.get(), &error)) {
+      QRTLog(kLogError, "Failed to perform build upgrade migration : %@", error);
+    }
+    QRT_CRASH_POINT("startup-build-upgrade-migrated");
+    // Recorded whatever the result: a failing step must not run at every boot.
+    status->writeCurrentBuildInfoToDisk();
+  }
+  QRTMoveSystemContainersIntoPlace(*this);
+}
+
+void QRTClientConnection::_cleanupOrphanedDataForUser(uint32_t userId, uint64_t containerClass) {
+  auto directory = QRTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(userId, containerClass, false);
+  if (!directory) return;
+  QRTFileManager& fm = QRTFileManager::defaultManager();
+  QRTErrorRef error;
+  auto entries = fm.urlsForItemsInDirectoryAtURL(*directory, &error);
+  if (!entries) {
+    if (!isMissing(error)) QRTLog(kLogError, "Failed to get items at %@ : %@", *directory, error);
+    return;
+  }
+  // One resolution of the class directory for all its entries: a start-up
+  // after a reboot looks at every container of the store.
+  platform::UniqueFd classFd;
+  const int openError = platform::safeOpen(directory->path(), O_RDONLY | O_DIRECTORY, &classFd);
+  auto metadataMissing = [&](const QRTURL& entry) {
+    if (openError) return fm.itemDoesNotExistAtURL(entry.URLByAppendingPathComponent(QRTMetadataFileName));
+    platform::UniqueFd file;
+    const std::string relative = entry.lastPathComponent() + "/" + QRTMetadataFileName;
+    const int err = platform::openBeneath(classFd.get(), relative.c_str(), O_PATH, &file);
+    if (err == 0) return false;
+    if (err == ENOENT) return true;
+    QRTLog(kLogError, "Failed to determine if %@ exists: %s", entry.URLByAppendingPathComponent(QRTMetadataFileName),
+           strerror(err));
+    return false;
+  };
+  const QRTWhitelist& whitelist = QRTWhitelist::sharedWhitelist();
+  for (const QRTURL& entry : *entries) {
+    const std::string name = entry.lastPathComponent();
+    const bool wellFormed = QRTUUID::fromString(name).has_value() || whitelist.containerIdIsWellknown(name, containerClass);
+    if (wellFormed) {
+      // Only a metadata file known to be missing orphans a well-named container.
+      if (!metadataMissing(entry)) continue;
+      QRTLog(kLogError, "Deleting orphaned data missing a metadata file at: %@", entry);
+    }
+    if (platform::deviceIsInternalBuild()) {
+      QRTLog(kLogError,
+             "***INTERNAL BUILD REQUEST: If you see this, file a Bugline in \"QuarterKit | all\" with the following data:");
+      QRTLog(kLogError, "\tSomeone is writing invalid data to a container, which has now been orphaned. Here are the "
+                        "invalid files:");
+      fm.printDirectoryStructureAtURL(entry);
+      QRTLog(kLogError, "***END INTERNAL BUILD REQUEST");
+    }
+    _moveItemAtURLToDeathRow(QRTURL::fileURL(entry.path(), true), true, false, nullptr);
+  }
+}
+
+void QRTClientConnection::rebootQuarterCleanup() {
+  QRTGlobalConfiguration& config = QRTGlobalConfiguration::sharedInstance();
+  QRTErrorRef error;
+  // Handed over whole; the getters make them again, empty, when next needed.
+  const QRTURL transient = config.transientDirectory();
+  if (!_moveItemAtURLToDeathRow(transient, true, false, &error)) {
+    QRTLog(kLogError, "Failed to delete shared transient URL %@ : %@", transient, error);
+  }
+  const QRTURL transientBundles = config.transientBundleDirectory();
+  if (!_moveItemAtURLToDeathRow(transientBundles, true, false, &error)) {
+    QRTLog(kLogError, "Failed to delete shared transient bundle URL %@ : %@", transientBundles, error);
+  }
+  auto user = config.getPerUserConfigurationForCurrentMobileUser();
+  if (user->existsUserBaseDirectory()) {
+    if (auto userTransient = user->transientDirectory();
+        userTransient && !_moveItemAtURLToDeathRow(*userTransient, true, false, &error)) {
+      QRTLog(kLogError, "Failed to delete per-user transient URL %@ : %@", *userTransient, error);
+    }
+    for (uint64_t cls : {QRTClassAppData, QRTClassAddonData, QRTClassVPNData, QRTClassAppGroup,
+                         QRTClassRelayServiceData, QRTClassInternalDaemonData, QRTClassTempDirData}) {
+      _cleanupOrphanedDataForUser(user->userId(), cls);
+    }
+  }
+  for (uint64_t cls : {QRTClassAppBundle, QRTClassAddonBundle, QRTClassVPNBundle, QRTClassFrameworkBundle}) {
+    _cleanupOrphanedDataForUser(QRTInstallerUserId, cls);
+  }
+  for (uint64_t cls : {QRTClassSystemData, QRTClassSystemGroup}) _cleanupOrphanedDataForUser(QRTSystemContainerUserId, cls);
+}
