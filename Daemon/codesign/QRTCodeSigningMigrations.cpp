@@ -10,6 +10,7 @@
 #include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/codesign/QRTSQLiteDB.h"
 #include "Daemon/fileops/QRTFileManager.h"
+#include "Daemon/groups/QRTGroupManager.h"
 #include "Daemon/migration/QRTMigrationStatus.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTContainerCache.h"
@@ -78,8 +79,17 @@ bool QRTCodeSigningMapping::_addMigratedEntry(const QRTCodeSigningEntry& entry, 
     QRTSetError(error, QRT_ERROR(QRTErrorInvalidArgument, nullptr, false, "Unusable identifier %@", identifier));
     return false;
   }
-  generation_.fetch_add(1, std::memory_order_acq_rel);
-  return codeSigningMappingDB->addCodeSigningEntry(&entry, identifier, error);
+  // The kept group counts need the entry this one replaces.
+  std::optional<QRTCodeSigningEntry> stored;
+  if (groupCounts_[QRTGroupTypeApplication] || groupCounts_[QRTGroupTypeSystem]) {
+    QRTErrorRef readError;
+    stored = _onQueue_storedEntry(identifier, &readError);
+    if (readError) {
+      groupCounts_[QRTGroupTypeApplication].reset();
+      groupCounts_[QRTGroupTypeSystem].reset();
+    }
+  }
+  return _onQueue_writeEntry(identifier, stored, &entry, error);
 }
 
 std::optional<plist::Dictionary> QRTCodeSigningMapping::_readCodeSigningMappingFromDiskAtURL(const QRTURL& url,
