@@ -23,6 +23,7 @@
 
 #include "base/Frame.h"
 #include "platform/Log.h"
+#include "platform/SafePath.h"
 
 namespace platform {
 
@@ -593,29 +594,19 @@ std::unique_ptr<RequestListener> RequestListener::create(const std::string& path
   impl->path = path;
   impl->queue = std::move(queue);
   impl->handler = std::move(handler);
-  // Bound under a staging name and renamed into place once listening, so
-  // that a client never finds a socket that refuses it.
-  const std::string staging = path + ".new";
-  sockaddr_un addr{};
-  if (staging.size() >= sizeof addr.sun_path) {
-    errno = ENAMETOOLONG;
+  // Any process may connect; entitlements decide what it may do.
+  UniqueFd listening;
+  if (int err = safeListenUnixSocket(path, 0666, SOCK_NONBLOCK, &listening)) {
+    errno = err;
     return fail();
   }
-  addr.sun_family = AF_UNIX;
-  memcpy(addr.sun_path, staging.c_str(), staging.size() + 1);
-  impl->listenFd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
-  if (impl->listenFd < 0) return fail();
-  if (::unlink(staging.c_str()) != 0 && errno != ENOENT) return fail();
-  if (::bind(impl->listenFd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) return fail();
+  impl->listenFd = listening.release();
   auto failBound = [&] {
     const int error = errno;
-    ::unlink(staging.c_str());
+    safeUnlink(path);
     errno = error;
     return fail();
   };
-  // Any process may connect; entitlements decide what it may do.
-  if (::fchmodat(AT_FDCWD, staging.c_str(), 0666, 0) != 0) return failBound();
-  if (::listen(impl->listenFd, SOMAXCONN) != 0) return failBound();
   impl->epollFd = ::epoll_create1(EPOLL_CLOEXEC);
   impl->wakeFd = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
   impl->budgetFd = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
@@ -641,7 +632,6 @@ std::unique_ptr<RequestListener> RequestListener::create(const std::string& path
   ev.events = EPOLLIN | EPOLLET;
   ev.data.fd = impl->sweepFd;
   if (::epoll_ctl(impl->epollFd, EPOLL_CTL_ADD, impl->sweepFd, &ev) != 0) return failBound();
-  if (::rename(staging.c_str(), path.c_str()) != 0) return failBound();
   return std::unique_ptr<RequestListener>(new RequestListener(std::move(impl)));
 }
 
@@ -682,12 +672,16 @@ void RequestListener::stopAccepting() {
   if (::epoll_ctl(impl_->epollFd, EPOLL_CTL_DEL, impl_->listenFd, nullptr) != 0 && errno != ENOENT)
     QRTLog(kLogError, "epoll_ctl(DEL) for the listener failed: %s", strerror(errno));
   impl_->stop();
-  if (::unlink(impl_->path.c_str()) != 0 && errno != ENOENT)
-    QRTLog(kLogError, "Cannot remove %s: %s", impl_->path.c_str(), strerror(errno));
+  if (int err = safeUnlink(impl_->path)) QRTLog(kLogError, "Cannot remove %s: %s", impl_->path.c_str(), strerror(err));
 }
 
 int acquireInstanceLock(const std::string& path) {
-  int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600);
+  SafeParent parent;
+  if (int err = safeOpenParent(path, &parent)) {
+    errno = err;
+    return -1;
+  }
+  int fd = ::openat(parent.fd.get(), parent.name.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600);
   if (fd < 0) return -1;
   struct stat st;
   const int statted = ::fstat(fd, &st);

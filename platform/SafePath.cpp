@@ -2,8 +2,10 @@
 
 #include <fcntl.h>
 #include <linux/openat2.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
+#include <sys/un.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -270,6 +272,38 @@ int safeReplaceFile(std::string_view hostPath, std::string_view content, mode_t 
   SafeParent parent;
   if (int err = safeOpenParent(hostPath, &parent)) return err;
   return replaceFileAt(parent.fd.get(), parent.name, content.data(), content.size(), mode);
+}
+
+int safeListenUnixSocket(std::string_view hostPath, mode_t mode, int socketFlags, UniqueFd* out) {
+  SafeParent parent;
+  if (int err = safeOpenParent(hostPath, &parent)) return err;
+  const std::string staging = parent.name + ".new";
+  // bind takes a path: the parent is reached through its descriptor's
+  // /proc entry, and bind never follows a link at the name it creates.
+  const std::string bindPath = "/proc/self/fd/" + std::to_string(parent.fd.get()) + "/" + staging;
+  sockaddr_un addr{};
+  if (bindPath.size() >= sizeof addr.sun_path) return ENAMETOOLONG;
+  addr.sun_family = AF_UNIX;
+  memcpy(addr.sun_path, bindPath.c_str(), bindPath.size() + 1);
+  UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | socketFlags, 0));
+  if (!fd.valid()) return errno;
+  if (unlinkat(parent.fd.get(), staging.c_str(), 0) != 0 && errno != ENOENT) return errno;
+  if (::bind(fd.get(), reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) return errno;
+  if (fchmodat(parent.fd.get(), staging.c_str(), mode, 0) != 0 || ::listen(fd.get(), SOMAXCONN) != 0 ||
+      renameat(parent.fd.get(), staging.c_str(), parent.fd.get(), parent.name.c_str()) != 0) {
+    const int err = errno;
+    unlinkat(parent.fd.get(), staging.c_str(), 0);
+    return err;
+  }
+  *out = std::move(fd);
+  return 0;
+}
+
+int safeUnlink(std::string_view hostPath) {
+  SafeParent parent;
+  if (int err = safeOpenParent(hostPath, &parent)) return err == ENOENT ? 0 : err;
+  if (unlinkat(parent.fd.get(), parent.name.c_str(), 0) != 0 && errno != ENOENT) return errno;
+  return 0;
 }
 
 }  // namespace platform

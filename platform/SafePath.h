@@ -68,4 +68,12 @@ int safeMakeDirectory(std::string_view hostPath, mode_t mode, bool withParents, 
 int safeReadFile(std::string_view hostPath, std::string* out, size_t limit);
 int safeReplaceFile(std::string_view hostPath, std::string_view content, mode_t mode);
 
+// A listening Unix stream socket at a host path: bound under NAME.new (a
+// stale one removed first), given its mode, listening, then renamed to NAME,
+// so that a client never finds a socket that refuses it. Every step is made
+// relative to the parent's descriptor.
+int safeListenUnixSocket(std::string_view hostPath, mode_t mode, int socketFlags, UniqueFd* out);
+// Removes a non-directory; a missing item is success.
+int safeUnlink(std::string_view hostPath);
+
 }  // namespace platform

@@ -16,6 +16,7 @@
 #include "base/Frame.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
+#include "platform/SafePath.h"
 
 namespace platform {
 
@@ -157,25 +158,9 @@ std::unique_ptr<UpcallListener> UpcallListener::create(const std::string& path, 
   impl->path = path;
   impl->queue = &serveQueue;
   impl->handler = std::move(handler);
-  // Bound under a staging name, made 0600 and listening before it is renamed
-  // into place: no one but root ever finds it open.
-  const std::string staging = path + ".new";
-  sockaddr_un addr{};
-  if (staging.size() >= sizeof addr.sun_path) {
-    errno = ENAMETOOLONG;
-    return nullptr;
-  }
-  addr.sun_family = AF_UNIX;
-  memcpy(addr.sun_path, staging.c_str(), staging.size() + 1);
-  impl->listenFd = UniqueFd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  if (impl->listenFd.get() < 0) return nullptr;
-  if (::unlink(staging.c_str()) != 0 && errno != ENOENT) return nullptr;
-  if (::bind(impl->listenFd.get(), reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) return nullptr;
-  if (::fchmodat(AT_FDCWD, staging.c_str(), 0600, 0) != 0 || ::listen(impl->listenFd.get(), SOMAXCONN) != 0 ||
-      ::rename(staging.c_str(), path.c_str()) != 0) {
-    const int error = errno;
-    ::unlink(staging.c_str());
-    errno = error;
+  // Made 0600 and listening before it has its name: no one but root ever finds it open.
+  if (int err = safeListenUnixSocket(path, 0600, 0, &impl->listenFd)) {
+    errno = err;
     return nullptr;
   }
   return std::unique_ptr<UpcallListener>(new UpcallListener(std::move(impl)));
