@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <syslog.h>
+#include <systemd/sd-journal.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -42,6 +43,7 @@ LogFile& logFile() {
 std::atomic<bool> gFileOpen{false};
 std::atomic<int> gLevel{kLogNotice};
 std::atomic<bool> gStderr{false};
+std::atomic<bool> gJournal{false};
 
 std::string levelTag(int level) {
   switch (level) {
@@ -196,12 +198,33 @@ void logSetLevel(int level) { gLevel = level; }
 
 int logLevel() { return gLevel; }
 
-bool logEnabled(int level) { return !gFileOpen.load(std::memory_order_relaxed) || level <= gLevel.load(std::memory_order_relaxed); }
+bool logEnabled(int level) {
+  const bool filtered = gFileOpen.load(std::memory_order_relaxed) || gJournal.load(std::memory_order_relaxed);
+  return !filtered || level <= gLevel.load(std::memory_order_relaxed);
+}
 
 void logSetStderr(bool on) { gStderr = on; }
 
+void logSetJournal(bool on) { gJournal = on; }
+
+bool logReopen() {
+  LogFile& file = logFile();
+  std::lock_guard lock(file.mutex);
+  if (file.path.empty()) return false;
+  closeFileLocked(file);
+  return openDirectoryLocked(file) && openFileLocked(file);
+}
+
 void logWrite(int level, const char* function, const std::string& message) {
   std::string line = formatLine(level, function, message);
+  if (gJournal) {
+    // The journal stamps time and pid itself.
+    const std::string func = escaped(function ? function : "(null)");
+    sd_journal_send("MESSAGE=%s: %s", func.c_str(), escaped(message).c_str(), "PRIORITY=%d", syslogPriority(level),
+                    "CODE_FUNC=%s", func.c_str(), "SYSLOG_IDENTIFIER=%s", program_invocation_short_name, nullptr);
+    if (gStderr) writeAll(STDERR_FILENO, line);
+    return;
+  }
   LogFile& file = logFile();
   std::lock_guard lock(file.mutex);
   if (file.fd >= 0 && file.sizeLimit > 0 && file.size > 0 && file.size + line.size() > file.sizeLimit)

@@ -23,6 +23,11 @@ int logLevel();
 bool logEnabled(int level);
 // Every line is copied to standard error as well.
 void logSetStderr(bool on);
+// Lines go to the systemd journal (with their level as priority and the
+// function as CODE_FUNC) instead of the file; set before logging starts.
+void logSetJournal(bool on);
+// Closes and reopens the file at its path, for an outside rotation (SIGHUP).
+bool logReopen();
 // Control bytes (below 0x20, and 0x7f) of the function name and the message
 // are written as \xNN, so that every message stays one line.
 void logWrite(int level, const char* function, const std::string& message);
