@@ -272,11 +272,12 @@ int QRTDaemonMain(int argc, char** argv) {
   }
   // A client that goes away mid-reply must not end the daemon.
   if (signal(SIGPIPE, SIG_IGN) == SIG_ERR) fprintf(stderr, "quarterd: cannot ignore SIGPIPE: %s\n", strerror(errno));
-  // Before any thread exists, so that every thread inherits the blocked SIGTERM.
-  platform::installTerminationHandler(stopListener);
+  // Before any thread exists, so that every thread inherits the blocked
+  // SIGHUP and SIGTERM (each handler starts a thread of its own).
   platform::installHangupHandler([] {
     if (platform::logReopen()) QRTLog(kLogNotice, "Log reopened");
   });
+  platform::installTerminationHandler(stopListener);
   if (!setUpDeviceRoot(options.root)) return 2;
 
   platform::transactionBegin();

@@ -45,11 +45,17 @@ void installHangupHandler(std::function<void()> reopen) {
     sigaddset(&signals, SIGHUP);
     if (int error = pthread_sigmask(SIG_BLOCK, &signals, nullptr))
       QRTLog(kLogError, "Cannot block SIGHUP: %s", strerror(error));
+    // The thread blocks every signal, so that none meant for the process
+    // (SIGTERM and its own handler) lands on it.
+    sigset_t all, previous;
+    sigfillset(&all);
+    pthread_sigmask(SIG_SETMASK, &all, &previous);
     try {
       std::thread(hangupThread, signals, std::move(reopen)).detach();
     } catch (const std::system_error& e) {
       QRTLog(kLogError, "Cannot start the SIGHUP handler: %s", e.what());
     }
+    pthread_sigmask(SIG_SETMASK, &previous, nullptr);
   });
 }
 
