@@ -170,7 +170,7 @@ bool takeInstanceLock() {
 void openLog(const Options& options) {
   platform::logSetStderr(options.logStderr);
   if (options.logJournal) {
-    platform::logSetJournal(true);
+    platform::logToJournal();
     platform::logSetLevel(options.logLevel);
     return;
   }

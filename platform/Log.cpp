@@ -3,7 +3,6 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <syslog.h>
-#include <systemd/sd-journal.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -43,7 +42,7 @@ LogFile& logFile() {
 std::atomic<bool> gFileOpen{false};
 std::atomic<int> gLevel{kLogNotice};
 std::atomic<bool> gStderr{false};
-std::atomic<bool> gJournal{false};
+std::atomic<LogSink> gSink{nullptr};
 
 std::string levelTag(int level) {
   switch (level) {
@@ -199,13 +198,13 @@ void logSetLevel(int level) { gLevel = level; }
 int logLevel() { return gLevel; }
 
 bool logEnabled(int level) {
-  const bool filtered = gFileOpen.load(std::memory_order_relaxed) || gJournal.load(std::memory_order_relaxed);
+  const bool filtered = gFileOpen.load(std::memory_order_relaxed) || gSink.load(std::memory_order_relaxed);
   return !filtered || level <= gLevel.load(std::memory_order_relaxed);
 }
 
 void logSetStderr(bool on) { gStderr = on; }
 
-void logSetJournal(bool on) { gJournal = on; }
+void logSetSink(LogSink sink) { gSink = sink; }
 
 bool logReopen() {
   LogFile& file = logFile();
@@ -217,11 +216,8 @@ bool logReopen() {
 
 void logWrite(int level, const char* function, const std::string& message) {
   std::string line = formatLine(level, function, message);
-  if (gJournal) {
-    // The journal stamps time and pid itself.
-    const std::string func = escaped(function ? function : "(null)");
-    sd_journal_send("MESSAGE=%s: %s", func.c_str(), escaped(message).c_str(), "PRIORITY=%d", syslogPriority(level),
-                    "CODE_FUNC=%s", func.c_str(), "SYSLOG_IDENTIFIER=%s", program_invocation_short_name, nullptr);
+  if (LogSink sink = gSink.load()) {
+    sink(syslogPriority(level), escaped(function ? function : "(null)"), escaped(message));
     if (gStderr) writeAll(STDERR_FILENO, line);
     return;
   }

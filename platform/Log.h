@@ -23,9 +23,10 @@ int logLevel();
 bool logEnabled(int level);
 // Every line is copied to standard error as well.
 void logSetStderr(bool on);
-// Lines go to the systemd journal (with their level as priority and the
-// function as CODE_FUNC) instead of the file; set before logging starts.
-void logSetJournal(bool on);
+// Where lines go instead of the file (the journal, ServiceManager.h); set
+// before logging starts. Function and message arrive escaped.
+using LogSink = void (*)(int level, const std::string& function, const std::string& message);
+void logSetSink(LogSink sink);
 // Closes and reopens the file at its path, for an outside rotation (SIGHUP).
 bool logReopen();
 // Control bytes (below 0x20, and 0x7f) of the function name and the message

@@ -3,6 +3,7 @@
 #include <pthread.h>
 #include <signal.h>
 #include <systemd/sd-daemon.h>
+#include <systemd/sd-journal.h>
 
 #include <cstring>
 #include <mutex>
@@ -29,7 +30,15 @@ void hangupThread(sigset_t signals, std::function<void()> reopen) {
   }
 }
 
+// The journal stamps time and pid itself.
+void journalSink(int priority, const std::string& function, const std::string& message) {
+  sd_journal_send("MESSAGE=%s: %s", function.c_str(), message.c_str(), "PRIORITY=%d", priority, "CODE_FUNC=%s",
+                  function.c_str(), "SYSLOG_IDENTIFIER=%s", program_invocation_short_name, nullptr);
+}
+
 }  // namespace
+
+void logToJournal() { logSetSink(journalSink); }
 
 void serviceNotifyReady(const std::string& status) { notify("READY=1\nSTATUS=" + status); }
 

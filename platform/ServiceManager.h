@@ -14,6 +14,10 @@ void serviceNotifyReady(const std::string& status);
 void serviceNotifyStopping(const std::string& status);
 void serviceNotifyStatus(const std::string& status);
 
+// Sends the log's lines to the systemd journal (level as PRIORITY, the
+// function as CODE_FUNC) instead of the file.
+void logToJournal();
+
 // On SIGHUP calls reopen from a thread of its own. Like
 // installTerminationHandler, call it before any other thread exists.
 void installHangupHandler(std::function<void()> reopen);
