@@ -175,7 +175,6 @@ void openLog(const Options& options) {
     return;
   }
   std::string logPath = QRTGlobalConfiguration::sharedInstance().logDirectory().path() + "/quarterd.log";
-  platform::logSetStderr(options.logStderr);
   if (!platform::logOpen(logPath, "com.norvane.quarterd", options.logLevel)) {
     platform::syslogWrite(LOG_ERR, QRTFormat("Failed to set up rotating logs at path %s", logPath.c_str()));
   }

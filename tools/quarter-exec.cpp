@@ -37,7 +37,8 @@ const char kUsage[] = R"(usage: quarter-exec [--root DIR] --user UID --identifie
 Runs PROGRAM as user UID, confined to the containers quarterd gives the program
 ID: read and write beneath its data container (HOME and TMPDIR point there),
 its application group, system and system group containers; read and execute of
-PROGRAM and the system's libraries; nothing else. Must be run as root.
+PROGRAM and the system's libraries, and reading its own /proc entry; nothing
+else. Must be run as root.
 
 Options:
   --root DIR         the device root of the daemon to ask (default /)
@@ -330,6 +331,10 @@ int run(const Options& options) {
   for (const char* dir : {"/usr", "/lib", "/lib64", "/lib32", "/libx32", "/bin", "/sbin", "/etc"})
     if (int err = rules.allowSystemPath(dir, strcmp(dir, "/etc") == 0 ? kReadFile | kReadDir : kSystemRights))
       return fail(kExitFailure, std::string("cannot open up ") + dir + ": " + strerror(err));
+  // Its own process directory: /proc/self names this process, which the
+  // program becomes.
+  if (int err = rules.allowSystemPath("/proc/self", kReadFile | kReadDir))
+    return fail(kExitFailure, std::string("cannot open up /proc/self: ") + strerror(err));
   for (const char* device : {"/dev/null", "/dev/zero", "/dev/full", "/dev/random", "/dev/urandom"})
     if (int err = rules.allowSystemPath(device, kReadFile | kWriteFile))
       return fail(kExitFailure, std::string("cannot open up ") + device + ": " + strerror(err));

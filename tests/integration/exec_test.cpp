@@ -95,6 +95,8 @@ TEST_F(ExecTest, ProgramReachesItsContainersAndNothingElse) {
       {"r:" + database, exists(database) ? "EACCES" : "ENOENT"},
       {"w:" + database, "EACCES"},
       {"r:" + root + "/etc/passwd", "EACCES"},  // world-readable, outside every container
+      {"r:/proc/self/status", "ok"},
+      {"r:/proc/1/status", "EACCES"},
   };
   std::vector<std::string> args{"--root", root, "--user", "501", "--identifier", "com.example.a", "--", probe};
   std::string expected;
