@@ -9,6 +9,8 @@
 #include <sys/stat.h>
 #include <syslog.h>
 
+#include <getopt.h>
+
 #include <cerrno>
 #include <cstdio>
 #include <mutex>
@@ -25,6 +27,7 @@
 #include "platform/Log.h"
 #include "platform/RequestSocket.h"
 #include "platform/SafePath.h"
+#include "platform/ServiceManager.h"
 #include "platform/UpcallSocket.h"
 
 using platform::kLogDebug;
@@ -57,26 +60,66 @@ bool gTerminating = false;
 struct Options {
   std::string root = "/";
   bool logStderr = false;
+  bool logJournal = false;
   int logLevel = platform::kLogNotice;
+  bool help = false;
+  bool version = false;
 };
 
-void usage() { fprintf(stderr, "usage: quarterd [--root DIR] [--log-stderr] [--log-level N]\n"); }
+const char kUsage[] = R"(usage: quarterd [--root DIR] [--log-stderr] [--log-level N] [--log-journal]
+
+Owns the containers of every program of a device and serves requests for them.
+
+Options:
+  --root DIR       the device root, an existing absolute directory (default /)
+  --log-stderr     also write every log line to standard error
+  --log-level N    the log's starting level, 0 to 7 (default 5; 7 adds debug lines)
+  --log-journal    log to the systemd journal instead of the log file
+  -h, --help       print this text and exit
+  -V, --version    print the version and exit
+)";
+
+void usage(FILE* to) { fputs(kUsage, to); }
 
 bool parseOptions(int argc, char** argv, Options* options) {
-  for (int i = 1; i < argc; ++i) {
-    std::string arg = argv[i];
-    if (arg == "--root" && i + 1 < argc) {
-      options->root = argv[++i];
-    } else if (arg == "--log-stderr") {
-      options->logStderr = true;
-    } else if (arg == "--log-level" && i + 1 < argc) {
-      char* end = nullptr;
-      long level = strtol(argv[++i], &end, 10);
-      if (!end || *end || level < 0 || level > 7) return false;
-      options->logLevel = static_cast<int>(level);
-    } else {
-      return false;
+  enum { kRoot = 1000, kLogStderr, kLogLevel, kLogJournal };
+  static const option kLong[] = {
+      {"root", required_argument, nullptr, kRoot},
+      {"log-stderr", no_argument, nullptr, kLogStderr},
+      {"log-level", required_argument, nullptr, kLogLevel},
+      {"log-journal", no_argument, nullptr, kLogJournal},
+      {"help", no_argument, nullptr, 'h'},
+      {"version", no_argument, nullptr, 'V'},
+      {nullptr, 0, nullptr, 0},
+  };
+  opterr = 0;
+  for (int c; (c = getopt_long(argc, argv, "+hV", kLong, nullptr)) != -1;) {
+    switch (c) {
+      case kRoot: options->root = optarg; break;
+      case kLogStderr: options->logStderr = true; break;
+      case kLogJournal: options->logJournal = true; break;
+      case kLogLevel: {
+        char* end = nullptr;
+        errno = 0;
+        long level = strtol(optarg, &end, 10);
+        if (errno || !*optarg || *end || level < 0 || level > 7) {
+          fprintf(stderr, "quarterd: --log-level takes 0 to 7, not '%s'\n", optarg);
+          return false;
+        }
+        options->logLevel = static_cast<int>(level);
+        break;
+      }
+      case 'h': options->help = true; break;
+      case 'V': options->version = true; break;
+      default:
+        fprintf(stderr, "quarterd: %s: %s\n", optopt ? "bad or incomplete option" : "unknown option",
+                argv[optind - 1]);
+        return false;
     }
+  }
+  if (optind < argc) {
+    fprintf(stderr, "quarterd: unexpected argument %s\n", argv[optind]);
+    return false;
   }
   return true;
 }
@@ -125,8 +168,13 @@ bool takeInstanceLock() {
 }
 
 void openLog(const Options& options) {
-  std::string logPath = QRTGlobalConfiguration::sharedInstance().logDirectory().path() + "/quarterd.log";
   platform::logSetStderr(options.logStderr);
+  if (options.logJournal) {
+    platform::logToJournal();
+    platform::logSetLevel(options.logLevel);
+    return;
+  }
+  std::string logPath = QRTGlobalConfiguration::sharedInstance().logDirectory().path() + "/quarterd.log";
   if (!platform::logOpen(logPath, "com.norvane.quarterd", options.logLevel)) {
     platform::syslogWrite(LOG_ERR, QRTFormat("Failed to set up rotating logs at path %s", logPath.c_str()));
   }
@@ -155,6 +203,7 @@ bool startListener() {
 }
 
 void stopListener() {
+  platform::serviceNotifyStopping("Stopping: finishing running requests");
   std::lock_guard<std::mutex> hold(gListenerLock);
   gTerminating = true;
   if (gListener) gListener->stopAccepting();
@@ -212,18 +261,28 @@ bool QRTKernServerStart() {
 int QRTDaemonMain(int argc, char** argv) {
   Options options;
   if (!parseOptions(argc, argv, &options)) {
-    usage();
+    usage(stderr);
     return 2;
+  }
+  if (options.help || options.version) {
+    if (options.help) usage(stdout);
+    else printf("quarterd %s\n", QRT_VERSION);
+    return 0;
   }
   // A client that goes away mid-reply must not end the daemon.
   if (signal(SIGPIPE, SIG_IGN) == SIG_ERR) fprintf(stderr, "quarterd: cannot ignore SIGPIPE: %s\n", strerror(errno));
-  // Before any thread exists, so that every thread inherits the blocked SIGTERM.
+  // Before any thread exists, so that every thread inherits the blocked
+  // SIGHUP and SIGTERM (each handler starts a thread of its own).
+  platform::installHangupHandler([] {
+    if (platform::logReopen()) QRTLog(kLogNotice, "Log reopened");
+  });
   platform::installTerminationHandler(stopListener);
   if (!setUpDeviceRoot(options.root)) return 2;
 
   platform::transactionBegin();
   openLog(options);
   if (!takeInstanceLock()) return 1;
+  platform::serviceNotifyStatus("Starting: recovering interrupted work");
   QRTLog(kLogDebug, "quarterd built at %s %s started", __DATE__, __TIME__);
   raiseDescriptorLimit();
   // Frames and messages of megabytes go straight back to the system when
@@ -263,5 +322,7 @@ int QRTDaemonMain(int argc, char** argv) {
   platform::transactionEnd();
 
   if (!startListener()) return -1;
+  // Only now does the request socket answer, and start-up work is done.
+  platform::serviceNotifyReady("Serving requests");
   return platform::runMainLoop();
 }

@@ -42,6 +42,7 @@ LogFile& logFile() {
 std::atomic<bool> gFileOpen{false};
 std::atomic<int> gLevel{kLogNotice};
 std::atomic<bool> gStderr{false};
+std::atomic<LogSink> gSink{nullptr};
 
 std::string levelTag(int level) {
   switch (level) {
@@ -196,12 +197,30 @@ void logSetLevel(int level) { gLevel = level; }
 
 int logLevel() { return gLevel; }
 
-bool logEnabled(int level) { return !gFileOpen.load(std::memory_order_relaxed) || level <= gLevel.load(std::memory_order_relaxed); }
+bool logEnabled(int level) {
+  const bool filtered = gFileOpen.load(std::memory_order_relaxed) || gSink.load(std::memory_order_relaxed);
+  return !filtered || level <= gLevel.load(std::memory_order_relaxed);
+}
 
 void logSetStderr(bool on) { gStderr = on; }
 
+void logSetSink(LogSink sink) { gSink = sink; }
+
+bool logReopen() {
+  LogFile& file = logFile();
+  std::lock_guard lock(file.mutex);
+  if (file.path.empty()) return false;
+  closeFileLocked(file);
+  return openDirectoryLocked(file) && openFileLocked(file);
+}
+
 void logWrite(int level, const char* function, const std::string& message) {
   std::string line = formatLine(level, function, message);
+  if (LogSink sink = gSink.load()) {
+    sink(syslogPriority(level), escaped(function ? function : "(null)"), escaped(message));
+    if (gStderr) writeAll(STDERR_FILENO, line);
+    return;
+  }
   LogFile& file = logFile();
   std::lock_guard lock(file.mutex);
   if (file.fd >= 0 && file.sizeLimit > 0 && file.size > 0 && file.size + line.size() > file.sizeLimit)

@@ -23,6 +23,12 @@ int logLevel();
 bool logEnabled(int level);
 // Every line is copied to standard error as well.
 void logSetStderr(bool on);
+// Where lines go instead of the file (the journal, ServiceManager.h); set
+// before logging starts. Function and message arrive escaped.
+using LogSink = void (*)(int level, const std::string& function, const std::string& message);
+void logSetSink(LogSink sink);
+// Closes and reopens the file at its path, for an outside rotation (SIGHUP).
+bool logReopen();
 // Control bytes (below 0x20, and 0x7f) of the function name and the message
 // are written as \xNN, so that every message stays one line.
 void logWrite(int level, const char* function, const std::string& message);

@@ -1,6 +1,8 @@
 // quarterctl: sends requests to quarterd and prints the replies, for people
 // and for scripts (--json). Exit status: 0 success, 1 the daemon answered
 // with an error, 2 usage or connection trouble.
+#include <getopt.h>
+
 #include <algorithm>
 #include <cerrno>
 #include <chrono>
@@ -10,6 +12,7 @@
 #include <cstring>
 #include <ctime>
 #include <fstream>
+#include <functional>
 #include <iostream>
 #include <memory>
 #include <optional>
@@ -18,6 +21,9 @@
 #include <utility>
 #include <vector>
 
+#include <nlohmann/json.hpp>
+
+#include "QuarterKit/Errors.h"
 #include "QuarterKit/QuarterKit.h"
 #include "QuarterKit/Requests.h"
 #include "base/PlistCodec.h"
@@ -35,12 +41,14 @@ const char kUsageHead[] = R"(usage: quarterctl [--root DIR | --socket PATH] [--j
 Sends one request to quarterd and prints its reply.
 
 Options:
-  --root DIR         talk to the daemon of device root DIR (socket DIR/run/com.norvane.quarterd)
-  --socket PATH      talk to the request socket at PATH (default /run/com.norvane.quarterd)
+  --root DIR         talk to the daemon of device root DIR (socket DIR/run/com.norvane.quarterd);
+                     without --root and --socket, the root comes from QUARTERD_ROOT, else /
+  --socket PATH      talk to the request socket at PATH
   --json             print the whole reply as a JSON object: integers as numbers, 16-byte data
                      as UUID strings, other data as base64 strings, dates as ISO 8601 strings
   --timeout SECONDS  how long to wait for the reply (default 60)
   -h, --help         this text
+  -V, --version      the version
 
 Commands:
   raw [--file FILE] [KEY=TYPE:VALUE ...]
@@ -66,8 +74,9 @@ caller's own identifier when --identifier is missing.
 Output: create, lookup, system-path and metadata print "Key: value" lines for the reply keys
 they are about; list prints "IDENTIFIER UUID" per container; info get, du, system-group-path
 and codesign get print the value alone; groups prints one line per group; the others, and raw,
-print every reply key, sorted. 16-byte data is shown as a UUID and nested values in the
-old-style property-list text form.
+print every other reply key, sorted, then "ok". 16-byte data is shown as a UUID and nested
+values in the old-style property-list text form. A failure is reported on standard error
+with its code and what it means: quarterctl: error 21 (no such container).
 
 Exit status: 0 when the reply's ReplyError is 1, 1 when it is another value, 2 on usage
 errors, connection failures and when no reply came.
@@ -76,6 +85,8 @@ errors, connection failures and when no reply came.
 struct Options {
   std::string socketPath = qk::requestSocketPath("/");
   bool json = false;
+  bool help = false;
+  bool version = false;
   std::chrono::milliseconds timeout = std::chrono::seconds(60);
   std::vector<std::string> args;  // the command and its arguments
 };
@@ -83,6 +94,28 @@ struct Options {
 struct UsageError {
   std::string message;
 };
+
+// getopt_long over args[first..]: onOption(val, optarg) for each option and,
+// with words allowed, onOption(1, word) for each other word, all in order.
+void parseLong(const std::vector<std::string>& args, size_t first, const std::vector<option>& longs,
+               const std::string& context, bool words, const std::function<void(int, const char*)>& onOption) {
+  std::vector<std::string> storage{context};
+  storage.insert(storage.end(), args.begin() + static_cast<std::ptrdiff_t>(first), args.end());
+  std::vector<char*> argv;
+  for (std::string& a : storage) argv.push_back(a.data());
+  argv.push_back(nullptr);
+  std::vector<option> table = longs;
+  table.push_back({nullptr, 0, nullptr, 0});
+  const int argc = static_cast<int>(storage.size());
+  optind = 0;  // a full restart: this runs once per word list
+  opterr = 0;
+  for (int c; (c = getopt_long(argc, argv.data(), "-:", table.data(), nullptr)) != -1;) {
+    if (c == ':') throw UsageError{std::string(argv[optind - 1]) + " needs a value"};
+    if (c == '?' || (c == 1 && !words))
+      throw UsageError{"unknown argument to " + context + ": " + (c == 1 ? optarg : argv[optind - 1])};
+    onOption(c, optarg);
+  }
+}
 
 // ---- parsing ----------------------------------------------------------------
 
@@ -261,59 +294,28 @@ std::string base64(const plist::Data& d) {
   return out;
 }
 
-void jsonString(const std::string& s, std::string& out) {
-  out += '"';
-  for (unsigned char c : s) {
-    switch (c) {
-      case '"': out += "\\\""; break;
-      case '\\': out += "\\\\"; break;
-      case '\n': out += "\\n"; break;
-      case '\r': out += "\\r"; break;
-      case '\t': out += "\\t"; break;
-      default:
-        if (c < 0x20) {
-          char buf[8];
-          snprintf(buf, sizeof buf, "\\u%04x", c);
-          out += buf;
-        } else {
-          out += static_cast<char>(c);
-        }
-    }
-  }
-  out += '"';
-}
-
-void json(const plist::Value& v, std::string& out) {
+nlohmann::json toJson(const plist::Value& v) {
   switch (v.type()) {
-    case plist::Type::Boolean: out += v.boolean() ? "true" : "false"; return;
-    case plist::Type::Integer: out += integerText(v.integer()); return;
-    case plist::Type::Real: out += std::isfinite(v.real()) ? realText(v.real()) : "null"; return;
-    case plist::Type::Date: return jsonString(dateText(v.date()), out);
-    case plist::Type::String: return jsonString(v.string(), out);
-    case plist::Type::Data: return jsonString(uuidText(v).value_or(base64(v.data())), out);
+    case plist::Type::Boolean: return v.boolean();
+    case plist::Type::Integer:
+      if (v.integer().isUnsigned) return v.integer().asUnsigned();
+      return v.integer().asSigned();
+    case plist::Type::Real: return v.real();  // NaN and infinities dump as null
+    case plist::Type::Date: return dateText(v.date());
+    case plist::Type::String: return v.string();
+    case plist::Type::Data: return uuidText(v).value_or(base64(v.data()));
     case plist::Type::Array: {
-      out += '[';
-      const char* sep = "";
-      for (const plist::Value& e : v.array()) {
-        out += std::exchange(sep, ",");
-        json(e, out);
-      }
-      out += ']';
-      return;
+      nlohmann::json out = nlohmann::json::array();
+      for (const plist::Value& e : v.array()) out.push_back(toJson(e));
+      return out;
     }
     case plist::Type::Dictionary: {
-      out += '{';
-      const char* sep = "";
-      for (const auto& [k, e] : v.dictionary()) {
-        out += std::exchange(sep, ",");
-        jsonString(k, out);
-        out += ':';
-        json(e, out);
-      }
-      out += '}';
-      return;
+      nlohmann::json out = nlohmann::json::object();
+      for (const auto& [k, e] : v.dictionary()) out[k] = toJson(e);
+      return out;
     }
   }
+  return nullptr;
 }
 
 // How a subcommand shows a reply when --json is not given.
@@ -336,18 +338,20 @@ void printList(const qk::Reply& reply) {
 void printReply(const qk::Reply& reply, const Options& options, Output output,
                 const std::vector<std::string>& keys) {
   if (options.json) {
-    std::string out;
-    json(plist::Value(reply.dictionary()), out);
-    std::cout << out << '\n';
+    // A string the daemon sent that is not UTF-8 is shown with U+FFFD, not refused.
+    std::cout << toJson(plist::Value(reply.dictionary())).dump(-1, ' ', false, nlohmann::json::error_handler_t::replace)
+              << '\n';
     return;
   }
   switch (output) {
     case Output::Whole:
     case Output::Keys:
       for (const auto& [key, value] : reply.dictionary()) {
-        bool wanted = output == Output::Whole || std::find(keys.begin(), keys.end(), key) != keys.end();
+        bool wanted = output == Output::Whole ? key != "ReplyError"
+                                              : std::find(keys.begin(), keys.end(), key) != keys.end();
         if (wanted) std::cout << key << ": " << plainText(value) << '\n';
       }
+      if (output == Output::Whole && reply.ok()) std::cout << "ok\n";
       return;
     case Output::List:
       if (reply.ok()) printList(reply);
@@ -386,25 +390,18 @@ int finish(const qk::Connection& connection, const std::optional<qk::Reply>& rep
   }
   printReply(*reply, options, output, keys);
   if (reply->ok()) return kExitOK;
-  // Whole output already showed ReplyError.
-  if (!options.json && output != Output::Whole)
-    std::cerr << "quarterctl: request failed: ReplyError " << reply->error() << '\n';
+  std::cerr << "quarterctl: " << qk::describeResult(reply->error()) << '\n';
   return kExitReplyError;
 }
 
 int runRaw(const Options& options) {
   plist::Dictionary request;
-  const auto& args = options.args;
-  for (size_t i = 1; i < args.size(); ++i) {
-    if (args[i] == "--file") {
-      if (++i == args.size()) throw UsageError{"--file needs a path"};
-      plist::Value file = readPlistFile(args[i]);
-      if (!file.isDictionary()) throw UsageError{args[i] + " does not hold a dictionary"};
-      for (auto& [k, v] : file.dictionary()) request.insert_or_assign(k, v);
-    } else {
-      addAssignment(args[i], request);
-    }
-  }
+  parseLong(options.args, 1, {{"file", required_argument, nullptr, 'f'}}, "raw", true, [&](int c, const char* arg) {
+    if (c == 1) return addAssignment(arg, request);
+    plist::Value file = readPlistFile(arg);
+    if (!file.isDictionary()) throw UsageError{std::string(arg) + " does not hold a dictionary"};
+    for (auto& [k, v] : file.dictionary()) request.insert_or_assign(k, v);
+  });
   auto connection = connectOrExplain(options);
   if (!connection) return kExitUsage;
   return finish(*connection, qk::perform(*connection, qk::Request(std::move(request))), options);
@@ -706,12 +703,6 @@ const Subcommand kSubcommands[] = {
      "Moves one user-managed asset (--source, relative to the assets directory) to death row."},
 };
 
-const OptionRow* findOption(const std::string& flag) {
-  for (const OptionRow& option : kOptionTable)
-    if (flag == option.flag) return &option;
-  return nullptr;
-}
-
 // The subcommand named by the first one or two words; *words says how many.
 const Subcommand* findSubcommand(const std::vector<std::string>& args, size_t* words) {
   for (const Subcommand& row : kSubcommands) {
@@ -729,18 +720,19 @@ const Subcommand* findSubcommand(const std::vector<std::string>& args, size_t* w
 
 Args parseArgs(const Subcommand& row, const std::vector<std::string>& args, size_t first) {
   Args a;
-  for (size_t i = first; i < args.size(); ++i) {
-    const OptionRow* option = findOption(args[i]);
-    if (!option || !(option->bit & row.options))
-      throw UsageError{"unknown argument to " + std::string(row.name) + ": " + args[i]};
-    std::string value;
-    if (option->valueName) {
-      if (i + 1 == args.size()) throw UsageError{args[i] + " needs a value"};
-      value = args[++i];
-    }
-    option->set(a, value);
-    a.given |= option->bit;
+  std::vector<option> longs;
+  constexpr int kBase = 1000;
+  for (size_t i = 0; i < std::size(kOptionTable); ++i) {
+    const OptionRow& entry = kOptionTable[i];
+    if (entry.bit & row.options)
+      longs.push_back({entry.flag + 2, entry.valueName ? required_argument : no_argument, nullptr,
+                       kBase + static_cast<int>(i)});
   }
+  parseLong(args, first, longs, row.name, false, [&](int c, const char* value) {
+    const OptionRow& entry = kOptionTable[c - kBase];
+    entry.set(a, value ? value : "");
+    a.given |= entry.bit;
+  });
   unsigned missing = row.required & ~a.given;
   if (a.addon) missing &= ~kClass;  // the addon wipe always works on class 4
   for (const OptionRow& option : kOptionTable)
@@ -770,21 +762,22 @@ int runProtect(const Options& options) {
   uint64_t containerClass = 2;
   std::optional<uint64_t> userId;
   bool thirdParty = false, retryIfLocked = false;
-  const auto& args = options.args;
-  for (size_t i = 1; i < args.size(); ++i) {
-    const std::string& flag = args[i];
-    auto value = [&]() -> const std::string& {
-      if (i + 1 == args.size()) throw UsageError{flag + " needs a value"};
-      return args[++i];
-    };
-    if (flag == "--identifier") identifier = value();
-    else if (flag == "--protection-class") protectionClass = parseSigned(value(), flag);
-    else if (flag == "--class") containerClass = parseUnsigned(value(), flag);
-    else if (flag == "--user") userId = parseUnsigned(value(), flag);
-    else if (flag == "--third-party") thirdParty = true;
-    else if (flag == "--retry-if-locked") retryIfLocked = true;
-    else throw UsageError{"unknown argument to protect: " + flag};
-  }
+  enum { kIdentifierOpt = 1000, kProtection, kClassOpt, kUserOpt, kThirdParty, kRetry };
+  const std::vector<option> longs = {
+      {"identifier", required_argument, nullptr, kIdentifierOpt}, {"protection-class", required_argument, nullptr, kProtection},
+      {"class", required_argument, nullptr, kClassOpt},           {"user", required_argument, nullptr, kUserOpt},
+      {"third-party", no_argument, nullptr, kThirdParty},         {"retry-if-locked", no_argument, nullptr, kRetry},
+  };
+  parseLong(options.args, 1, longs, "protect", false, [&](int c, const char* value) {
+    switch (c) {
+      case kIdentifierOpt: identifier = value; break;
+      case kProtection: protectionClass = parseSigned(value, "--protection-class"); break;
+      case kClassOpt: containerClass = parseUnsigned(value, "--class"); break;
+      case kUserOpt: userId = parseUnsigned(value, "--user"); break;
+      case kThirdParty: thirdParty = true; break;
+      case kRetry: retryIfLocked = true; break;
+    }
+  });
   if (!identifier) throw UsageError{"protect needs --identifier"};
   if (!protectionClass) throw UsageError{"protect needs --protection-class"};
   auto connection = connectOrExplain(options);
@@ -818,26 +811,41 @@ std::string usageText() {
 // Global options stop at the first word that is not one.
 Options parseOptions(int argc, char** argv) {
   Options options;
-  int i = 1;
-  for (; i < argc; ++i) {
-    std::string a = argv[i];
-    auto next = [&]() -> std::string {
-      if (i + 1 == argc) throw UsageError{a + " needs a value"};
-      return argv[++i];
-    };
-    if (a == "--root") options.socketPath = qk::requestSocketPath(next());
-    else if (a == "--socket") options.socketPath = next();
-    else if (a == "--json") options.json = true;
-    else if (a == "--timeout") options.timeout = std::chrono::seconds(parseUnsigned(next(), a));
-    else if (a.size() > 1 && a[0] == '-' && a != "-h" && a != "--help") throw UsageError{"unknown option " + a};
-    else break;
+  if (const char* root = getenv("QUARTERD_ROOT"); root && *root) options.socketPath = qk::requestSocketPath(root);
+  enum { kRoot = 1000, kSocket, kJson, kTimeout };
+  static const option kLong[] = {
+      {"root", required_argument, nullptr, kRoot}, {"socket", required_argument, nullptr, kSocket},
+      {"json", no_argument, nullptr, kJson},       {"timeout", required_argument, nullptr, kTimeout},
+      {"help", no_argument, nullptr, 'h'},         {"version", no_argument, nullptr, 'V'},
+      {nullptr, 0, nullptr, 0},
+  };
+  opterr = 0;
+  for (int c; (c = getopt_long(argc, argv, "+:hV", kLong, nullptr)) != -1;) {
+    switch (c) {
+      case kRoot: options.socketPath = qk::requestSocketPath(optarg); break;
+      case kSocket: options.socketPath = optarg; break;
+      case kJson: options.json = true; break;
+      case kTimeout: options.timeout = std::chrono::seconds(parseUnsigned(optarg, "--timeout")); break;
+      case 'h': options.help = true; break;
+      case 'V': options.version = true; break;
+      case ':': throw UsageError{std::string(argv[optind - 1]) + " needs a value"};
+      default: throw UsageError{"unknown option " + std::string(argv[optind - 1])};
+    }
   }
-  options.args.assign(argv + i, argv + argc);
+  options.args.assign(argv + optind, argv + argc);
   return options;
 }
 
 int run(int argc, char** argv) {
   Options options = parseOptions(argc, argv);
+  if (options.version) {
+    std::cout << "quarterctl " << QRT_VERSION << '\n';
+    return kExitOK;
+  }
+  if (options.help) {
+    std::cout << usageText();
+    return kExitOK;
+  }
   if (options.args.empty()) throw UsageError{"no command given"};
   const std::string& command = options.args[0];
   bool help = command == "help" ||

@@ -1,0 +1,121 @@
+// quarterd as a service: readiness and stopping told to the service manager
+// through a notify socket this test owns, SIGHUP reopening the log, and the
+// tools' --help agreeing with their man pages.
+#include <signal.h>
+#include <stdio.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <regex>
+#include <set>
+#include <string>
+#include <vector>
+
+#include "DaemonFixture.h"
+
+namespace {
+
+bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
+
+class ServiceTest : public DaemonFixture {
+ protected:
+  // Restarts the daemon with NOTIFY_SOCKET naming a datagram socket of ours.
+  void restartNotifying() {
+    ASSERT_EQ(stopDaemon(), 0);
+    notify = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+    ASSERT_GE(notify, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    const std::string path = root + "/notify";
+    ASSERT_LT(path.size(), sizeof address.sun_path);
+    path.copy(address.sun_path, path.size());
+    ASSERT_EQ(bind(notify, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    timeval timeout{30, 0};
+    setsockopt(notify, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
+    setenv("NOTIFY_SOCKET", path.c_str(), 1);
+    startDaemon();
+    unsetenv("NOTIFY_SOCKET");
+  }
+  void TearDown() override {
+    if (notify >= 0) close(notify);
+    DaemonFixture::TearDown();
+  }
+
+  // Messages up to and including the first that holds state; empty when none came.
+  std::vector<std::string> receiveUntil(const std::string& state) {
+    std::vector<std::string> messages;
+    char buffer[4096];
+    for (ssize_t n; (n = recv(notify, buffer, sizeof buffer, 0)) > 0;) {
+      messages.emplace_back(buffer, static_cast<size_t>(n));
+      if (contains(messages.back(), state)) return messages;
+    }
+    return {};
+  }
+
+  int notify = -1;
+};
+
+TEST_F(ServiceTest, ReadyOnlyOnceRequestsAreServedAndStoppingOnSigterm) {
+  restartNotifying();
+  std::vector<std::string> start = receiveUntil("READY=1");
+  ASSERT_FALSE(start.empty()) << "no READY=1";
+  // The moment READY=1 is out, a request must be answered (this program
+  // has no entitlement: a refusal is an answer too).
+  EXPECT_NE(codeOf(call(1, {{"UserID", 501}, {"ContainerClass", 2}})), 0u);
+  EXPECT_TRUE(contains(start.front(), "STATUS=Starting")) << start.front();
+  EXPECT_TRUE(contains(start.back(), "STATUS=")) << start.back();
+
+  kill(daemon, SIGTERM);
+  std::vector<std::string> stop = receiveUntil("STOPPING=1");
+  EXPECT_FALSE(stop.empty()) << "no STOPPING=1";
+  int status = -1;
+  waitpid(daemon, &status, 0);
+  daemon = -1;
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+}
+
+TEST_F(ServiceTest, HangupReopensTheLogAfterOutsideRotation) {
+  const std::string log = root + "/private/var/root/Library/Logs/QuarterKit/quarterd.log";
+  ASSERT_TRUE(logContains("quarterd built at"));
+  ASSERT_EQ(rename(log.c_str(), (log + ".rotated").c_str()), 0);
+  kill(daemon, SIGHUP);
+  EXPECT_TRUE(logContains("Log reopened"));
+  EXPECT_FALSE(contains(readFile(log + ".rotated"), "Log reopened"));
+}
+
+std::string output(const std::string& command) {
+  std::string out;
+  if (FILE* pipe = popen(command.c_str(), "r")) {
+    char buffer[4096];
+    for (size_t n; (n = fread(buffer, 1, sizeof buffer, pipe)) > 0;) out.append(buffer, n);
+    pclose(pipe);
+  }
+  return out;
+}
+
+// Every --long-option a text names; roff writes the dashes as \-.
+std::set<std::string> longOptions(std::string text) {
+  text = std::regex_replace(text, std::regex(R"(\\-)"), "-");
+  std::set<std::string> options;
+  const std::regex option("--[a-z][a-z-]*[a-z]");
+  for (auto it = std::sregex_iterator(text.begin(), text.end(), option); it != std::sregex_iterator(); ++it)
+    options.insert(it->str());
+  return options;
+}
+
+TEST(ManPages, AgreeWithHelpOnEveryOption) {
+  struct { std::string binary, page; } tools[] = {
+      {QRT_DAEMON_PATH, "quarterd.8"},
+      {QRT_QUARTERCTL_PATH, "quarterctl.1"},
+      {QRT_EXEC_PATH, "quarter-exec.1"},
+  };
+  for (const auto& [binary, page] : tools) {
+    std::set<std::string> help = longOptions(output(binary + " --help"));
+    EXPECT_GE(help.size(), 5u) << binary;
+    EXPECT_EQ(help, longOptions(readFile(std::string(QRT_MAN_DIR) + "/" + page))) << page;
+  }
+}
+
+}  // namespace

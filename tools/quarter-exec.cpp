@@ -1,0 +1,379 @@
+// quarter-exec: the sandbox launcher. Asks quarterd's upcall socket for a
+// program's containers, confines the program to them with Landlock, drops to
+// the user and executes it.
+#include <dirent.h>
+#include <fcntl.h>
+#include <getopt.h>
+#include <grp.h>
+#include <limits.h>
+#include <sys/prctl.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "QuarterKit/Upcall.h"
+#include "platform/DeviceRoot.h"
+#include "platform/Identity.h"
+#include "platform/SafePath.h"
+#include "platform/UserDatabase.h"
+
+namespace {
+
+constexpr int kExitFailure = 1;
+constexpr int kExitUsage = 2;
+constexpr int kExitCannotExecute = 126;
+
+const char kUsage[] = R"(usage: quarter-exec [--root DIR] --user UID --identifier ID -- PROGRAM [ARGS...]
+
+Runs PROGRAM as user UID, confined to the containers quarterd gives the program
+ID: read and write beneath its data container (HOME and TMPDIR point there),
+its application group, system and system group containers; read and execute of
+PROGRAM and the system's libraries, and reading its own /proc entry; nothing
+else. Must be run as root.
+
+Options:
+  --root DIR         the device root of the daemon to ask (default /)
+  --user UID         the user to run as and whose containers to use
+  --identifier ID    the program's signing identifier; PROGRAM must be registered
+                     under it in DIR/etc/quarterd/identities
+  -h, --help         print this text and exit
+  -V, --version      print the version and exit
+)";
+
+// Landlock's user interface, declared here: the system headers may predate
+// the rights and fields of the ABI the running kernel offers.
+struct RulesetAttr {
+  uint64_t handledAccessFs;
+  uint64_t handledAccessNet;
+  uint64_t scoped;
+};
+struct PathBeneathAttr {
+  uint64_t allowedAccess;
+  int32_t parentFd;
+} __attribute__((packed));
+
+constexpr uint32_t kCreateRulesetVersion = 1u << 0;
+constexpr int kRulePathBeneath = 1;
+enum : uint64_t {
+  kExecute = 1ull << 0,
+  kWriteFile = 1ull << 1,
+  kReadFile = 1ull << 2,
+  kReadDir = 1ull << 3,
+  kRemoveDir = 1ull << 4,
+  kRemoveFile = 1ull << 5,
+  kMakeChar = 1ull << 6,
+  kMakeDir = 1ull << 7,
+  kMakeReg = 1ull << 8,
+  kMakeSock = 1ull << 9,
+  kMakeFifo = 1ull << 10,
+  kMakeBlock = 1ull << 11,
+  kMakeSym = 1ull << 12,
+  kRefer = 1ull << 13,     // ABI 2
+  kTruncate = 1ull << 14,  // ABI 3
+  kIoctlDev = 1ull << 15,  // ABI 5
+};
+constexpr uint64_t kScopeAbstractUnixSocket = 1ull << 0;  // ABI 6
+constexpr uint64_t kScopeSignal = 1ull << 1;              // ABI 6
+// Rights that apply to a file rather than to what lies beneath a directory.
+constexpr uint64_t kFileRights = kExecute | kWriteFile | kReadFile | kTruncate | kIoctlDev;
+// Containers: everything but execution (nothing written there runs) and
+// device nodes.
+constexpr uint64_t kContainerRights = kWriteFile | kReadFile | kReadDir | kRemoveDir | kRemoveFile | kMakeDir |
+                                      kMakeReg | kMakeSock | kMakeFifo | kMakeSym | kRefer | kTruncate;
+constexpr uint64_t kSystemRights = kExecute | kReadFile | kReadDir;
+constexpr const char* kMetadataFileName = ".com.norvane.quarter_kit.metadata.plist";
+
+struct Options {
+  std::string root = "/";
+  std::optional<uint32_t> user;
+  std::string identifier;
+  std::vector<std::string> command;
+  bool help = false;
+  bool version = false;
+};
+
+int fail(int status, const std::string& message) {
+  fprintf(stderr, "quarter-exec: %s\n", message.c_str());
+  return status;
+}
+
+struct UsageError {
+  std::string message;
+};
+
+Options parseOptions(int argc, char** argv) {
+  enum { kRoot = 1000, kUser, kIdentifier };
+  static const option kLong[] = {
+      {"root", required_argument, nullptr, kRoot},   {"user", required_argument, nullptr, kUser},
+      {"identifier", required_argument, nullptr, kIdentifier},
+      {"help", no_argument, nullptr, 'h'},           {"version", no_argument, nullptr, 'V'},
+      {nullptr, 0, nullptr, 0},
+  };
+  Options options;
+  opterr = 0;
+  for (int c; (c = getopt_long(argc, argv, "+:hV", kLong, nullptr)) != -1;) {
+    switch (c) {
+      case kRoot: options.root = optarg; break;
+      case kUser: {
+        char* end = nullptr;
+        errno = 0;
+        unsigned long uid = strtoul(optarg, &end, 10);
+        if (errno || !*optarg || *end || optarg[0] == '-' || uid >= UINT32_MAX)
+          throw UsageError{"--user takes a numeric user id, not '" + std::string(optarg) + "'"};
+        options.user = static_cast<uint32_t>(uid);
+        break;
+      }
+      case kIdentifier: options.identifier = optarg; break;
+      case 'h': options.help = true; break;
+      case 'V': options.version = true; break;
+      case ':': throw UsageError{std::string(argv[optind - 1]) + " needs a value"};
+      default: throw UsageError{"unknown option " + std::string(argv[optind - 1])};
+    }
+  }
+  options.command.assign(argv + optind, argv + argc);
+  if (options.help || options.version) return options;
+  if (!options.user) throw UsageError{"--user is required"};
+  if (options.identifier.empty()) throw UsageError{"--identifier is required"};
+  if (options.command.empty()) throw UsageError{"no program given"};
+  return options;
+}
+
+// PROGRAM as execvp would find it, resolved to the path the identity
+// registry knows it by.
+std::optional<std::string> resolveProgram(const std::string& name) {
+  std::vector<std::string> candidates;
+  if (name.find('/') != std::string::npos) {
+    candidates.push_back(name);
+  } else {
+    const char* path = getenv("PATH");
+    std::string search = path && *path ? path : "/usr/local/bin:/usr/bin:/bin";
+    for (size_t start = 0; start <= search.size();) {
+      size_t colon = search.find(':', start);
+      if (colon == std::string::npos) colon = search.size();
+      std::string dir = search.substr(start, colon - start);
+      candidates.push_back((dir.empty() ? "." : dir) + "/" + name);
+      start = colon + 1;
+    }
+  }
+  for (const std::string& candidate : candidates) {
+    char resolved[PATH_MAX];
+    struct stat st;
+    if (realpath(candidate.c_str(), resolved) && stat(resolved, &st) == 0 && S_ISREG(st.st_mode) &&
+        access(resolved, X_OK) == 0)
+      return std::string(resolved);
+  }
+  return std::nullopt;
+}
+
+// An entitlement that is a string or an array of strings.
+std::vector<std::string> stringsOf(const std::optional<plist::Dictionary>& entitlements, const char* key) {
+  std::vector<std::string> out;
+  const plist::Value* value = entitlements ? plist::find(*entitlements, key) : nullptr;
+  if (!value) return out;
+  if (const std::string* s = value->stringIf()) out.push_back(*s);
+  if (const plist::Array* array = value->arrayIf())
+    for (const plist::Value& e : *array)
+      if (const std::string* s = e.stringIf()) out.push_back(*s);
+  return out;
+}
+
+class Ruleset {
+ public:
+  // abi 0: Landlock is absent and nothing is enforced.
+  explicit Ruleset(int abi) : abi_(abi) {
+    if (abi_ <= 0) return;
+    handled_ = (1ull << 13) - 1;
+    if (abi_ >= 2) handled_ |= kRefer;
+    if (abi_ >= 3) handled_ |= kTruncate;
+    if (abi_ >= 5) handled_ |= kIoctlDev;
+    RulesetAttr attr{handled_, 0, 0};
+    size_t size = sizeof attr.handledAccessFs;
+    if (abi_ >= 6) {
+      // Nor may the program signal, or reach the abstract sockets of,
+      // processes outside its confinement.
+      attr.scoped = kScopeAbstractUnixSocket | kScopeSignal;
+      size = sizeof attr;
+    }
+    fd_ = static_cast<int>(syscall(SYS_landlock_create_ruleset, &attr, size, 0));
+  }
+
+  bool valid() const { return abi_ <= 0 || fd_ >= 0; }
+
+  // Rights beneath the item fd names (or on the file itself); those the
+  // ABI does not know are dropped.
+  int allow(int fd, uint64_t rights, bool isDirectory) {
+    if (abi_ <= 0) return 0;
+    PathBeneathAttr rule{rights & handled_ & (isDirectory ? ~0ull : kFileRights), fd};
+    if (!rule.allowedAccess) return 0;
+    return syscall(SYS_landlock_add_rule, fd_, kRulePathBeneath, &rule, 0) == 0 ? 0 : errno;
+  }
+
+  // A system path that may be missing (/lib64 on some systems); links are
+  // followed, as the program's loader would follow them.
+  int allowSystemPath(const char* path, uint64_t rights) {
+    int fd = open(path, O_PATH | O_CLOEXEC);
+    if (fd < 0) return errno == ENOENT ? 0 : errno;
+    struct stat st;
+    int err = fstat(fd, &st) == 0 ? allow(fd, rights, S_ISDIR(st.st_mode)) : errno;
+    close(fd);
+    return err;
+  }
+
+  // Everything beneath a container but its metadata file, which only the
+  // daemon writes; the container's top directory itself is only listed.
+  int allowContainer(const std::string& path) {
+    if (abi_ <= 0) return 0;
+    platform::UniqueFd dir;
+    if (int err = platform::safeOpen(path, O_RDONLY | O_DIRECTORY, &dir)) return err;
+    if (int err = allow(dir.get(), kReadDir, true)) return err;
+    DIR* listing = fdopendir(dup(dir.get()));
+    if (!listing) return errno;
+    int err = 0;
+    while (dirent* entry = readdir(listing)) {
+      std::string name = entry->d_name;
+      if (name == "." || name == ".." || name == kMetadataFileName) continue;
+      int fd = openat(dir.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC);
+      struct stat st;
+      if (fd < 0 || fstat(fd, &st) != 0) {
+        err = errno;
+      } else if (S_ISDIR(st.st_mode) || S_ISREG(st.st_mode)) {
+        err = allow(fd, kContainerRights, S_ISDIR(st.st_mode));
+      }
+      if (fd >= 0) close(fd);
+      if (err) break;
+    }
+    closedir(listing);
+    return err;
+  }
+
+  int restrictSelf() { return abi_ <= 0 || syscall(SYS_landlock_restrict_self, fd_, 0) == 0 ? 0 : errno; }
+
+ private:
+  int abi_;
+  int fd_ = -1;
+  uint64_t handled_ = 0;
+};
+
+int landlockABI() {
+  long abi = syscall(SYS_landlock_create_ruleset, nullptr, 0, kCreateRulesetVersion);
+  return abi < 0 ? 0 : static_cast<int>(abi);
+}
+
+int run(const Options& options) {
+  if (geteuid() != 0)
+    return fail(kExitFailure, "must be run as root: it asks quarterd for the containers, then drops to the user");
+  char root[PATH_MAX];
+  if (options.root.empty() || options.root[0] != '/' || !realpath(options.root.c_str(), root))
+    return fail(kExitUsage, "bad device root " + options.root);
+  platform::setDeviceRoot(root);
+
+  const std::string& name = options.command.front();
+  std::optional<std::string> program = resolveProgram(name);
+  if (!program) return fail(kExitCannotExecute, "cannot find an executable " + name);
+  auto account = platform::userById(*options.user);
+  if (!account) return fail(kExitFailure, "no account for user " + std::to_string(*options.user));
+
+  // The identifier must be the program's own: its entitlements name its groups.
+  auto identity = platform::identityForExecutable(*program);
+  const std::string registry = platform::hostPath("/etc/quarterd/identities");
+  if (!identity->signingIdentifier)
+    return fail(kExitFailure, "unknown identifier " + options.identifier + ": " + *program + " has no identity in " +
+                                  registry);
+  if (*identity->signingIdentifier != options.identifier)
+    return fail(kExitFailure, "unknown identifier " + options.identifier + ": " + *program + " is registered as " +
+                                  *identity->signingIdentifier + " in " + registry);
+
+  qk::UpcallRequest request;
+  request.codeSignatureId = options.identifier;
+  request.personaId = *options.user;
+  request.containerType = 0;
+  request.appGroupIds = stringsOf(identity->entitlements, "com.norvane.security.application-groups");
+  request.systemGroupIds = stringsOf(identity->entitlements, "com.norvane.security.system-groups");
+  if (auto system = stringsOf(identity->entitlements, "com.norvane.security.system-container"); !system.empty())
+    request.systemContainerId = system.front();
+
+  const std::string socketPath = qk::upcallSocketPath(root);
+  std::string error;
+  auto client = qk::UpcallClient::connect(socketPath, &error);
+  if (!client) return fail(kExitFailure, "cannot reach quarterd at " + socketPath + ": " + error);
+  auto answer = client->call(request);
+  client.reset();
+  if (!answer) return fail(kExitFailure, "quarterd did not answer on " + socketPath);
+  if (answer->returnCode != 0)
+    return fail(kExitFailure, "quarterd refused the request (return code " + std::to_string(answer->returnCode) + ")");
+  if (!answer->readable || answer->status.value_or(0) != 1 || !answer->dataContainer)
+    return fail(kExitFailure, "quarterd could not provide every container of " + options.identifier + " for user " +
+                                  std::to_string(*options.user));
+
+  std::vector<std::string> containers{*answer->dataContainer};
+  for (const auto& [group, path] : answer->groups) containers.push_back(path);
+  if (answer->systemContainer) containers.push_back(*answer->systemContainer);
+  for (const auto& [group, path] : answer->systemGroups) containers.push_back(path);
+
+  const int abi = landlockABI();
+  if (abi <= 0)
+    fprintf(stderr, "quarter-exec: warning: the kernel offers no Landlock (%s); %s runs without file-system confinement\n",
+            strerror(errno), program->c_str());
+  Ruleset rules(abi);
+  if (!rules.valid()) return fail(kExitFailure, std::string("cannot create the Landlock ruleset: ") + strerror(errno));
+  for (const std::string& container : containers)
+    if (int err = rules.allowContainer(container))
+      return fail(kExitFailure, "cannot open up " + container + ": " + strerror(err));
+  for (const char* dir : {"/usr", "/lib", "/lib64", "/lib32", "/libx32", "/bin", "/sbin", "/etc"})
+    if (int err = rules.allowSystemPath(dir, strcmp(dir, "/etc") == 0 ? kReadFile | kReadDir : kSystemRights))
+      return fail(kExitFailure, std::string("cannot open up ") + dir + ": " + strerror(err));
+  // Its own process directory: /proc/self names this process, which the
+  // program becomes.
+  if (int err = rules.allowSystemPath("/proc/self", kReadFile | kReadDir))
+    return fail(kExitFailure, std::string("cannot open up /proc/self: ") + strerror(err));
+  for (const char* device : {"/dev/null", "/dev/zero", "/dev/full", "/dev/random", "/dev/urandom"})
+    if (int err = rules.allowSystemPath(device, kReadFile | kWriteFile))
+      return fail(kExitFailure, std::string("cannot open up ") + device + ": " + strerror(err));
+  if (int err = rules.allowSystemPath(program->c_str(), kExecute | kReadFile))
+    return fail(kExitFailure, "cannot open up " + *program + ": " + strerror(err));
+
+  setenv("HOME", answer->dataContainer->c_str(), 1);
+  if (answer->tempDir) setenv("TMPDIR", answer->tempDir->c_str(), 1);
+  if (chdir(answer->dataContainer->c_str()) != 0)
+    return fail(kExitFailure, "cannot enter " + *answer->dataContainer + ": " + strerror(errno));
+
+  // No set-id program may regain what is dropped here, and Landlock asks for
+  // it anyway.
+  if (prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0)
+    return fail(kExitFailure, std::string("cannot set no_new_privs: ") + strerror(errno));
+  if (int err = rules.restrictSelf()) return fail(kExitFailure, std::string("cannot enforce Landlock: ") + strerror(err));
+  const gid_t gid = account->gid;
+  if (setgroups(1, &gid) != 0 || setresgid(gid, gid, gid) != 0 || setresuid(*options.user, *options.user, *options.user) != 0)
+    return fail(kExitFailure, "cannot drop to user " + std::to_string(*options.user) + ": " + strerror(errno));
+
+  std::vector<char*> argv;
+  for (const std::string& arg : options.command) argv.push_back(const_cast<char*>(arg.c_str()));
+  argv.push_back(nullptr);
+  execv(program->c_str(), argv.data());
+  return fail(kExitCannotExecute, "cannot execute " + *program + ": " + strerror(errno));
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  try {
+    Options options = parseOptions(argc, argv);
+    if (options.help) return fputs(kUsage, stdout), 0;
+    if (options.version) return printf("quarter-exec %s\n", QRT_VERSION), 0;
+    return run(options);
+  } catch (const UsageError& e) {
+    fprintf(stderr, "quarter-exec: %s\n(quarter-exec --help for usage)\n", e.message.c_str());
+  } catch (const std::exception& e) {
+    fprintf(stderr, "quarter-exec: %s\n", e.what());
+  }
+  return kExitUsage;
+}
