@@ -24,19 +24,14 @@
 #include "QuarterKit/QuarterKit.h"
 #include "QuarterKit/Requests.h"
 #include "base/Frame.h"
+#include "bench/BenchLoad.h"
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
+using bench::Clock;
 constexpr uint64_t kRefused = 55;
 
-struct Stats {
-  double requestsPerSecond = 0;
-  double p50us = 0;
-  double p99us = 0;
-  uint64_t requests = 0;
-  uint64_t unexpected = 0;  // replies other than "refused", or none
-};
+using Stats = bench::LoadStats;
 
 // Command 1 from a caller without entitlements: refused before any handler.
 plist::Dictionary refusedRequest() {
@@ -59,8 +54,7 @@ void clientLoop(const std::string& socketPath, Clock::time_point deadline, std::
   while (Clock::now() < deadline) {
     auto start = Clock::now();
     auto reply = connection->call(request, std::chrono::seconds(10));
-    auto ns = std::chrono::duration_cast<std::chrono::nanoseconds>(Clock::now() - start).count();
-    latenciesNs.push_back(static_cast<uint32_t>(std::min<int64_t>(ns, UINT32_MAX)));
+    latenciesNs.push_back(bench::nanosecondsSince(start));
     if (!reply || qk::Reply(std::move(*reply)).error() != kRefused) {
       ++unexpected;
       if (connection->closed()) return;
@@ -69,43 +63,12 @@ void clientLoop(const std::string& socketPath, Clock::time_point deadline, std::
 }
 
 Stats measure(const std::string& socketPath, int clients, double seconds) {
-  std::vector<std::vector<uint32_t>> latencies(clients);
-  std::vector<uint64_t> unexpected(clients, 0);
-  auto begin = Clock::now();
-  auto deadline = begin + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(seconds));
-  std::vector<std::thread> threads;
-  for (int i = 0; i < clients; ++i)
-    threads.emplace_back(clientLoop, socketPath, deadline, std::ref(latencies[i]), std::ref(unexpected[i]));
-  for (auto& t : threads) t.join();
-  double elapsed = std::chrono::duration<double>(Clock::now() - begin).count();
-
-  std::vector<uint32_t> all;
-  Stats stats;
-  for (int i = 0; i < clients; ++i) {
-    all.insert(all.end(), latencies[i].begin(), latencies[i].end());
-    stats.unexpected += unexpected[i];
-  }
-  stats.requests = all.size();
-  if (all.empty()) return stats;
-  std::sort(all.begin(), all.end());
-  stats.requestsPerSecond = static_cast<double>(all.size()) / elapsed;
-  stats.p50us = all[all.size() / 2] / 1000.0;
-  stats.p99us = all[std::min(all.size() - 1, all.size() * 99 / 100)] / 1000.0;
-  return stats;
+  return bench::runLoad(clients, seconds, [&](Clock::time_point deadline, std::vector<uint32_t>& ns, uint64_t& unexpected) {
+    clientLoop(socketPath, deadline, ns, unexpected);
+  });
 }
 
 // ---- the echo server ----------------------------------------------------------
-
-bool writeAll(int fd, const uint8_t* p, size_t n) {
-  while (n > 0) {
-    ssize_t w = ::send(fd, p, n, MSG_NOSIGNAL);
-    if (w < 0 && errno == EINTR) continue;
-    if (w <= 0) return false;
-    p += w;
-    n -= static_cast<size_t>(w);
-  }
-  return true;
-}
 
 // Answers every request with {"ReplyError": 55} after decoding it, the least
 // work the daemon does for one.
@@ -156,7 +119,7 @@ class EchoServer {
       while (auto f = decoder.next()) {
         if (!frame::decodeMessage(f->payload)) ok = false;
         std::vector<uint8_t> bytes = frame::encode(f->messageId, reply);
-        if (!ok || !writeAll(fd, bytes.data(), bytes.size())) break;
+        if (!ok || !frame::sendAll(fd, bytes.data(), bytes.size())) break;
       }
       if (!ok || decoder.failed()) break;
     }
@@ -275,7 +238,7 @@ Options parseOptions(int argc, char** argv) {
 }
 
 void printRow(const char* target, int clients, const Stats& s) {
-  printf("%-8s %7d %12.0f %10.1f %10.1f %10llu\n", target, clients, s.requestsPerSecond, s.p50us, s.p99us,
+  printf("%-8s %7d %12.0f %10.1f %10.1f %10llu\n", target, clients, s.perSecond, s.p50us, s.p99us,
          static_cast<unsigned long long>(s.unexpected));
 }
 
@@ -316,9 +279,9 @@ int main(int argc, char** argv) {
   }
   for (size_t i = 0; i < options.clients.size(); ++i) {
     const auto& [echo, d] = rows[i];
-    if (echo.requestsPerSecond > 0 && echo.p50us > 0)
+    if (echo.perSecond > 0 && echo.p50us > 0)
       printf("daemon/echo, %d clients: throughput %.2f, p50 latency %.2f\n", options.clients[i],
-             d.requestsPerSecond / echo.requestsPerSecond, d.p50us / echo.p50us);
+             d.perSecond / echo.perSecond, d.p50us / echo.p50us);
   }
   return 0;
 }

@@ -22,17 +22,15 @@
 #include <vector>
 
 #include "QuarterKit/Upcall.h"
+#include "bench/BenchLoad.h"
 #include "packbuff/packbuff.h"
 #include "platform/UpcallSocket.h"
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
+using bench::Clock;
 
-struct Stats {
-  double p50us = 0, p99us = 0, perSecond = 0;
-  uint64_t calls = 0, unexpected = 0;
-};
+using Stats = bench::LoadStats;
 
 qk::UpcallRequest programWithGroups() {
   qk::UpcallRequest r;
@@ -55,8 +53,7 @@ void kernelLoop(const std::string& path, Clock::time_point deadline, std::vector
   while (Clock::now() < deadline) {
     auto start = Clock::now();
     auto answer = kernel->call(request);
-    ns.push_back(static_cast<uint32_t>(std::min<int64_t>(
-        std::chrono::duration_cast<std::chrono::nanoseconds>(Clock::now() - start).count(), UINT32_MAX)));
+    ns.push_back(bench::nanosecondsSince(start));
     if (!answer || answer->returnCode != 0 || answer->status != 1u || answer->groups.size() != 4) {
       ++unexpected;
       if (!answer) return;
@@ -65,27 +62,9 @@ void kernelLoop(const std::string& path, Clock::time_point deadline, std::vector
 }
 
 Stats measure(const std::string& path, int kernels, double seconds) {
-  std::vector<std::vector<uint32_t>> ns(kernels);
-  std::vector<uint64_t> unexpected(kernels, 0);
-  auto begin = Clock::now();
-  auto deadline = begin + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(seconds));
-  std::vector<std::thread> threads;
-  for (int i = 0; i < kernels; ++i)
-    threads.emplace_back(kernelLoop, path, deadline, std::ref(ns[i]), std::ref(unexpected[i]));
-  for (auto& t : threads) t.join();
-  Stats s;
-  std::vector<uint32_t> all;
-  for (int i = 0; i < kernels; ++i) {
-    all.insert(all.end(), ns[i].begin(), ns[i].end());
-    s.unexpected += unexpected[i];
-  }
-  if (all.empty()) return s;
-  std::sort(all.begin(), all.end());
-  s.calls = all.size();
-  s.perSecond = static_cast<double>(all.size()) / std::chrono::duration<double>(Clock::now() - begin).count();
-  s.p50us = all[all.size() / 2] / 1000.0;
-  s.p99us = all[std::min(all.size() - 1, all.size() * 99 / 100)] / 1000.0;
-  return s;
+  return bench::runLoad(kernels, seconds, [&](Clock::time_point deadline, std::vector<uint32_t>& ns, uint64_t& unexpected) {
+    kernelLoop(path, deadline, ns, unexpected);
+  });
 }
 
 // The reply the daemon gives such a program, with made-up paths of the same length.
