@@ -35,6 +35,16 @@ void stageGroupContainer(const QRTMetadataRef& container, uint32_t user) {
   }
 }
 
+// Error 11, in the caller's name, when there is no identifier.
+bool identifierGiven(const char* function, uint32_t userId, const std::optional<std::string>& identifier,
+                     uint64_t* withError) {
+  if (identifier) return true;
+  QRTErrorRef error = QRTCreateError(function, __LINE__, QRTErrorDomain, QRTErrorInvalidParameter, nullptr, nullptr,
+                                     true, "Can't act on an invalid object: userId: %u, ID: %@", userId, identifier);
+  if (withError) *withError = error->resultCode();
+  return false;
+}
+
 }  // namespace
 
 QRTGroupManager& QRTGroupManager::defaultManager() {
@@ -132,13 +142,7 @@ void QRTGroupManager::_cleanupUnreferencedGroupContainersForUser(uint32_t user, 
 std::optional<std::map<std::string, std::string>> QRTGroupManager::groupContainerPathsForUser(
     uint32_t userId, QRTClientConnection& clientConnection, const std::optional<std::string>& identifier,
     uint64_t* withError) {
-  if (!identifier) {
-    QRTErrorRef error =
-        QRT_ERROR(QRTErrorInvalidParameter, nullptr, true, "Can't act on an invalid object: userId: %u, ID: %@", userId,
-                  identifier);
-    if (withError) *withError = error->resultCode();
-    return std::nullopt;
-  }
+  if (!identifierGiven(__func__, userId, identifier, withError)) return std::nullopt;
   std::optional<std::map<std::string, std::string>> paths;
   auto body = [&] {
     QRTAllIdentifiersLock lock(true);
@@ -181,13 +185,7 @@ std::optional<std::map<std::string, std::string>> QRTGroupManager::groupContaine
 
 std::optional<std::vector<std::string>> QRTGroupManager::groupContainerIdentifiersForUser(
     uint32_t userId, const std::optional<std::string>& identifier, uint64_t* withError) {
-  if (!identifier) {
-    QRTErrorRef error =
-        QRT_ERROR(QRTErrorInvalidParameter, nullptr, true, "Can't act on an invalid object: userId: %u, ID: %@", userId,
-                  identifier);
-    if (withError) *withError = error->resultCode();
-    return std::nullopt;
-  }
+  if (!identifierGiven(__func__, userId, identifier, withError)) return std::nullopt;
   std::optional<std::vector<std::string>> identifiers;
   QRTErrorRef failure = QRT_GUARD([&] {
     QRTAllIdentifiersLock lock(true);
