@@ -21,8 +21,8 @@ std::optional<std::string> QRTError::localizedDescription() const {
 }
 
 std::string QRTError::description() const {
-  std::string text = "Error Domain=" + domain_ + " Code=" + std::to_string(code_);
-  if (auto d = localizedDescription()) text += " \"" + *d + "\"";
+  std::string text = domain_ + " " + std::to_string(code_);
+  if (auto d = localizedDescription()) text += ": " + *d;
   return text;
 }
 

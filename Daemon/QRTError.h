@@ -85,7 +85,7 @@ class QRTError {
   const plist::Dictionary& userInfo() const { return userInfo_; }
   const QRTErrorRef& underlying() const { return underlying_; }
   std::optional<std::string> localizedDescription() const;
-  // Error Domain=D Code=N "description"
+  // "QRTErrorDomain 21: No Container with userId: 501" (no colon part without a description)
   std::string description() const;
 
  private:

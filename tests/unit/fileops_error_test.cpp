@@ -11,7 +11,7 @@ TEST(QRTErrorTest, CarriesDescriptionOriginAndCause) {
   QRTErrorRef cause = QRT_POSIX_ERROR(2, "stat of %@ failed: %s", std::string("/a"), "No such file");
   EXPECT_EQ(cause->domain(), QRTPOSIXErrorDomain);
   EXPECT_EQ(cause->code(), 2);
-  EXPECT_EQ(cause->description(), "Error Domain=QRTPOSIXErrorDomain Code=2 \"stat of /a failed: No such file\"");
+  EXPECT_EQ(cause->description(), "QRTPOSIXErrorDomain 2: stat of /a failed: No such file");
 
   plist::Dictionary start{{"Extra", "kept"}};
   QRTErrorRef error = QRTCreateError("someFunction", 42, QRTErrorDomain, 21, cause, &start, false,
@@ -29,7 +29,7 @@ TEST(QRTErrorTest, CarriesDescriptionOriginAndCause) {
 TEST(QRTErrorTest, WithoutFormatThereIsNoDescription) {
   QRTErrorRef error = QRTCreateError("f", 1, QRTErrorDomain, -1, nullptr, nullptr, true, nullptr);
   EXPECT_EQ(error->localizedDescription(), std::nullopt);
-  EXPECT_EQ(error->description(), "Error Domain=QRTErrorDomain Code=-1");
+  EXPECT_EQ(error->description(), "QRTErrorDomain -1");
   EXPECT_EQ(error->resultCode(), UINT64_MAX);
 }
 
