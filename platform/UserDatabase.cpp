@@ -135,4 +135,6 @@ std::optional<GroupAccount> groupByName(const std::string& name) {
   return account;
 }
 
+uint32_t ordinaryUserMinimum() { return 501; }
+
 }  // namespace platform

@@ -25,4 +25,8 @@ std::optional<UserAccount> userByName(const std::string& name);
 std::optional<UserAccount> userById(uint32_t uid);
 std::optional<GroupAccount> groupByName(const std::string& name);
 
+// The lowest uid of an ordinary (human) user; anything below is the system's
+// or a service's. 501 on a device root.
+uint32_t ordinaryUserMinimum();
+
 }  // namespace platform
