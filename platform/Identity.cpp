@@ -21,6 +21,7 @@
 #include "platform/FileIO.h"
 #include "platform/Log.h"
 #include "platform/SafePath.h"
+#include "platform/UserDatabase.h"
 
 #ifndef SO_PEERPIDFD
 #define SO_PEERPIDFD 77  // Linux 6.5; older C library headers lack it
@@ -32,13 +33,21 @@ namespace {
 
 // ---- peer credentials ----
 
-std::string executableOf(pid_t pid) {
-  if (pid <= 0) return {};
-  std::string link = "/proc/" + std::to_string(pid) + "/exe";
+// The path is only the key that finds a registry entry; the file itself,
+// reached through the magic link whatever the peer's mount namespace shows,
+// is what must match it.
+void readExecutable(PeerCredentials* peer) {
+  if (peer->pid <= 0) return;
+  std::string link = "/proc/" + std::to_string(peer->pid) + "/exe";
   char target[PATH_MAX];
   ssize_t length = readlink(link.c_str(), target, sizeof target);
-  if (length <= 0 || static_cast<size_t>(length) >= sizeof target) return {};
-  return std::string(target, static_cast<size_t>(length));
+  if (length <= 0 || static_cast<size_t>(length) >= sizeof target) return;
+  UniqueFd file(open(link.c_str(), O_PATH | O_CLOEXEC));
+  struct stat st;
+  if (!file.valid() || fstat(file.get(), &st) != 0) return;
+  peer->executable.assign(target, static_cast<size_t>(length));
+  peer->executableDevice = st.st_dev;
+  peer->executableInode = st.st_ino;
 }
 
 // A pidfd polls readable once its process has exited.
@@ -90,19 +99,40 @@ DirectoryStamp stampOf(const std::string& path) {
   return stamp;
 }
 
-using IdentityMap = std::unordered_map<std::string, std::shared_ptr<const CodeIdentity>>;
+// One registry file's entry: the whole identity, and the part that any
+// peer running the program holds.
+struct Entry {
+  std::shared_ptr<const CodeIdentity> whole;
+  std::shared_ptr<const CodeIdentity> userPart;
+  std::vector<uid_t> users;  // who may hold the system-level entitlements
+};
+
+// The file an Executable path names, as the daemon sees it.
+struct FileId {
+  dev_t device = 0;
+  ino_t inode = 0;
+  bool operator==(const FileId&) const = default;
+};
+
+using IdentityMap = std::unordered_map<std::string, Entry>;
 
 struct Registry {
   std::shared_mutex mutex;
   bool loaded = false;
   DirectoryStamp stamp;
   IdentityMap byExecutable;
+  // Kept from the last look; looked at again on a mismatch.
+  std::unordered_map<std::string, FileId> files;
 };
 
 Registry& registry() {
   static Registry* instance = new Registry;  // request threads may outlive static destruction
   return *instance;
 }
+
+// Root's, and writable by no one else: anyone who can write the registry
+// can give themselves any entitlement.
+bool ownedByRootOnly(const struct stat& st) { return st.st_uid == 0 && (st.st_mode & (S_IWGRP | S_IWOTH)) == 0; }
 
 std::vector<std::string> registryFileNames(int dirfd) {
   std::vector<std::string> names;
@@ -117,37 +147,122 @@ std::vector<std::string> registryFileNames(int dirfd) {
   return names;
 }
 
+// The accounts of a Users value; nothing when it is not an array of names and ids.
+std::optional<std::vector<uid_t>> usersOf(const plist::Value& value, const std::string& path) {
+  const plist::Array* array = value.arrayIf();
+  if (!array) return std::nullopt;
+  std::vector<uid_t> users;
+  for (const plist::Value& item : *array) {
+    if (const plist::Integer* id = item.integerIf(); id && id->asUnsigned() < UINT32_MAX) {
+      users.push_back(static_cast<uid_t>(id->asUnsigned()));
+    } else if (const std::string* name = item.stringIf()) {
+      if (std::optional<UserAccount> account = userByName(*name)) users.push_back(account->uid);
+      else QRTLog(kLogError, "Identity file %s: no account named %s; left out of Users", path.c_str(), name->c_str());
+    } else {
+      return std::nullopt;
+    }
+  }
+  return users;
+}
+
+// The entry of one parsed file, or nothing (with the reason) when it is refused.
+std::optional<Entry> entryOf(const plist::Dictionary& file, const std::string& path, std::string* why) {
+  auto whole = std::make_shared<CodeIdentity>();
+  if (const plist::Value* signing = plist::find(file, "SigningIdentifier"); signing && signing->stringIf())
+    whole->signingIdentifier = signing->string();
+  plist::Dictionary userLevel;
+  if (const plist::Value* entitlements = plist::find(file, "Entitlements"); entitlements && entitlements->dictionaryIf()) {
+    whole->entitlements = entitlements->dictionary();
+    for (const auto& [name, value] : *whole->entitlements) {
+      if (name == kUserLevelEntitlement) userLevel.emplace(name, value);
+      else whole->systemLevel = true;
+    }
+  }
+  Entry entry;
+  entry.users = {0};
+  if (const plist::Value* users = plist::find(file, "Users")) {
+    std::optional<std::vector<uid_t>> listed = usersOf(*users, path);
+    if (!listed) return *why = "Users is not an array of account names and ids", std::nullopt;
+    entry.users = std::move(*listed);
+  }
+  const uint32_t ordinary = ordinaryUserMinimum();
+  for (uid_t uid : entry.users) {
+    if (whole->systemLevel && uid >= ordinary)
+      return *why = "Users lists the ordinary user " + std::to_string(uid) + " next to system-level entitlements",
+             std::nullopt;
+  }
+  entry.whole = whole;
+  if (!whole->systemLevel) {
+    entry.userPart = whole;
+  } else {
+    auto part = std::make_shared<CodeIdentity>();
+    part->signingIdentifier = whole->signingIdentifier;
+    part->entitlements = std::move(userLevel);
+    part->program = whole;
+    entry.userPart = std::move(part);
+  }
+  return entry;
+}
+
 // Adds one file's entry; a later file replaces an earlier one's whole entry.
 void addRegistryFile(int dirfd, const std::string& directory, const std::string& name, IdentityMap& identities) {
   const std::string path = directory + "/" + name;
   std::string bytes;
-  if (int err = readFileAt(dirfd, name.c_str(), &bytes, 16u << 20)) {
+  UniqueFd fd(openNoFollowAt(dirfd, name.c_str(), O_RDONLY));
+  struct stat st;
+  int err = !fd.valid() ? errno : fstat(fd.get(), &st) != 0 ? errno : 0;
+  if (err == 0 && S_ISREG(st.st_mode) && !ownedByRootOnly(st)) {
+    QRTLog(kLogError, "Skipping identity file %s: owned by %u with mode %o; it must be root's and writable by no one else",
+           path.c_str(), static_cast<unsigned>(st.st_uid), static_cast<unsigned>(st.st_mode & 07777));
+    return;
+  }
+  if (err == 0) err = readOpened(fd.get(), &bytes, 16u << 20);
+  if (err != 0) {
     QRTLog(kLogError, "Cannot read identity file %s: %s", path.c_str(), strerror(err));
     return;
   }
   std::string error;
   std::optional<plist::Value> value = plist::parse(bytes.data(), bytes.size(), &error);
-  const plist::Dictionary* entry = value ? value->dictionaryIf() : nullptr;
-  const plist::Value* executable = entry ? plist::find(*entry, "Executable") : nullptr;
+  const plist::Dictionary* file = value ? value->dictionaryIf() : nullptr;
+  const plist::Value* executable = file ? plist::find(*file, "Executable") : nullptr;
   if (!executable || !executable->stringIf()) {
     QRTLog(kLogError, "Skipping identity file %s: %s", path.c_str(),
-           !value ? error.c_str() : !entry ? "not a dictionary" : "no Executable string");
+           !value ? error.c_str() : !file ? "not a dictionary" : "no Executable string");
     return;
   }
-  auto identity = std::make_shared<CodeIdentity>();
-  if (const plist::Value* signing = plist::find(*entry, "SigningIdentifier"); signing && signing->stringIf())
-    identity->signingIdentifier = signing->string();
-  if (const plist::Value* entitlements = plist::find(*entry, "Entitlements"); entitlements && entitlements->dictionaryIf())
-    identity->entitlements = entitlements->dictionary();
-  identities[executable->string()] = std::move(identity);
+  std::optional<Entry> entry = entryOf(*file, path, &error);
+  if (!entry) {
+    QRTLog(kLogError, "Refusing identity file %s: %s", path.c_str(), error.c_str());
+    return;
+  }
+  identities[executable->string()] = std::move(*entry);
 }
 
 IdentityMap loadRegistry(const std::string& directory) {
   IdentityMap identities;
   UniqueFd fd;
-  if (safeOpen(directory, O_RDONLY | O_DIRECTORY, &fd) != 0) return identities;
+  struct stat st;
+  if (safeOpen(directory, O_RDONLY | O_DIRECTORY, &fd) != 0 || fstat(fd.get(), &st) != 0) return identities;
+  if (!ownedByRootOnly(st)) {
+    QRTLog(kLogError, "Skipping the identity registry %s: owned by %u with mode %o; it must be root's and writable by no one else",
+           directory.c_str(), static_cast<unsigned>(st.st_uid), static_cast<unsigned>(st.st_mode & 07777));
+    return identities;
+  }
   for (const std::string& name : registryFileNames(fd.get())) addRegistryFile(fd.get(), directory, name, identities);
   return identities;
+}
+
+// Resolved from "/" without following a link anywhere: the path is the one
+// /proc/PID/exe shows, which has none.
+std::optional<FileId> fileIdOf(const std::string& path) {
+  if (path.empty() || path.front() != '/') return std::nullopt;
+  UniqueFd top(open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
+  UniqueFd fd;
+  struct stat st;
+  const char* relative = path.size() > 1 ? path.c_str() + 1 : ".";
+  if (!top.valid() || openBeneath(top.get(), relative, O_PATH, &fd) != 0 || fstat(fd.get(), &st) != 0)
+    return std::nullopt;
+  return FileId{st.st_dev, st.st_ino};
 }
 
 std::shared_ptr<const CodeIdentity> noIdentity() {
@@ -155,9 +270,37 @@ std::shared_ptr<const CodeIdentity> noIdentity() {
   return *none;
 }
 
-std::shared_ptr<const CodeIdentity> lookUp(const IdentityMap& identities, const std::string& executablePath) {
-  auto found = identities.find(executablePath);
-  return found == identities.end() ? noIdentity() : found->second;
+// The entry for a path and the file last seen there, read under the lock
+// after bringing the registry up to date.
+std::optional<std::pair<Entry, std::optional<FileId>>> currentEntry(const std::string& executablePath) {
+  Registry& reg = registry();
+  DirectoryStamp now = stampOf(hostPath("/etc/quarterd/identities"));
+  auto find = [&]() -> std::optional<std::pair<Entry, std::optional<FileId>>> {
+    auto found = reg.byExecutable.find(executablePath);
+    if (found == reg.byExecutable.end()) return std::nullopt;
+    auto file = reg.files.find(executablePath);
+    return std::pair{found->second, file == reg.files.end() ? std::nullopt : std::optional<FileId>(file->second)};
+  };
+  {
+    std::shared_lock lock(reg.mutex);
+    if (reg.loaded && reg.stamp == now) return find();
+  }
+  std::unique_lock lock(reg.mutex);
+  if (!reg.loaded || !(reg.stamp == now)) {
+    // The stamp was taken before reading, so a change made meanwhile shows
+    // up as a new stamp on the next call.
+    reg.byExecutable = now.present ? loadRegistry(now.path) : IdentityMap{};
+    reg.files.clear();
+    reg.stamp = std::move(now);
+    reg.loaded = true;
+  }
+  return find();
+}
+
+void rememberFile(const std::string& executablePath, const FileId& id) {
+  Registry& reg = registry();
+  std::unique_lock lock(reg.mutex);
+  if (reg.byExecutable.count(executablePath)) reg.files[executablePath] = id;
 }
 
 }  // namespace
@@ -177,34 +320,45 @@ std::optional<PeerCredentials> peerCredentials(int socketFd) {
   if (getsockopt(socketFd, SOL_SOCKET, SO_PEERPIDFD, &pidfd, &length) != 0) {
     if (errno == ENOPROTOOPT) {
       notePidfdUnavailable();
-      peer.executable = executableOf(peer.pid);
+      readExecutable(&peer);
     }
     return peer;  // otherwise the peer is gone: nothing about it can be trusted
   }
-  peer.executable = executableOf(peer.pid);
+  readExecutable(&peer);
   peer.verified = stillRunning(pidfd);
-  if (!peer.verified) peer.executable.clear();
+  if (!peer.verified) {
+    peer.executable.clear();
+    peer.executableInode = 0;
+  }
   close(pidfd);
   return peer;
 }
 
 std::shared_ptr<const CodeIdentity> identityForExecutable(const std::string& executablePath) {
   if (executablePath.empty()) return noIdentity();
-  Registry& reg = registry();
-  DirectoryStamp now = stampOf(hostPath("/etc/quarterd/identities"));
-  {
-    std::shared_lock lock(reg.mutex);
-    if (reg.loaded && reg.stamp == now) return lookUp(reg.byExecutable, executablePath);
+  auto current = currentEntry(executablePath);
+  return current ? current->first.whole : noIdentity();
+}
+
+std::shared_ptr<const CodeIdentity> identityForPeer(const PeerCredentials& peer) {
+  if (peer.executable.empty() || peer.executableInode == 0) return noIdentity();
+  auto current = currentEntry(peer.executable);
+  if (!current) return noIdentity();
+  const FileId running{peer.executableDevice, peer.executableInode};
+  if (current->second != running) {
+    // Not the file last seen there: an upgraded program, or another file
+    // mounted over the path in the peer's own namespace.
+    std::optional<FileId> there = fileIdOf(peer.executable);
+    if (there) rememberFile(peer.executable, *there);
+    if (there != running) {
+      QRTLog(kLogError, "pid %d runs another file than %s; no identity", static_cast<int>(peer.pid),
+             peer.executable.c_str());
+      return noIdentity();
+    }
   }
-  std::unique_lock lock(reg.mutex);
-  if (!reg.loaded || !(reg.stamp == now)) {
-    // The stamp was taken before reading, so a change made meanwhile shows
-    // up as a new stamp on the next call.
-    reg.byExecutable = now.present ? loadRegistry(now.path) : IdentityMap{};
-    reg.stamp = std::move(now);
-    reg.loaded = true;
-  }
-  return lookUp(reg.byExecutable, executablePath);
+  const Entry& entry = current->first;
+  const bool listed = std::find(entry.users.begin(), entry.users.end(), peer.uid) != entry.users.end();
+  return listed ? entry.whole : entry.userPart;
 }
 
 }  // namespace platform

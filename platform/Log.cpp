@@ -10,7 +10,10 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <map>
 #include <mutex>
+#include <optional>
+#include <unordered_map>
 #include <string_view>
 
 #include "platform/FileIO.h"
@@ -174,7 +177,76 @@ void rotateLocked(LogFile& file) {
     syslog(LOG_ERR, "Failed to reopen log %s after rotation: %s", file.path.c_str(), strerror(errno));
 }
 
+// Refusal lines admitted in the current second, per caller uid.
+struct RefusalBudget {
+  std::mutex mutex;
+  int64_t second = 0;
+  std::unordered_map<uint32_t, uint32_t> admitted;
+  std::map<uint32_t, uint64_t> leftOut;
+};
+
+RefusalBudget& refusalBudget() {
+  static RefusalBudget* budget = new RefusalBudget;
+  return *budget;
+}
+std::atomic<bool> gRefusalsLeftOut{false};
+
+int64_t monotonicSecond() {
+  timespec now{};
+  clock_gettime(CLOCK_MONOTONIC, &now);
+  return now.tv_sec;
+}
+
+// Starts a new second when one has passed; the summary of the last one's
+// left-out lines, or nothing.
+std::optional<std::string> turnSecondLocked(RefusalBudget& budget, int64_t now) {
+  if (now == budget.second) return std::nullopt;
+  budget.second = now;
+  budget.admitted.clear();
+  if (budget.leftOut.empty()) return std::nullopt;
+  std::string text = "Left out refusal lines over " + std::to_string(kRefusalLinesPerSecond) + " a second:";
+  for (const auto& [uid, count] : budget.leftOut) text += " uid " + std::to_string(uid) + " " + std::to_string(count);
+  budget.leftOut.clear();
+  gRefusalsLeftOut = false;
+  return text;
+}
+
+// Says what was left out once its second is over, on the next line logged.
+void flushRefusalSummary() {
+  if (!gRefusalsLeftOut.load(std::memory_order_relaxed)) return;
+  RefusalBudget& budget = refusalBudget();
+  std::optional<std::string> summary;
+  {
+    std::lock_guard lock(budget.mutex);
+    summary = turnSecondLocked(budget, monotonicSecond());
+  }
+  if (summary) logWrite(kLogError, "logRefusal", *summary);
+}
+
 }  // namespace
+
+void logRefusal(uint32_t callerUid, const char* function, const std::string& message) {
+  RefusalBudget& budget = refusalBudget();
+  std::optional<std::string> summary;
+  bool admit;
+  {
+    std::lock_guard lock(budget.mutex);
+    summary = turnSecondLocked(budget, monotonicSecond());
+    admit = ++budget.admitted[callerUid] <= kRefusalLinesPerSecond;
+    if (!admit) {
+      ++budget.leftOut[callerUid];
+      gRefusalsLeftOut = true;
+    }
+  }
+  if (summary) logWrite(kLogError, "logRefusal", *summary);
+  if (admit) logWrite(kLogError, function, message);
+}
+
+std::string logIdentifier(std::string_view identifier) {
+  constexpr size_t kShown = 255;
+  if (identifier.size() <= kShown) return std::string(identifier);
+  return std::string(identifier.substr(0, kShown)) + "... (" + std::to_string(identifier.size()) + " bytes)";
+}
 
 bool logOpen(const std::string& path, const std::string& name, int level) {
   LogFile& file = logFile();
@@ -215,6 +287,7 @@ bool logReopen() {
 }
 
 void logWrite(int level, const char* function, const std::string& message) {
+  flushRefusalSummary();
   std::string line = formatLine(level, function, message);
   if (LogSink sink = gSink.load()) {
     sink(syslogPriority(level), escaped(function ? function : "(null)"), escaped(message));

@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <string>
+#include <string_view>
 
 #include "base/QRTFormat.h"
 
@@ -32,6 +33,13 @@ bool logReopen();
 // Control bytes (below 0x20, and 0x7f) of the function name and the message
 // are written as \xNN, so that every message stays one line.
 void logWrite(int level, const char* function, const std::string& message);
+// Refusal lines (a missing entitlement, a user check, a bad parameter) are
+// what any caller can make at will, so each caller uid gets 20 a second; the
+// rest are counted and one line a second says how many were left out.
+inline constexpr uint32_t kRefusalLinesPerSecond = 20;
+void logRefusal(uint32_t callerUid, const char* function, const std::string& message);
+// An identifier as a log line shows it: cut to 255 bytes.
+std::string logIdentifier(std::string_view identifier);
 // Straight to the system log, for lines about the log itself.
 void syslogWrite(int priority, const std::string& message);
 // Closes the file (tests reopen the log on another path).
@@ -45,6 +53,11 @@ void logClose();
   do {                                                                       \
     if (::platform::logEnabled(level))                                       \
       ::platform::logWrite((level), __func__, QRTFormat(__VA_ARGS__));       \
+  } while (0)
+#define QRTLogRefusal(callerUid, ...)                                        \
+  do {                                                                       \
+    if (::platform::logEnabled(::platform::kLogError))                       \
+      ::platform::logRefusal((callerUid), __func__, QRTFormat(__VA_ARGS__)); \
   } while (0)
 #define QRTLogAs(level, function, ...)                                       \
   do {                                                                       \

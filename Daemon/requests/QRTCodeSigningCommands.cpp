@@ -51,7 +51,7 @@ void QRTHandleGroupContainerPaths(const plist::Dictionary& request, const QRTRep
                                   QRTClientConnection& client, uint64_t* result) {
   uint32_t userId = 0;
   auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));
-  if (!validateUserId(requested, QRTClassAppGroup, client.clientUserId(), &userId, result)) return;
+  if (!validateUserId(requested, QRTClassAppGroup, client, &userId, result)) return;
   if (!mappingOr66(result)) return;
   replyGroupPaths(userId, request, reply, client, result);
 }
@@ -60,7 +60,7 @@ void QRTHandleGroupContainerIdentifiers(const plist::Dictionary& request, const 
                                         QRTClientConnection& client, uint64_t* result) {
   uint32_t userId = 0;
   auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));
-  if (!validateUserId(requested, QRTClassAppGroup, client.clientUserId(), &userId, result)) return;
+  if (!validateUserId(requested, QRTClassAppGroup, client, &userId, result)) return;
   if (!mappingOr66(result)) return;
   auto identifiers = QRTGroupManager::defaultManager().groupContainerIdentifiersForUser(
       userId, QRTMessageIdentifier(request, client.clientBundleIdentifier()), result);
@@ -80,8 +80,11 @@ void QRTHandleSystemGroupContainerPath(const plist::Dictionary& request, const Q
   const std::optional<std::string>& caller = client.clientBundleIdentifier();
   const std::optional<std::string> identifier = QRTMessageIdentifier(request, caller);
   const std::optional<std::string> group = QRTMessageString(request, "GroupIdentifier");
-  // Entitlement is judged by the caller's own identifier, whatever it names.
-  const QRTGroupList entitled = caller ? mapping->systemGroupIdentifiersForIdentifier(*caller) : std::nullopt;
+  // Entitlement is judged by the caller's own identifier, whatever it names,
+  // and counts only for a caller whose uid may hold system-level entitlements.
+  const QRTGroupList entitled = caller && client.rights().systemEntitled
+                                    ? mapping->systemGroupIdentifiersForIdentifier(*caller)
+                                    : std::nullopt;
   std::optional<std::string> path;
   if (group && entitled && std::find(entitled->begin(), entitled->end(), *group) != entitled->end()) {
     auto paths = QRTGroupManager::defaultManager().groupContainerPathsForUser(QRTSystemContainerUserId, client,
@@ -99,8 +102,8 @@ void QRTHandleSystemGroupContainerPath(const plist::Dictionary& request, const Q
     if (group != kQuietSystemGroup) {
       plist::Array list;
       if (entitled) list.assign(entitled->begin(), entitled->end());
-      QRTLog(kLogError, "%@ is not entitled for system group identifier: %@.  Only entitled for: %@", caller, group,
-             plist::Value(std::move(list)));
+      QRTLogRefusal(client.clientUserId(), "%@ is not entitled for system group identifier: %@.  Only entitled for: %@",
+                    caller, group, plist::Value(std::move(list)));
     }
     *result = QRTErrorNotEntitled;
     return;

@@ -1,5 +1,8 @@
 #include "Daemon/requests/QRTContainerCommands.h"
 
+#include <algorithm>
+
+#include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTMetadata.h"
 #include "Daemon/store/QRTWhitelist.h"
@@ -14,8 +17,32 @@ std::optional<uint32_t> checkedUser(const plist::Dictionary& request, uint64_t c
                                     const QRTClientConnection& client, uint64_t* result) {
   uint32_t effective = 0;
   auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));
-  if (!validateUserId(requested, containerClass, client.clientUserId(), &effective, result)) return std::nullopt;
+  if (!validateUserId(requested, containerClass, client, &effective, result)) return std::nullopt;
   return effective;
+}
+
+// Bundle and system group containers are global: anyone may connect, so they
+// need the entitlement that makes them, before anything is made, looked up or
+// sent to death row.
+bool globalClassEntitled(uint64_t containerClass, const std::optional<std::string>& identifier,
+                         const QRTClientConnection& client, uint64_t* result) {
+  const char* needed = nullptr;
+  if (QRTIsBundleClass(containerClass)) {
+    if (!client.rights().masterEntitled) needed = QRTEntitlementAllowed;
+  } else if (containerClass == QRTClassSystemGroup && !client.rights().masterEntitled) {
+    // The same system-group entitlement that command 17 asks for.
+    QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
+    const std::optional<std::string>& caller = client.clientBundleIdentifier();
+    const QRTGroupList entitled = mapping && caller && client.rights().systemEntitled
+                                      ? mapping->systemGroupIdentifiersForIdentifier(*caller)
+                                      : std::nullopt;
+    if (!identifier || !entitled || std::find(entitled->begin(), entitled->end(), *identifier) == entitled->end())
+      needed = "com.norvane.security.system-groups";
+  }
+  if (!needed) return true;
+  QRTLogEntitlementRefusal(client.clientUserId(), client.rights().pid, client.clientBundleIdentifier(), needed);
+  *result = QRTErrorNotEntitled;
+  return false;
 }
 
 }  // namespace
@@ -23,6 +50,9 @@ std::optional<uint32_t> checkedUser(const plist::Dictionary& request, uint64_t c
 void QRTHandleCreateOrLookupContainer(const plist::Dictionary& request, const QRTReplyRef& reply,
                                       QRTClientConnection& client, uint64_t* result) {
   uint64_t containerClass = QRTMessageU64(request, "ContainerClass");
+  if (!globalClassEntitled(containerClass, QRTMessageIdentifier(request, client.clientBundleIdentifier()), client,
+                           result))
+    return;
   std::optional<uint32_t> userId = checkedUser(request, containerClass, client, result);
   if (!userId) return;
   auto metadata = client.createOrLookupContainerForUser(
@@ -89,12 +119,12 @@ void QRTHandleReplaceContainer(const plist::Dictionary& request, const QRTReplyR
     oldClass = QRTMessageU64(request, "OldContainerClass");
     oldIdentifier = QRTMessageString(request, "OldIdentifier");
     auto requested = static_cast<uint32_t>(QRTMessageU64(request, "OldContainerUserID"));
-    if (!validateUserId(requested, oldClass, client.clientUserId(), &oldUser, result)) return;
+    if (!validateUserId(requested, oldClass, client, &oldUser, result)) return;
   }
   uint64_t newClass = QRTMessageU64(request, "NewContainerClass");
   uint32_t newUser = 0;
   auto requested = static_cast<uint32_t>(QRTMessageU64(request, "NewContainerUserID"));
-  if (!validateUserId(requested, newClass, client.clientUserId(), &newUser, result)) return;
+  if (!validateUserId(requested, newClass, client, &newUser, result)) return;
   client.replaceContainer(oldUUID, QRTMessageUUID(request, "NewContainerUUID"), oldUser, newUser, oldIdentifier,
                           QRTMessageString(request, "NewIdentifier"), oldClass, newClass, false, false, result);
 }
@@ -124,7 +154,7 @@ void QRTHandleStageContainerForDelete(const plist::Dictionary& request, const QR
       const plist::Integer* n = requested[i].integerIf();
       uint32_t effective = 0;
       if (!validateUserId(static_cast<uint32_t>(n ? n->asUnsigned() : 0), classes[i].value_or(0),
-                          client.clientUserId(), &effective, result)) {
+                          client, &effective, result)) {
         return;
       }
       users.push_back(effective);
@@ -216,7 +246,7 @@ void QRTHandleWipeAddonDataContainer(const plist::Dictionary& request, const QRT
   client.setAllowOtherIdLookup(false);
   uint32_t userId = 0;
   auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));
-  if (!validateUserId(requested, QRTClassAddonData, client.clientUserId(), &userId, result)) return;
+  if (!validateUserId(requested, QRTClassAddonData, client, &userId, result)) return;
   client.deleteDataContainerContentForUser(userId, QRTMessageString(request, "Identifier"), QRTClassAddonData, result);
 }
 

@@ -12,7 +12,7 @@ void QRTHandleSetDataProtection(const plist::Dictionary& request, const QRTReply
   uint32_t userId = 0;
   const auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));
   // A failed check leaves the result set: the dispatcher sends the one reply.
-  if (!validateUserId(requested, containerClass, client.clientUserId(), &userId, result)) return;
+  if (!validateUserId(requested, containerClass, client, &userId, result)) return;
   const int64_t protectionClass = QRTMessageI64(request, "DataProtectionClass");
   if (protectionClass < std::numeric_limits<int32_t>::min() || protectionClass > std::numeric_limits<int32_t>::max()) {
     QRTLog(platform::kLogError, "Data protection class %lld is not allowed", static_cast<long long>(protectionClass));

@@ -13,8 +13,13 @@
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "platform/Identity.h"
 #include "platform/Log.h"
+#include "platform/UserDatabase.h"
 
 using platform::kLogError;
+
+namespace {
+bool requestIdentifiersValid(const plist::Dictionary& request, uint32_t callerUid, uint64_t command);
+}  // namespace
 
 void QRTReply::send(uint64_t code) {
   dictionary["ReplyError"] = code;
@@ -84,6 +89,8 @@ void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::R
     std::optional<QRTClientConnection> client = checkEntitlementsAndInitClientObject(*connection, row.entitlement);
     if (!client) {
       result = QRTErrorNotEntitled;
+    } else if (!requestIdentifiersValid(request, client->clientUserId(), command)) {
+      result = QRTErrorInvalidParameter;
     } else {
       handled = true;
       QRTErrorRef failure = QRT_GUARD([&] { row.handler(request, reply, *client, &result); });
@@ -161,7 +168,8 @@ std::optional<QRTClientConnection> checkEntitlementsAndInitClientObject(const pl
                                                                         const char* entitlement) {
   const auto& peer = connection.peer();
   int pid = peer ? static_cast<int>(peer->pid) : 0;
-  std::shared_ptr<const platform::CodeIdentity> caller = platform::identityForExecutable(peer ? peer->executable : "");
+  std::shared_ptr<const platform::CodeIdentity> caller =
+      peer ? platform::identityForPeer(*peer) : platform::identityForExecutable("");
   const platform::CodeIdentity& identity = *caller;
   if (!peer || peer->executable.empty()) {
     QRTLog(kLogError, "Failed to copy signing ID for pid %d : %@", pid,
@@ -170,15 +178,16 @@ std::optional<QRTClientConnection> checkEntitlementsAndInitClientObject(const pl
   const std::string requirement = entitlement;
   const bool requiresNone = requirement == QRTEntitlementNone;
   const uint32_t userId = peer ? peer->uid : UINT32_MAX;
+  QRTClientConnection::Rights rights{pid, userId == 0 || identity.systemLevel, identity.systemLevel, false};
   auto refuse = [&]() -> std::optional<QRTClientConnection> {
-    QRTLogAs(kLogError, "checkEntitlementsAndInitClientObject",
-             "connection attempt from pid %d (%@) missing required entitlement: %s", pid, identity.signingIdentifier,
-             entitlement);
+    QRTLogEntitlementRefusal(userId, pid, identity.signingIdentifier, entitlement);
     return std::nullopt;
   };
   if (!identity.entitlements || identity.entitlements->empty()) {
     if (!requiresNone) return refuse();
-    return QRTClientConnection(identity.signingIdentifier, userId, false, std::nullopt);
+    QRTClientConnection client(identity.signingIdentifier, userId, false, std::nullopt);
+    client.setRights(rights);
+    return client;
   }
   const plist::Dictionary& entitlements = *identity.entitlements;
   const bool allowed = entitlementTrue(entitlements, QRTEntitlementAllowed);
@@ -194,11 +203,25 @@ std::optional<QRTClientConnection> checkEntitlementsAndInitClientObject(const pl
   } else if (!requiresNone && !allowed && !entitlementTrue(entitlements, entitlement)) {
     return refuse();
   }
-  registerCallerEntitlements(caller);
-  return QRTClientConnection(identity.signingIdentifier, userId, otherIdLookup, std::move(wipeIdentifiers));
+  // The database records the program, whoever runs it; what this caller
+  // may do is decided by its own part of the identity.
+  registerCallerEntitlements(caller->program ? caller->program : caller);
+  rights.masterEntitled = allowed;
+  QRTClientConnection client(identity.signingIdentifier, userId, otherIdLookup, std::move(wipeIdentifiers));
+  client.setRights(rights);
+  return client;
 }
 
-bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, uint32_t callerUserId,
+void QRTLogEntitlementRefusal(uint32_t callerUid, int pid, const std::optional<std::string>& signingIdentifier,
+                              const char* entitlement) {
+  platform::logRefusal(callerUid, "checkEntitlementsAndInitClientObject",
+                       QRTFormat("connection attempt from pid %d (%@) missing required entitlement: %s", pid,
+                                 signingIdentifier ? std::optional(platform::logIdentifier(*signingIdentifier))
+                                                   : std::nullopt,
+                                 entitlement));
+}
+
+bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, uint32_t callerUserId, bool systemProcess,
                     uint32_t* effectiveUserId, uint64_t* result) {
   bool valid;
   uint32_t effective = requestedUserId;
@@ -207,7 +230,9 @@ bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, uint32_t 
     effective = QRTInstallerUserId;
   } else if (QRTIsSystemClass(containerClass)) {
     valid = requestedUserId == QRTSystemContainerUserId;
-  } else if (callerUserId > 500) {
+  } else if (!systemProcess || callerUserId >= platform::ordinaryUserMinimum()) {
+    // Anyone may connect, whatever their uid: only root and the holders of
+    // system-level entitlements act for other users.
     valid = requestedUserId == callerUserId || requestedUserId == 1;
     effective = callerUserId;
   } else if (requestedUserId == 1) {
@@ -218,8 +243,8 @@ bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, uint32_t 
   }
   if (!valid) {
     if (result) {
-      QRTLog(kLogError, "Invalid userId %u for class %llu from client %u", requestedUserId,
-             static_cast<unsigned long long>(containerClass), callerUserId);
+      QRTLogRefusal(callerUserId, "Invalid userId %u for class %llu from client %u", requestedUserId,
+                    static_cast<unsigned long long>(containerClass), callerUserId);
       *result = QRTErrorInvalidArgument;
     }
     return false;
@@ -227,6 +252,63 @@ bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, uint32_t 
   if (effectiveUserId) *effectiveUserId = effective;
   return true;
 }
+
+bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, const QRTClientConnection& client,
+                    uint32_t* effectiveUserId, uint64_t* result) {
+  return validateUserId(requestedUserId, containerClass, client.clientUserId(), client.rights().systemProcess,
+                        effectiveUserId, result);
+}
+
+bool QRTIdentifierIsValid(std::string_view identifier) {
+  if (identifier.empty() || identifier.size() > kQRTIdentifierMaxBytes) return false;
+  for (size_t i = 0; i < identifier.size();) {
+    const auto c = static_cast<unsigned char>(identifier[i]);
+    if (c < 0x20 || c == 0x7f) return false;
+    if (c < 0x80) {
+      ++i;
+      continue;
+    }
+    // Shortest-form UTF-8 of a scalar value; C1 controls are controls too.
+    size_t length = c >= 0xc2 && c <= 0xdf ? 2 : c >= 0xe0 && c <= 0xef ? 3 : c >= 0xf0 && c <= 0xf4 ? 4 : 0;
+    if (length == 0 || i + length > identifier.size()) return false;
+    uint32_t value = c & (0x7f >> length);
+    for (size_t k = 1; k < length; ++k) {
+      const auto next = static_cast<unsigned char>(identifier[i + k]);
+      if ((next & 0xc0) != 0x80) return false;
+      value = value << 6 | (next & 0x3f);
+    }
+    if ((length == 3 && (value < 0x800 || (value >= 0xd800 && value <= 0xdfff))) ||
+        (length == 4 && (value < 0x10000 || value > 0x10ffff)) || (value >= 0x80 && value <= 0x9f))
+      return false;
+    i += length;
+  }
+  return true;
+}
+
+namespace {
+
+// Every identifier a request names: the program, group and system group
+// identifiers a handler may read.
+bool requestIdentifiersValid(const plist::Dictionary& request, uint32_t callerUid, uint64_t command) {
+  auto check = [&](const char* key, const plist::Value& value) {
+    const std::string* identifier = value.stringIf();
+    if (!identifier || QRTIdentifierIsValid(*identifier)) return true;
+    QRTLogRefusal(callerUid, "Invalid %s %@ (%llu bytes) in command %llu from client %u", key,
+                  platform::logIdentifier(*identifier), static_cast<unsigned long long>(identifier->size()), static_cast<unsigned long long>(command),
+                  callerUid);
+    return false;
+  };
+  for (const char* key : {"Identifier", "GroupIdentifier", "OldIdentifier", "NewIdentifier"}) {
+    if (const plist::Value* value = plist::find(request, key); value && !check(key, *value)) return false;
+  }
+  if (const plist::Value* list = plist::find(request, "IdentifiersArray"); list && list->arrayIf()) {
+    for (const plist::Value& item : list->array())
+      if (!check("IdentifiersArray", item)) return false;
+  }
+  return true;
+}
+
+}  // namespace
 
 uint64_t QRTMessageU64(const plist::Dictionary& message, std::string_view key) {
   const plist::Value* v = plist::find(message, key);

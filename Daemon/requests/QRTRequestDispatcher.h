@@ -70,10 +70,23 @@ void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::R
 std::optional<QRTClientConnection> checkEntitlementsAndInitClientObject(const platform::RequestConnection& connection,
                                                                         const char* entitlement);
 
+// The entitlement refusal line, limited per caller uid like every refusal.
+void QRTLogEntitlementRefusal(uint32_t callerUid, int pid, const std::optional<std::string>& signingIdentifier,
+                              const char* entitlement);
+
 // Checks a requested user id against the class and the caller; on success
-// stores the user id the operation must use.
-bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, uint32_t callerUserId,
+// stores the user id the operation must use. A caller that is not a system
+// process (systemProcess false) is checked as an ordinary user's, whatever
+// its uid.
+bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, uint32_t callerUserId, bool systemProcess,
                     uint32_t* effectiveUserId, uint64_t* result);
+bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, const QRTClientConnection& client,
+                    uint32_t* effectiveUserId, uint64_t* result);
+
+// A request's program, group or system group identifier: 1 to 255 bytes of
+// UTF-8 without control characters.
+inline constexpr size_t kQRTIdentifierMaxBytes = 255;
+bool QRTIdentifierIsValid(std::string_view identifier);
 
 // Message readers: a missing key, or a value of another type, reads as 0,
 // false or nothing.

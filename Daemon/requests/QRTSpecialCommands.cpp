@@ -30,7 +30,7 @@ void QRTHandleRetryTest(const plist::Dictionary& request, const QRTReplyRef&, QR
     return;
   }
   uint32_t userId = 0;
-  if (!validateUserId(static_cast<uint32_t>(QRTMessageU64(request, "UserID")), 2, client.clientUserId(), &userId,
+  if (!validateUserId(static_cast<uint32_t>(QRTMessageU64(request, "UserID")), 2, client, &userId,
                       result))
     return;
   client.retryTestForUser(userId, QRTMessageU64(request, "NumRetryCrashes"), result);

@@ -29,7 +29,9 @@ QRTClientConnection::QRTClientConnection(std::optional<std::string> bundleId, ui
     : clientBundleIdentifier_(std::move(bundleId)),
       clientUserId_(clientUserId),
       allowOtherIdLookup_(allowOtherIdLookup),
-      entitledWipeIdentifiers_(std::move(entitledWipeIdentifiers)) {}
+      entitledWipeIdentifiers_(std::move(entitledWipeIdentifiers)) {
+  rights_.systemProcess = clientUserId == 0;
+}
 
 QRTClientConnection::QRTClientConnection(std::optional<std::string> bundleId, bool allowOtherIdLookup)
     : QRTClientConnection(std::move(bundleId), 0, allowOtherIdLookup, std::nullopt) {}

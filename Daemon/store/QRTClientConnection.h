@@ -37,6 +37,17 @@ class QRTClientConnection {
   void setAllowGroupIdLookup(bool allow) { allowGroupIdLookup_ = allow; }
   const std::optional<std::vector<std::string>>& entitledWipeIdentifiers() const { return entitledWipeIdentifiers_; }
 
+  // What the caller's uid and identity together allow (root and the internal
+  // client: a system process).
+  struct Rights {
+    int pid = 0;
+    bool systemProcess = false;   // root, or a holder of system-level entitlements
+    bool systemEntitled = false;  // holds system-level entitlements
+    bool masterEntitled = false;  // holds the master entitlement
+  };
+  const Rights& rights() const { return rights_; }
+  void setRights(const Rights& rights) { rights_ = rights; }
+
   // Finds the container of (user, class, identifier, transient), or makes it
   // through the staging directory when asked to. Nothing on failure, with
   // the code in *withError.
@@ -157,4 +168,5 @@ class QRTClientConnection {
   bool allowOtherIdLookup_ = false;
   bool allowGroupIdLookup_ = false;
   std::optional<std::vector<std::string>> entitledWipeIdentifiers_;
+  Rights rights_;
 };

@@ -193,13 +193,16 @@ Container DaemonFixture::make(uint64_t user, const std::string& identifier, uint
 }
 
 void DaemonFixture::setIdentity(const std::string& name, const std::string& executable,
-                                const std::string& signingIdentifier, const plist::Dictionary& entitlements) {
+                                const std::string& signingIdentifier, const plist::Dictionary& entitlements,
+                                const plist::Array& users) {
   plist::Dictionary identity{
       {"Executable", executable}, {"SigningIdentifier", signingIdentifier}, {"Entitlements", entitlements}};
+  if (!users.empty()) identity["Users"] = users;
   plist::Data bytes = plist::writeBinary(identity);
   std::string dir = root + "/etc/quarterd/identities";
   std::string tmp = dir + "/." + name + ".tmp";
   writeFile(tmp, std::string(bytes.begin(), bytes.end()));
+  chmod(tmp.c_str(), 0644);  // the daemon skips a registry file others can write
   rename(tmp.c_str(), (dir + "/" + name + ".plist").c_str());
 }
 

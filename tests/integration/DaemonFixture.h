@@ -61,9 +61,10 @@ class DaemonFixture : public ::testing::Test {
   // User 501's application class directory.
   std::string appClassDir() const { return root + "/private/var/mobile/Containers/Data/Application"; }
 
-  // Registers (or replaces) the identity file name.plist for an executable.
+  // Registers (or replaces) the identity file name.plist for an executable;
+  // system-level entitlements count for the users listed (root when none are).
   void setIdentity(const std::string& name, const std::string& executable, const std::string& signingIdentifier,
-                   const plist::Dictionary& entitlements);
+                   const plist::Dictionary& entitlements, const plist::Array& users = {});
   // Registers an identity for this test program's own executable.
   void setOwnIdentity(const std::string& signingIdentifier, const plist::Dictionary& entitlements);
   void clearOwnIdentity();

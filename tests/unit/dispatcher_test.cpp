@@ -19,21 +19,23 @@ TEST(ValidateUserId, EffectiveUserByClassAndCaller) {
   std::ofstream(root / "etc/passwd") << "mobile:x:502:502::/private/var/mobile:/bin/sh\n";
   platform::setDeviceRoot(root.path());
   constexpr uint32_t kRefused = 0xffffffff;  // with error 38
-  const uint32_t cases[][4] = {
-      // requested user, class, caller, effective user. Global classes belong to their fixed users...
-      {33, 1, 0, 33}, {33, 8, 501, 33}, {501, 1, 0, kRefused}, {499, 12, 0, 499}, {0, 12, 0, kRefused},
-      {1, 13, 0, kRefused},
-      // ...ordinary callers get their own user...
-      {1, 2, 600, 600}, {600, 2, 600, 600}, {501, 2, 600, kRefused}, {0, 7, 600, kRefused},
+  const uint32_t cases[][5] = {
+      // requested user, class, caller, caller is a system process, effective user. Global classes belong to their fixed users...
+      {33, 1, 0, 1, 33}, {33, 8, 501, 0, 33}, {501, 1, 0, 1, kRefused}, {499, 12, 0, 1, 499}, {0, 12, 0, 1, kRefused},
+      {1, 13, 0, 1, kRefused},
+      // ...ordinary callers, and low uids without system-level entitlements, get their own user...
+      {1, 2, 600, 0, 600}, {600, 2, 600, 0, 600}, {501, 2, 600, 0, kRefused}, {0, 7, 600, 0, kRefused},
+      {501, 2, 120, 0, kRefused}, {0, 2, 120, 0, kRefused}, {1, 2, 120, 0, 120}, {501, 2, 600, 1, kRefused},
       // ...system callers name any user of a per-user class (1: the current mobile user).
-      {1, 2, 33, 502}, {1, 0, 0, 502}, {0, 2, 0, 0}, {777, 11, 500, 777}, {501, 0, 0, kRefused}, {501, 14, 0, kRefused},
+      {1, 2, 33, 1, 502}, {1, 0, 0, 1, 502}, {0, 2, 0, 1, 0}, {777, 11, 500, 1, 777}, {501, 0, 0, 1, kRefused},
+      {501, 14, 0, 1, kRefused},
   };
-  for (const auto& [requested, cls, caller, expected] : cases) {
+  for (const auto& [requested, cls, caller, system, expected] : cases) {
     uint32_t effective = 0xdeadbeef;
     uint64_t result = 1;
-    const bool ok = validateUserId(requested, cls, caller, &effective, &result);
-    EXPECT_EQ(ok ? effective : kRefused, expected) << requested << " " << cls << " " << caller;
-    EXPECT_EQ(result, ok ? 1u : 38u) << requested << " " << cls << " " << caller;
+    const bool ok = validateUserId(requested, cls, caller, system != 0, &effective, &result);
+    EXPECT_EQ(ok ? effective : kRefused, expected) << requested << " " << cls << " " << caller << " " << system;
+    EXPECT_EQ(result, ok ? 1u : 38u) << requested << " " << cls << " " << caller << " " << system;
   }
   platform::setDeviceRoot("/");
 }
