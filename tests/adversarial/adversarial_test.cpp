@@ -5,6 +5,8 @@
 // and must keep serving.
 #include <fcntl.h>
 #include <grp.h>
+#include <sched.h>
+#include <sys/mount.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -171,7 +173,8 @@ struct Case {
 
 class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterface<Case> {
  public:
-  using DaemonFixture::deadDirectory, DaemonFixture::make, DaemonFixture::restartDaemon, DaemonFixture::root;
+  using DaemonFixture::deadDirectory, DaemonFixture::make, DaemonFixture::restartDaemon, DaemonFixture::root,
+      DaemonFixture::createOrLookup, DaemonFixture::setIdentity;
   void SetUp() override {
     DaemonFixture::SetUp();
     if (HasFatalFailure()) return;
@@ -221,6 +224,52 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
     for (const auto& [command, keys] : requests) send(command, keys);
   }
 
+  // Requests sent (each `repeat` times) on one connection by a process of
+  // uid's with no entitlement; how many did not answer expected (the process is lastPid).
+  int sendsAs(uid_t uid, uint64_t expected, const std::vector<std::pair<uint64_t, plist::Dictionary>>& requests,
+              int repeat = 1) {
+    if ((lastPid = fork()) == 0) {
+      becomeUser(uid);
+      auto connection = qk::Connection::connect(qk::requestSocketPath(root));
+      int wrong = 0;
+      for (const auto& [command, keys] : requests)
+        for (int i = 0; i < repeat; ++i)
+          wrong += !connection || codeOf(connection->call(request(command, keys), kRequestTimeout)) != expected;
+      _exit(std::min(wrong, 250));
+    }
+    int status = -1;
+    waitpid(lastPid, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 255;
+  }
+  // quarterctl raw run by the user as the registered entitled program, or
+  // (bindOver) as their own program mounted over its path in namespaces of
+  // their own; the exit status, 125 when the namespaces are refused.
+  int runEntitledAs(uid_t uid, bool bindOver, const std::vector<std::string>& raw) {
+    const std::string entitled = root + "/usr/bin/entitledctl";
+    pid_t pid = fork();
+    if (pid == 0) {
+      becomeUser(uid);
+      if (bindOver) {
+        auto map = [](const char* file, const std::string& text) { std::ofstream(file) << text; };
+        if (unshare(CLONE_NEWUSER | CLONE_NEWNS) != 0) _exit(125);
+        map("/proc/self/setgroups", "deny");
+        map("/proc/self/uid_map", "0 " + std::to_string(uid) + " 1");
+        map("/proc/self/gid_map", "0 " + std::to_string(uid) + " 1");
+        if (mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+            mount(QRT_QUARTERCTL_PATH, entitled.c_str(), nullptr, MS_BIND, nullptr) != 0)
+          _exit(125);
+      }
+      std::vector<const char*> argv{entitled.c_str(), "--root", root.c_str(), "raw"};
+      for (const std::string& arg : raw) argv.push_back(arg.c_str());
+      argv.push_back(nullptr);
+      execv(argv[0], const_cast<char* const*>(argv.data()));
+      _exit(127);
+    }
+    int status = -1;
+    waitpid(pid, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 255;
+  }
+
   void plant(const std::function<bool()>& step) { ASSERT_EQ(asUser(kUser, step), 0) << "the user could not plant"; }
 
   static plist::Dictionary stage(const Container& c) {
@@ -255,6 +304,7 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
   }
 
   std::string outside;
+  pid_t lastPid = -1;
   // The user's application and addon containers, a replacement, and another user's container.
   Container app, addon, fresh, other;
   std::string trace_;
@@ -264,6 +314,7 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
 TEST_P(AdversarialTest, NothingOutsideTheUsersReachChanges) {
   const Case& c = GetParam();
   ASSERT_NO_FATAL_FAILURE(c.setup(*this));
+  if (IsSkipped()) return;
   const Snapshot before = snapshot();
   std::optional<Racer> racer;
   if (c.race) racer.emplace(kUser, [&] { c.race(*this); });
@@ -323,6 +374,12 @@ void hardLinks(T& t) {
   ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/suid").c_str()), 0);
 }
 void freshApp(T& t) { t.fresh = t.make(kUser, "com.example.app", 2, true); }
+// A root-owned copy of quarterctl registered with the master entitlement (for root alone).
+void registerEntitledCopy(T& t) {
+  const std::string copy = t.root + "/usr/bin/entitledctl";
+  ASSERT_EQ(system(("mkdir -p " + parentOf(copy) + " && cp " QRT_QUARTERCTL_PATH " " + copy).c_str()), 0);
+  t.setIdentity("entitledctl", copy, "com.example.entitledctl", {{"com.norvane.private.QuarterKit.allowed", true}});
+}
 
 const Case kCases[] = {
     // The metadata file.
@@ -479,6 +536,56 @@ const Case kCases[] = {
        byNameThenPass(10)(t);
      },
      [](const T& t) { flip(t.containers(), t.home() + "/decoys"); }},
+    // Borrowed identities, requests from users and service accounts that no
+    // entitlement covers, and refusals meant to flush the log.
+    {"EntitledProgramRunByTheUser_AsWithPreload_DeleteOthers", registerEntitledCopy,
+     [](T& t) { t.runEntitledAs(kUser, false, {"Command=u64:10", "UserID=u64:502", "ContainerClass=u64:2",
+                                               "Identifier=str:com.example.other"}); }},
+    {"NamespaceBindMountOverEntitledProgram_DeleteOthers", registerEntitledCopy,
+     [](T& t) {
+       if (t.runEntitledAs(kUser, true, {"Command=u64:10", "UserID=u64:502", "ContainerClass=u64:2",
+                                         "Identifier=str:com.example.other"}) == 125)
+         GTEST_SKIP() << "unprivileged user and mount namespaces are refused here";
+     }},
+    {"LongIdentifiers_300Creations", [](T&) {},
+     [](T& t) {
+       EXPECT_EQ(t.sendsAs(kUser, 11, {{0, T::creation(std::string(1 << 20, 'a'))}}, 300), 0)
+           << "creations with 1 MB identifiers not refused with 11";
+       EXPECT_EQ(listDirectory(parentOf(t.app.path)).size(), 1u) << "containers left in the class directory";
+     }},
+    {"ServiceAccountActsForOthers_TransientAndRootsHome",
+     [](T& t) {
+       std::ofstream(t.root + "/etc/passwd", std::ios::app) << "svc:x:120:120::/private/var/empty:/bin/false\n";
+       freshApp(t);
+     },
+     [](T& t) {
+       EXPECT_EQ(t.sendsAs(120, 38, {{0, T::creation("com.example.app", true)},
+                                     {0, with(T::creation("com.example.app"), {{"UserID", 0}})}}), 0);
+       EXPECT_TRUE(exists(t.fresh.path)) << "the user's transient container was sent to death row";
+     }},
+    {"GlobalClassesWithoutEntitlement_CreateAndTransient",
+     [](T& t) {
+       t.fresh = t.make(33, "com.example.bundle", 1, true);
+       writeFile(t.fresh.path + "/payload", "the installer's");
+     },
+     [](T& t) {
+       EXPECT_EQ(t.sendsAs(kUser, 55, {{0, with(byName(33, 1, "com.example.bundle"), {{"CreateIfNecessary", true},
+                                                                                   {"Transient", true}})},
+                                       {0, with(byName(33, 3, "com.victim.app"), {{"CreateIfNecessary", true}})},
+                                       {0, with(byName(499, 13, "systemgroup.com.victim"), {{"CreateIfNecessary", true}})}}),
+                 0);
+       EXPECT_EQ(readFile(t.fresh.path + "/payload"), "the installer's");
+       EXPECT_NE(t.createOrLookup(33, "com.victim.app", 3, false).error, 1u) << "a bundle container was made";
+       EXPECT_NE(t.createOrLookup(499, "systemgroup.com.victim", 13, false).error, 1u) << "a system group container was made";
+     }},
+    {"RefusalsFlushingTheLog_800In200ms", [](T&) {},
+     [](T& t) {
+       t.sendsAs(kUser, 55, {{10, byName(t.other)}});
+       const std::string evidence = "from pid " + std::to_string(t.lastPid) + " ";
+       t.sendsAs(kUser, 55, {{17, {{"GroupIdentifier", std::string(16 << 10, 'g')}}}}, 800);
+       const std::string log = t.root + "/private/var/root/Library/Logs/QuarterKit/quarterd.log";
+       EXPECT_NE((readFile(log + ".0") + readFile(log)).find(evidence), std::string::npos) << "the refusal is gone";
+     }},
 };
 
 INSTANTIATE_TEST_SUITE_P(Arrangements, AdversarialTest, ::testing::ValuesIn(kCases),

@@ -218,6 +218,48 @@ TEST_F(DeviceRootTest, IdentityRegistryLastSortedFileWinsAndChangesAreSeen) {
   EXPECT_FALSE(identityForExecutable("/usr/bin/tool")->signingIdentifier);
 }
 
+// The entry is the file the peer runs, and its system-level entitlements go
+// only to the uids in Users (root when absent).
+TEST_F(DeviceRootTest, PeerIdentityIsTheFileAndTheUid) {
+  writeFile(at("/etc/passwd"), "mobile:x:501:501::/private/var/mobile:/bin/sh\nsvc:x:120:120::/:/bin/false\n");
+  const fs::path registry = at("/etc/quarterd/identities"), file = registry / "tool.plist";
+  struct stat real {};
+  ASSERT_EQ(stat("/usr/bin/true", &real), 0);
+  const plist::Dictionary groups{{"com.norvane.security.application-groups", plist::Array{"group.a"}}};
+  plist::Dictionary both = groups;
+  both["com.norvane.private.QuarterKit.allowed"] = true;
+  struct Row {
+    std::optional<plist::Array> users;
+    plist::Dictionary entitlements;
+    uid_t uid;
+    mode_t fileMode, dirMode;
+    bool otherFile;
+    int expected;  // -1 no identity, 0 application groups only, 1 everything
+  } rows[] = {
+      {{}, both, 0, 0644, 0755, false, 1},           {{}, both, 501, 0644, 0755, false, 0},
+      {{}, both, 120, 0644, 0755, false, 0},         {plist::Array{"svc"}, both, 120, 0644, 0755, false, 1},
+      {plist::Array{120}, both, 0, 0644, 0755, false, 0},
+      {plist::Array{"mobile"}, both, 0, 0644, 0755, false, -1},  // an ordinary user next to `allowed`
+      {plist::Array{501}, groups, 501, 0644, 0755, false, 0},    // ...is fine with user-level ones alone
+      {{}, both, 0, 0664, 0755, false, -1},          {{}, both, 0, 0644, 0777, false, -1},
+      {{}, both, 0, 0644, 0755, true, -1},  // another file at the path in the peer's namespace
+  };
+  for (const Row& row : rows) {
+    plist::Dictionary entry{{"Executable", "/usr/bin/true"}, {"SigningIdentifier", "com.example.tool"},
+                            {"Entitlements", row.entitlements}};
+    if (row.users) entry["Users"] = *row.users;
+    writePlist(file, entry);
+    fs::permissions(file, static_cast<fs::perms>(row.fileMode));
+    fs::permissions(registry, static_cast<fs::perms>(row.dirMode));
+    PeerCredentials peer{getpid(), row.uid, row.uid, "/usr/bin/true", true, real.st_dev, real.st_ino + row.otherFile};
+    std::shared_ptr<const CodeIdentity> identity = identityForPeer(peer);
+    const int got = !identity->signingIdentifier ? -1 : identity->systemLevel ? 1 : 0;
+    EXPECT_EQ(got, row.expected) << "uid " << row.uid << " modes " << std::oct << row.fileMode << " " << row.dirMode;
+    if (got == 0) { EXPECT_EQ(*identity->entitlements, groups); }
+    fs::permissions(registry, static_cast<fs::perms>(0755));
+  }
+}
+
 // A live peer's executable picks its identity in every integration test that
 // sets the test's own; a peer that is gone must not be taken for anyone.
 TEST_F(DeviceRootTest, PeerCredentialsOfAnExitedPeerAreNotVerified) {
