@@ -351,8 +351,8 @@ std::shared_ptr<const CodeIdentity> identityForPeer(const PeerCredentials& peer)
     std::optional<FileId> there = fileIdOf(peer.executable);
     if (there) rememberFile(peer.executable, *there);
     if (there != running) {
-      QRTLog(kLogError, "pid %d runs another file than %s; no identity", static_cast<int>(peer.pid),
-             peer.executable.c_str());
+      QRTLogRefusal(peer.uid, "pid %d runs another file than %s; no identity", static_cast<int>(peer.pid),
+                    peer.executable.c_str());
       return noIdentity();
     }
   }
