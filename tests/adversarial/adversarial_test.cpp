@@ -174,7 +174,7 @@ struct Case {
 class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterface<Case> {
  public:
   using DaemonFixture::deadDirectory, DaemonFixture::make, DaemonFixture::restartDaemon, DaemonFixture::root,
-      DaemonFixture::createOrLookup, DaemonFixture::setIdentity;
+      DaemonFixture::createOrLookup, DaemonFixture::setIdentity, DaemonFixture::logContains;
   void SetUp() override {
     DaemonFixture::SetUp();
     if (HasFatalFailure()) return;
@@ -374,8 +374,12 @@ void hardLinks(T& t) {
   ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/suid").c_str()), 0);
 }
 void freshApp(T& t) { t.fresh = t.make(kUser, "com.example.app", 2, true); }
-// A root-owned copy of quarterctl registered with the master entitlement (for root alone).
+// A root-owned copy of quarterctl registered with the master entitlement (for
+// root alone), and a system container that the entitlement could delete.
+const std::vector<std::string> kDeleteSystemContainer{"Command=u64:10", "UserID=u64:499", "ContainerClass=u64:12",
+                                                      "Identifier=str:com.example.sysd"};
 void registerEntitledCopy(T& t) {
+  t.fresh = t.make(499, "com.example.sysd", 12);
   const std::string copy = t.root + "/usr/bin/entitledctl";
   ASSERT_EQ(system(("mkdir -p " + parentOf(copy) + " && cp " QRT_QUARTERCTL_PATH " " + copy).c_str()), 0);
   t.setIdentity("entitledctl", copy, "com.example.entitledctl", {{"com.norvane.private.QuarterKit.allowed", true}});
@@ -538,14 +542,17 @@ const Case kCases[] = {
      [](const T& t) { flip(t.containers(), t.home() + "/decoys"); }},
     // Borrowed identities, requests from users and service accounts that no
     // entitlement covers, and refusals meant to flush the log.
-    {"EntitledProgramRunByTheUser_AsWithPreload_DeleteOthers", registerEntitledCopy,
-     [](T& t) { t.runEntitledAs(kUser, false, {"Command=u64:10", "UserID=u64:502", "ContainerClass=u64:2",
-                                               "Identifier=str:com.example.other"}); }},
-    {"NamespaceBindMountOverEntitledProgram_DeleteOthers", registerEntitledCopy,
+    {"EntitledProgramRunByTheUser_AsWithPreload_DeleteSystemContainer", registerEntitledCopy,
      [](T& t) {
-       if (t.runEntitledAs(kUser, true, {"Command=u64:10", "UserID=u64:502", "ContainerClass=u64:2",
-                                         "Identifier=str:com.example.other"}) == 125)
+       t.runEntitledAs(kUser, false, kDeleteSystemContainer);
+       EXPECT_TRUE(exists(t.fresh.path)) << "the system container was deleted";
+     }},
+    {"NamespaceBindMountOverEntitledProgram_DeleteSystemContainer", registerEntitledCopy,
+     [](T& t) {
+       if (t.runEntitledAs(kUser, true, kDeleteSystemContainer) == 125)
          GTEST_SKIP() << "unprivileged user and mount namespaces are refused here";
+       EXPECT_TRUE(exists(t.fresh.path)) << "the system container was deleted";
+       EXPECT_TRUE(t.logContains("runs another file than")) << "the mounted file was taken for the program";
      }},
     {"LongIdentifiers_300Creations", [](T&) {},
      [](T& t) {

@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <thread>
+#include <tuple>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -218,43 +219,32 @@ TEST_F(DeviceRootTest, IdentityRegistryLastSortedFileWinsAndChangesAreSeen) {
   EXPECT_FALSE(identityForExecutable("/usr/bin/tool")->signingIdentifier);
 }
 
-// The entry is the file the peer runs, and its system-level entitlements go
-// only to the uids in Users (root when absent).
+// The entry is the file the peer runs; system-level entitlements go only to
+// the uids in Users (root when absent). Expected: -1 none, 0 groups only, 1 all.
 TEST_F(DeviceRootTest, PeerIdentityIsTheFileAndTheUid) {
   writeFile(at("/etc/passwd"), "mobile:x:501:501::/private/var/mobile:/bin/sh\nsvc:x:120:120::/:/bin/false\n");
   const fs::path registry = at("/etc/quarterd/identities"), file = registry / "tool.plist";
   struct stat real {};
   ASSERT_EQ(stat("/usr/bin/true", &real), 0);
   const plist::Dictionary groups{{"com.norvane.security.application-groups", plist::Array{"group.a"}}};
-  plist::Dictionary both = groups;
-  both["com.norvane.private.QuarterKit.allowed"] = true;
-  struct Row {
-    std::optional<plist::Array> users;
-    plist::Dictionary entitlements;
-    uid_t uid;
-    mode_t fileMode, dirMode;
-    bool otherFile;
-    int expected;  // -1 no identity, 0 application groups only, 1 everything
-  } rows[] = {
-      {{}, both, 0, 0644, 0755, false, 1},           {{}, both, 501, 0644, 0755, false, 0},
-      {{}, both, 120, 0644, 0755, false, 0},         {plist::Array{"svc"}, both, 120, 0644, 0755, false, 1},
-      {plist::Array{120}, both, 0, 0644, 0755, false, 0},
-      {plist::Array{"mobile"}, both, 0, 0644, 0755, false, -1},  // an ordinary user next to `allowed`
-      {plist::Array{501}, groups, 501, 0644, 0755, false, 0},    // ...is fine with user-level ones alone
-      {{}, both, 0, 0664, 0755, false, -1},          {{}, both, 0, 0644, 0777, false, -1},
-      {{}, both, 0, 0644, 0755, true, -1},  // another file at the path in the peer's namespace
+  plist::Dictionary all = groups;
+  all["com.norvane.private.QuarterKit.allowed"] = true;
+  const plist::Array none;
+  const std::tuple<plist::Array, plist::Dictionary, uid_t, int, int, ino_t, int> rows[] = {
+      {none, all, 0, 0644, 0755, 0, 1}, {none, all, 501, 0644, 0755, 0, 0}, {none, all, 120, 0644, 0755, 0, 0},
+      {{"svc"}, all, 120, 0644, 0755, 0, 1}, {{120}, all, 0, 0644, 0755, 0, 0}, {{"mobile"}, all, 0, 0644, 0755, 0, -1},
+      {{501}, groups, 501, 0644, 0755, 0, 0}, {none, all, 0, 0664, 0755, 0, -1}, {none, all, 0, 0644, 0777, 0, -1},
+      {none, all, 0, 0644, 0755, 1, -1},  // another file at the path (a mount in the peer's namespace)
   };
-  for (const Row& row : rows) {
-    plist::Dictionary entry{{"Executable", "/usr/bin/true"}, {"SigningIdentifier", "com.example.tool"},
-                            {"Entitlements", row.entitlements}};
-    if (row.users) entry["Users"] = *row.users;
+  for (const auto& [users, entitlements, uid, fileMode, dirMode, otherFile, expected] : rows) {
+    plist::Dictionary entry{{"Executable", "/usr/bin/true"}, {"SigningIdentifier", "t"}, {"Entitlements", entitlements}};
+    if (!users.empty()) entry["Users"] = users;
     writePlist(file, entry);
-    fs::permissions(file, static_cast<fs::perms>(row.fileMode));
-    fs::permissions(registry, static_cast<fs::perms>(row.dirMode));
-    PeerCredentials peer{getpid(), row.uid, row.uid, "/usr/bin/true", true, real.st_dev, real.st_ino + row.otherFile};
-    std::shared_ptr<const CodeIdentity> identity = identityForPeer(peer);
+    fs::permissions(file, static_cast<fs::perms>(fileMode));
+    fs::permissions(registry, static_cast<fs::perms>(dirMode));
+    auto identity = identityForPeer({getpid(), uid, uid, "/usr/bin/true", true, real.st_dev, real.st_ino + otherFile});
     const int got = !identity->signingIdentifier ? -1 : identity->systemLevel ? 1 : 0;
-    EXPECT_EQ(got, row.expected) << "uid " << row.uid << " modes " << std::oct << row.fileMode << " " << row.dirMode;
+    EXPECT_EQ(got, expected) << "uid " << uid << " modes " << std::oct << fileMode << " " << dirMode;
     if (got == 0) { EXPECT_EQ(*identity->entitlements, groups); }
     fs::permissions(registry, static_cast<fs::perms>(0755));
   }
