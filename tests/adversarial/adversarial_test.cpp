@@ -96,6 +96,12 @@ void becomeUser(uid_t uid) {
   if (setgroups(0, nullptr) != 0 || setresgid(uid, uid, uid) != 0 || setresuid(uid, uid, uid) != 0) _exit(126);
 }
 
+int exitStatus(pid_t pid) {
+  int status = -1;
+  waitpid(pid, &status, 0);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : 255;
+}
+
 // Runs step in a child as the user; the child's wait status (0 when step returned true).
 int asUser(uid_t uid, const std::function<bool()>& step) {
   pid_t pid = fork();
@@ -237,9 +243,7 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
           wrong += !connection || codeOf(connection->call(request(command, keys), kRequestTimeout)) != expected;
       _exit(std::min(wrong, 250));
     }
-    int status = -1;
-    waitpid(lastPid, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 255;
+    return exitStatus(lastPid);
   }
   // quarterctl raw run by the user as the registered entitled program, or
   // (bindOver) as their own program mounted over its path in namespaces of
@@ -265,9 +269,7 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
       execv(argv[0], const_cast<char* const*>(argv.data()));
       _exit(127);
     }
-    int status = -1;
-    waitpid(pid, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 255;
+    return exitStatus(pid);
   }
 
   void plant(const std::function<bool()>& step) { ASSERT_EQ(asUser(kUser, step), 0) << "the user could not plant"; }
@@ -374,8 +376,7 @@ void hardLinks(T& t) {
   ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/suid").c_str()), 0);
 }
 void freshApp(T& t) { t.fresh = t.make(kUser, "com.example.app", 2, true); }
-// A root-owned copy of quarterctl registered with the master entitlement (for
-// root alone), and a system container that the entitlement could delete.
+// A root copy of quarterctl with the master entitlement (root's alone), and a system container it could delete.
 const std::vector<std::string> kDeleteSystemContainer{"Command=u64:10", "UserID=u64:499", "ContainerClass=u64:12",
                                                       "Identifier=str:com.example.sysd"};
 void registerEntitledCopy(T& t) {
@@ -540,8 +541,7 @@ const Case kCases[] = {
        byNameThenPass(10)(t);
      },
      [](const T& t) { flip(t.containers(), t.home() + "/decoys"); }},
-    // Borrowed identities, requests from users and service accounts that no
-    // entitlement covers, and refusals meant to flush the log.
+    // Borrowed identities, requests no entitlement covers, refusals to flush the log.
     {"EntitledProgramRunByTheUser_AsWithPreload_DeleteSystemContainer", registerEntitledCopy,
      [](T& t) {
        t.runEntitledAs(kUser, false, kDeleteSystemContainer);
@@ -556,15 +556,11 @@ const Case kCases[] = {
      }},
     {"LongIdentifiers_300Creations", [](T&) {},
      [](T& t) {
-       EXPECT_EQ(t.sendsAs(kUser, 11, {{0, T::creation(std::string(1 << 20, 'a'))}}, 300), 0)
-           << "creations with 1 MB identifiers not refused with 11";
+       EXPECT_EQ(t.sendsAs(kUser, 11, {{0, T::creation(std::string(1 << 20, 'a'))}}, 300), 0) << "not refused with 11";
        EXPECT_EQ(listDirectory(parentOf(t.app.path)).size(), 1u) << "containers left in the class directory";
      }},
     {"ServiceAccountActsForOthers_TransientAndRootsHome",
-     [](T& t) {
-       std::ofstream(t.root + "/etc/passwd", std::ios::app) << "svc:x:120:120::/private/var/empty:/bin/false\n";
-       freshApp(t);
-     },
+     [](T& t) { std::ofstream(t.root + "/etc/passwd", std::ios::app) << "svc:x:120:120::/:/bin/false\n", freshApp(t); },
      [](T& t) {
        EXPECT_EQ(t.sendsAs(120, 38, {{0, T::creation("com.example.app", true)},
                                      {0, with(T::creation("com.example.app"), {{"UserID", 0}})}}), 0);
@@ -576,11 +572,10 @@ const Case kCases[] = {
        writeFile(t.fresh.path + "/payload", "the installer's");
      },
      [](T& t) {
-       EXPECT_EQ(t.sendsAs(kUser, 55, {{0, with(byName(33, 1, "com.example.bundle"), {{"CreateIfNecessary", true},
-                                                                                   {"Transient", true}})},
-                                       {0, with(byName(33, 3, "com.victim.app"), {{"CreateIfNecessary", true}})},
-                                       {0, with(byName(499, 13, "systemgroup.com.victim"), {{"CreateIfNecessary", true}})}}),
-                 0);
+       const plist::Dictionary create{{"CreateIfNecessary", true}}, transient{{"CreateIfNecessary", true}, {"Transient", true}};
+       EXPECT_EQ(t.sendsAs(kUser, 55, {{0, with(byName(33, 1, "com.example.bundle"), transient)},
+                                       {0, with(byName(33, 3, "com.victim.app"), create)},
+                                       {0, with(byName(499, 13, "systemgroup.com.victim"), create)}}), 0);
        EXPECT_EQ(readFile(t.fresh.path + "/payload"), "the installer's");
        EXPECT_NE(t.createOrLookup(33, "com.victim.app", 3, false).error, 1u) << "a bundle container was made";
        EXPECT_NE(t.createOrLookup(499, "systemgroup.com.victim", 13, false).error, 1u) << "a system group container was made";

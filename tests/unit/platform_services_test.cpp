@@ -227,8 +227,7 @@ TEST_F(DeviceRootTest, PeerIdentityIsTheFileAndTheUid) {
   struct stat real {};
   ASSERT_EQ(stat("/usr/bin/true", &real), 0);
   const plist::Dictionary groups{{"com.norvane.security.application-groups", plist::Array{"group.a"}}};
-  plist::Dictionary all = groups;
-  all["com.norvane.private.QuarterKit.allowed"] = true;
+  const plist::Dictionary all{*groups.begin(), {"com.norvane.private.QuarterKit.allowed", true}};
   const plist::Array none;
   const std::tuple<plist::Array, plist::Dictionary, uid_t, int, int, ino_t, int> rows[] = {
       {none, all, 0, 0644, 0755, 0, 1}, {none, all, 501, 0644, 0755, 0, 0}, {none, all, 120, 0644, 0755, 0, 0},
