@@ -1162,14 +1162,19 @@ bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTW
 }
 
 std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& url, QRTErrorRef* error) {
+  return QRT_dictionaryWithContentsOfURL(url, kMaxPropertyListFileSize, plist::Limits{}, error);
+}
+
+std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& url, size_t maxBytes,
+                                                                 const plist::Limits& limits, QRTErrorRef* error) {
   std::string bytes;
-  if (int err = platform::safeReadFile(url.path(), &bytes, kMaxPropertyListFileSize)) {
+  if (int err = platform::safeReadFile(url.path(), &bytes, maxBytes)) {
     QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to read property list at %@: %s", url, errorText(err)));
     return std::nullopt;
   }
   std::string reason;
   std::optional<plist::Value> value =
-      plist::parse(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size(), &reason);
+      plist::parse(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size(), &reason, limits);
   if (!value) {
     QRTSetError(error, QRTCreateError(__func__, __LINE__, QRTPropertyListErrorDomain, QRTPropertyListReadCorruptError,
                                       nullptr, nullptr, false, "Failed to parse property list at %@: %s", url,

@@ -18,6 +18,7 @@
 #include <vector>
 
 #include "Daemon/QRTError.h"
+#include "base/PlistCodec.h"
 #include "base/PlistValue.h"
 #include "base/QRTURL.h"
 
@@ -187,6 +188,10 @@ bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTW
 // dictionary. Unparsable bytes fail in QRTPropertyListErrorDomain with 3840, another
 // top-level type with 2048, a read failure with a POSIX error.
 std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& url, QRTErrorRef* error);
+// The same for a file of at most maxBytes (EFBIG past it) whose value stays
+// within limits; for files whose values are kept for long.
+std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& url, size_t maxBytes,
+                                                                 const plist::Limits& limits, QRTErrorRef* error);
 
 inline constexpr int32_t QRTPropertyListReadCorruptError = 3840;
 inline constexpr int32_t QRTFormattingError = 2048;
