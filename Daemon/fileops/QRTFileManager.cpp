@@ -815,13 +815,6 @@ bool TreeWalker::leave() {
 
 // ---------------------------------------------------------------------------
 
-// A fresh hidden name beside name, for a copy that is renamed into place.
-std::string hiddenSibling(const std::string& name) {
-  uint64_t random = 0;
-  if (getrandom(&random, sizeof random, GRND_NONBLOCK) != sizeof random) random = static_cast<uint64_t>(getpid());
-  return "." + name.substr(0, 200) + ".qrt-move-" + std::to_string(random);
-}
-
 std::string randomSuffix(size_t length) {
   static const char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789";
   unsigned char bytes[16];
@@ -975,39 +968,6 @@ bool QRTFileManager::copyItemIfExistsAtURL(const QRTURL& src, const QRTURL& toUR
   return _copyItemAtURL(src, toURL, false, error);
 }
 
-namespace {
-
-// Across file systems: a durable copy under a hidden name beside the
-// destination, renamed into place (so the destination never holds half a
-// copy, and a failed copy is removed), then the source goes.
-bool moveAcross(const QRTURL& src, const QRTURL& toURL, SafeParent& from, SafeParent& to, QRTErrorRef* error) {
-  const std::string temporary = hiddenSibling(to.name);
-  TreeCloner cloner(true);
-  int err = cloner.run(from.fd.get(), from.name.c_str(), to.fd.get(), temporary.c_str());
-  if (err) {
-    TreePruner(to.fd.get(), temporary, toURL.path()).run();
-    QRTSetError(error, QRTCreatePOSIXError("_moveItemAtURL", __LINE__, err, "clonetree of %@ to %@ failed: %s", src,
-                                           toURL, errorText(err)));
-    return false;
-  }
-  if (renameat(to.fd.get(), temporary.c_str(), to.fd.get(), to.name.c_str()) != 0 ||
-      (err = platform::syncDirectory(to.fd.get())) != 0) {
-    if (!err) err = errno;
-    TreePruner(to.fd.get(), temporary, toURL.path()).run();
-    QRTSetError(error, QRTCreatePOSIXError("_moveItemAtURL", __LINE__, err, "rename of %@ to %@ failed: %s", src,
-                                           toURL, errorText(err)));
-    return false;
-  }
-  TreePruner pruner(from.fd.get(), from.name, src.path());
-  err = pruner.run();
-  if (err == 0 || err == ENOENT) err = pruner.firstError();
-  if (err == 0 || err == ENOENT) err = platform::syncDirectory(from.fd.get());
-  if (err != 0 && err != ENOENT) QRTLogAs(kLogError, "_moveItemAtURL", "Failed to remove source %@ : %s", src, errorText(err));
-  return true;
-}
-
-}  // namespace
-
 bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
                                     QRTErrorRef* error) {
   SafeParent from, to;
@@ -1016,9 +976,10 @@ bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool
   if (!openEnds(__func__, src, toURL, failIfSrcMissing, &from, &to, &missing, &err, error)) return false;
   if (missing) return true;
   if (!err) {
+    // EXDEV stays an error: a copy would turn hard links into separate
+    // files and write sparse files out in full, as root.
     if (renameat(from.fd.get(), from.name.c_str(), to.fd.get(), to.name.c_str()) != 0) {
       err = errno;
-      if (err == EXDEV) return moveAcross(src, toURL, from, to, error);
     } else {
       // Both directories flushed before anyone hears of the move (once when
       // they are one).

@@ -76,10 +76,8 @@ class QRTFileManager {
   // renameat between the two safely opened parent directories, both of which
   // are flushed before true is returned: true means the move is durable. A
   // false after the rename itself succeeded (a failed flush) leaves the item
-  // at the destination. Across file systems: a flushed copy under a hidden
-  // name beside the destination, renamed into place (a failed copy is
-  // removed and the source left whole), then the source removed (a failure
-  // there is only logged).
+  // at the destination. Across file systems the move fails with EXDEV: a
+  // container is never copied on its way.
   bool _moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing, QRTErrorRef* error);
   bool moveItemAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
   bool moveItemIfExistsAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);

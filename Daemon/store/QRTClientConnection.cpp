@@ -116,16 +116,24 @@ QRTMetadataRef QRTClientConnection::_createNewContainer(uint32_t userId, const s
                                                         uint64_t containerClass, bool transient, QRTErrorRef* error) {
   QRTGlobalConfiguration& configuration = QRTGlobalConfiguration::sharedInstance();
   const std::string directoryName = QRTUUID::random().UUIDString();
-  const QRTURL staging = configuration.stagingDirectory().URLByAppendingPathComponent(directoryName, true);
+  std::optional<QRTURL> classDirectory = configuration.containerDirectoryURLForUser(userId, containerClass, transient);
+  std::string finalName = directoryName;
+  if (auto wellKnown = QRTWhitelist::sharedWhitelist().wellknownContainerForId(identifier, containerClass)) {
+    finalName = *wellKnown;
+  }
+  // Built on the class directory's own file system, so that it is only ever renamed.
+  std::optional<QRTURL> stagingDirectory =
+      classDirectory ? configuration.stagingDirectoryForURL(classDirectory->URLByAppendingPathComponent(finalName, true))
+                     : std::nullopt;
+  if (!stagingDirectory) {
+    QRTSetError(error, QRT_ERROR(classDirectory ? QRTErrorCreateStagingFailed : QRTErrorMoveStagingToLiveFailed,
+                                 nullptr, true, "No staging directory for %@ in %@", identifier, classDirectory));
+    return nullptr;
+  }
+  const QRTURL staging = stagingDirectory->URLByAppendingPathComponent(directoryName, true);
 
   QRTMetadataRef metadata = _buildInStaging(staging, userId, identifier, containerClass, error);
   if (metadata) {
-    std::optional<QRTURL> classDirectory =
-        configuration.containerDirectoryURLForUser(userId, containerClass, transient);
-    std::string finalName = directoryName;
-    if (auto wellKnown = QRTWhitelist::sharedWhitelist().wellknownContainerForId(identifier, containerClass)) {
-      finalName = *wellKnown;
-    }
     QRTURL finalURL = classDirectory ? classDirectory->URLByAppendingPathComponent(finalName, true) : QRTURL();
     QRTErrorRef moveError;
     if (!classDirectory || !QRTFileManager::defaultManager().moveItemAtURL(staging, finalURL, &moveError)) {
