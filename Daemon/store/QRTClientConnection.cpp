@@ -239,5 +239,22 @@ QRTMetadataRef QRTClientConnection::_lookupOrCreate(uint32_t userId, const std::
                                  identifier));
     return nullptr;
   }
+  // A user's containers, and so the cache's memory for them, stay bounded.
+  if (userId != 0) {
+    const size_t limit = QRTGlobalConfiguration::sharedInstance().maxContainersPerClass();
+    QRTErrorRef countError;
+    auto held = QRTContainerCache::sharedInstance().countOfContainersForUser(userId, containerClass, &countError);
+    if (!held) {
+      QRTSetError(error, countError);
+      return nullptr;
+    }
+    if (*held >= limit) {
+      QRTSetError(error, QRT_ERROR(QRTErrorInvalidArgument, nullptr, true,
+                                   "User %u holds %llu containers of class %llu, the most allowed: not creating %@",
+                                   userId, static_cast<unsigned long long>(*held),
+                                   static_cast<unsigned long long>(containerClass), identifier));
+      return nullptr;
+    }
+  }
   return _createNewContainer(userId, identifier, containerClass, transient, error);
 }

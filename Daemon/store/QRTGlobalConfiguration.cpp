@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 
 #include "Daemon/store/QRTContentClass.h"
@@ -16,6 +17,7 @@
 namespace {
 
 constexpr mode_t kDirectoryMode = 0755;
+constexpr size_t kMaxContainersPerClass = 10'000;
 constexpr const char* kUserStagingName = ".staging";
 constexpr const char* kUserDeathrowName = ".deathrow";
 
@@ -184,6 +186,18 @@ std::vector<QRTURL> QRTGlobalConfiguration::allStagingDirectories() {
 
 std::vector<QRTURL> QRTGlobalConfiguration::allDeathrowDirectories() {
   return allDirectories(deathrowDirectory(), kUserDeathrowName);
+}
+
+size_t QRTGlobalConfiguration::maxContainersPerClass() const {
+#ifdef QRT_TEST_HOOKS
+  // Tests lower the bound rather than make ten thousand containers.
+  if (auto text = platform::readHostFile(platform::hostPath("/run/quarterd.maxcontainers"), 32)) {
+    char* end = nullptr;
+    const unsigned long n = strtoul(text->c_str(), &end, 10);
+    if (end != text->c_str()) return n;
+  }
+#endif
+  return kMaxContainersPerClass;
 }
 
 QRTURL QRTGlobalConfiguration::replaceDirectory() {

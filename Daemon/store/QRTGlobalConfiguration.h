@@ -47,6 +47,9 @@ class QRTGlobalConfiguration {
   // pass the checks, for death-row passes and start-up clean-up.
   std::vector<QRTURL> allStagingDirectories();
   std::vector<QRTURL> allDeathrowDirectories();
+
+  // How many containers of one class a user other than root may hold.
+  size_t maxContainersPerClass() const;
   QRTURL replaceDirectory();
   QRTURL pendingUpdatesDirectory();
   QRTURL transientBundleDirectory();
