@@ -44,6 +44,10 @@ struct QRTTraversalEntry {
 // link at any component is refused, never followed.
 using QRTTraversalVisitor = std::function<bool(QRTTraversalEntry& entry, QRTErrorRef* error)>;
 
+namespace platform {
+struct Item;
+}
+
 class QRTFileManager {
  public:
   static QRTFileManager& defaultManager();
@@ -93,6 +97,17 @@ class QRTFileManager {
   // passed over; a directory swapped since the listing is an Other entry with
   // error ESTALE and is not entered.
   bool _traverseDirectory(const QRTURL& root, QRTErrorRef* error, const QRTTraversalVisitor& withBlock);
+
+  // The one check before anything is taken from a tree a user can write into
+  // a place they cannot (a global class, a system container, the daemon's
+  // home, the code-signing database): every directory from base down to url,
+  // and every item of url's tree, is owned by root or by owner and writable
+  // by no one else, each regular file has one link, and nothing else but
+  // directories and links is there. Checked on the descriptors of one walk
+  // that follows no link; a refusal gets a log line naming the item and why.
+  // *top, when given, receives url's item, pinned. Callers check the
+  // destination again after the move, with base equal to url there.
+  bool itemIsImportableAtURL(const QRTURL& url, const QRTURL& fromBase, uid_t owner, platform::Item* top = nullptr);
 
   // Items of the directory in directory order, hidden names left out.
   std::optional<std::vector<QRTURL>> urlsForItemsInDirectoryAtURL(const QRTURL& url, QRTErrorRef* error);
