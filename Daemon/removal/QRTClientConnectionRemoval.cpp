@@ -174,6 +174,7 @@ void QRTClientConnection::stageForDeleteContainersWithUsers(const std::vector<ui
           continue;
         }
       }
+      QRT_CRASH_POINT("delete-after-stage");
       QRTErrorRef cacheError;
       if (!cache.removeContainerForUser(userId, containerClass, metadata->identifier(), metadata->transient(),
                                         &cacheError)) {

@@ -133,6 +133,7 @@ QRTMetadataRef QRTClientConnection::_createNewContainer(uint32_t userId, const s
   const QRTURL staging = stagingDirectory->URLByAppendingPathComponent(directoryName, true);
 
   QRTMetadataRef metadata = _buildInStaging(staging, userId, identifier, containerClass, error);
+  QRT_CRASH_POINT("create-after-build");
   if (metadata) {
     QRTURL finalURL = classDirectory ? classDirectory->URLByAppendingPathComponent(finalName, true) : QRTURL();
     QRTErrorRef moveError;
@@ -140,6 +141,7 @@ QRTMetadataRef QRTClientConnection::_createNewContainer(uint32_t userId, const s
       QRTSetError(error, QRT_ERROR(QRTErrorMoveStagingToLiveFailed, moveError, true,
                                    "Failed to move staging dir: %@ to live dir: %@", staging, finalURL));
     } else {
+      QRT_CRASH_POINT("create-after-move");
       QRTMetadataRef stored;
       QRTErrorRef cacheError;
       if (QRTContainerCache::sharedInstance().addContainerMetadata(metadata, userId, finalURL, transient, true,

@@ -1,10 +1,13 @@
 // Replacing containers through the real daemon: the swap, its refusals, the
 // wipe built on it, and what a daemon killed at each step of a replace finds
 // when it starts again.
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
+#include <cstring>
 #include <filesystem>
 #include <optional>
 #include <string>
@@ -62,15 +65,16 @@ class ReplaceTest : public DaemonFixture {
     return made;
   }
 
+  std::string base() const { return root + "/private/var/mobile/Containers"; }
+
   // Copies of the content with this marker anywhere under the device root
   // but on death row, which holds only what is already given up.
   int liveCopies(const std::string& marker) const {
     int count = 0;
     std::error_code ec;
-    const fs::path deathRow = deadDirectory();
     for (auto it = fs::recursive_directory_iterator(root, ec); it != fs::recursive_directory_iterator();
          it.increment(ec)) {
-      if (it->path() == deathRow) {
+      if (it->path() == deadDirectory() || it->path() == base() + "/.deathrow") {
         it.disable_recursion_pending();
       } else if (it->path().filename() == kMarkerFile && readFile(it->path().string()) == marker) {
         ++count;
@@ -101,6 +105,7 @@ class ReplaceTest : public DaemonFixture {
   void expectNothingInFlight() {
     EXPECT_TRUE(listDirectory(replaceDir()).empty());
     EXPECT_TRUE(listDirectory(stagingDir()).empty());
+    EXPECT_TRUE(listDirectory(base() + "/.staging").empty());
   }
 
   // The container of the identifier at path with uuid and marker, now and after a kill and restart.
@@ -200,10 +205,63 @@ TEST_F(ReplaceTest, PromotionMakesTransientContainerPermanent) {
   EXPECT_EQ(markerAt(permanent.path), "taken");
 }
 
-TEST_F(ReplaceTest, KilledReplaceOrWipeLeavesExactlyOneContentLive) {
+// With the home on the daemon's file system, or on a second one (a tmpfs),
+// where staging and death row are the user base's own.
+class ReplaceCrashTest : public ReplaceTest, public ::testing::WithParamInterface<bool> {
+ protected:
+  void SetUp() override {
+    ReplaceTest::SetUp();
+    if (!GetParam() || HasFailure()) return;
+    const std::string home = root + "/private/var/mobile";
+    stopDaemon();
+    ASSERT_EQ(system(("mv " + home + " " + home + ".disk && mkdir -m 755 " + home).c_str()), 0);
+    struct stat owner;
+    ASSERT_EQ(stat((home + ".disk").c_str(), &owner), 0);
+    const std::string options = "mode=0755,size=64m,uid=" + std::to_string(owner.st_uid) + ",gid=" +
+                                std::to_string(owner.st_gid);
+    if (mount("quarterd-test", home.c_str(), "tmpfs", 0, options.c_str()) != 0) {
+      const int err = errno;
+      startDaemon();
+      GTEST_SKIP() << "cannot mount a tmpfs for the home: " << strerror(err);
+    }
+    mounted_ = home;
+    ASSERT_EQ(system(("cp -a " + home + ".disk/. " + home).c_str()), 0);
+    startDaemon();
+  }
+  void TearDown() override {
+    if (!mounted_.empty()) {
+      if (daemon > 0) { EXPECT_EQ(stopDaemon(), 0) << "daemon exit status"; }
+      umount2(mounted_.c_str(), MNT_DETACH);
+    }
+    ReplaceTest::TearDown();
+  }
+  std::string mounted_;
+};
+
+TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
 #ifndef QRT_TEST_HOOKS
   GTEST_SKIP() << "crash points need a build with test hooks";
 #endif
+  if (GetParam()) {
+    struct stat home, daemonHome;
+    ASSERT_EQ(stat(base().c_str(), &home), 0);
+    ASSERT_EQ(stat(daemonCaches().c_str(), &daemonHome), 0);
+    ASSERT_NE(home.st_dev, daemonHome.st_dev);
+  }
+  // A creation is whole or absent; a deletion takes the content to death row only.
+  for (const char* point : {"create-after-build", "create-after-move", "delete-after-stage"}) {
+    SCOPED_TRACE(point);
+    const std::string id = std::string("com.example.") + point;
+    const bool deleting = std::string(point).starts_with("delete");
+    if (deleting) make(id, false, id);
+    crashAndRestart(deleting ? 10 : 0, deleting ? byName(501, 2, id) : with(byName(501, 2, id), {{"CreateIfNecessary", true}}),
+                    point);
+    Container live = lookup(id);
+    if (live.error == 1) { EXPECT_TRUE(exists(live.path + "/Library/Caches")) << live.path; }
+    EXPECT_EQ(live.error, deleting || std::string(point) == "create-after-build" ? 21u : 1u);
+    if (deleting) { EXPECT_EQ(liveCopies(id), 0); }
+    expectNothingInFlight();
+  }
   // Each point with whether the new content has reached its place by then.
   const std::pair<const char*, bool> points[] = {
       {"replace-after-journal", false},  {"replace-after-stage", false},     {"replace-after-cache-remove", false},
@@ -236,6 +294,9 @@ TEST_F(ReplaceTest, KilledReplaceOrWipeLeavesExactlyOneContentLive) {
     EXPECT_EQ(liveCopies(wipeId + "-old"), newInPlace ? 0 : 1);
   }
 }
+
+INSTANTIATE_TEST_SUITE_P(Home, ReplaceCrashTest, ::testing::Bool(),
+                         [](const auto& info) { return info.param ? "OnSecondFileSystem" : "OnDaemonsFileSystem"; });
 
 TEST_F(ReplaceTest, StartUpRecoveryActsOnlyOnValidJournals) {
   const std::string filled = root + "/filled-destination";
