@@ -1,7 +1,6 @@
 // Replacing containers through the real daemon: the swap, its refusals, the
 // wipe built on it, and what a daemon killed at each step of a replace finds
 // when it starts again.
-#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -207,42 +206,14 @@ TEST_F(ReplaceTest, PromotionMakesTransientContainerPermanent) {
 
 // With the home on the daemon's file system, or on a second one (a tmpfs),
 // where staging and death row are the user base's own.
-class ReplaceCrashTest : public ReplaceTest, public ::testing::WithParamInterface<bool> {
- protected:
-  void SetUp() override {
-    ReplaceTest::SetUp();
-    if (!GetParam() || HasFailure()) return;
-    const std::string home = root + "/private/var/mobile";
-    stopDaemon();
-    ASSERT_EQ(system(("mv " + home + " " + home + ".disk && mkdir -m 755 " + home).c_str()), 0);
-    struct stat owner;
-    ASSERT_EQ(stat((home + ".disk").c_str(), &owner), 0);
-    const std::string options = "mode=0755,size=64m,uid=" + std::to_string(owner.st_uid) + ",gid=" +
-                                std::to_string(owner.st_gid);
-    if (mount("quarterd-test", home.c_str(), "tmpfs", 0, options.c_str()) != 0) {
-      const int err = errno;
-      startDaemon();
-      GTEST_SKIP() << "cannot mount a tmpfs for the home: " << strerror(err);
-    }
-    mounted_ = home;
-    ASSERT_EQ(system(("cp -a " + home + ".disk/. " + home).c_str()), 0);
-    startDaemon();
-  }
-  void TearDown() override {
-    if (!mounted_.empty()) {
-      if (daemon > 0) { EXPECT_EQ(stopDaemon(), 0) << "daemon exit status"; }
-      umount2(mounted_.c_str(), MNT_DETACH);
-    }
-    ReplaceTest::TearDown();
-  }
-  std::string mounted_;
-};
+class ReplaceCrashTest : public ReplaceTest, public ::testing::WithParamInterface<bool> {};
 
 TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
 #ifndef QRT_TEST_HOOKS
   GTEST_SKIP() << "crash points need a build with test hooks";
 #endif
   if (GetParam()) {
+    if (!mountHomeOnTmpfs()) GTEST_SKIP() << "cannot mount a tmpfs for the home: " << strerror(errno);
     struct stat home, daemonHome;
     ASSERT_EQ(stat(base().c_str(), &home), 0);
     ASSERT_EQ(stat(daemonCaches().c_str(), &daemonHome), 0);
