@@ -118,20 +118,12 @@ void DaemonFixture::TearDown() {
 
 bool DaemonFixture::mountHomeOnTmpfs() {
   const std::string home = root + "/private/var/mobile", disk = home + ".disk";
-  struct stat owner;
-  if (stat(home.c_str(), &owner) != 0) return false;
-  if (daemon > 0) stopDaemon();
-  const std::string options =
-      "mode=0755,size=96m,uid=" + std::to_string(owner.st_uid) + ",gid=" + std::to_string(owner.st_gid);
-  bool mounted = rename(home.c_str(), disk.c_str()) == 0 && mkdir(home.c_str(), 0755) == 0 &&
-                 mount("quarterd-test", home.c_str(), "tmpfs", 0, options.c_str()) == 0;
-  if (mounted) {
-    mountedHome = home;
-    EXPECT_EQ(system(("cp -a " + disk + "/. " + home).c_str()), 0);
-  } else {
-    rmdir(home.c_str());
-    rename(disk.c_str(), home.c_str());
-  }
+  stopDaemon();
+  const bool mounted = rename(home.c_str(), disk.c_str()) == 0 && mkdir(home.c_str(), 0755) == 0 &&
+                       mount("quarterd-test", home.c_str(), "tmpfs", 0, "size=96m") == 0;
+  if (mounted) mountedHome = home;
+  else rmdir(home.c_str());
+  EXPECT_EQ(system(("cp -a " + disk + "/. " + home + (mounted ? "" : " && rm -rf " + disk)).c_str()), 0);
   startDaemon();
   return mounted;
 }
