@@ -148,8 +148,9 @@ void QRTMoveSystemContainersIntoPlace(QRTClientConnection& client) {
     installBackupDirectory(*shared, QRTClassSystemGroup, "Couldn't find any system shared containers at %@: %@",
                            client);
   }
-  // Internal builds keep the backup, ".inprogress" and ".failed" included, for diagnosis.
-  if (platform::deviceIsInternalBuild()) return;
+  // Internal builds keep the backup, ".inprogress" and ".failed" included,
+  // for diagnosis; a refused tree stays the user's, untouched.
+  if (platform::deviceIsInternalBuild() || (!dataMoved && !sharedMoved)) return;
   QRTErrorRef error;
   if (base && !QRTFileManager::defaultManager().removeItemAtURL(*base, &error)) {
     QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace", "Failed to remove system container base dir %@: %@", *base,
