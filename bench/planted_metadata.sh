@@ -61,7 +61,7 @@ for kind in $kinds; do
   [ "$kind" = requests ] || plant "$root" "$kind"
   start "$root"
   before=$(rss_kib "$pid")
-  "$build/tools/quarterctl" --root "$root" lookup --class 2 --user 501 --identifier org.absent >/dev/null || true
+  "$build/tools/quarterctl" --root "$root" lookup --class 2 --user 501 --identifier org.absent >/dev/null 2>&1 || true
   after=$(rss_kib "$pid")
   printf '%-10s %8d %9d KiB %9d KiB %7d KiB\n' "$kind" "$n" "$before" "$after" $((after - before))
   stop
