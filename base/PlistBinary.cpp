@@ -76,7 +76,7 @@ struct Object {
 // the second builds the value only when those bounds hold.
 class BinaryReader {
  public:
-  BinaryReader(const uint8_t* bytes, size_t length) : p_(bytes), n_(length) {}
+  BinaryReader(const uint8_t* bytes, size_t length, const Limits& limits) : p_(bytes), n_(length), limits_(limits) {}
 
   std::optional<Value> read(std::string* error, uint64_t* footprint) {
     std::optional<Value> result;
@@ -118,6 +118,7 @@ class BinaryReader {
 
   const uint8_t* p_;
   size_t n_;
+  const Limits limits_;
   size_t offsetSize_ = 0;
   size_t refSize_ = 0;
   uint64_t numObjects_ = 0;
@@ -141,7 +142,7 @@ bool BinaryReader::readTrailer() {
   if (numObjects_ < 1 || top_ >= numObjects_) return fail("bad object count in trailer");
   // A well-formed file holds no unreachable objects, so a bigger table means
   // a bigger expansion.
-  if (numObjects_ > kMaxObjects) return fail("too many objects");
+  if (numObjects_ > limits_.maxObjects) return fail("too many objects");
   const uint64_t tableEnd = n_ - kTrailerSize;
   if (tableOffset_ <= kHeaderSize || tableOffset_ > tableEnd) return fail("offset table out of range");
   if (numObjects_ > (tableEnd - tableOffset_) / offsetSize_) return fail("offset table out of range");
@@ -268,8 +269,9 @@ bool BinaryReader::measureTop() {
   visits_ = 1;
   if (!measure(top_, 0)) return false;
   const Meta& m = meta_[top_];
-  if (m.count > kMaxObjects) return fail("too many objects");
-  if (m.count * kObjectFootprint + m.bytes > kMaxFootprint) return fail("too much data");
+  if (m.count > limits_.maxObjects) return fail("too many objects");
+  if (m.count * kObjectFootprint + m.bytes > limits_.maxFootprint || m.bytes > limits_.maxBytes)
+    return fail("too much data");
   return true;
 }
 
@@ -277,7 +279,7 @@ bool BinaryReader::measureTop() {
 bool BinaryReader::measure(uint64_t index, size_t depth) {
   Meta& m = meta_[index];
   if (m.state == kDone) {
-    if (depth + m.height > kMaxDepth) return fail("nesting too deep");
+    if (depth + m.height > limits_.maxDepth) return fail("nesting too deep");
     return true;
   }
   if (m.state == kActive) return fail("cyclic reference");
@@ -304,7 +306,7 @@ bool BinaryReader::measure(uint64_t index, size_t depth) {
 }
 
 bool BinaryReader::measureContainer(uint64_t index, const Object& o, size_t depth) {
-  if (depth + 1 > kMaxDepth) return fail("nesting too deep");
+  if (depth + 1 > limits_.maxDepth) return fail("nesting too deep");
   meta_[index].state = kActive;
   const uint64_t refs = o.kind == Kind::Dictionary ? 2 * o.count : o.count;
   uint64_t count = 1, bytes = 0;
@@ -312,7 +314,7 @@ bool BinaryReader::measureContainer(uint64_t index, const Object& o, size_t dept
   for (uint64_t i = 0; i < refs; ++i) {
     // Each reference scanned is at least one object of the expansion, so this
     // bounds the work even before the per-object counts add up.
-    if (++visits_ > kMaxObjects) return fail("too many objects");
+    if (++visits_ > limits_.maxObjects) return fail("too many objects");
     const uint64_t child = ref(o, i);
     if (child >= numObjects_) return fail("object reference out of range");
     if (!measure(child, depth + 1)) return false;
@@ -320,13 +322,13 @@ bool BinaryReader::measureContainer(uint64_t index, const Object& o, size_t dept
     if (i < o.count && o.kind == Kind::Dictionary && c.kind != Kind::Ascii && c.kind != Kind::Utf16) {
       return fail("dictionary key is not a string");
     }
-    count = std::min<uint64_t>(count + c.count, kMaxObjects + 1);
+    count = std::min<uint64_t>(count + c.count, limits_.maxObjects + 1);
     bytes = saturatingAdd(bytes, c.bytes);
-    if (bytes > kMaxFootprint) return fail("too much data");
+    if (bytes > limits_.maxFootprint || bytes > limits_.maxBytes) return fail("too much data");
     height = std::max(height, c.height);
   }
   Meta& m = meta_[index];
-  if (count > kMaxObjects) return fail("too many objects");
+  if (count > limits_.maxObjects) return fail("too many objects");
   m.count = static_cast<uint32_t>(count);
   m.bytes = bytes;
   m.height = static_cast<uint8_t>(height + 1);
@@ -627,15 +629,17 @@ bool startsLikeXML(const uint8_t* p, size_t n) {
 
 }  // namespace
 
-std::optional<Value> parseBinary(const void* bytes, size_t length, std::string* error, uint64_t* footprint) {
-  return BinaryReader(static_cast<const uint8_t*>(bytes), length).read(error, footprint);
+std::optional<Value> parseBinary(const void* bytes, size_t length, std::string* error, uint64_t* footprint,
+                                 const Limits& limits) {
+  return BinaryReader(static_cast<const uint8_t*>(bytes), length, limits).read(error, footprint);
 }
 
 Data writeBinary(const Value& value) { return BinaryWriter().write(value); }
 
-std::optional<Value> parse(const void* bytes, size_t length, std::string* error) {
+std::optional<Value> parse(const void* bytes, size_t length, std::string* error, const Limits& limits) {
   const auto* p = static_cast<const uint8_t*>(bytes);
-  if (length >= kHeaderSize && std::memcmp(p, "bplist00", kHeaderSize) == 0) return parseBinary(bytes, length, error);
+  if (length >= kHeaderSize && std::memcmp(p, "bplist00", kHeaderSize) == 0)
+    return parseBinary(bytes, length, error, nullptr, limits);
   if (startsLikeXML(p, length)) return parseXML(bytes, length, error);
   if (error) *error = "unknown format";
   return std::nullopt;

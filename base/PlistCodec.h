@@ -20,12 +20,22 @@ constexpr size_t kMaxObjects = 1'000'000;  // after expansion of shared referenc
 // become a hundred megabytes.
 constexpr uint64_t kMaxFootprint = 96ull << 20;
 
+// Tighter bounds for a reader whose values are kept for long (the default
+// ones are the most any reader accepts). maxBytes bounds the strings and data
+// as often as they are reached.
+struct Limits {
+  size_t maxDepth = kMaxDepth;
+  size_t maxObjects = kMaxObjects;
+  uint64_t maxFootprint = kMaxFootprint;
+  uint64_t maxBytes = kMaxFootprint;
+};
+
 // Binary ("bplist00") or XML, chosen by the leading bytes. On failure returns
 // nothing and, when given, puts a short reason into *error.
-std::optional<Value> parse(const void* bytes, size_t length, std::string* error = nullptr);
+std::optional<Value> parse(const void* bytes, size_t length, std::string* error = nullptr, const Limits& limits = {});
 // *footprint, when given, receives the built value's estimated memory cost.
 std::optional<Value> parseBinary(const void* bytes, size_t length, std::string* error = nullptr,
-                                 uint64_t* footprint = nullptr);
+                                 uint64_t* footprint = nullptr, const Limits& limits = {});
 std::optional<Value> parseXML(const void* bytes, size_t length, std::string* error = nullptr);
 
 // The binary format, version 00. Unsigned integers above INT64_MAX are written

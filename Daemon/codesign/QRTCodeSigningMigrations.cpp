@@ -4,7 +4,10 @@
 // valid stored entry is never overwritten, and the files and the status
 // records go only after the entries are in.
 
+#include <fcntl.h>
+
 #include <cerrno>
+#include <cstring>
 
 #include "Daemon/QRTCrashPoint.h"
 #include "Daemon/codesign/QRTCodeSigningMapping.h"
@@ -17,6 +20,8 @@
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTMetadata.h"
+#include "base/PlistCodec.h"
+#include "platform/FileIO.h"
 #include "platform/Log.h"
 
 using platform::kLogDebug;
@@ -69,6 +74,29 @@ uint64_t clearInfoKey(const QRTMetadataRef& container, const char* key) {
                                                               container->uuid(), container->identifier(),
                                                               container->containerClass(), false, &code);
   return code;
+}
+
+// The group ids in the metadata file of the container at url, when the file
+// is root's alone (one link, writable by no one else).
+std::optional<plist::Value> groupIdsFromRootsMetadata(const QRTURL& url) {
+  const QRTURL file = url.URLByAppendingPathComponent(QRTMetadataFileName);
+  platform::Item item;
+  if (!QRTFileManager::defaultManager().itemIsImportableAtURL(file, file, 0, &item)) return std::nullopt;
+  platform::UniqueFd fd;
+  std::string bytes;
+  int err = platform::reopenItem(item, O_RDONLY, &fd);
+  if (!err) err = platform::readOpened(fd.get(), &bytes, QRTMetadataMaxEncodedBytes);
+  const plist::Limits limits{QRTMetadataMaxDepth, QRTMetadataMaxObjects, plist::kMaxFootprint,
+                             QRTMetadataMaxEncodedBytes};
+  std::optional<plist::Value> value = err ? std::nullopt : plist::parse(bytes.data(), bytes.size(), nullptr, limits);
+  const plist::Dictionary* top = value ? value->dictionaryIf() : nullptr;
+  const plist::Dictionary* info = top ? dictionaryAt(*top, QRTMetadataInfoKey) : nullptr;
+  const plist::Value* groups = info ? plist::find(*info, kGroupContainerIDsKey) : nullptr;
+  if (!groups) {
+    QRTLog(kLogError, "No group ids readable from %@: %s", file, err ? strerror(err) : "not in the file");
+    return std::nullopt;
+  }
+  return *groups;
 }
 
 }  // namespace
@@ -147,8 +175,12 @@ void QRTCodeSigningMapping::_onQueue_migrateAppGroupIdsFromDataContainersToFile(
       return;  // not recorded: runs again next time
     }
     for (const QRTMetadataRef& container : *containers) {
-      const plist::Value* groups = container->info() ? plist::find(*container->info(), kGroupContainerIDsKey) : nullptr;
-      if (!groups) continue;
+      if (!container->info() || !plist::find(*container->info(), kGroupContainerIDsKey)) continue;
+      // Data containers are the user's: their ids count only from a metadata
+      // file that root wrote, read from the very file that was checked.
+      std::optional<plist::Value> groupsRead = groupIdsFromRootsMetadata(container->url());
+      if (!groupsRead) continue;
+      const plist::Value* groups = &*groupsRead;
       const std::string& identifier = container->identifier();
       QRTLog(kLogDebug, "Data container for userId: 501, identifier %@ references container IDs: %@", identifier,
              *groups);

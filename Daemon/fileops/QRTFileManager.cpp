@@ -815,13 +815,6 @@ bool TreeWalker::leave() {
 
 // ---------------------------------------------------------------------------
 
-// A fresh hidden name beside name, for a copy that is renamed into place.
-std::string hiddenSibling(const std::string& name) {
-  uint64_t random = 0;
-  if (getrandom(&random, sizeof random, GRND_NONBLOCK) != sizeof random) random = static_cast<uint64_t>(getpid());
-  return "." + name.substr(0, 200) + ".qrt-move-" + std::to_string(random);
-}
-
 std::string randomSuffix(size_t length) {
   static const char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789";
   unsigned char bytes[16];
@@ -975,39 +968,6 @@ bool QRTFileManager::copyItemIfExistsAtURL(const QRTURL& src, const QRTURL& toUR
   return _copyItemAtURL(src, toURL, false, error);
 }
 
-namespace {
-
-// Across file systems: a durable copy under a hidden name beside the
-// destination, renamed into place (so the destination never holds half a
-// copy, and a failed copy is removed), then the source goes.
-bool moveAcross(const QRTURL& src, const QRTURL& toURL, SafeParent& from, SafeParent& to, QRTErrorRef* error) {
-  const std::string temporary = hiddenSibling(to.name);
-  TreeCloner cloner(true);
-  int err = cloner.run(from.fd.get(), from.name.c_str(), to.fd.get(), temporary.c_str());
-  if (err) {
-    TreePruner(to.fd.get(), temporary, toURL.path()).run();
-    QRTSetError(error, QRTCreatePOSIXError("_moveItemAtURL", __LINE__, err, "clonetree of %@ to %@ failed: %s", src,
-                                           toURL, errorText(err)));
-    return false;
-  }
-  if (renameat(to.fd.get(), temporary.c_str(), to.fd.get(), to.name.c_str()) != 0 ||
-      (err = platform::syncDirectory(to.fd.get())) != 0) {
-    if (!err) err = errno;
-    TreePruner(to.fd.get(), temporary, toURL.path()).run();
-    QRTSetError(error, QRTCreatePOSIXError("_moveItemAtURL", __LINE__, err, "rename of %@ to %@ failed: %s", src,
-                                           toURL, errorText(err)));
-    return false;
-  }
-  TreePruner pruner(from.fd.get(), from.name, src.path());
-  err = pruner.run();
-  if (err == 0 || err == ENOENT) err = pruner.firstError();
-  if (err == 0 || err == ENOENT) err = platform::syncDirectory(from.fd.get());
-  if (err != 0 && err != ENOENT) QRTLogAs(kLogError, "_moveItemAtURL", "Failed to remove source %@ : %s", src, errorText(err));
-  return true;
-}
-
-}  // namespace
-
 bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
                                     QRTErrorRef* error) {
   SafeParent from, to;
@@ -1016,9 +976,10 @@ bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool
   if (!openEnds(__func__, src, toURL, failIfSrcMissing, &from, &to, &missing, &err, error)) return false;
   if (missing) return true;
   if (!err) {
+    // EXDEV stays an error: a copy would turn hard links into separate
+    // files and write sparse files out in full, as root.
     if (renameat(from.fd.get(), from.name.c_str(), to.fd.get(), to.name.c_str()) != 0) {
       err = errno;
-      if (err == EXDEV) return moveAcross(src, toURL, from, to, error);
     } else {
       // Both directories flushed before anyone hears of the move (once when
       // they are one).
@@ -1042,6 +1003,94 @@ bool QRTFileManager::moveItemAtURL(const QRTURL& src, const QRTURL& toURL, QRTEr
 
 bool QRTFileManager::moveItemIfExistsAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error) {
   return _moveItemAtURL(src, toURL, false, error);
+}
+
+namespace {
+
+constexpr int kMaxImportDepth = 128;
+
+// Why the item may not be imported, or nullptr.
+const char* importRefusal(const struct stat& st, uid_t owner) {
+  if (st.st_uid != 0 && st.st_uid != owner) return "owned by another user";
+  if (S_ISLNK(st.st_mode)) return nullptr;
+  if (!S_ISDIR(st.st_mode) && !S_ISREG(st.st_mode)) return "neither a directory, a file nor a link";
+  if (st.st_mode & (S_IWGRP | S_IWOTH)) return "writable by others";
+  if (S_ISREG(st.st_mode) && st.st_nlink != 1) return "a file with more than one link";
+  return nullptr;
+}
+
+// The tree below the directory; false (with the item's path and the reason) at the first refusal.
+bool importableTree(int dirfd, std::string& path, uid_t owner, int depth, const char** why) {
+  if (depth > kMaxImportDepth) return (*why = "nested too deep"), false;
+  UniqueFd dir(platform::openDirectoryAt(dirfd, "."));
+  if (!dir.valid()) return (*why = strerror(errno)), false;
+  std::vector<std::string> names;
+  platform::DirectoryBatch batch;
+  for (ssize_t n; (n = platform::readDirectoryBatch(dir.get(), &batch)) != 0;) {
+    if (n < 0) return (*why = strerror(static_cast<int>(-n))), false;
+    bool malformed = false;
+    platform::forEachEntry(batch, static_cast<size_t>(n), [&](uint64_t, unsigned char, const char* name) {
+      if (name) names.emplace_back(name);
+      else malformed = true;
+    });
+    if (malformed) return (*why = "an unreadable entry"), false;
+  }
+  for (const std::string& name : names) {
+    const size_t length = path.size();
+    path += "/" + name;
+    platform::Item item;
+    if (int err = platform::openItemAt(dir.get(), name.c_str(), &item)) return (*why = strerror(err)), false;
+    if ((*why = importRefusal(item.st, owner))) return false;
+    if (S_ISDIR(item.st.st_mode)) {
+      UniqueFd sub;
+      if (int err = platform::reopenItem(item, O_RDONLY | O_DIRECTORY, &sub)) return (*why = strerror(err)), false;
+      if (!importableTree(sub.get(), path, owner, depth + 1, why)) return false;
+    }
+    path.resize(length);
+  }
+  return true;
+}
+
+}  // namespace
+
+bool QRTFileManager::itemIsImportableAtURL(const QRTURL& url, const QRTURL& fromBase, uid_t owner,
+                                           platform::Item* top) {
+  std::string base = fromBase.path(), target = url.path();
+  while (base.size() > 1 && base.back() == '/') base.pop_back();
+  while (target.size() > 1 && target.back() == '/') target.pop_back();
+  std::string path = base;
+  const char* why = nullptr;
+  platform::Item item;
+  if (target != base && target.compare(0, base.size() + 1, base + "/") != 0) {
+    why = "not inside the tree it is taken from";
+  } else if (int err = platform::safeOpenItem(base, &item)) {
+    why = strerror(err);
+  } else if (!(why = importRefusal(item.st, owner))) {
+    // Down to url one component at a time, each checked on the descriptor of the one before.
+    for (size_t start = base.size() + 1; start < target.size() + 1 && !why;) {
+      size_t slash = target.find('/', start);
+      if (slash == std::string::npos) slash = target.size();
+      const std::string name = target.substr(start, slash - start);
+      start = slash + 1;
+      if (name.empty()) continue;
+      path += "/" + name;
+      platform::Item next;
+      if (!S_ISDIR(item.st.st_mode)) why = "below something that is not a directory";
+      else if (int err = platform::openItemAt(item.fd.get(), name.c_str(), &next)) why = strerror(err);
+      else if (!(why = importRefusal(next.st, owner))) item = std::move(next);
+    }
+    if (!why && S_ISDIR(item.st.st_mode)) {
+      UniqueFd dir;
+      if (int err = platform::reopenItem(item, O_RDONLY | O_DIRECTORY, &dir)) why = strerror(err);
+      else importableTree(dir.get(), path, owner, 0, &why);
+    }
+  }
+  if (why) {
+    QRTLog(kLogError, "Not taking %@ from a tree a user can write: %@: %s", url, path, why);
+    return false;
+  }
+  if (top) *top = std::move(item);
+  return true;
 }
 
 std::optional<QRTURL> QRTFileManager::createTemporaryDirectoryInDirectoryURL(const QRTURL& parent,
@@ -1162,14 +1211,19 @@ bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTW
 }
 
 std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& url, QRTErrorRef* error) {
+  return QRT_dictionaryWithContentsOfURL(url, kMaxPropertyListFileSize, plist::Limits{}, error);
+}
+
+std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& url, size_t maxBytes,
+                                                                 const plist::Limits& limits, QRTErrorRef* error) {
   std::string bytes;
-  if (int err = platform::safeReadFile(url.path(), &bytes, kMaxPropertyListFileSize)) {
+  if (int err = platform::safeReadFile(url.path(), &bytes, maxBytes)) {
     QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to read property list at %@: %s", url, errorText(err)));
     return std::nullopt;
   }
   std::string reason;
   std::optional<plist::Value> value =
-      plist::parse(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size(), &reason);
+      plist::parse(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size(), &reason, limits);
   if (!value) {
     QRTSetError(error, QRTCreateError(__func__, __LINE__, QRTPropertyListErrorDomain, QRTPropertyListReadCorruptError,
                                       nullptr, nullptr, false, "Failed to parse property list at %@: %s", url,

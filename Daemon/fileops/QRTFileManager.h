@@ -18,6 +18,7 @@
 #include <vector>
 
 #include "Daemon/QRTError.h"
+#include "base/PlistCodec.h"
 #include "base/PlistValue.h"
 #include "base/QRTURL.h"
 
@@ -42,6 +43,10 @@ struct QRTTraversalEntry {
 // Paths are resolved from the device root (platform/SafePath.h): a symbolic
 // link at any component is refused, never followed.
 using QRTTraversalVisitor = std::function<bool(QRTTraversalEntry& entry, QRTErrorRef* error)>;
+
+namespace platform {
+struct Item;
+}
 
 class QRTFileManager {
  public:
@@ -75,10 +80,8 @@ class QRTFileManager {
   // renameat between the two safely opened parent directories, both of which
   // are flushed before true is returned: true means the move is durable. A
   // false after the rename itself succeeded (a failed flush) leaves the item
-  // at the destination. Across file systems: a flushed copy under a hidden
-  // name beside the destination, renamed into place (a failed copy is
-  // removed and the source left whole), then the source removed (a failure
-  // there is only logged).
+  // at the destination. Across file systems the move fails with EXDEV: a
+  // container is never copied on its way.
   bool _moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing, QRTErrorRef* error);
   bool moveItemAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
   bool moveItemIfExistsAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
@@ -94,6 +97,17 @@ class QRTFileManager {
   // passed over; a directory swapped since the listing is an Other entry with
   // error ESTALE and is not entered.
   bool _traverseDirectory(const QRTURL& root, QRTErrorRef* error, const QRTTraversalVisitor& withBlock);
+
+  // The one check before anything is taken from a tree a user can write into
+  // a place they cannot (a global class, a system container, the daemon's
+  // home, the code-signing database): every directory from base down to url,
+  // and every item of url's tree, is owned by root or by owner and writable
+  // by no one else, each regular file has one link, and nothing else but
+  // directories and links is there. Checked on the descriptors of one walk
+  // that follows no link; a refusal gets a log line naming the item and why.
+  // *top, when given, receives url's item, pinned. Callers check the
+  // destination again after the move, with base equal to url there.
+  bool itemIsImportableAtURL(const QRTURL& url, const QRTURL& fromBase, uid_t owner, platform::Item* top = nullptr);
 
   // Items of the directory in directory order, hidden names left out.
   std::optional<std::vector<QRTURL>> urlsForItemsInDirectoryAtURL(const QRTURL& url, QRTErrorRef* error);
@@ -187,6 +201,10 @@ bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTW
 // dictionary. Unparsable bytes fail in QRTPropertyListErrorDomain with 3840, another
 // top-level type with 2048, a read failure with a POSIX error.
 std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& url, QRTErrorRef* error);
+// The same for a file of at most maxBytes (EFBIG past it) whose value stays
+// within limits; for files whose values are kept for long.
+std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& url, size_t maxBytes,
+                                                                 const plist::Limits& limits, QRTErrorRef* error);
 
 inline constexpr int32_t QRTPropertyListReadCorruptError = 3840;
 inline constexpr int32_t QRTFormattingError = 2048;

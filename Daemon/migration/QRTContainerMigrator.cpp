@@ -70,10 +70,14 @@ void QRTContainerMigrator::_moveOldLogFiles() {
       std::string stem;
       const long next = numericExtension(item.lastPathComponent(), &stem) + 1;
       if (next > static_cast<long>(gQRTLogFileCount)) continue;
+      // The old directory is in a user's home: only root's own files go to root's log directory.
+      if (!fm.itemIsImportableAtURL(item, *oldLogs, 0)) continue;
       QRTURL target = logDirectory.URLByAppendingPathComponent(stem + "." + std::to_string(next));
       QRTErrorRef moveError;
       if (!fm.moveItemAtURL(item, target, &moveError)) {
         QRTLog(kLogError, "Failed to move to new logging directory from %@ : %@", item, moveError);
+      } else if (!fm.itemIsImportableAtURL(target, target, 0) && !fm.removeItemAtURL(target, &moveError)) {
+        QRTLog(kLogError, "Failed to remove %@, swapped while it was moved: %@", target, moveError);
       }
     }
     QRTLog(kLogNotice, "Migrated log files on %@", QRTMigrationStatus::currentBuildVersion());
@@ -100,13 +104,23 @@ bool QRTContainerMigrator::_buildUpgradeSteps(QRTMigrationStatus* status, QRTErr
 
   const QRTURL oldBundles = QRTURL::fileURL(platform::hostPath(kOldBundleContainerPath), true);
   QRTFileManager& fm = QRTFileManager::defaultManager();
-  if (fm.itemExistsAtURL(oldBundles)) {
+  // The old place is in a user's home: only a tree of root's or the
+  // installer's alone becomes the bundle classes.
+  if (fm.itemExistsAtURL(oldBundles) && fm.itemIsImportableAtURL(oldBundles, oldBundles, kBundleOwnerId)) {
     QRTLog(kLogNotice, "Moving bundle containers from user to system location");
+    const QRTURL bundles = QRTGlobalConfiguration::sharedInstance().bundleDirectory();
     QRTErrorRef error;
-    if (!fm.moveItemAtURL(oldBundles, QRTGlobalConfiguration::sharedInstance().bundleDirectory(), &error)) {
+    if (!fm.moveItemAtURL(oldBundles, bundles, &error)) {
       QRTLog(kLogError, "Failed to migrate to new bundle containers location : %@.  This is terrible.", error);
       QRTSetError(withError, error);
       return false;
+    }
+    if (!fm.itemIsImportableAtURL(bundles, bundles, kBundleOwnerId)) {
+      // Swapped since it was checked: what arrived is not kept.
+      const QRTURL removed = bundles.URLByDeletingLastPathComponent().URLByAppendingPathComponent("Bundle.refused", true);
+      if (!fm.moveItemAtURL(bundles, removed, &error) || !fm.removeItemAtURL(removed, &error)) {
+        QRTLog(kLogError, "Failed to remove refused bundle containers : %@", error);
+      }
     }
   }
   QRT_CRASH_POINT("migrator-build-upgrade-bundles-moved");

@@ -52,9 +52,13 @@ bool QRTClientConnection::_moveItemAtURLToDeathRow(const QRTURL& url, bool isDir
   QRTFileManager& files = QRTFileManager::defaultManager();
   QRTErrorRef underlying;
   {
+    std::optional<QRTURL> deathRow = QRTGlobalConfiguration::sharedInstance().deathrowDirectoryForURL(url);
+    if (!deathRow) {
+      QRTSetError(error, QRT_ERROR(QRTErrorDeathRowFailed, nullptr, true, "No death row on the file system of %@", url));
+      return false;
+    }
     std::lock_guard<std::mutex> handOver(gDeathRowHandOverLock);
-    std::optional<QRTURL> holding = files.createTemporaryDirectoryInDirectoryURL(
-        QRTGlobalConfiguration::sharedInstance().deathrowDirectory(), &underlying);
+    std::optional<QRTURL> holding = files.createTemporaryDirectoryInDirectoryURL(*deathRow, &underlying);
     if (!holding) {
       QRTSetError(error, QRT_ERROR(QRTErrorDeathRowFailed, underlying, true, "Failed to create unique directory at: %@",
                                    url));
@@ -76,24 +80,26 @@ bool QRTClientConnection::_moveItemAtURLToDeathRow(const QRTURL& url, bool isDir
 }
 
 uint64_t QRTClientConnection::_runDeathRowPass() {
-  QRTErrorRef listError;
-  QRTURL deathRow = QRTGlobalConfiguration::sharedInstance().deathrowDirectory();
-  std::optional<std::vector<QRTURL>> items;
-  {
-    std::lock_guard<std::mutex> handOver(gDeathRowHandOverLock);
-    items = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow, &listError);
-  }
-  if (!items) {
-    if (listError->domain() == QRTPOSIXErrorDomain && listError->code() == ENOENT) return QRTErrorNone;
-    return QRT_ERROR(QRTErrorDeleteFailed, listError, true, "Failed to get items for deletion: %@ : %@", nullptr,
-                     listError)
-        ->resultCode();
-  }
   uint64_t result = QRTErrorNone;
-  for (const QRTURL& item : *items) {
-    QRTErrorRef itemError;
-    if (!_removeItemOrMoveToTempAtURL(item, &itemError)) {
-      result = QRT_ERROR(QRTErrorDestroyFailed, itemError, true, "Failed to destroy item at: %@", item)->resultCode();
+  for (const QRTURL& deathRow : QRTGlobalConfiguration::sharedInstance().allDeathrowDirectories()) {
+    QRTErrorRef listError;
+    std::optional<std::vector<QRTURL>> items;
+    {
+      std::lock_guard<std::mutex> handOver(gDeathRowHandOverLock);
+      items = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow, &listError);
+    }
+    if (!items) {
+      if (listError->domain() == QRTPOSIXErrorDomain && listError->code() == ENOENT) continue;
+      result = QRT_ERROR(QRTErrorDeleteFailed, listError, true, "Failed to get items for deletion: %@ : %@", deathRow,
+                         listError)
+                   ->resultCode();
+      continue;
+    }
+    for (const QRTURL& item : *items) {
+      QRTErrorRef itemError;
+      if (!_removeItemOrMoveToTempAtURL(item, &itemError)) {
+        result = QRT_ERROR(QRTErrorDestroyFailed, itemError, true, "Failed to destroy item at: %@", item)->resultCode();
+      }
     }
   }
   return result;
@@ -146,8 +152,12 @@ void QRTClientConnection::stageForDeleteContainersWithUsers(const std::vector<ui
       }
       auto metadata = cache.containerForUser(userId, containerClass, identifiers[i], UUIDs[i]->UUIDString());
       if (!metadata) continue;
-      QRTURL target = QRTGlobalConfiguration::sharedInstance().deathrowDirectory().URLByAppendingPathComponent(
-          metadata->url().lastPathComponent(), true);
+      auto deathRow = QRTGlobalConfiguration::sharedInstance().deathrowDirectoryForURL(metadata->url());
+      if (!deathRow) {
+        QRT_ERROR(QRTErrorDeleteFailed, nullptr, true, "No death row on the file system of %@", metadata->url());
+        continue;
+      }
+      QRTURL target = deathRow->URLByAppendingPathComponent(metadata->url().lastPathComponent(), true);
       // Dropped whether or not the move succeeds: a bundle on its way out grants nothing.
       if (QRTIsBundleClass(containerClass)) {
         if (QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance()) {
@@ -164,6 +174,7 @@ void QRTClientConnection::stageForDeleteContainersWithUsers(const std::vector<ui
           continue;
         }
       }
+      QRT_CRASH_POINT("delete-after-stage");
       QRTErrorRef cacheError;
       if (!cache.removeContainerForUser(userId, containerClass, metadata->identifier(), metadata->transient(),
                                         &cacheError)) {

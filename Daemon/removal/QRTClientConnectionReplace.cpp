@@ -46,14 +46,17 @@ void QRTClientConnection::quarterCleanup() {
     deleteContainersOnDeathRowWithCompletion(nullptr);
     return;
   }
-  QRTURL staging = QRTGlobalConfiguration::sharedInstance().stagingDirectory();
-  QRTErrorRef error;
-  auto items = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(staging, &error);
-  if (!items && !(error->domain() == QRTPOSIXErrorDomain && error->code() == ENOENT)) {
-    QRTLog(platform::kLogError, "Failed to get items at staging URL%@ : %@", staging, error);
-  }
-  for (const QRTURL& item : items.value_or(std::vector<QRTURL>{})) {
-    _moveItemAtURLToDeathRow(item, true, false, nullptr);
+  QRTGlobalConfiguration& configuration = QRTGlobalConfiguration::sharedInstance();
+  configuration.getPerUserConfigurationForCurrentMobileUser();  // its base's staging is looked at too
+  for (const QRTURL& staging : configuration.allStagingDirectories()) {
+    QRTErrorRef error;
+    auto items = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(staging, &error);
+    if (!items && !(error->domain() == QRTPOSIXErrorDomain && error->code() == ENOENT)) {
+      QRTLog(platform::kLogError, "Failed to get items at staging URL%@ : %@", staging, error);
+    }
+    for (const QRTURL& item : items.value_or(std::vector<QRTURL>{})) {
+      _moveItemAtURLToDeathRow(item, true, false, nullptr);
+    }
   }
   deleteContainersOnDeathRowWithCompletion(nullptr);
 }
@@ -420,8 +423,15 @@ void QRTClientConnection::replaceContainer(const std::optional<QRTUUID>& replace
       QRTGlobalConfiguration& configuration = QRTGlobalConfiguration::sharedInstance();
       const std::string name = QRTUUID::random().UUIDString();
       job.journal = configuration.replaceDirectory().URLByAppendingPathComponent(QRTFormat("%@.plist", name));
-      job.staging = configuration.stagingDirectory().URLByAppendingPathComponent(name, true);
-      if (!_writeToDiskReplaceAt(job.journal, job.oldURL, job.newURL, job.staging, job.destination,
+      // Beside the old container, so that it is only ever renamed; a
+      // replace without an old container needs no staging.
+      auto stagingDirectory = job.oldContainer ? configuration.stagingDirectoryForURL(job.oldURL)
+                                               : std::optional<QRTURL>(configuration.stagingDirectory());
+      if (!stagingDirectory) {
+        error = QRT_ERROR_AS(kReplace, QRTErrorMoveToStagingFailed, nullptr, "No staging directory for %@",
+                             job.oldURL);
+      } else if (job.staging = stagingDirectory->URLByAppendingPathComponent(name, true);
+                 !_writeToDiskReplaceAt(job.journal, job.oldURL, job.newURL, job.staging, job.destination,
                                  job.preserveOldUUID ? job.oldUUID : std::nullopt, &error)) {
         QRTLog(kLogError, "Failed to write replace file: %@", error);
       } else {

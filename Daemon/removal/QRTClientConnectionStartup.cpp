@@ -4,6 +4,7 @@
 // next step runs.
 
 #include <fcntl.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 #include <cstring>
@@ -60,6 +61,11 @@ void _moveSystemContainerIntoPlace(const QRTURL& restored, uint64_t containerCla
   }
   QRTLog(kLogError, "Restoring container for %@ at %@ to %@", identifier, restored, container->url());
   QRTFileManager& fm = QRTFileManager::defaultManager();
+  struct stat owner;
+  if (int err = platform::safeStat(container->url().path(), &owner)) {
+    QRTLog(kLogError, "Failed to find the owner of system container %@: %s", identifier, strerror(err));
+    return;
+  }
   QRTErrorRef error;
   auto items = fm.urlsForItemsInDirectoryAtURL(restored, &error);
   if (!items) {
@@ -78,6 +84,11 @@ void _moveSystemContainerIntoPlace(const QRTURL& restored, uint64_t containerCla
       QRTLog(kLogError, "Failed to move file in restored system container %@:%@ to destination %@: %@", identifier,
              item, destination, step);
       _moveFailedPathAside(item, failedDirectory, name);
+    } else if (!fm.itemIsImportableAtURL(destination, destination, 0)) {
+      // Swapped since the backup was checked: what arrived is not kept.
+      client._moveItemAtURLToDeathRow(destination, true, false, nullptr);
+    } else if (!fm.standardizeOwnershipAtURL(destination, owner.st_uid, owner.st_gid, &step)) {
+      QRTLog(kLogError, "Failed to give %@ the owner of system container %@: %@", destination, identifier, step);
     }
   }
   client.recreateDefaultStructureForUser(container->uid(), container->uuid(), identifier, containerClass, &code);
@@ -89,9 +100,12 @@ void _moveSystemContainerIntoPlace(const QRTURL& restored, uint64_t containerCla
 
 // Moves the backup's subdirectory to ".inprogress"; only what this start
 // moved there is installed, so an interrupted install is never repeated.
-bool takeBackupDirectory(const std::optional<QRTURL>& directory, const char* moveFailure) {
+bool takeBackupDirectory(const std::optional<QRTURL>& directory, const std::optional<QRTURL>& base,
+                         const char* moveFailure) {
   QRTFileManager& fm = QRTFileManager::defaultManager();
-  if (!directory || !fm.itemExistsAtURL(*directory)) return false;
+  if (!directory || !base || !fm.itemExistsAtURL(*directory)) return false;
+  // The backup lies in a user's home: only a tree of root's alone is installed.
+  if (!fm.itemIsImportableAtURL(*directory, *base, 0)) return false;
   const QRTURL inProgress = withExtension(*directory, "inprogress");
   QRTErrorRef error;
   if (!fm.removeItemAtURL(inProgress, &error)) {
@@ -121,8 +135,10 @@ void QRTMoveSystemContainersIntoPlace(QRTClientConnection& client) {
   auto user = QRTGlobalConfiguration::sharedInstance().getPerUserConfigurationForCurrentMobileUser();
   const auto data = user->systemContainerBackupDirectory();
   const auto shared = user->systemGroupContainerBackupDirectory();
-  const bool dataMoved = takeBackupDirectory(data, "Failed to move system containers to inprogress: %@");
-  const bool sharedMoved = takeBackupDirectory(shared, "Failed to move shared system containers to inprogress: %@");
+  const auto base = user->systemContainerBackupBaseDirectory();
+  const bool dataMoved = takeBackupDirectory(data, base, "Failed to move system containers to inprogress: %@");
+  const bool sharedMoved =
+      takeBackupDirectory(shared, base, "Failed to move shared system containers to inprogress: %@");
   if (dataMoved) {
     QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace", "Installing system containers");
     installBackupDirectory(*data, QRTClassSystemData, "Couldn't find any system containers at %@: %@", client);
@@ -132,9 +148,9 @@ void QRTMoveSystemContainersIntoPlace(QRTClientConnection& client) {
     installBackupDirectory(*shared, QRTClassSystemGroup, "Couldn't find any system shared containers at %@: %@",
                            client);
   }
-  // Internal builds keep the backup, ".inprogress" and ".failed" included, for diagnosis.
-  if (platform::deviceIsInternalBuild()) return;
-  const auto base = user->systemContainerBackupBaseDirectory();
+  // Internal builds keep the backup, ".inprogress" and ".failed" included,
+  // for diagnosis; a refused tree stays the user's, untouched.
+  if (platform::deviceIsInternalBuild() || (!dataMoved && !sharedMoved)) return;
   QRTErrorRef error;
   if (base && !QRTFileManager::defaultManager().removeItemAtURL(*base, &error)) {
     QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace", "Failed to remove system container base dir %@: %@", *base,

@@ -118,22 +118,32 @@ QRTMetadataRef QRTClientConnection::_createNewContainer(uint32_t userId, const s
                                                         uint64_t containerClass, bool transient, QRTErrorRef* error) {
   QRTGlobalConfiguration& configuration = QRTGlobalConfiguration::sharedInstance();
   const std::string directoryName = QRTUUID::random().UUIDString();
-  const QRTURL staging = configuration.stagingDirectory().URLByAppendingPathComponent(directoryName, true);
+  std::optional<QRTURL> classDirectory = configuration.containerDirectoryURLForUser(userId, containerClass, transient);
+  std::string finalName = directoryName;
+  if (auto wellKnown = QRTWhitelist::sharedWhitelist().wellknownContainerForId(identifier, containerClass)) {
+    finalName = *wellKnown;
+  }
+  // Built on the class directory's own file system, so that it is only ever renamed.
+  std::optional<QRTURL> stagingDirectory =
+      classDirectory ? configuration.stagingDirectoryForURL(classDirectory->URLByAppendingPathComponent(finalName, true))
+                     : std::nullopt;
+  if (!stagingDirectory) {
+    QRTSetError(error, QRT_ERROR(classDirectory ? QRTErrorCreateStagingFailed : QRTErrorMoveStagingToLiveFailed,
+                                 nullptr, true, "No staging directory for %@ in %@", identifier, classDirectory));
+    return nullptr;
+  }
+  const QRTURL staging = stagingDirectory->URLByAppendingPathComponent(directoryName, true);
 
   QRTMetadataRef metadata = _buildInStaging(staging, userId, identifier, containerClass, error);
+  QRT_CRASH_POINT("create-after-build");
   if (metadata) {
-    std::optional<QRTURL> classDirectory =
-        configuration.containerDirectoryURLForUser(userId, containerClass, transient);
-    std::string finalName = directoryName;
-    if (auto wellKnown = QRTWhitelist::sharedWhitelist().wellknownContainerForId(identifier, containerClass)) {
-      finalName = *wellKnown;
-    }
     QRTURL finalURL = classDirectory ? classDirectory->URLByAppendingPathComponent(finalName, true) : QRTURL();
     QRTErrorRef moveError;
     if (!classDirectory || !QRTFileManager::defaultManager().moveItemAtURL(staging, finalURL, &moveError)) {
       QRTSetError(error, QRT_ERROR(QRTErrorMoveStagingToLiveFailed, moveError, true,
                                    "Failed to move staging dir: %@ to live dir: %@", staging, finalURL));
     } else {
+      QRT_CRASH_POINT("create-after-move");
       QRTMetadataRef stored;
       QRTErrorRef cacheError;
       if (QRTContainerCache::sharedInstance().addContainerMetadata(metadata, userId, finalURL, transient, true,
@@ -232,6 +242,23 @@ QRTMetadataRef QRTClientConnection::_lookupOrCreate(uint32_t userId, const std::
     QRTSetError(error, QRT_ERROR(QRTErrorNotFound, nullptr, false, "Container with identifier: \"%@\" Not Found",
                                  identifier));
     return nullptr;
+  }
+  // A user's containers, and so the cache's memory for them, stay bounded.
+  if (userId != 0) {
+    const size_t limit = QRTGlobalConfiguration::sharedInstance().maxContainersPerClass();
+    QRTErrorRef countError;
+    auto held = QRTContainerCache::sharedInstance().countOfContainersForUser(userId, containerClass, &countError);
+    if (!held) {
+      QRTSetError(error, countError);
+      return nullptr;
+    }
+    if (*held >= limit) {
+      QRTSetError(error, QRT_ERROR(QRTErrorInvalidArgument, nullptr, true,
+                                   "User %u holds %llu containers of class %llu, the most allowed: not creating %@",
+                                   userId, static_cast<unsigned long long>(*held),
+                                   static_cast<unsigned long long>(containerClass), identifier));
+      return nullptr;
+    }
   }
   return _createNewContainer(userId, identifier, containerClass, transient, error);
 }

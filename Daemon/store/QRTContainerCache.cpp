@@ -1,5 +1,7 @@
 #include "Daemon/store/QRTContainerCache.h"
 
+#include <cstdint>
+
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
@@ -59,7 +61,15 @@ std::optional<QRTContainerCache::ClassMap> QRTContainerCache::buildClassMap(uint
   ClassMap map;
   const bool pushMappings = populateSandboxCache && !transient &&
                             (contentClass == 10 || contentClass == 12 || contentClass == 13);
+  // Planted directories beyond a user's bound are not read: they could not
+  // have been made through requests.
+  const size_t limit = userId == 0 ? SIZE_MAX : QRTGlobalConfiguration::sharedInstance().maxContainersPerClass();
   for (const QRTURL& item : *items) {
+    if (map.size() >= limit) {
+      QRTLog(kLogError, "Cache: %@%@: more than %llu containers; the rest are left out",
+             cacheKey(userId, contentClass), suffix(transient), static_cast<unsigned long long>(limit));
+      break;
+    }
     QRTErrorRef readError;
     QRTMetadataRef metadata = QRTMetadata::readAndValidateMetadataAtUrl(item, userId, true, &readError);
     if (!metadata) continue;
@@ -177,6 +187,23 @@ QRTMetadataRef QRTContainerCache::containerForUser(uint32_t userId, uint64_t con
   } catch (...) {
     QRTSetError(error, QRT_EXCEPTION_ERROR());
     return nullptr;
+  }
+}
+
+std::optional<size_t> QRTContainerCache::countOfContainersForUser(uint32_t userId, uint64_t contentClass,
+                                                                  QRTErrorRef* error) {
+  try {
+    size_t count = 0;
+    std::unique_lock<std::mutex> hold(cacheLock);
+    for (bool transient : {false, true}) {
+      ClassMap* map = lockedClassMap(hold, __func__, userId, contentClass, transient, true, error);
+      if (!map) return std::nullopt;
+      count += map->size();
+    }
+    return count;
+  } catch (...) {
+    QRTSetError(error, QRT_EXCEPTION_ERROR());
+    return std::nullopt;
   }
 }
 

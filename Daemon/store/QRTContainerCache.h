@@ -31,6 +31,8 @@ class QRTContainerCache {
                                                                   bool transient, QRTErrorRef* error) {
     return allContainersForUser(userId, contentClass, transient, true, error);
   }
+  // Live and transient containers of the user and class together.
+  std::optional<size_t> countOfContainersForUser(uint32_t userId, uint64_t contentClass, QRTErrorRef* error);
   // Stores the metadata under its identifier, replacing any entry; the stored
   // object (a copy when the metadata's own URL or transient flag differ from
   // the given ones) goes to *stored when asked for.

@@ -1,15 +1,52 @@
 #include "Daemon/store/QRTGlobalConfiguration.h"
 
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTPerUserConfiguration.h"
 #include "platform/DeviceRoot.h"
 #include "platform/Log.h"
+#include "platform/SafePath.h"
 #include "platform/UserDatabase.h"
 
 namespace {
 
 constexpr mode_t kDirectoryMode = 0755;
+constexpr size_t kMaxContainersPerClass = 10'000;
+constexpr const char* kUserStagingName = ".staging";
+constexpr const char* kUserDeathrowName = ".deathrow";
+
+// The user base's own directory of that name: made if missing, and used only
+// while it is a real directory of root's that no one else may enter.
+std::optional<QRTURL> checkedUserDirectory(const QRTURL& base, const char* name) {
+  const QRTURL url = base.URLByAppendingPathComponent(name, true);
+  platform::UniqueFd fd;
+  int err = platform::safeMakeDirectory(url.path(), 0700, false, platform::kAnyOwner, &fd);
+  struct stat st;
+  if (!err && fstat(fd.get(), &st) != 0) err = errno;
+  if (!err && (st.st_uid != 0 || !S_ISDIR(st.st_mode) || (st.st_mode & 077) != 0)) err = EPERM;
+  if (err) {
+    QRTLog(platform::kLogError, "Refusing %@ as a directory of the daemon's: %s", url, strerror(err));
+    return std::nullopt;
+  }
+  return url;
+}
+
+bool sameFileSystem(const QRTURL& a, const QRTURL& b) {
+  struct stat sa, sb;
+  return platform::safeStat(a.path(), &sa) == 0 && platform::safeStat(b.path(), &sb) == 0 && sa.st_dev == sb.st_dev;
+}
+
+bool isBelow(const QRTURL& url, const QRTURL& base) {
+  std::string prefix = base.path();
+  if (prefix.empty() || prefix.back() != '/') prefix += '/';
+  return url.path().compare(0, prefix.size(), prefix) == 0;
+}
 constexpr int32_t kLibraryProtectionClass = 4;
 
 using Config = QRTGlobalConfiguration;
@@ -105,6 +142,62 @@ QRTURL QRTGlobalConfiguration::deathrowDirectory() {
       deathrowDirectory_, __func__,
       [](Config& c) { return c.cachesDirectory().URLByAppendingPathComponent("Dead", true); }, -1,
       "Failed to create deathrow dir at \"%@\": %@");
+}
+
+std::optional<QRTURL> QRTGlobalConfiguration::directoryOnFileSystemOf(const QRTURL& url, const QRTURL& daemonDirectory,
+                                                                     const char* name) {
+  // The parent: url itself may not exist yet, or be on its way out.
+  const QRTURL parent = url.URLByDeletingLastPathComponent();
+  if (sameFileSystem(parent, daemonDirectory)) return daemonDirectory;
+  std::lock_guard<std::recursive_mutex> hold(lock_);
+  for (const auto& [uid, user] : perUserConfigurations_) {
+    // The home rather than the base: the user's transient directory lies outside the base.
+    auto base = user->userBaseDirectoryPath();
+    const auto& home = user->userHomeDirectory();
+    if (base && home && isBelow(url, *home) && sameFileSystem(parent, *base)) return checkedUserDirectory(*base, name);
+  }
+  QRTLog(platform::kLogError, "No %s directory on the file system of %@", name, url);
+  return std::nullopt;
+}
+
+std::optional<QRTURL> QRTGlobalConfiguration::stagingDirectoryForURL(const QRTURL& url) {
+  return directoryOnFileSystemOf(url, stagingDirectory(), kUserStagingName);
+}
+
+std::optional<QRTURL> QRTGlobalConfiguration::deathrowDirectoryForURL(const QRTURL& url) {
+  return directoryOnFileSystemOf(url, deathrowDirectory(), kUserDeathrowName);
+}
+
+std::vector<QRTURL> QRTGlobalConfiguration::allDirectories(const QRTURL& daemonDirectory, const char* name) {
+  std::vector<QRTURL> all{daemonDirectory};
+  std::lock_guard<std::recursive_mutex> hold(lock_);
+  for (const auto& [uid, user] : perUserConfigurations_) {
+    auto base = user->userBaseDirectoryPath();
+    struct stat st;
+    if (!base || platform::safeStat(base->URLByAppendingPathComponent(name).path(), &st) != 0) continue;
+    if (auto checked = checkedUserDirectory(*base, name)) all.push_back(*checked);
+  }
+  return all;
+}
+
+std::vector<QRTURL> QRTGlobalConfiguration::allStagingDirectories() {
+  return allDirectories(stagingDirectory(), kUserStagingName);
+}
+
+std::vector<QRTURL> QRTGlobalConfiguration::allDeathrowDirectories() {
+  return allDirectories(deathrowDirectory(), kUserDeathrowName);
+}
+
+size_t QRTGlobalConfiguration::maxContainersPerClass() const {
+#ifdef QRT_TEST_HOOKS
+  // Tests lower the bound rather than make ten thousand containers.
+  if (auto text = platform::readHostFile(platform::hostPath("/run/quarterd.maxcontainers"), 32)) {
+    char* end = nullptr;
+    const unsigned long n = strtoul(text->c_str(), &end, 10);
+    if (end != text->c_str()) return n;
+  }
+#endif
+  return kMaxContainersPerClass;
 }
 
 QRTURL QRTGlobalConfiguration::replaceDirectory() {

@@ -35,6 +35,21 @@ class QRTGlobalConfiguration {
   QRTURL transientDirectory();
   QRTURL stagingDirectory();
   QRTURL deathrowDirectory();
+  // Where the item at url is built or sent on its way out, on url's own file
+  // system so that it is only ever renamed: the daemon's staging (death-row)
+  // directory when it shares url's file system, otherwise ".staging"
+  // (".deathrow") in the user base that holds url, made by root with mode
+  // 0700 and checked to be root's and not a link at every call. Nothing,
+  // with a log line, when neither fits.
+  std::optional<QRTURL> stagingDirectoryForURL(const QRTURL& url);
+  std::optional<QRTURL> deathrowDirectoryForURL(const QRTURL& url);
+  // The daemon's directory and those of the user bases known so far that
+  // pass the checks, for death-row passes and start-up clean-up.
+  std::vector<QRTURL> allStagingDirectories();
+  std::vector<QRTURL> allDeathrowDirectories();
+
+  // How many containers of one class a user other than root may hold.
+  size_t maxContainersPerClass() const;
   QRTURL replaceDirectory();
   QRTURL pendingUpdatesDirectory();
   QRTURL transientBundleDirectory();
@@ -58,6 +73,9 @@ class QRTGlobalConfiguration {
 
  private:
   QRTGlobalConfiguration();
+
+  std::optional<QRTURL> directoryOnFileSystemOf(const QRTURL& url, const QRTURL& daemonDirectory, const char* name);
+  std::vector<QRTURL> allDirectories(const QRTURL& daemonDirectory, const char* name);
 
   // Computes the URL into slot on first use, then creates the directory.
   QRTURL cachedDirectory(std::optional<QRTURL>& slot, const char* getter, QRTURL (*compute)(QRTGlobalConfiguration&),

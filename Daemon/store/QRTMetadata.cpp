@@ -1,5 +1,7 @@
 #include "Daemon/store/QRTMetadata.h"
 
+#include <cerrno>
+
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "base/PlistCodec.h"
@@ -66,19 +68,41 @@ plist::Dictionary QRTMetadata::dictionaryRepresentation() const {
 namespace {
 
 // Counts objects as the reader does (every value and every dictionary key,
-// shared ones once per use) and stops early once over the budget.
-bool withinObjectBudget(const plist::Value& value, size_t depth, size_t* objects) {
+// shared ones once per use) and the bytes of strings and data, and stops
+// early once over the budget.
+bool withinBudget(const plist::Value& value, size_t depth, size_t* objects, size_t* bytes) {
   if (++*objects > QRTMetadataMaxObjects || depth > QRTMetadataMaxDepth) return false;
+  if (const std::string* s = value.stringIf()) *bytes += s->size();
+  if (value.isData()) *bytes += value.data().size();
+  if (*bytes > QRTMetadataMaxEncodedBytes) return false;
   if (value.isArray()) {
     for (const plist::Value& element : value.array()) {
-      if (!withinObjectBudget(element, depth + 1, objects)) return false;
+      if (!withinBudget(element, depth + 1, objects, bytes)) return false;
     }
   } else if (value.isDictionary()) {
     for (const auto& [key, element] : value.dictionary()) {
-      if (++*objects > QRTMetadataMaxObjects || !withinObjectBudget(element, depth + 1, objects)) return false;
+      *bytes += key.size();
+      if (++*objects > QRTMetadataMaxObjects || !withinBudget(element, depth + 1, objects, bytes)) return false;
     }
   }
   return true;
+}
+
+bool withinBudget(const plist::Value& whole) {
+  size_t objects = 0, bytes = 0;
+  return withinBudget(whole, 1, &objects, &bytes);
+}
+
+// The metadata file, read with the bounds it is written with.
+std::optional<plist::Dictionary> readMetadataFile(const QRTURL& file, QRTErrorRef* error) {
+  const plist::Limits limits{QRTMetadataMaxDepth, QRTMetadataMaxObjects, plist::kMaxFootprint,
+                             QRTMetadataMaxEncodedBytes};
+  auto dictionary = QRT_dictionaryWithContentsOfURL(file, QRTMetadataMaxEncodedBytes, limits, error);
+  if (dictionary && !withinBudget(plist::Value(*dictionary))) {
+    QRTSetError(error, QRT_POSIX_ERROR(EFBIG, "Metadata at %@ expands past its bounds", file));
+    return std::nullopt;
+  }
+  return dictionary;
 }
 
 }  // namespace
@@ -86,8 +110,7 @@ bool withinObjectBudget(const plist::Value& value, size_t depth, size_t* objects
 bool QRTMetadata::writeMetadataToDiskWithError(QRTErrorRef* error) const {
   plist::Dictionary dictionary = dictionaryRepresentation();
   const plist::Value whole(dictionary);
-  size_t objects = 0;
-  if (!withinObjectBudget(whole, 1, &objects) || plist::writeBinary(whole).size() > QRTMetadataMaxEncodedBytes) {
+  if (!withinBudget(whole) || plist::writeBinary(whole).size() > QRTMetadataMaxEncodedBytes) {
     QRTSetError(error, QRT_ERROR(QRTErrorInvalidArgument, nullptr, true,
                                  "Metadata for %@ at %@ would exceed %llu bytes, %llu objects or %llu levels",
                                  identifier_, url_, static_cast<unsigned long long>(QRTMetadataMaxEncodedBytes),
@@ -108,7 +131,7 @@ bool QRTMetadata::writeMetadataToDiskWithError(QRTErrorRef* error) const {
 bool QRTMetadata::rewriteUUIDAtUrl(const QRTURL& url, const QRTUUID& uuid, QRTErrorRef* error) {
   const QRTURL file = url.URLByAppendingPathComponent(QRTMetadataFileName);
   QRTErrorRef underlying;
-  std::optional<plist::Dictionary> dictionary = QRT_dictionaryWithContentsOfURL(file, &underlying);
+  std::optional<plist::Dictionary> dictionary = readMetadataFile(file, &underlying);
   if (!dictionary) {
     QRTSetError(error, QRT_ERROR(QRTErrorReadFailed, underlying, true, "Failed to read metadata at URL %@", url));
     return false;
@@ -134,7 +157,7 @@ std::shared_ptr<QRTMetadata> QRTMetadata::readAndValidateMetadataAtUrl(const QRT
                                                                        bool checkClassPath, QRTErrorRef* error) {
   QRTErrorRef readError;
   std::optional<plist::Dictionary> dictionary =
-      QRT_dictionaryWithContentsOfURL(url.URLByAppendingPathComponent(QRTMetadataFileName), &readError);
+      readMetadataFile(url.URLByAppendingPathComponent(QRTMetadataFileName), &readError);
   if (!dictionary) {
     QRTSetError(error, QRT_ERROR(QRTErrorReadFailed, readError, true, "Failed to read metadata at URL %@", url));
     return nullptr;

@@ -28,9 +28,10 @@ class QRTMetadata;
 // makes a new object that replaces the cached one.
 using QRTMetadataRef = std::shared_ptr<const QRTMetadata>;
 
-// What a metadata file may hold so that the reader, which refuses larger or
-// deeper property lists, always takes it back: 1 MiB encoded, 100,000 objects
-// and 32 levels of nesting.
+// What a metadata file may hold, written and read alike: 1 MiB encoded, 1 MiB
+// of strings and data counted as often as they are reached, 100,000 objects
+// and 32 levels of nesting. A larger file is unreadable, so planted metadata
+// costs no more memory than metadata made through requests.
 inline constexpr size_t QRTMetadataMaxEncodedBytes = 1u << 20;
 inline constexpr size_t QRTMetadataMaxObjects = 100'000;
 inline constexpr size_t QRTMetadataMaxDepth = 32;

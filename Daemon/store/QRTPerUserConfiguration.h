@@ -20,6 +20,8 @@ class QRTPerUserConfiguration {
   const std::optional<QRTURL>& userHomeDirectory() const { return userHomeDirectory_; }
   // home + "Containers", created.
   std::optional<QRTURL> userBaseDirectory();
+  // The same path, nothing created.
+  std::optional<QRTURL> userBaseDirectoryPath() const { return homeRelative("Containers"); }
   // home + "Library/Caches/com.norvane.quarterd/Temp", created.
   std::optional<QRTURL> transientDirectory();
   // home + "Library/Backup/SystemContainers" and its "Data" and "Shared"; not created.

@@ -25,6 +25,7 @@
 #include <utility>
 
 #include "DaemonFixture.h"
+#include "base/PlistCodec.h"
 
 namespace {
 
@@ -90,6 +91,17 @@ std::string differences(const Snapshot& before, const Snapshot& after) {
   for (const auto& [path, item] : after)
     if (!before.count(path)) note("created " + path + ": " + describe(item));
   return count > 8 ? text + "\n  ... and " + std::to_string(count - 8) + " more" : text;
+}
+
+// The first item of the tree owned by uid, or "".
+std::string firstOwnedBy(const std::string& tree, uid_t uid) {
+  std::error_code ec;
+  for (auto it = std::filesystem::recursive_directory_iterator(tree, ec);
+       it != std::filesystem::recursive_directory_iterator(); it.increment(ec)) {
+    struct stat st;
+    if (lstat(it->path().c_str(), &st) == 0 && st.st_uid == uid) return it->path();
+  }
+  return "";
 }
 
 void becomeUser(uid_t uid) {
@@ -175,12 +187,15 @@ struct Case {
   std::function<void(AdversarialTest&)> requests;
   // Repeated by the user while the requests run, each round ending where it began.
   std::function<void(const AdversarialTest&)> race = nullptr;
+  // What the row must also find afterwards.
+  std::function<void(AdversarialTest&)> check = nullptr;
 };
 
 class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterface<Case> {
  public:
   using DaemonFixture::deadDirectory, DaemonFixture::make, DaemonFixture::restartDaemon, DaemonFixture::root,
-      DaemonFixture::createOrLookup, DaemonFixture::setIdentity, DaemonFixture::logContains;
+      DaemonFixture::createOrLookup, DaemonFixture::setIdentity, DaemonFixture::logContains, DaemonFixture::stopDaemon,
+      DaemonFixture::startDaemon, DaemonFixture::daemon, DaemonFixture::logText, DaemonFixture::mountHomeOnTmpfs;
   void SetUp() override {
     DaemonFixture::SetUp();
     if (HasFatalFailure()) return;
@@ -323,9 +338,15 @@ TEST_P(AdversarialTest, NothingOutsideTheUsersReachChanges) {
   c.requests(*this);
   if (racer) { EXPECT_GT(racer->finish(), 0) << "the race never ran"; }
 
+  if (c.check) c.check(*this);
+
   RecordProperty("replies", trace_);
   const std::string changed = differences(before, snapshot());
   EXPECT_TRUE(changed.empty()) << "outside the user's reach:" << changed << "\nreplies (command:code):" << trace_;
+  // Nothing of the user's reaches the global classes or the daemon's logs.
+  for (const std::string& tree : {root + "/private/var/containers", root + "/private/var/root/Library/Logs"}) {
+    EXPECT_EQ(firstOwnedBy(tree, kUser), "") << "the user's item in " << tree << "; replies:" << trace_;
+  }
   auto connection = qk::Connection::connect(qk::requestSocketPath(root));
   auto reply = connection ? connection->call(request(0, byName(other)), kRequestTimeout) : std::nullopt;
   EXPECT_EQ(codeOf(reply), 1u) << "the daemon no longer serves; replies (command:code):" << trace_;
@@ -385,6 +406,28 @@ void registerEntitledCopy(T& t) {
   ASSERT_EQ(system(("mkdir -p " + parentOf(copy) + " && cp " QRT_QUARTERCTL_PATH " " + copy).c_str()), 0);
   t.setIdentity("entitledctl", copy, "com.example.entitledctl", {{"com.norvane.private.QuarterKit.allowed", true}});
 }
+
+// As the user: a container directory (made with its parents) whose metadata
+// file names the identifier and class, with info values.
+bool plantContainer(const std::string& dir, const std::string& identifier, uint64_t cls, uint64_t persona,
+                    const plist::Dictionary& info) {
+  std::error_code error;
+  std::filesystem::create_directories(dir + "/Library", error);
+  const plist::Data bytes = plist::writeBinary(plist::Dictionary{
+      {"QRTMetadataIdentifier", identifier}, {"QRTMetadataUUID", QRTUUID::random().UUIDString()},
+      {"QRTMetadataContentClass", cls}, {"QRTMetadataPersona", persona}, {"QRTMetadataInfo", info}});
+  writeFile(dir + "/" + kMetadataFile, std::string(bytes.begin(), bytes.end()));
+  writeFile(dir + "/Library/planted", "the user's");
+  return exists(dir + "/Library/planted");
+}
+// The next start counts as the first after a boot.
+void reboot(T& t) {
+  if (t.daemon > 0) { ASSERT_EQ(t.stopDaemon(), 0); }
+  unlink((t.root + "/run/quarterd.fb_check").c_str());
+  t.startDaemon();
+}
+std::string newUUIDIn(const std::string& dir) { return dir + "/" + QRTUUID::random().UUIDString(); }
+void expectReply(const T& t, const std::string& reply) { EXPECT_NE(t.trace_.find(reply), std::string::npos) << t.trace_; }
 
 const Case kCases[] = {
     // The metadata file.
@@ -587,6 +630,84 @@ const Case kCases[] = {
        t.sendsAs(kUser, 55, {{17, {{"GroupIdentifier", std::string(16 << 10, 'g')}}}}, 800);
        const std::string log = t.root + "/private/var/root/Library/Logs/QuarterKit/quarterd.log";
        EXPECT_NE((readFile(log + ".0") + readFile(log)).find(evidence), std::string::npos) << "the refusal is gone";
+     }},
+    // Trees of the user's taken into global places at start-up.
+    {"PlantedBackup_Reboot",
+     [](T& t) {
+       ASSERT_EQ(chown((t.home() + "/Library").c_str(), kUser, kUser), 0);  // as a user's own home has it
+       t.plant([&] {
+         const std::string backup = t.home() + "/Library/Backup/SystemContainers/Data/com.example.sysd";
+         std::error_code error;
+         std::filesystem::create_directories(backup + "/Library", error);
+         writeFile(backup + "/Library/tool", "the user's");
+         return chmod((backup + "/Library/tool").c_str(), 04755) == 0;
+       });
+       reboot(t);
+     },
+     [](T& t) { t.send(4); }},
+    {"PlantedBundleAndLogs_BuildUpgrade",
+     [](T& t) {
+       ASSERT_EQ(t.stopDaemon(), 0);
+       // As before the daemon's first start on an older system: no bundle directory yet.
+       ASSERT_EQ(system(("rm -rf " + t.root + "/private/var/containers/Bundle").c_str()), 0);
+       ASSERT_EQ(chown((t.home() + "/Library").c_str(), kUser, kUser), 0);
+       t.plant([&] {
+         std::error_code error;
+         std::filesystem::create_directories(t.home() + "/Library/Logs/QuarterKit", error);
+         writeFile(t.home() + "/Library/Logs/QuarterKit/quarterd.log.0", "the user's");
+         return plantContainer(newUUIDIn(t.containers() + "/Bundle/Application"), "com.victim.app", 1, 33, {});
+       });
+       const plist::Data version = plist::writeBinary(plist::Dictionary{{"BuildVersion", "99Z999"}});
+       writeFile(t.root + "/etc/system-version.plist", std::string(version.begin(), version.end()));
+       reboot(t);
+     },
+     [](T& t) { t.send(0, byName(33, 1, "com.victim.app")); }, nullptr, [](T& t) { expectReply(t, "0:21"); }},
+    {"PlantedMetadataWithGroupIds_DataMigration",
+     [](T& t) {
+       t.plant([&] {
+         return plantContainer(newUUIDIn(t.containers() + "/Data/Application"), "com.victim.sysd", 2, kUser,
+                               {{"com.norvane.Emplacer.GroupContainerIDs", plist::Array{"systemgroup.com.victim"}}});
+       });
+       t.restartDaemon();
+     },
+     [](T& t) { t.send(24); }, nullptr,
+     [](T& t) { EXPECT_EQ(t.logText().find("Migrating app group entitlements for com.victim.sysd"), std::string::npos); }},
+    // Metadata that expands far past what a request could write (one string, shared 88 times).
+    {"PlantedLargeMetadata_Lookup",
+     [](T& t) {
+       t.plant([&] {
+         plist::Dictionary info;
+         const std::string big(512 << 10, 'x');
+         for (int i = 0; i < 88; ++i) info["k" + std::to_string(i)] = big;
+         return plantContainer(newUUIDIn(t.containers() + "/Data/Application"), "com.example.big", 2, kUser, info);
+       });
+       t.restartDaemon();
+     },
+     [](T& t) { t.send(0, byName(kUser, 2, "com.example.big")); }, nullptr, [](T& t) { expectReply(t, "0:21"); }},
+    // Bounds on what one user holds.
+    {"MassCreation_BoundPerClass",
+     [](T& t) { writeFile(t.root + "/run/quarterd.maxcontainers", "3"); },
+     [](T& t) { for (int i = 0; i < 4; ++i) t.send(0, T::creation("com.example.mass" + std::to_string(i))); }, nullptr,
+     [](T& t) {
+       EXPECT_EQ(listDirectory(t.containers() + "/Data/Application").size(), 3u) << t.trace_;
+       expectReply(t, "0:38");
+     }},
+    // A home on another file system: nothing is copied to the daemon's death row.
+    {"DeletionAcrossFileSystems_HardLinksAndSparseFile",
+     [](T& t) {
+       if (!t.mountHomeOnTmpfs()) GTEST_SKIP() << "cannot mount a tmpfs for the home";
+       t.plant([&] {
+         const std::string file = t.in(t.app, "Documents/data");
+         writeFile(file, std::string(1 << 20, 'd'));
+         for (int i = 0; i < 50; ++i) link(file.c_str(), (file + std::to_string(i)).c_str());
+         return close(open(t.in(t.app, "Documents/sparse").c_str(), O_CREAT | O_WRONLY, 0644)) == 0 &&
+                truncate(t.in(t.app, "Documents/sparse").c_str(), 64 << 20) == 0;
+       });
+     },
+     [](T& t) { t.send(10, byName(t.app)); }, nullptr,
+     [](T& t) {
+       EXPECT_FALSE(exists(t.app.path)) << t.trace_;
+       EXPECT_EQ(firstOwnedBy(t.deadDirectory(), kUser), "") << "copied to the daemon's death row";
      }},
 };
 

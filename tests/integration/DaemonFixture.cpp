@@ -3,6 +3,7 @@
 #include <dirent.h>
 #include <signal.h>
 #include <stdlib.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -111,7 +112,20 @@ void DaemonFixture::TearDown() {
     int status = stopDaemon();
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "daemon exit status " << status;
   }
+  if (!mountedHome.empty()) umount2(mountedHome.c_str(), MNT_DETACH);
   if (!root.empty() && !HasFailure()) system(("rm -rf " + root).c_str());
+}
+
+bool DaemonFixture::mountHomeOnTmpfs() {
+  const std::string home = root + "/private/var/mobile", disk = home + ".disk";
+  stopDaemon();
+  const bool mounted = rename(home.c_str(), disk.c_str()) == 0 && mkdir(home.c_str(), 0755) == 0 &&
+                       mount("quarterd-test", home.c_str(), "tmpfs", 0, "size=96m") == 0;
+  if (mounted) mountedHome = home;
+  else rmdir(home.c_str());
+  EXPECT_EQ(system(("cp -a " + disk + "/. " + home + (mounted ? "" : " && rm -rf " + disk)).c_str()), 0);
+  startDaemon();
+  return mounted;
 }
 
 void DaemonFixture::startDaemon() {
@@ -133,6 +147,7 @@ void DaemonFixture::startDaemon() {
 
 int DaemonFixture::stopDaemon() {
   int status = -1;
+  if (daemon <= 0) return status;  // kill(-1) would reach every process
   kill(daemon, SIGTERM);
   waitpid(daemon, &status, 0);
   daemon = -1;
@@ -145,6 +160,7 @@ void DaemonFixture::restartDaemon() {
 }
 
 void DaemonFixture::killDaemon() {
+  if (daemon <= 0) return;
   kill(daemon, SIGKILL);
   waitpid(daemon, nullptr, 0);
   daemon = -1;

@@ -69,12 +69,17 @@ class DaemonFixture : public ::testing::Test {
   void setOwnIdentity(const std::string& signingIdentifier, const plist::Dictionary& entitlements);
   void clearOwnIdentity();
 
+  // Moves user 501's home onto a tmpfs of its own, the daemon stopped
+  // around it; false (the daemon running as before) when mounting is refused.
+  bool mountHomeOnTmpfs();
+
   std::string logText() const;
   // Waits (up to 5 s) until the log holds the text.
   bool logContains(const std::string& text) const;
 
   std::string root;
   pid_t daemon = -1;
+  std::string mountedHome;
 };
 
 plist::Dictionary request(uint64_t command, plist::Dictionary keys = {});

@@ -62,15 +62,16 @@ class ReplaceTest : public DaemonFixture {
     return made;
   }
 
+  std::string base() const { return root + "/private/var/mobile/Containers"; }
+
   // Copies of the content with this marker anywhere under the device root
   // but on death row, which holds only what is already given up.
   int liveCopies(const std::string& marker) const {
     int count = 0;
     std::error_code ec;
-    const fs::path deathRow = deadDirectory();
     for (auto it = fs::recursive_directory_iterator(root, ec); it != fs::recursive_directory_iterator();
          it.increment(ec)) {
-      if (it->path() == deathRow) {
+      if (it->path() == deadDirectory() || it->path() == base() + "/.deathrow") {
         it.disable_recursion_pending();
       } else if (it->path().filename() == kMarkerFile && readFile(it->path().string()) == marker) {
         ++count;
@@ -101,6 +102,7 @@ class ReplaceTest : public DaemonFixture {
   void expectNothingInFlight() {
     EXPECT_TRUE(listDirectory(replaceDir()).empty());
     EXPECT_TRUE(listDirectory(stagingDir()).empty());
+    EXPECT_TRUE(listDirectory(base() + "/.staging").empty());
   }
 
   // The container of the identifier at path with uuid and marker, now and after a kill and restart.
@@ -200,10 +202,28 @@ TEST_F(ReplaceTest, PromotionMakesTransientContainerPermanent) {
   EXPECT_EQ(markerAt(permanent.path), "taken");
 }
 
-TEST_F(ReplaceTest, KilledReplaceOrWipeLeavesExactlyOneContentLive) {
+// With the home on the daemon's file system, or on a second one (a tmpfs),
+// where staging and death row are the user base's own.
+class ReplaceCrashTest : public ReplaceTest, public ::testing::WithParamInterface<bool> {};
+
+TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
 #ifndef QRT_TEST_HOOKS
   GTEST_SKIP() << "crash points need a build with test hooks";
 #endif
+  if (GetParam() && !mountHomeOnTmpfs()) GTEST_SKIP() << "cannot mount a tmpfs for the home";
+  // A creation is whole or absent; a deletion leaves the content on death row only.
+  for (auto [point, command, code] : {std::tuple{"create-after-build", 0, 21u}, {"create-after-move", 0, 1u},
+                                      {"delete-after-stage", 10, 21u}}) {
+    SCOPED_TRACE(point);
+    const std::string id = std::string("com.example.") + point;
+    if (command == 10) make(id, false, id);
+    crashAndRestart(command, with(byName(501, 2, id), {{"CreateIfNecessary", true}}), point);
+    Container live = lookup(id);
+    EXPECT_EQ(live.error, code);
+    if (live.error == 1) { EXPECT_TRUE(exists(live.path + "/Library/Caches")) << live.path; }
+    EXPECT_EQ(liveCopies(id), 0);
+    expectNothingInFlight();
+  }
   // Each point with whether the new content has reached its place by then.
   const std::pair<const char*, bool> points[] = {
       {"replace-after-journal", false},  {"replace-after-stage", false},     {"replace-after-cache-remove", false},
@@ -236,6 +256,9 @@ TEST_F(ReplaceTest, KilledReplaceOrWipeLeavesExactlyOneContentLive) {
     EXPECT_EQ(liveCopies(wipeId + "-old"), newInPlace ? 0 : 1);
   }
 }
+
+INSTANTIATE_TEST_SUITE_P(Home, ReplaceCrashTest, ::testing::Bool(),
+                         [](const auto& info) { return info.param ? "OnSecondFileSystem" : "OnDaemonsFileSystem"; });
 
 TEST_F(ReplaceTest, StartUpRecoveryActsOnlyOnValidJournals) {
   const std::string filled = root + "/filled-destination";

@@ -167,8 +167,7 @@ TEST_F(FileManagerTest, WhileLockedClassOneCanNeitherBeSetNorLeft) {
   EXPECT_EQ(protectionClassOf(path("was-one")), 1);
 }
 
-// Set-id bits and device nodes are the hostile suite's; a cross-device move
-// copies with this same walk.
+// Set-id bits and device nodes are the hostile suite's.
 TEST_F(FileManagerTest, CopyKeepsDataModeOwnerXattrsAclsAndLinks) {
   makeFile("src/sub/file", "payload");
   ASSERT_EQ(chown(path("src/sub/file").c_str(), 502, 503), 0);
