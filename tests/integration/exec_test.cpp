@@ -54,7 +54,7 @@ class ExecTest : public DaemonFixture {
 
   // The launcher with the arguments (behind a wrapper command), as root or
   // (uid given) as that user, on a terminal of its own, with an inherited
-  // descriptor 5 and variables that must not reach the program.
+  // descriptor 99 and variables that must not reach the program.
   Launched launch(const std::vector<std::string>& args, uid_t asUser = 0, std::vector<std::string> command = {},
                   const std::string& input = "/dev/null") {
     const std::string out = root + "/exec.out", err = root + "/exec.err";
@@ -65,7 +65,7 @@ class ExecTest : public DaemonFixture {
     if (child == 0) {
       int o = open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0666), e = open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0666);
       int i = open(input.c_str(), O_RDONLY);
-      if (o < 0 || e < 0 || i < 0 || dup2(o, 1) < 0 || dup2(e, 2) < 0 || dup2(i, 0) < 0 || dup2(i, 5) < 0) _exit(120);
+      if (o < 0 || e < 0 || i < 0 || dup2(o, 1) < 0 || dup2(e, 2) < 0 || dup2(i, 0) < 0 || dup2(i, 99) < 0) _exit(120);
       if (setsid() < 0 || open(ptsname(pty), O_RDWR | O_CLOEXEC) < 0) _exit(123);
       setenv("LD_LIBRARY_PATH", "/nowhere", 1);
       setenv("TERM", "xterm-test", 1);
@@ -122,7 +122,7 @@ TEST_F(ExecTest, ProgramReachesItsContainersAndNothingElse) {
       {"c:/proc/self/status", "ok"},  // a child's own entry
       {"r:/proc/1/environ", "EACCES"},
       {"c:/dev/tty", "ok"},
-      {"f:5", "EBADF"},  // inherited by the launcher
+      {"f:99", "EBADF"},  // inherited by the launcher
       {"e:LD_LIBRARY_PATH", "unset"},
       {"e:TERM", "xterm-test"},
       {"e:PATH", "/usr/local/bin:/usr/bin:/bin"},
