@@ -321,8 +321,10 @@ class Ruleset {
   // itself: run by the confined program (with a library of its own
   // preloaded), they would lend it their identity.
   int allowPrograms(const char* path, const std::set<FileId>& excluded, std::set<FileId>* seen) {
-    if (abi_ <= 0) return 0;
-    return forEachFile(path, [&](int fd, const struct stat& st, const char*) {
+    struct stat dir;
+    // /bin is /usr/bin on a merged /usr: one walk.
+    if (abi_ <= 0 || stat(path, &dir) != 0 || !seen->insert({dir.st_dev, dir.st_ino}).second) return 0;
+    return forEachFile(path, [](const char*) { return true; }, [&](int fd, const struct stat& st) {
       const bool program = S_ISREG(st.st_mode) && (st.st_mode & 0111) && st.st_uid == 0 && !(st.st_mode & 022);
       if (!program || excluded.count({st.st_dev, st.st_ino}) || !seen->insert({st.st_dev, st.st_ino}).second) return 0;
       return allow(fd, kExecute | kReadFile, false);
@@ -332,31 +334,31 @@ class Ruleset {
   // The dynamic loaders (ld-*.so*), which the kernel executes for a program.
   int allowLoaders(const char* path) {
     if (abi_ <= 0) return 0;
-    return forEachFile(path, [&](int fd, const struct stat& st, const char* name) {
-      return S_ISREG(st.st_mode) && st.st_uid == 0 && strncmp(name, "ld-", 3) == 0 && strstr(name, ".so")
-                 ? allow(fd, kExecute | kReadFile, false)
-                 : 0;
-    });
+    return forEachFile(
+        path, [](const char* name) { return strncmp(name, "ld-", 3) == 0 && strstr(name, ".so"); },
+        [&](int fd, const struct stat& st) {
+          return S_ISREG(st.st_mode) && st.st_uid == 0 ? allow(fd, kExecute | kReadFile, false) : 0;
+        });
   }
 
   int restrictSelf() { return abi_ <= 0 || syscall(SYS_landlock_restrict_self, fd_, 0) == 0 ? 0 : errno; }
 
  private:
-  // fn(fd, st, name) for each entry of a system directory, links followed
-  // (root's own); a missing directory is nothing to do.
-  template <typename Fn>
-  static int forEachFile(const char* path, Fn fn) {
+  // fn(fd, st) for each entry of a system directory whose name wanted(name)
+  // accepts, links followed (root's own); a missing directory is nothing to do.
+  template <typename Wanted, typename Fn>
+  static int forEachFile(const char* path, Wanted wanted, Fn fn) {
     int dirFd = open(path, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
     if (dirFd < 0) return errno == ENOENT || errno == ENOTDIR ? 0 : errno;
     DIR* listing = fdopendir(dirFd);
     if (!listing) return close(dirFd), errno;
     int err = 0;
     while (dirent* entry = readdir(listing)) {
-      if (entry->d_name[0] == '.') continue;
+      if (entry->d_name[0] == '.' || !wanted(entry->d_name)) continue;
       int fd = openat(dirFd, entry->d_name, O_PATH | O_CLOEXEC);
       struct stat st;
       if (fd < 0) continue;  // a dangling link
-      if (fstat(fd, &st) == 0) err = fn(fd, st, entry->d_name);
+      if (fstat(fd, &st) == 0) err = fn(fd, st);
       close(fd);
       if (err) break;
     }
