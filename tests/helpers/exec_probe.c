@@ -18,42 +18,30 @@
 
 static int tryAccess(char op, const char* path) {
   if (op == 'u') return unlink(path) == 0;
-  if (op == 'n') {
-    struct sockaddr_in to = {.sin_family = AF_INET, .sin_port = htons(atoi(path)), .sin_addr = {htonl(INADDR_LOOPBACK)}};
-    int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    int ok = fd >= 0 && connect(fd, (struct sockaddr*)&to, sizeof to) == 0;
-    if (fd >= 0) close(fd);
-    return ok;
-  }
-  int fd = op == 'w' ? open(path, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644) : open(path, O_RDONLY | O_CLOEXEC);
-  int ok = fd >= 0 && (op != 'w' || write(fd, "probe\n", 6) == 6);
+  if (op == 'f') return fcntl(atoi(path), F_GETFD) >= 0;
+  struct sockaddr_in to = {.sin_family = AF_INET, .sin_port = htons(atoi(path)), .sin_addr = {htonl(INADDR_LOOPBACK)}};
+  int fd = op == 'n'   ? socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)
+           : op == 'w' ? open(path, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0755)
+                       : open(path, O_RDONLY | O_CLOEXEC);
+  int ok = fd >= 0 && (op != 'w' || write(fd, "probe\n", 6) == 6) &&
+           (op != 'n' || connect(fd, (struct sockaddr*)&to, sizeof to) == 0);
   if (fd >= 0) close(fd);
   return ok;
 }
 
-// Copies standard input to lib and runs argv with it preloaded.
-static int preloaded(const char* lib, char** argv) {
-  int fd = open(lib, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0755);
-  char buffer[65536];
-  for (ssize_t n; fd >= 0 && (n = read(0, buffer, sizeof buffer)) > 0;)
-    if (write(fd, buffer, (size_t)n) != n) return 0;
-  if (fd < 0) return 0;
-  close(fd);
+// Runs argv (a read of path when argv is NULL) in a child; its errno or status.
+static int inChild(const char* path, char** argv, char** env) {
   fflush(stdout);
   pid_t child = fork();
-  if (child == 0) {
-    char preload[4096];
-    snprintf(preload, sizeof preload, "LD_PRELOAD=%s", lib);
-    char* env[] = {preload, NULL};
-    execve(argv[0], argv, env);
-    dprintf(1, "exec %s\n", strerrorname_np(errno));
-    _exit(127);
-  }
+  if (child == 0 && !argv) _exit(tryAccess('r', path) ? 0 : errno);
+  if (child == 0) execve(argv[0], argv, env), dprintf(1, "exec %s\n", strerrorname_np(errno)), _exit(127);
   int status = 0;
-  return waitpid(child, &status, 0) == child && WIFEXITED(status) && WEXITSTATUS(status) == 0 ? 1 : (errno = 0, 0);
+  waitpid(child, &status, 0);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
 int main(int argc, char** argv) {
+  char buffer[1 << 16], preload[4096];
   for (int i = 1; i < argc; ++i) {
     const char op = argv[i][0], *arg = argv[i] + 2;
     int ok = 1;
@@ -61,18 +49,13 @@ int main(int argc, char** argv) {
     if (op == 'e') {
       printf("%s\n", getenv(arg) ? getenv(arg) : "unset");
       continue;
-    } else if (op == 'f') {
-      ok = fcntl(atoi(arg), F_GETFD) >= 0;
     } else if (op == 'c') {
-      fflush(stdout);
-      pid_t child = fork();
-      if (child == 0) _exit(tryAccess('r', arg) ? 0 : errno);
-      int status = 0;
-      waitpid(child, &status, 0);
-      ok = WIFEXITED(status) && WEXITSTATUS(status) == 0;
-      errno = WIFEXITED(status) ? WEXITSTATUS(status) : 0;
-    } else if (op == 'x') {
-      ok = preloaded(arg, argv + i + 1);
+      ok = !(errno = inChild(arg, NULL, NULL));
+    } else if (op == 'x') {  // the library from standard input, then the command with it preloaded
+      int fd = open(arg, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0755);
+      for (ssize_t n; fd >= 0 && (n = read(0, buffer, sizeof buffer)) > 0;) ok &= write(fd, buffer, (size_t)n) == n;
+      snprintf(preload, sizeof preload, "LD_PRELOAD=%s", arg);
+      ok = fd >= 0 && ok && close(fd) == 0 && inChild(NULL, argv + i + 1, (char*[]){preload, NULL}) == 0;
       i = argc;
     } else {
       ok = tryAccess(op, arg);
