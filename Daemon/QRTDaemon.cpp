@@ -55,6 +55,9 @@ int gLastAppliedLockState = 3;
 // The listener is made by the main thread and stopped by the SIGTERM thread.
 std::mutex gListenerLock;
 std::unique_ptr<platform::RequestListener> gListener;
+// Kept for the life of the process and never destroyed, not even by exit:
+// its threads may still be running then.
+platform::UpcallListener* gUpcallListener = nullptr;
 bool gTerminating = false;
 
 struct Options {
@@ -207,6 +210,7 @@ void stopListener() {
   std::lock_guard<std::mutex> hold(gListenerLock);
   gTerminating = true;
   if (gListener) gListener->stopAccepting();
+  if (gUpcallListener) gUpcallListener->stopAccepting();
 }
 
 }  // namespace
@@ -238,12 +242,15 @@ void set_first_boot_work_completed() {
 }
 
 bool QRTKernServerStart() {
-  // Served only from the main queue, which runs once start-up is over. Kept
-  // for the life of the process and never destroyed, not even by exit: its
-  // threads may still be running then.
-  static platform::UpcallListener* listener = nullptr;
+  // Served only from the main queue, which runs once start-up is over.
   const std::string path = platform::hostPath("/run/com.norvane.quarterd.upcall");
-  listener = platform::UpcallListener::create(path, platform::mainQueue(), demux_server).release();
+  platform::UpcallListener* listener =
+      platform::UpcallListener::create(path, platform::mainQueue(), demux_server).release();
+  {
+    std::lock_guard<std::mutex> hold(gListenerLock);
+    gUpcallListener = listener;
+    if (gTerminating && listener) listener->stopAccepting();  // SIGTERM came first
+  }
   if (!listener) {
     QRTLog(kLogError, "Failed to check in %s: %s", path.c_str(), strerror(errno));
     return false;

@@ -67,6 +67,7 @@ std::vector<uint8_t> encodeUpcallReply(const UpcallReply& reply) {
 
 struct UpcallListener::Impl {
   std::string path;
+  std::atomic<bool> stopping{false};
   Queue* queue = nullptr;
   UpcallHandler handler;
   UniqueFd listenFd;
@@ -88,7 +89,8 @@ void UpcallListener::Impl::acceptLoop(const std::shared_ptr<Impl>& self) {
         std::this_thread::sleep_for(std::chrono::milliseconds(100));
         continue;
       }
-      QRTLog(kLogError, "The upcall socket stops accepting: %s", strerror(errno));
+      if (!stopping.load())
+        QRTLog(kLogError, "The upcall socket stops accepting: %s", strerror(errno));
       return;
     }
     if (connections.fetch_add(1) >= kUpcallMaxConnections) {
@@ -173,6 +175,12 @@ UpcallListener::UpcallListener(std::shared_ptr<Impl> impl) : impl_(std::move(imp
 // with their peers.
 UpcallListener::~UpcallListener() {
   if (impl_->listenFd.get() >= 0) ::shutdown(impl_->listenFd.get(), SHUT_RDWR);
+}
+
+void UpcallListener::stopAccepting() {
+  if (impl_->stopping.exchange(true)) return;
+  ::shutdown(impl_->listenFd.get(), SHUT_RDWR);
+  if (int err = safeUnlink(impl_->path)) QRTLog(kLogError, "Cannot remove %s: %s", impl_->path.c_str(), strerror(err));
 }
 
 void UpcallListener::resume() {

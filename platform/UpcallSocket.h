@@ -65,6 +65,9 @@ class UpcallListener {
   ~UpcallListener();
   // Starts accepting.
   void resume();
+  // Stops accepting and removes the socket (a clean exit); connections being
+  // served finish.
+  void stopAccepting();
 
   struct Impl;
 

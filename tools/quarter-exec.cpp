@@ -11,7 +11,11 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <set>
+#include <utility>
+
 #include <cerrno>
+#include <cstddef>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
@@ -21,6 +25,7 @@
 #include <vector>
 
 #include "QuarterKit/Upcall.h"
+#include "base/PlistCodec.h"
 #include "platform/DeviceRoot.h"
 #include "platform/Identity.h"
 #include "platform/SafePath.h"
@@ -31,22 +36,28 @@ namespace {
 constexpr int kExitFailure = 1;
 constexpr int kExitUsage = 2;
 constexpr int kExitCannotExecute = 126;
+constexpr int kExitNotFound = 127;
 
-const char kUsage[] = R"(usage: quarter-exec [--root DIR] --user UID --identifier ID -- PROGRAM [ARGS...]
+const char kUsage[] = R"(usage: quarter-exec [--root DIR] [--no-network] [--allow-unconfined]
+                    --user UID --identifier ID -- PROGRAM [ARGS...]
 
-Runs PROGRAM as user UID, confined to the containers quarterd gives the program
-ID: read and write beneath its data container (HOME and TMPDIR point there),
-its application group, system and system group containers; read and execute of
-PROGRAM and the system's libraries, and reading its own /proc entry; nothing
-else. Must be run as root.
+Runs PROGRAM as user UID, confined with Landlock to the containers quarterd
+gives the program ID: read and write beneath its data container (HOME, TMPDIR
+and the XDG_*_HOME directories lie there), its application group, system and
+system group containers; execution of PROGRAM and of the system's programs
+(never of another registered program, nor of anything in a container); reading
+the system's files and /proc; /dev/tty. It starts with a clean environment and
+no descriptor but 0, 1 and 2. Must be run as root; UID may not be 0.
 
 Options:
-  --root DIR         the device root of the daemon to ask (default /)
-  --user UID         the user to run as and whose containers to use
-  --identifier ID    the program's signing identifier; PROGRAM must be registered
-                     under it in DIR/etc/quarterd/identities
-  -h, --help         print this text and exit
-  -V, --version      print the version and exit
+  --root DIR          the device root of the daemon to ask (default /)
+  --user UID          the user to run as and whose containers to use
+  --identifier ID     the program's signing identifier; PROGRAM must be registered
+                      under it in DIR/etc/quarterd/identities
+  --no-network        no TCP bind or connect (Landlock ABI 4 or later)
+  --allow-unconfined  run even when the kernel cannot confine as asked
+  -h, --help          print this text and exit
+  -V, --version       print the version and exit
 )";
 
 // Landlock's user interface, declared here: the system headers may predate
@@ -81,6 +92,8 @@ enum : uint64_t {
   kTruncate = 1ull << 14,  // ABI 3
   kIoctlDev = 1ull << 15,  // ABI 5
 };
+constexpr uint64_t kNetBindTcp = 1ull << 0;     // ABI 4
+constexpr uint64_t kNetConnectTcp = 1ull << 1;  // ABI 4
 constexpr uint64_t kScopeAbstractUnixSocket = 1ull << 0;  // ABI 6
 constexpr uint64_t kScopeSignal = 1ull << 1;              // ABI 6
 // Rights that apply to a file rather than to what lies beneath a directory.
@@ -89,7 +102,16 @@ constexpr uint64_t kFileRights = kExecute | kWriteFile | kReadFile | kTruncate |
 // device nodes.
 constexpr uint64_t kContainerRights = kWriteFile | kReadFile | kReadDir | kRemoveDir | kRemoveFile | kMakeDir |
                                       kMakeReg | kMakeSock | kMakeFifo | kMakeSym | kRefer | kTruncate;
-constexpr uint64_t kSystemRights = kExecute | kReadFile | kReadDir;
+constexpr uint64_t kReadRights = kReadFile | kReadDir;
+// A container's top directory: dotfiles may be made and written there, but
+// nothing removed or replaced, so the daemon's metadata file stays.
+constexpr uint64_t kContainerTopRights = kReadFile | kReadDir | kWriteFile | kTruncate | kMakeDir | kMakeReg |
+                                         kMakeSym | kMakeFifo | kMakeSock;
+// Where system programs may live; each of their files is allowed on its own.
+constexpr const char* kProgramDirectories[] = {"/usr/local/sbin", "/usr/local/bin", "/usr/sbin", "/usr/bin",
+                                               "/sbin",           "/bin",           "/usr/games"};
+constexpr const char* kLibraryDirectories[] = {"/lib",     "/lib64",     "/lib32",     "/libx32",
+                                               "/usr/lib", "/usr/lib64", "/usr/lib32", "/usr/libx32"};
 constexpr const char* kMetadataFileName = ".com.norvane.quarter_kit.metadata.plist";
 
 struct Options {
@@ -97,6 +119,8 @@ struct Options {
   std::optional<uint32_t> user;
   std::string identifier;
   std::vector<std::string> command;
+  bool noNetwork = false;
+  bool allowUnconfined = false;
   bool help = false;
   bool version = false;
 };
@@ -111,10 +135,12 @@ struct UsageError {
 };
 
 Options parseOptions(int argc, char** argv) {
-  enum { kRoot = 1000, kUser, kIdentifier };
+  enum { kRoot = 1000, kUser, kIdentifier, kNoNetwork, kAllowUnconfined };
   static const option kLong[] = {
       {"root", required_argument, nullptr, kRoot},   {"user", required_argument, nullptr, kUser},
       {"identifier", required_argument, nullptr, kIdentifier},
+      {"no-network", no_argument, nullptr, kNoNetwork},
+      {"allow-unconfined", no_argument, nullptr, kAllowUnconfined},
       {"help", no_argument, nullptr, 'h'},           {"version", no_argument, nullptr, 'V'},
       {nullptr, 0, nullptr, 0},
   };
@@ -129,10 +155,13 @@ Options parseOptions(int argc, char** argv) {
         unsigned long uid = strtoul(optarg, &end, 10);
         if (errno || !*optarg || *end || optarg[0] == '-' || uid >= UINT32_MAX)
           throw UsageError{"--user takes a numeric user id, not '" + std::string(optarg) + "'"};
+        if (uid == 0) throw UsageError{"--user 0: root cannot be confined (it keeps every capability)"};
         options.user = static_cast<uint32_t>(uid);
         break;
       }
       case kIdentifier: options.identifier = optarg; break;
+      case kNoNetwork: options.noNetwork = true; break;
+      case kAllowUnconfined: options.allowUnconfined = true; break;
       case 'h': options.help = true; break;
       case 'V': options.version = true; break;
       case ':': throw UsageError{std::string(argv[optind - 1]) + " needs a value"};
@@ -186,10 +215,37 @@ std::vector<std::string> stringsOf(const std::optional<plist::Dictionary>& entit
   return out;
 }
 
+using FileId = std::pair<dev_t, ino_t>;
+
+// The files the identity registry names, with the identifier each is
+// registered under. Paths are looked at as the daemon looks at them, links
+// followed: that is the file an exec of the path runs.
+std::vector<std::pair<FileId, std::string>> registeredFiles() {
+  std::vector<std::pair<FileId, std::string>> files;
+  platform::UniqueFd dir;
+  if (platform::safeOpen(platform::hostPath("/etc/quarterd/identities"), O_RDONLY | O_DIRECTORY, &dir)) return files;
+  DIR* listing = fdopendir(dup(dir.get()));
+  if (!listing) return files;
+  while (dirent* entry = readdir(listing)) {
+    std::string bytes;
+    if (entry->d_name[0] == '.' || platform::readFileAt(dir.get(), entry->d_name, &bytes, 1u << 20)) continue;
+    std::optional<plist::Value> value = plist::parse(bytes.data(), bytes.size());
+    const plist::Dictionary* entryDict = value ? value->dictionaryIf() : nullptr;
+    const plist::Value* executable = entryDict ? plist::find(*entryDict, "Executable") : nullptr;
+    const plist::Value* identifier = entryDict ? plist::find(*entryDict, "SigningIdentifier") : nullptr;
+    struct stat st;
+    if (!executable || !executable->stringIf() || stat(executable->stringIf()->c_str(), &st) != 0) continue;
+    const std::string* id = identifier ? identifier->stringIf() : nullptr;
+    files.emplace_back(FileId{st.st_dev, st.st_ino}, id ? *id : std::string());
+  }
+  closedir(listing);
+  return files;
+}
+
 class Ruleset {
  public:
   // abi 0: Landlock is absent and nothing is enforced.
-  explicit Ruleset(int abi) : abi_(abi) {
+  Ruleset(int abi, bool noNetwork) : abi_(abi) {
     if (abi_ <= 0) return;
     handled_ = (1ull << 13) - 1;
     if (abi_ >= 2) handled_ |= kRefer;
@@ -197,6 +253,11 @@ class Ruleset {
     if (abi_ >= 5) handled_ |= kIoctlDev;
     RulesetAttr attr{handled_, 0, 0};
     size_t size = sizeof attr.handledAccessFs;
+    if (abi_ >= 4 && noNetwork) {
+      // Handled with no rule: every TCP bind and connect is refused.
+      attr.handledAccessNet = kNetBindTcp | kNetConnectTcp;
+      size = offsetof(RulesetAttr, scoped);
+    }
     if (abi_ >= 6) {
       // Nor may the program signal, or reach the abstract sockets of,
       // processes outside its confinement.
@@ -228,13 +289,13 @@ class Ruleset {
     return err;
   }
 
-  // Everything beneath a container but its metadata file, which only the
-  // daemon writes; the container's top directory itself is only listed.
+  // Everything beneath a container's items; at its top, where the daemon's
+  // metadata file lies, new items only.
   int allowContainer(const std::string& path) {
     if (abi_ <= 0) return 0;
     platform::UniqueFd dir;
     if (int err = platform::safeOpen(path, O_RDONLY | O_DIRECTORY, &dir)) return err;
-    if (int err = allow(dir.get(), kReadDir, true)) return err;
+    if (int err = allow(dir.get(), kContainerTopRights, true)) return err;
     DIR* listing = fdopendir(dup(dir.get()));
     if (!listing) return errno;
     int err = 0;
@@ -255,9 +316,56 @@ class Ruleset {
     return err;
   }
 
+  // Execution of each root-owned program file in the directory that no one
+  // else can write, but for the registered ones other than the program
+  // itself: run by the confined program (with a library of its own
+  // preloaded), they would lend it their identity.
+  int allowPrograms(const char* path, const std::set<FileId>& excluded, std::set<FileId>* seen) {
+    struct stat dir;
+    // /bin is /usr/bin on a merged /usr: one walk.
+    if (abi_ <= 0 || stat(path, &dir) != 0 || !seen->insert({dir.st_dev, dir.st_ino}).second) return 0;
+    return forEachFile(path, [](const char*) { return true; }, [&](int fd, const struct stat& st) {
+      const bool program = S_ISREG(st.st_mode) && (st.st_mode & 0111) && st.st_uid == 0 && !(st.st_mode & 022);
+      if (!program || excluded.count({st.st_dev, st.st_ino}) || !seen->insert({st.st_dev, st.st_ino}).second) return 0;
+      return allow(fd, kExecute | kReadFile, false);
+    });
+  }
+
+  // The dynamic loaders (ld-*.so*), which the kernel executes for a program.
+  int allowLoaders(const char* path) {
+    if (abi_ <= 0) return 0;
+    return forEachFile(
+        path, [](const char* name) { return strncmp(name, "ld-", 3) == 0 && strstr(name, ".so"); },
+        [&](int fd, const struct stat& st) {
+          return S_ISREG(st.st_mode) && st.st_uid == 0 ? allow(fd, kExecute | kReadFile, false) : 0;
+        });
+  }
+
   int restrictSelf() { return abi_ <= 0 || syscall(SYS_landlock_restrict_self, fd_, 0) == 0 ? 0 : errno; }
 
  private:
+  // fn(fd, st) for each entry of a system directory whose name wanted(name)
+  // accepts, links followed (root's own); a missing directory is nothing to do.
+  template <typename Wanted, typename Fn>
+  static int forEachFile(const char* path, Wanted wanted, Fn fn) {
+    int dirFd = open(path, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (dirFd < 0) return errno == ENOENT || errno == ENOTDIR ? 0 : errno;
+    DIR* listing = fdopendir(dirFd);
+    if (!listing) return close(dirFd), errno;
+    int err = 0;
+    while (dirent* entry = readdir(listing)) {
+      if (entry->d_name[0] == '.' || !wanted(entry->d_name)) continue;
+      int fd = openat(dirFd, entry->d_name, O_PATH | O_CLOEXEC);
+      struct stat st;
+      if (fd < 0) continue;  // a dangling link
+      if (fstat(fd, &st) == 0) err = fn(fd, st);
+      close(fd);
+      if (err) break;
+    }
+    closedir(listing);
+    return err;
+  }
+
   int abi_;
   int fd_ = -1;
   uint64_t handled_ = 0;
@@ -266,6 +374,39 @@ class Ruleset {
 int landlockABI() {
   long abi = syscall(SYS_landlock_create_ruleset, nullptr, 0, kCreateRulesetVersion);
   return abi < 0 ? 0 : static_cast<int>(abi);
+}
+
+// Variables passed through from the launcher's environment; everything
+// else (LD_* above all) is left behind.
+bool passedThrough(const char* entry) {
+  for (const char* name : {"TERM=", "LANG=", "TZ=", "COLORTERM=", "NO_COLOR=", "LC_"})
+    if (strncmp(entry, name, strlen(name)) == 0) return true;
+  return false;
+}
+
+std::vector<std::string> cleanEnvironment(const std::string& home, const std::string& tmp) {
+  std::vector<std::string> env;
+  for (char** entry = environ; *entry; ++entry)
+    if (passedThrough(*entry)) env.emplace_back(*entry);
+  env.push_back("PATH=/usr/local/bin:/usr/bin:/bin");
+  env.push_back("HOME=" + home);
+  env.push_back("TMPDIR=" + tmp);
+  env.push_back("XDG_CONFIG_HOME=" + home + "/Library/Preferences");
+  env.push_back("XDG_CACHE_HOME=" + home + "/Library/Caches");
+  env.push_back("XDG_DATA_HOME=" + home + "/Library/Application Support");
+  env.push_back("XDG_STATE_HOME=" + home + "/Library/Application Support/State");
+  return env;
+}
+
+// The system's library directories, with the multiarch ones beneath /usr/lib.
+std::vector<std::string> libraryDirectories() {
+  std::vector<std::string> dirs(std::begin(kLibraryDirectories), std::end(kLibraryDirectories));
+  if (DIR* usrLib = opendir("/usr/lib")) {
+    while (dirent* entry = readdir(usrLib))
+      if (strstr(entry->d_name, "-linux-")) dirs.push_back(std::string("/usr/lib/") + entry->d_name);
+    closedir(usrLib);
+  }
+  return dirs;
 }
 
 int run(const Options& options) {
@@ -278,7 +419,7 @@ int run(const Options& options) {
 
   const std::string& name = options.command.front();
   std::optional<std::string> program = resolveProgram(name);
-  if (!program) return fail(kExitCannotExecute, "cannot find an executable " + name);
+  if (!program) return fail(kExitNotFound, "cannot find an executable " + name);
   auto account = platform::userById(*options.user);
   if (!account) return fail(kExitFailure, "no account for user " + std::to_string(*options.user));
 
@@ -291,6 +432,29 @@ int run(const Options& options) {
   if (*identity->signingIdentifier != options.identifier)
     return fail(kExitFailure, "unknown identifier " + options.identifier + ": " + *program + " is registered as " +
                                   *identity->signingIdentifier + " in " + registry);
+  struct stat programStat;
+  if (stat(program->c_str(), &programStat) != 0)
+    return fail(kExitCannotExecute, "cannot execute " + *program + ": " + strerror(errno));
+  const FileId programId{programStat.st_dev, programStat.st_ino};
+  std::set<FileId> otherPrograms;
+  for (const auto& [file, identifier] : registeredFiles()) {
+    // Another name of this very file could be executed as another program.
+    if (file == programId && identifier != options.identifier)
+      return fail(kExitFailure, *program + " is also registered as " + identifier + " under another name in " +
+                                    registry + "; it cannot be confined to one identity");
+    if (file != programId) otherPrograms.insert(file);
+  }
+
+  const int abi = landlockABI();
+  if (abi <= 0 && !options.allowUnconfined)
+    return fail(kExitFailure, "the kernel offers no Landlock (" + std::string(strerror(errno)) + "); refusing to run " +
+                                  *program + " unconfined (--allow-unconfined runs it anyway)");
+  if (options.noNetwork && abi < 4 && !options.allowUnconfined)
+    return fail(kExitFailure, "--no-network needs Landlock ABI 4, the kernel offers " + std::to_string(abi) +
+                                  " (--allow-unconfined runs it with the network)");
+  if (abi <= 0 || (options.noNetwork && abi < 4))
+    fprintf(stderr, "quarter-exec: warning: %s runs without %s confinement (--allow-unconfined)\n", program->c_str(),
+            abi <= 0 ? "any" : "network");
 
   qk::UpcallRequest request;
   request.codeSignatureId = options.identifier;
@@ -319,32 +483,34 @@ int run(const Options& options) {
   if (answer->systemContainer) containers.push_back(*answer->systemContainer);
   for (const auto& [group, path] : answer->systemGroups) containers.push_back(path);
 
-  const int abi = landlockABI();
-  if (abi <= 0)
-    fprintf(stderr, "quarter-exec: warning: the kernel offers no Landlock (%s); %s runs without file-system confinement\n",
-            strerror(errno), program->c_str());
-  Ruleset rules(abi);
+  Ruleset rules(abi, options.noNetwork);
   if (!rules.valid()) return fail(kExitFailure, std::string("cannot create the Landlock ruleset: ") + strerror(errno));
   for (const std::string& container : containers)
     if (int err = rules.allowContainer(container))
       return fail(kExitFailure, "cannot open up " + container + ": " + strerror(err));
-  for (const char* dir : {"/usr", "/lib", "/lib64", "/lib32", "/libx32", "/bin", "/sbin", "/etc"})
-    if (int err = rules.allowSystemPath(dir, strcmp(dir, "/etc") == 0 ? kReadFile | kReadDir : kSystemRights))
+  // Reading the system's files and every process's /proc entries (what the
+  // kernel shows of other processes stays subject to its ptrace checks, which
+  // Landlock extends to everything outside the confinement): a program's
+  // children have /proc entries of their own.
+  for (const char* dir : {"/usr", "/lib", "/lib64", "/lib32", "/libx32", "/bin", "/sbin", "/etc", "/proc"})
+    if (int err = rules.allowSystemPath(dir, kReadRights))
       return fail(kExitFailure, std::string("cannot open up ") + dir + ": " + strerror(err));
-  // Its own process directory: /proc/self names this process, which the
-  // program becomes.
-  if (int err = rules.allowSystemPath("/proc/self", kReadFile | kReadDir))
-    return fail(kExitFailure, std::string("cannot open up /proc/self: ") + strerror(err));
-  for (const char* device : {"/dev/null", "/dev/zero", "/dev/full", "/dev/random", "/dev/urandom"})
-    if (int err = rules.allowSystemPath(device, kReadFile | kWriteFile))
+  std::set<FileId> seen;
+  for (const char* dir : kProgramDirectories)
+    if (int err = rules.allowPrograms(dir, otherPrograms, &seen))
+      return fail(kExitFailure, std::string("cannot open up ") + dir + ": " + strerror(err));
+  for (const std::string& dir : libraryDirectories())
+    if (int err = rules.allowLoaders(dir.c_str()))
+      return fail(kExitFailure, "cannot open up " + dir + ": " + strerror(err));
+  for (const char* device : {"/dev/null", "/dev/zero", "/dev/full", "/dev/random", "/dev/urandom", "/dev/tty"})
+    if (int err = rules.allowSystemPath(device, kReadFile | kWriteFile | (strcmp(device, "/dev/tty") ? 0ull : uint64_t{kIoctlDev})))
       return fail(kExitFailure, std::string("cannot open up ") + device + ": " + strerror(err));
   if (int err = rules.allowSystemPath(program->c_str(), kExecute | kReadFile))
     return fail(kExitFailure, "cannot open up " + *program + ": " + strerror(err));
 
-  setenv("HOME", answer->dataContainer->c_str(), 1);
-  if (answer->tempDir) setenv("TMPDIR", answer->tempDir->c_str(), 1);
-  if (chdir(answer->dataContainer->c_str()) != 0)
-    return fail(kExitFailure, "cannot enter " + *answer->dataContainer + ": " + strerror(errno));
+  const std::string& home = *answer->dataContainer;
+  std::vector<std::string> env = cleanEnvironment(home, answer->tempDir.value_or(home + "/tmp"));
+  if (chdir(home.c_str()) != 0) return fail(kExitFailure, "cannot enter " + home + ": " + strerror(errno));
 
   // No set-id program may regain what is dropped here, and Landlock asks for
   // it anyway.
@@ -355,11 +521,17 @@ int run(const Options& options) {
   if (setgroups(1, &gid) != 0 || setresgid(gid, gid, gid) != 0 || setresuid(*options.user, *options.user, *options.user) != 0)
     return fail(kExitFailure, "cannot drop to user " + std::to_string(*options.user) + ": " + strerror(errno));
 
-  std::vector<char*> argv;
+  std::vector<char*> argv, envp;
   for (const std::string& arg : options.command) argv.push_back(const_cast<char*>(arg.c_str()));
   argv.push_back(nullptr);
-  execv(program->c_str(), argv.data());
-  return fail(kExitCannotExecute, "cannot execute " + *program + ": " + strerror(errno));
+  for (const std::string& entry : env) envp.push_back(const_cast<char*>(entry.c_str()));
+  envp.push_back(nullptr);
+  // Whatever the launcher inherited stays behind; 0, 1 and 2 are the program's.
+  if (close_range(3, ~0u, CLOSE_RANGE_CLOEXEC) != 0)
+    return fail(kExitFailure, std::string("cannot close inherited descriptors: ") + strerror(errno));
+  execve(program->c_str(), argv.data(), envp.data());
+  const int err = errno;
+  return fail(err == ENOENT ? kExitNotFound : kExitCannotExecute, "cannot execute " + *program + ": " + strerror(err));
 }
 
 }  // namespace

@@ -81,7 +81,9 @@ bool QRTClientConnection::_createSubDirectories(const QRTURL& url, uint32_t user
     count = std::size(kDataSubDirectories);
   }
   const bool system = QRTIsSystemClass(containerClass);
-  const mode_t mode = system ? 0000 : 0755;
+  // A system container's group bits are its ACL mask (owner, group and other
+  // entries stay empty): 0000 would cut the systemusers entry down to nothing.
+  const mode_t mode = system ? 0070 : 0755;
   const uint32_t owner = system ? kNobodyId : userId;
   for (size_t i = 0; i < count; ++i) {
     QRTErrorRef underlying;

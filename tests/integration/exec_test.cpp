@@ -2,6 +2,7 @@
 // cannot reach, and whom it refuses.
 #include <fcntl.h>
 #include <limits.h>
+#include <stdlib.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -41,28 +42,49 @@ class ExecTest : public DaemonFixture {
     ASSERT_NE(realpath(probe.c_str(), resolved), nullptr);
     setIdentity("probe", resolved, "com.example.a",
                 {{"com.norvane.security.application-groups", plist::Array{"group.com.example.shared"}}});
+    // An entitled program where the system keeps its programs.
+    entitled = "/usr/local/bin/qrt-exec-test-entitled-" + std::to_string(getpid());
+    std::filesystem::copy_file(QRT_QUARTERCTL_PATH, entitled, std::filesystem::copy_options::overwrite_existing);
+    setIdentity("entitled", entitled, "com.example.entitled", {{"com.norvane.private.QuarterKit.allowed", true}});
+  }
+  void TearDown() override {
+    unlink(entitled.c_str());
+    DaemonFixture::TearDown();
   }
 
-  // The launcher with the arguments, as root or (uid given) as that user.
-  Launched launch(const std::vector<std::string>& args, uid_t asUser = 0) {
+  // The launcher with the arguments (behind a wrapper command), as root or
+  // (uid given) as that user, on a terminal of its own, with an inherited
+  // descriptor 99 and variables that must not reach the program.
+  Launched launch(const std::vector<std::string>& args, uid_t asUser = 0, std::vector<std::string> command = {},
+                  const std::string& input = "/dev/null") {
     const std::string out = root + "/exec.out", err = root + "/exec.err";
+    // The terminal's master stays here: its last close would hang the program up.
+    int pty = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
+    EXPECT_TRUE(pty >= 0 && grantpt(pty) == 0 && unlockpt(pty) == 0);
     pid_t child = fork();
     if (child == 0) {
       int o = open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0666), e = open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0666);
-      if (o < 0 || e < 0 || dup2(o, 1) < 0 || dup2(e, 2) < 0) _exit(120);
+      int i = open(input.c_str(), O_RDONLY);
+      if (o < 0 || e < 0 || i < 0 || dup2(o, 1) < 0 || dup2(e, 2) < 0 || dup2(i, 0) < 0 || dup2(i, 99) < 0) _exit(120);
+      if (setsid() < 0 || open(ptsname(pty), O_RDWR | O_CLOEXEC) < 0) _exit(123);
+      setenv("LD_LIBRARY_PATH", "/nowhere", 1);
+      setenv("TERM", "xterm-test", 1);
       if (asUser && (setresgid(asUser, asUser, asUser) != 0 || setresuid(asUser, asUser, asUser) != 0)) _exit(121);
-      std::vector<char*> argv{const_cast<char*>(launcher.c_str())};
-      for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
+      command.push_back(launcher);
+      command.insert(command.end(), args.begin(), args.end());
+      std::vector<char*> argv;
+      for (const std::string& a : command) argv.push_back(const_cast<char*>(a.c_str()));
       argv.push_back(nullptr);
-      execv(launcher.c_str(), argv.data());
+      execv(argv[0], argv.data());
       _exit(122);
     }
     int status = -1;
     waitpid(child, &status, 0);
-    return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, readFile(out), readFile(err)};
+    close(pty);
+    return {WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status), readFile(out), readFile(err)};
   }
 
-  std::string probe, launcher;
+  std::string probe, launcher, entitled;
 };
 
 TEST_F(ExecTest, ProgramReachesItsContainersAndNothingElse) {
@@ -87,7 +109,8 @@ TEST_F(ExecTest, ProgramReachesItsContainersAndNothingElse) {
       {"w:" + data + "/tmp/scratch", "ok"},
       {"w:" + group + "/Library/note", "ok"},
       {"w:" + data + metadata, "EACCES"},          // the daemon's file inside the program's own container
-      {"w:" + data + "/new-top-level-file", "EACCES"},
+      {"w:" + data + "/.dotfile", "ok"},  // made at the top, where nothing may be removed
+      {"u:" + data + metadata, "EACCES"},
       {"w:" + otherProgram.path + "/Documents/x", "EACCES"},  // same user: only Landlock stands in the way
       {"r:" + otherProgram.path + metadata, "EACCES"},
       {"w:" + otherUser.path + "/Documents/x", "EACCES"},
@@ -96,7 +119,18 @@ TEST_F(ExecTest, ProgramReachesItsContainersAndNothingElse) {
       {"w:" + database, "EACCES"},
       {"r:" + root + "/etc/passwd", "EACCES"},  // world-readable, outside every container
       {"r:/proc/self/status", "ok"},
-      {"r:/proc/1/status", "EACCES"},
+      {"c:/proc/self/status", "ok"},  // a child's own entry
+      {"r:/proc/1/environ", "EACCES"},
+      {"c:/dev/tty", "ok"},
+      {"f:99", "EBADF"},  // inherited by the launcher
+      {"e:LD_LIBRARY_PATH", "unset"},
+      {"e:TERM", "xterm-test"},
+      {"e:PATH", "/usr/local/bin:/usr/bin:/bin"},
+      {"e:HOME", data},
+      {"e:XDG_CONFIG_HOME", data + "/Library/Preferences"},
+      // The confined program stores a library and preloads it into a
+      // registered program, to act under that program's identity.
+      {"x:" + data + "/Library/l.so", "exec EACCES\nfailed"},
   };
   std::vector<std::string> args{"--root", root, "--user", "501", "--identifier", "com.example.a", "--", probe};
   std::string expected;
@@ -104,7 +138,8 @@ TEST_F(ExecTest, ProgramReachesItsContainersAndNothingElse) {
     args.push_back(c.access);
     expected += c.expected + "\n";
   }
-  Launched run = launch(args);
+  args.insert(args.end(), {entitled, "--root", root, "create", "--class", "2", "--user", "502", "--identifier", "stolen"});
+  Launched run = launch(args, 0, {}, QRT_EXEC_PRELOAD_PATH);
   ASSERT_EQ(run.status, 0) << run.err;
   EXPECT_EQ(run.out, expected);
   EXPECT_EQ(ownerAndMode(data + "/Documents/note").first, 501u) << "the program runs as the user";
@@ -112,26 +147,41 @@ TEST_F(ExecTest, ProgramReachesItsContainersAndNothingElse) {
 }
 
 TEST_F(ExecTest, RefusesWithClearMessages) {
+  const std::vector<std::string> noLandlock{QRT_SECCOMP_RUN_PATH, "--deny", "landlock_create_ruleset", "--"};
+  const std::vector<std::string> run{"--user", "501", "--identifier", "com.example.a", "--", probe};
+  auto with = [&](std::vector<std::string> before, std::vector<std::string> after = {}) {
+    before.insert(before.begin(), {"--root", root});
+    before.insert(before.end(), run.begin(), run.end());
+    before.insert(before.end(), after.begin(), after.end());
+    return before;
+  };
   struct Case {
     std::vector<std::string> args;
     uid_t user;
     int status;
-    std::string message;
+    std::string message, out;
+    std::vector<std::string> command;
   } cases[] = {
-      {{"--root", root, "--user", "501", "--identifier", "com.example.a", "--", probe}, 501, 1, "must be run as root"},
+      {with({}), 501, 1, "must be run as root", "", {}},
       {{"--root", root, "--user", "501", "--identifier", "com.example.nobody", "--", probe}, 0, 1,
-       "unknown identifier com.example.nobody: " + probe + " is registered as com.example.a"},
+       "unknown identifier com.example.nobody: " + probe + " is registered as com.example.a", "", {}},
       {{"--root", root, "--user", "501", "--identifier", "com.example.a", "--", "/bin/true"}, 0, 1,
-       "unknown identifier com.example.a: /usr/bin/true has no identity"},
-      {{"--root", root, "--user", "777", "--identifier", "com.example.a", "--", probe}, 0, 1, "no account for user 777"},
-      {{"--root", root, "--identifier", "com.example.a", "--", probe}, 0, 2, "--user is required"},
-      {{"--root", root, "--user", "501", "--identifier", "com.example.a"}, 0, 2, "no program given"},
+       "unknown identifier com.example.a: /usr/bin/true has no identity", "", {}},
+      {{"--root", root, "--user", "777", "--identifier", "com.example.a", "--", probe}, 0, 1, "no account for user 777", "", {}},
+      {{"--root", root, "--user", "0", "--identifier", "com.example.a", "--", probe}, 0, 2, "--user 0: root cannot be", "", {}},
+      {{"--root", root, "--identifier", "com.example.a", "--", probe}, 0, 2, "--user is required", "", {}},
+      {{"--root", root, "--user", "501", "--identifier", "com.example.a"}, 0, 2, "no program given", "", {}},
+      {{"--root", root, "--user", "501", "--identifier", "com.example.a", "--", "/no/such"}, 0, 127, "cannot find", "", {}},
+      {with({}), 0, 1, "the kernel offers no Landlock", "", noLandlock},
+      {with({"--allow-unconfined"}), 0, 0, "warning: " + probe + " runs without any confinement", "", noLandlock},
+      {with({}, {"n:1"}), 0, 0, "", "ECONNREFUSED\n", {}},
+      {with({"--no-network"}, {"n:1"}), 0, 0, "", "EACCES\n", {}},
   };
   for (const Case& c : cases) {
-    Launched run = launch(c.args, c.user);
-    EXPECT_EQ(run.status, c.status) << c.message << ": " << run.err;
-    EXPECT_TRUE(contains(run.err, "quarter-exec: " + c.message)) << run.err;
-    EXPECT_EQ(run.out, "") << c.message;
+    Launched launched = launch(c.args, c.user, c.command);
+    EXPECT_EQ(launched.status, c.status) << c.message << ": " << launched.err;
+    EXPECT_TRUE(contains(launched.err, c.message.empty() ? "" : "quarter-exec: " + c.message)) << launched.err;
+    EXPECT_EQ(launched.out, c.out) << c.message;
   }
 }
 

@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "DaemonFixture.h"
+#include "QuarterKit/Upcall.h"
 
 namespace {
 
@@ -73,6 +74,45 @@ TEST_F(ServiceTest, ReadyOnlyOnceRequestsAreServedAndStoppingOnSigterm) {
   waitpid(daemon, &status, 0);
   daemon = -1;
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+}
+
+// The daemon under the unit's own system-call filter (any call outside it
+// kills the process, as under the service manager) serves both sockets, makes
+// user and system containers, and removes both sockets on SIGTERM.
+TEST_F(ServiceTest, ServesUnderTheUnitsSystemCallFilterAndRemovesItsSocketsOnExit) {
+  const std::string unit = readFile(QRT_UNIT_PATH), key = "\nSystemCallFilter=";
+  const size_t at = unit.find(key);
+  ASSERT_NE(at, std::string::npos);
+  const std::string filter = unit.substr(at + key.size(), unit.find('\n', at + 1) - at - key.size());
+  ASSERT_EQ(stopDaemon(), 0);
+  daemon = fork();
+  if (daemon == 0) {
+    execl(QRT_SECCOMP_RUN_PATH, QRT_SECCOMP_RUN_PATH, "--filter", filter.c_str(), "--", QRT_DAEMON_PATH, "--root",
+          root.c_str(), nullptr);
+    _exit(127);
+  }
+  const std::string request = qk::requestSocketPath(root), upcall = qk::upcallSocketPath(root);
+  for (int i = 0; i < 400 && !exists(upcall); ++i) usleep(25000);
+  setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true}});
+  make(501, "com.example.app", 2);
+  EXPECT_EQ(codeOf(call(15, {{"Identifier", "com.norvane.mapsd"}})), 1u);
+  make(499, "com.norvane.mapsd", 12);
+  qk::UpcallRequest question;
+  question.codeSignatureId = "com.example.app";
+  question.personaId = 501;
+  auto client = qk::UpcallClient::connect(upcall);
+  ASSERT_TRUE(client);
+  auto answer = client->call(question);
+  EXPECT_TRUE(answer && answer->returnCode == 0 && answer->dataContainer);
+  client.reset();
+
+  kill(daemon, SIGTERM);
+  int status = -1;
+  waitpid(daemon, &status, 0);
+  daemon = -1;
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << (WIFSIGNALED(status) ? WTERMSIG(status) : -1);
+  EXPECT_FALSE(exists(request));
+  EXPECT_FALSE(exists(upcall));
 }
 
 TEST_F(ServiceTest, HangupReopensTheLogAfterOutsideRotation) {
