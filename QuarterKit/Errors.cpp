@@ -2,7 +2,7 @@
 
 #include <utility>
 
-namespace qk {
+namespace quarterkit {
 
 namespace {
 
@@ -70,4 +70,4 @@ std::string describeResult(uint64_t code) {
   return text ? out + " (" + text + ")" : out;
 }
 
-}  // namespace qk
+}  // namespace quarterkit

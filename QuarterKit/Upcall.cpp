@@ -12,7 +12,7 @@
 #include "base/Frame.h"
 #include "packbuff/packbuff.h"
 
-namespace qk {
+namespace quarterkit {
 
 namespace {
 
@@ -145,4 +145,4 @@ bool UpcallClient::closedByPeer() {
   return ::recv(fd_, &byte, 1, MSG_PEEK | MSG_DONTWAIT) == 0 || (p.revents & (POLLHUP | POLLERR));
 }
 
-}  // namespace qk
+}  // namespace quarterkit

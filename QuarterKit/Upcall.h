@@ -10,7 +10,7 @@
 #include <utility>
 #include <vector>
 
-namespace qk {
+namespace quarterkit {
 
 // R + "/run/com.norvane.quarterd.upcall".
 std::string upcallSocketPath(const std::string& deviceRoot = "/");
@@ -65,4 +65,6 @@ class UpcallClient {
   int fd_;
 };
 
-}  // namespace qk
+}  // namespace quarterkit
+
+namespace qk = quarterkit;
