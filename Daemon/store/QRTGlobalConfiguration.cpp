@@ -4,6 +4,7 @@
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTPerUserConfiguration.h"
 #include "platform/DeviceRoot.h"
+#include "platform/HostProfile.h"
 #include "platform/Log.h"
 #include "platform/UserDatabase.h"
 
@@ -24,7 +25,17 @@ QRTGlobalConfiguration& QRTGlobalConfiguration::sharedInstance() {
 QRTGlobalConfiguration::QRTGlobalConfiguration()
     : homeDirectory_(QRTURL::fileURL(platform::hostPath("/private/var/root/"), true)),
       emplacerdHomeDirectory_(QRTURL::fileURL(platform::hostPath("/private/var/emplacerd/"), true)) {
-  if (auto mobile = platform::userByName("mobile")) {
+  if (platform::hostProfile()) {
+    // The default user is whoever DefaultUser= names; without one, requests
+    // for it are refused rather than served as root's.
+    if (auto user = platform::hostDefaultUser()) {
+      currentMobileUserId_ = user->uid;
+      QRTLog(platform::kLogNotice, "Default user is %s (uid %u)", user->name.c_str(), currentMobileUserId_);
+    } else {
+      currentMobileUserId_ = kNoDefaultUser;
+      QRTLog(platform::kLogNotice, "No default user: set DefaultUser= in %s", platform::kHostConfigurationPath);
+    }
+  } else if (auto mobile = platform::userByName("mobile")) {
     currentMobileUserId_ = mobile->uid;
     QRTLog(platform::kLogError, "Current mobile user ID is %u", currentMobileUserId_);
   } else {
@@ -189,4 +200,8 @@ bool QRTGlobalConfiguration::migrationFileExistsWithName(const std::string& name
       name.find('\0') != std::string::npos)
     return false;
   return QRTFileManager::defaultManager().itemExistsAtURL(libraryDirectory().URLByAppendingPathComponent(name));
+}
+
+std::optional<uint64_t> QRTGlobalConfiguration::configuredMaxContainersPerClass() {
+  return platform::configuredMaxContainersPerClass();
 }
