@@ -157,14 +157,14 @@ bool setUpDeviceRoot(const std::string& root) {
 
 // The host profile's directories, in case systemd-tmpfiles has not run.
 // Returns the configuration's complaints, to be logged once the log is open.
-std::vector<std::string> setUpHostProfile() {
+std::vector<platform::HostProfileLine> setUpHostProfile() {
   platform::enableHostProfile();
   platform::setDeviceRoot("/");
-  std::vector<std::string> lines = platform::loadHostProfile();
+  std::vector<platform::HostProfileLine> lines = platform::loadHostProfile();
   for (const char* dir : {"/run/quarterd", "/var/lib/quarterd"}) {
     platform::UniqueFd made;
     if (int err = platform::safeMakeDirectory(dir, 0755, true, platform::kAnyOwner, &made))
-      lines.push_back(QRTFormat("Cannot create %s: %s", dir, strerror(err)));
+      lines.push_back({kLogError, QRTFormat("Cannot create %s: %s", dir, strerror(err))});
   }
   return lines;
 }
@@ -305,7 +305,7 @@ int QRTDaemonMain(int argc, char** argv) {
     if (platform::logReopen()) QRTLog(kLogNotice, "Log reopened");
   });
   platform::installTerminationHandler(stopListener);
-  std::vector<std::string> profileLines;
+  std::vector<platform::HostProfileLine> profileLines;
   if (!options.root)
     profileLines = setUpHostProfile();
   else if (!setUpDeviceRoot(*options.root))
@@ -313,7 +313,7 @@ int QRTDaemonMain(int argc, char** argv) {
 
   platform::transactionBegin();
   openLog(options);
-  for (const std::string& line : profileLines) QRTLog(kLogError, "%s", line.c_str());
+  for (const auto& line : profileLines) QRTLog(line.level, "%s", line.text.c_str());
   if (!takeInstanceLock()) return 1;
   platform::serviceNotifyStatus("Starting: recovering interrupted work");
   QRTLog(kLogDebug, "quarterd built at %s %s started", __DATE__, __TIME__);

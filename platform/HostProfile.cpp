@@ -7,6 +7,7 @@
 
 #include "base/QRTFormat.h"
 #include "platform/DeviceRoot.h"
+#include "platform/Log.h"
 #include "platform/UserDatabase.h"
 
 namespace platform {
@@ -143,30 +144,38 @@ HostConfiguration parseHostConfiguration(std::string_view text, std::vector<std:
   return configuration;
 }
 
-std::vector<std::string> loadHostProfile() {
+std::vector<HostProfileLine> loadHostProfile() {
   Profile& p = profile();
-  std::vector<std::string> lines;
-  if (std::optional<std::string> text = readHostFile(kHostConfigurationPath, 1u << 20)) {
-    p.configuration = parseHostConfiguration(*text, &lines);
-  } else if (errno != ENOENT) {
-    lines.push_back(QRTFormat("Cannot read %s: %s; every key keeps its default", kHostConfigurationPath,
-                              strerror(errno)));
-  }
+  std::vector<std::string> problems;
+  if (std::optional<std::string> text = readHostFile(kHostConfigurationPath, 1u << 20))
+    p.configuration = parseHostConfiguration(*text, &problems);
+  else if (errno != ENOENT)
+    problems.push_back(QRTFormat("Cannot read %s: %s; every key keeps its default", kHostConfigurationPath,
+                                 strerror(errno)));
   p.installer = accountNamed(kHostInstallerAccount);
   p.system = accountNamed(kHostSystemAccount);
   if (std::optional<GroupAccount> group = systemGroupByName(kHostSystemUsersGroup)) p.systemUsers = group->gid;
-  for (const auto& [account, name] : {std::pair{&p.installer, kHostInstallerAccount}, {&p.system, kHostSystemAccount}})
-    if (!*account)
-      lines.push_back(QRTFormat("No account %s: requests that need it fail (systemd-sysusers makes it)", name));
-  if (!p.systemUsers)
-    lines.push_back(QRTFormat("No group %s: system containers cannot be made (systemd-sysusers makes it)",
-                              kHostSystemUsersGroup));
+  for (const char* name : {kHostInstallerAccount, kHostSystemAccount, kHostSystemUsersGroup}) {
+    const bool found = name == kHostInstallerAccount ? p.installer.has_value()
+                       : name == kHostSystemAccount  ? p.system.has_value()
+                                                     : p.systemUsers.has_value();
+    if (!found) problems.push_back(QRTFormat("No account %s: requests that need it fail (systemd-sysusers makes it)", name));
+  }
+  std::string defaultUser;
   if (const std::optional<std::string>& name = p.configuration.defaultUser) {
     p.defaultUser = accountNamed(*name);
     if (!p.defaultUser)
-      lines.push_back(QRTFormat("DefaultUser=%s names no account: requests for the default user fail", name->c_str()));
+      problems.push_back(QRTFormat("DefaultUser=%s names no account: requests for the default user fail", name->c_str()));
+    else
+      defaultUser = QRTFormat("Default user is %s (uid %u)", name->c_str(), p.defaultUser->uid);
+  } else {
+    defaultUser = QRTFormat("No DefaultUser= in %s: requests for the default user fail", kHostConfigurationPath);
   }
   if (std::optional<std::string> defs = readHostFile("/etc/login.defs", 1u << 20)) p.uidMin = parseLoginDefsUidMin(*defs);
+
+  std::vector<HostProfileLine> lines;
+  for (std::string& problem : problems) lines.push_back({kLogError, std::move(problem)});
+  if (!defaultUser.empty()) lines.push_back({kLogNotice, std::move(defaultUser)});
   return lines;
 }
 

@@ -44,8 +44,12 @@ struct HostConfiguration {
 HostConfiguration parseHostConfiguration(std::string_view text, std::vector<std::string>* problems);
 
 // Reads the configuration file and resolves the accounts by name. Returns the
-// lines to log (the log is not open yet when this runs). Host profile only.
-std::vector<std::string> loadHostProfile();
+// lines to log, with their levels (the log is not open yet when this runs).
+struct HostProfileLine {
+  int level;
+  std::string text;
+};
+std::vector<HostProfileLine> loadHostProfile();
 
 // The configuration loaded at start; all defaults outside the host profile.
 const HostConfiguration& hostConfiguration();

@@ -26,15 +26,10 @@ QRTGlobalConfiguration::QRTGlobalConfiguration()
     : homeDirectory_(QRTURL::fileURL(platform::hostPath("/private/var/root/"), true)),
       emplacerdHomeDirectory_(QRTURL::fileURL(platform::hostPath("/private/var/emplacerd/"), true)) {
   if (platform::hostProfile()) {
-    // The default user is whoever DefaultUser= names; without one, requests
-    // for it are refused rather than served as root's.
-    if (auto user = platform::hostDefaultUser()) {
-      currentMobileUserId_ = user->uid;
-      QRTLog(platform::kLogNotice, "Default user is %s (uid %u)", user->name.c_str(), currentMobileUserId_);
-    } else {
-      currentMobileUserId_ = kNoDefaultUser;
-      QRTLog(platform::kLogNotice, "No default user: set DefaultUser= in %s", platform::kHostConfigurationPath);
-    }
+    // The default user is whoever DefaultUser= names (start-up logs which);
+    // without one, requests for it are refused rather than served as root's.
+    auto user = platform::hostDefaultUser();
+    currentMobileUserId_ = user ? user->uid : kNoDefaultUser;
   } else if (auto mobile = platform::userByName("mobile")) {
     currentMobileUserId_ = mobile->uid;
     QRTLog(platform::kLogError, "Current mobile user ID is %u", currentMobileUserId_);
