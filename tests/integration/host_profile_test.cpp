@@ -19,7 +19,7 @@
 
 namespace {
 
-constexpr uid_t kInstaller = 990, kAlice = 1500, kBob = 1501, kWebServer = 33;
+constexpr uid_t kInstaller = 990, kAlice = 1500, kBob = 1501, kCarol = 1502, kWebServer = 33;
 constexpr gid_t kSystemUsers = 992;
 
 // Starts quarterd in a mount namespace of its own and talks to it from
@@ -97,8 +97,9 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
   const std::string dir = tmpl;
   ASSERT_EQ(chmod(dir.c_str(), 0755), 0);
   ASSERT_EQ(system(("cp -a /etc " + dir + "/etc && mkdir -p " + dir + "/etc/quarterd/identities " + dir +
-                    "/home/alice " + dir + "/home/bob && chown 1500:1500 " + dir + "/home/alice && chown 1501:1501 " +
-                    dir + "/home/bob")
+                    "/home/alice " + dir + "/home/bob " + dir + "/home/carol " + dir + "/victim && chown 1500 " + dir +
+                    "/home/alice && chown 1501 " + dir + "/home/bob && chown 1502 " + dir + "/home/carol && ln -s " +
+                    dir + "/victim " + dir + "/home/carol/.local")
                        .c_str()),
             0);
   // www-data keeps uid 33, as on Debian: it must never own a container.
@@ -106,7 +107,8 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
                                      "quarterd-installer:x:990:990::/var/lib/quarterd/installer:/usr/sbin/nologin\n"
                                      "quarterd-system:x:991:991::/nonexistent:/usr/sbin/nologin\n"
                                      "alice:x:1500:1500::" + dir + "/home/alice:/bin/sh\n"
-                                     "bob:x:1501:1501::" + dir + "/home/bob:/bin/sh\n");
+                                     "bob:x:1501:1501::" + dir + "/home/bob:/bin/sh\n"
+                                     "carol:x:1502:1502::" + dir + "/home/carol:/bin/sh\n");
   writeFile(dir + "/etc/group", readFile("/etc/group") +
                                     "quarterd-installer:x:990:\nquarterd-system:x:991:\nquarterd-systemusers:x:992:\n"
                                     "alice:x:1500:\nbob:x:1501:\n");
@@ -139,6 +141,7 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
       {"alice's own data", kAlice, kAlice, 2, true, aliceData, kAlice, kAlice},
       {"bob's user 1 is bob", kBob, 1, 2, true, bobData, kBob, kBob},
       {"the web server's uid 33 is nobody here", kWebServer, 1, 2, false, "", UINT32_MAX, 0},
+      {"carol's ~/.local is a link elsewhere", kCarol, 1, 2, false, "", UINT32_MAX, 0},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.what);
@@ -160,6 +163,7 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
   }
   // The home's own .local stays its user's.
   EXPECT_EQ(ownerAndMode(dir + "/home/bob/.local").first, kBob);
+  EXPECT_TRUE(listDirectory(dir + "/victim").empty());
   EXPECT_EQ(system(("getfacl -n " + host.inside(store) + "Data/System/* 2>/dev/null | grep -q '^group:" +
                     std::to_string(kSystemUsers) + ":'")
                        .c_str()),
