@@ -145,6 +145,8 @@ void Connection::Impl::failAll() {
 std::string requestSocketPath(const std::string& deviceRoot) {
   std::string root = deviceRoot;
   while (!root.empty() && root.back() == '/') root.pop_back();
+  // No root: this machine's daemon, in the host profile's place.
+  if (root.empty()) return "/run/quarterd/request.sock";
   return root + "/run/com.norvane.quarterd";
 }
 

@@ -12,7 +12,8 @@
 
 namespace quarterkit {
 
-// R + "/run/com.norvane.quarterd.upcall".
+// R + "/run/com.norvane.quarterd.upcall"; "/" or "" (no root) gives the host
+// daemon's /run/quarterd/upcall.sock.
 std::string upcallSocketPath(const std::string& deviceRoot = "/");
 
 struct UpcallRequest {

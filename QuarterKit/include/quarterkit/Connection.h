@@ -17,7 +17,8 @@ namespace detail {
 struct ConnectionAccess;
 }  // namespace detail
 
-// R + "/run/com.norvane.quarterd" for a device root R ("/" gives the plain path).
+// R + "/run/com.norvane.quarterd" for a device root R; "/" or "" (no root)
+// gives the host daemon's /run/quarterd/request.sock.
 std::string requestSocketPath(const std::string& deviceRoot = "/");
 
 class Connection {
