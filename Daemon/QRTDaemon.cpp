@@ -14,7 +14,9 @@
 #include <cerrno>
 #include <cstdio>
 #include <mutex>
+#include <optional>
 #include <string>
+#include <vector>
 
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
@@ -23,6 +25,7 @@
 #include "platform/DeviceProperties.h"
 #include "platform/DeviceRoot.h"
 #include "platform/FirstBoot.h"
+#include "platform/HostProfile.h"
 #include "platform/LockState.h"
 #include "platform/Log.h"
 #include "platform/RequestSocket.h"
@@ -61,23 +64,27 @@ platform::UpcallListener* gUpcallListener = nullptr;
 bool gTerminating = false;
 
 struct Options {
-  std::string root = "/";
+  std::optional<std::string> root;  // nothing: the host profile
   bool logStderr = false;
   bool logJournal = false;
+  bool logFile = false;
   int logLevel = platform::kLogNotice;
   bool help = false;
   bool version = false;
 };
 
-const char kUsage[] = R"(usage: quarterd [--root DIR] [--log-stderr] [--log-level N] [--log-journal]
+const char kUsage[] = R"(usage: quarterd [--root DIR] [--log-stderr] [--log-level N] [--log-journal | --log-file]
 
 Owns the containers of every program of a device and serves requests for them.
+Without --root it serves this machine: the store in /var/lib/quarterd, the
+sockets in /run/quarterd, the configuration in /etc/quarterd/quarterd.conf.
 
 Options:
-  --root DIR       the device root, an existing absolute directory (default /)
+  --root DIR       serve the device tree under DIR, an existing absolute directory
   --log-stderr     also write every log line to standard error
   --log-level N    the log's starting level, 0 to 7 (default 5; 7 adds debug lines)
-  --log-journal    log to the systemd journal instead of the log file
+  --log-journal    log to the systemd journal (the default without --root)
+  --log-file       log to the rotated file under the daemon's home (the default with --root)
   -h, --help       print this text and exit
   -V, --version    print the version and exit
 )";
@@ -85,12 +92,13 @@ Options:
 void usage(FILE* to) { fputs(kUsage, to); }
 
 bool parseOptions(int argc, char** argv, Options* options) {
-  enum { kRoot = 1000, kLogStderr, kLogLevel, kLogJournal };
+  enum { kRoot = 1000, kLogStderr, kLogLevel, kLogJournal, kLogFile };
   static const option kLong[] = {
       {"root", required_argument, nullptr, kRoot},
       {"log-stderr", no_argument, nullptr, kLogStderr},
       {"log-level", required_argument, nullptr, kLogLevel},
       {"log-journal", no_argument, nullptr, kLogJournal},
+      {"log-file", no_argument, nullptr, kLogFile},
       {"help", no_argument, nullptr, 'h'},
       {"version", no_argument, nullptr, 'V'},
       {nullptr, 0, nullptr, 0},
@@ -101,6 +109,7 @@ bool parseOptions(int argc, char** argv, Options* options) {
       case kRoot: options->root = optarg; break;
       case kLogStderr: options->logStderr = true; break;
       case kLogJournal: options->logJournal = true; break;
+      case kLogFile: options->logFile = true; break;
       case kLogLevel: {
         char* end = nullptr;
         errno = 0;
@@ -124,6 +133,11 @@ bool parseOptions(int argc, char** argv, Options* options) {
     fprintf(stderr, "quarterd: unexpected argument %s\n", argv[optind]);
     return false;
   }
+  if (options->logJournal && options->logFile) {
+    fprintf(stderr, "quarterd: --log-journal and --log-file exclude each other\n");
+    return false;
+  }
+  if (!options->logJournal && !options->logFile) options->logJournal = !options->root;
   return true;
 }
 
@@ -142,6 +156,20 @@ bool setUpDeviceRoot(const std::string& root) {
       fprintf(stderr, "quarterd: cannot create %s: %s\n", path.c_str(), strerror(err));
   }
   return true;
+}
+
+// The host profile's directories, in case systemd-tmpfiles has not run.
+// Returns the configuration's complaints, to be logged once the log is open.
+std::vector<platform::HostProfileLine> setUpHostProfile() {
+  platform::enableHostProfile();
+  platform::setDeviceRoot("/");
+  std::vector<platform::HostProfileLine> lines = platform::loadHostProfile();
+  for (const char* dir : {"/run/quarterd", "/var/lib/quarterd"}) {
+    platform::UniqueFd made;
+    if (int err = platform::safeMakeDirectory(dir, 0755, true, platform::kAnyOwner, &made))
+      lines.push_back({kLogError, QRTFormat("Cannot create %s: %s", dir, strerror(err))});
+  }
+  return lines;
 }
 
 // Every connection costs a descriptor: take all the system lets us have.
@@ -284,10 +312,15 @@ int QRTDaemonMain(int argc, char** argv) {
     if (platform::logReopen()) QRTLog(kLogNotice, "Log reopened");
   });
   platform::installTerminationHandler(stopListener);
-  if (!setUpDeviceRoot(options.root)) return 2;
+  std::vector<platform::HostProfileLine> profileLines;
+  if (!options.root)
+    profileLines = setUpHostProfile();
+  else if (!setUpDeviceRoot(*options.root))
+    return 2;
 
   platform::transactionBegin();
   openLog(options);
+  for (const auto& line : profileLines) QRTLog(line.level, "%s", line.text.c_str());
   if (!takeInstanceLock()) return 1;
   platform::serviceNotifyStatus("Starting: recovering interrupted work");
   QRTLog(kLogDebug, "quarterd built at %s %s started", __DATE__, __TIME__);

@@ -12,9 +12,10 @@
 #include <vector>
 
 #include "QuarterKit/QuarterKit.h"
+#include "QuarterKit/Testing.h"
 #include "base/Frame.h"
 
-namespace qk {
+namespace quarterkit {
 
 namespace {
 using MaybeReply = std::optional<plist::Dictionary>;
@@ -144,6 +145,8 @@ void Connection::Impl::failAll() {
 std::string requestSocketPath(const std::string& deviceRoot) {
   std::string root = deviceRoot;
   while (!root.empty() && root.back() == '/') root.pop_back();
+  // No root: this machine's daemon, in the host profile's place.
+  if (root.empty()) return "/run/quarterd/request.sock";
   return root + "/run/com.norvane.quarterd";
 }
 
@@ -172,14 +175,14 @@ std::unique_ptr<Connection> Connection::connect(const std::string& socketPath, s
     ::close(fd);
     return nullptr;
   }
-  auto connection = adopt(fd);
+  auto connection = detail::ConnectionAccess::adopt(fd);
   if (!connection && error) *error = "cannot start the connection's reader thread";
   return connection;
 }
 
-std::unique_ptr<Connection> Connection::adopt(int fd) {
+std::unique_ptr<Connection> detail::ConnectionAccess::adopt(int fd) {
   try {
-    return std::unique_ptr<Connection>(new Connection(std::make_unique<Impl>(fd)));
+    return std::unique_ptr<Connection>(new Connection(std::make_unique<Connection::Impl>(fd)));
   } catch (const std::exception&) {
     // No reader thread could be started.
     ::close(fd);
@@ -200,9 +203,9 @@ MaybeReply Connection::call(const plist::Dictionary& request, std::chrono::milli
   return future.get();
 }
 
-bool Connection::sendRaw(const void* bytes, size_t length) {
-  std::lock_guard<std::mutex> lock(impl_->writeMutex);
-  return impl_->writeAll(static_cast<const uint8_t*>(bytes), length);
+bool detail::ConnectionAccess::sendRaw(Connection& connection, const void* bytes, size_t length) {
+  std::lock_guard<std::mutex> lock(connection.impl_->writeMutex);
+  return connection.impl_->writeAll(static_cast<const uint8_t*>(bytes), length);
 }
 
 bool Connection::closed() const { return impl_->isClosed.load(); }
@@ -213,4 +216,4 @@ std::chrono::milliseconds Connection::replyTimeout() const {
   return std::chrono::milliseconds(impl_->replyTimeoutMs.load());
 }
 
-}  // namespace qk
+}  // namespace quarterkit

@@ -1,15 +1,7 @@
-// What the daemon's result codes mean, for tools that show them to people.
+// In-tree name of <quarterkit/Errors.h>; qk is the old name of the namespace,
+// kept for one release.
 #pragma once
 
-#include <cstdint>
-#include <string>
+#include <quarterkit/Errors.h>
 
-namespace qk {
-
-// A short lower-case text for a result code ("no such container" for 21);
-// nullptr for a code the daemon does not send.
-const char* errorText(uint64_t code);
-// "ok" for 1, "error 21 (no such container)", or "error N" for an unknown code.
-std::string describeResult(uint64_t code);
-
-}  // namespace qk
+namespace qk = quarterkit;

@@ -2,10 +2,9 @@
 
 #include <cstdint>
 
-namespace qk {
+namespace quarterkit {
 
-Request::Request(Command command) : Request(static_cast<uint64_t>(command)) {}
-Request::Request(uint64_t command) { u64("Command", command); }
+Request::Request(Command command) { u64("Command", static_cast<uint64_t>(command)); }
 
 Request& Request::u64(std::string_view key, uint64_t v) {
   // Unsigned on the wire only where a signed reader would get it wrong.
@@ -19,8 +18,8 @@ Request& Request::string(std::string_view key, std::string v) { return value(key
 Request& Request::string(std::string_view key, const std::optional<std::string>& v) {
   return v ? string(key, *v) : *this;
 }
-Request& Request::uuid(std::string_view key, const QRTUUID& v) { return value(key, uuidValue(v)); }
-Request& Request::uuid(std::string_view key, const std::optional<QRTUUID>& v) { return v ? uuid(key, *v) : *this; }
+Request& Request::uuid(std::string_view key, const UUID& v) { return value(key, uuidValue(v)); }
+Request& Request::uuid(std::string_view key, const std::optional<UUID>& v) { return v ? uuid(key, *v) : *this; }
 Request& Request::array(std::string_view key, plist::Array v) { return value(key, plist::Value(std::move(v))); }
 Request& Request::dictionary(std::string_view key, plist::Dictionary v) {
   return value(key, plist::Value(std::move(v)));
@@ -30,7 +29,7 @@ Request& Request::value(std::string_view key, plist::Value v) {
   return *this;
 }
 
-plist::Value uuidValue(const QRTUUID& uuid) { return plist::Data(uuid.bytes().begin(), uuid.bytes().end()); }
+plist::Value uuidValue(const UUID& uuid) { return plist::Data(uuid.bytes().begin(), uuid.bytes().end()); }
 
 uint64_t Reply::u64(std::string_view key) const {
   const plist::Value* v = value(key);
@@ -48,10 +47,10 @@ std::optional<std::string> Reply::string(std::string_view key) const {
   const std::string* s = v ? v->stringIf() : nullptr;
   return s ? std::optional<std::string>(*s) : std::nullopt;
 }
-std::optional<QRTUUID> Reply::uuid(std::string_view key) const {
+std::optional<UUID> Reply::uuid(std::string_view key) const {
   const plist::Value* v = value(key);
   const plist::Data* d = v ? v->dataIf() : nullptr;
-  return d ? QRTUUID::fromBytes(d->data(), d->size()) : std::nullopt;
+  return d ? UUID::fromBytes(d->data(), d->size()) : std::nullopt;
 }
 const plist::Array* Reply::array(std::string_view key) const {
   const plist::Value* v = value(key);
@@ -70,12 +69,12 @@ std::vector<std::string> Reply::strings(std::string_view key) const {
       if (const std::string* s = v.stringIf()) out.push_back(*s);
   return out;
 }
-std::vector<QRTUUID> Reply::uuids(std::string_view key) const {
-  std::vector<QRTUUID> out;
+std::vector<UUID> Reply::uuids(std::string_view key) const {
+  std::vector<UUID> out;
   if (const plist::Array* a = array(key))
     for (const plist::Value& v : *a)
       if (const plist::Data* d = v.dataIf())
-        if (auto u = QRTUUID::fromBytes(d->data(), d->size())) out.push_back(*u);
+        if (auto u = UUID::fromBytes(d->data(), d->size())) out.push_back(*u);
   return out;
 }
 
@@ -132,11 +131,11 @@ Result replaceContainer(Connection& c, const std::optional<ContainerRef>& old, c
   return perform(c, r);
 }
 
-Result stageContainerForDelete(Connection& c, const std::vector<uint64_t>& userIds, const std::vector<QRTUUID>& uuids,
+Result stageContainerForDelete(Connection& c, const std::vector<uint64_t>& userIds, const std::vector<UUID>& uuids,
                                const std::vector<std::string>& identifiers, const std::vector<uint64_t>& classes) {
   plist::Array users, uuidArray, ids, classArray;
   for (uint64_t u : userIds) users.emplace_back(u);
-  for (const QRTUUID& u : uuids) uuidArray.push_back(uuidValue(u));
+  for (const UUID& u : uuids) uuidArray.push_back(uuidValue(u));
   for (const std::string& s : identifiers) ids.emplace_back(s);
   for (uint64_t k : classes) classArray.emplace_back(k);
   return perform(c, Request(Command::stageContainerForDelete)
@@ -290,4 +289,4 @@ Result deleteUserManagedAsset(Connection& c, const std::optional<std::string>& i
       c, Request(Command::deleteUserManagedAsset).string("Identifier", identifier).string("SourcePath", relativePath));
 }
 
-}  // namespace qk
+}  // namespace quarterkit

@@ -12,7 +12,7 @@
 #include "base/Frame.h"
 #include "packbuff/packbuff.h"
 
-namespace qk {
+namespace quarterkit {
 
 namespace {
 
@@ -63,8 +63,10 @@ void readAnswerItems(std::vector<uint8_t>& bytes, UpcallAnswer* answer) {
 
 std::string upcallSocketPath(const std::string& deviceRoot) {
   std::string root = deviceRoot;
-  while (root.size() > 1 && root.back() == '/') root.pop_back();
-  return (root == "/" ? "" : root) + "/run/com.norvane.quarterd.upcall";
+  while (!root.empty() && root.back() == '/') root.pop_back();
+  // No root: this machine's daemon, in the host profile's place.
+  if (root.empty()) return "/run/quarterd/upcall.sock";
+  return root + "/run/com.norvane.quarterd.upcall";
 }
 
 std::vector<uint8_t> packUpcallRequest(const UpcallRequest& request) {
@@ -145,4 +147,4 @@ bool UpcallClient::closedByPeer() {
   return ::recv(fd_, &byte, 1, MSG_PEEK | MSG_DONTWAIT) == 0 || (p.revents & (POLLHUP | POLLERR));
 }
 
-}  // namespace qk
+}  // namespace quarterkit

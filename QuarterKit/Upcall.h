@@ -10,9 +10,10 @@
 #include <utility>
 #include <vector>
 
-namespace qk {
+namespace quarterkit {
 
-// R + "/run/com.norvane.quarterd.upcall".
+// R + "/run/com.norvane.quarterd.upcall"; "/" or "" (no root) gives the host
+// daemon's /run/quarterd/upcall.sock.
 std::string upcallSocketPath(const std::string& deviceRoot = "/");
 
 struct UpcallRequest {
@@ -65,4 +66,6 @@ class UpcallClient {
   int fd_;
 };
 
-}  // namespace qk
+}  // namespace quarterkit
+
+namespace qk = quarterkit;

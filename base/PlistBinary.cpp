@@ -7,7 +7,7 @@
 
 #include "base/PlistCodec.h"
 
-namespace plist {
+namespace quarterkit::plist {
 namespace {
 
 constexpr size_t kHeaderSize = 8;
@@ -645,4 +645,4 @@ std::optional<Value> parse(const void* bytes, size_t length, std::string* error,
   return std::nullopt;
 }
 
-}  // namespace plist
+}  // namespace quarterkit::plist

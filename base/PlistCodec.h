@@ -10,7 +10,7 @@
 
 #include "base/PlistValue.h"
 
-namespace plist {
+namespace quarterkit::plist {
 
 constexpr size_t kMaxDepth = 64;
 constexpr size_t kMaxObjects = 1'000'000;  // after expansion of shared references
@@ -42,4 +42,4 @@ std::optional<Value> parseXML(const void* bytes, size_t length, std::string* err
 // as 16-byte integers, the way other writers of the format do.
 Data writeBinary(const Value& value);
 
-}  // namespace plist
+}  // namespace quarterkit::plist

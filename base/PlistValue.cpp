@@ -6,7 +6,7 @@
 #include <cstdio>
 #include <cstring>
 
-namespace plist {
+namespace quarterkit::plist {
 namespace {
 
 bool isPlainToken(std::string_view s) {
@@ -170,4 +170,4 @@ std::string describe(const Value& v) {
   return out;
 }
 
-}  // namespace plist
+}  // namespace quarterkit::plist

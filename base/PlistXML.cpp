@@ -10,7 +10,7 @@
 
 #include "base/PlistCodec.h"
 
-namespace plist {
+namespace quarterkit::plist {
 namespace {
 
 bool isSpace(char c) { return c == ' ' || c == '\t' || c == '\n' || c == '\r'; }
@@ -559,4 +559,4 @@ std::optional<Value> parseXML(const void* bytes, size_t length, std::string* err
   }
 }
 
-}  // namespace plist
+}  // namespace quarterkit::plist

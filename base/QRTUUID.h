@@ -1,29 +1,7 @@
-// A 128-bit UUID: random version-4 values and the canonical upper-case text form.
+// The UUID is the client library's public type; the daemon calls it by its
+// own name.
 #pragma once
 
-#include <array>
-#include <cstdint>
-#include <optional>
-#include <string>
-#include <string_view>
+#include <quarterkit/UUID.h>
 
-class QRTUUID {
- public:
-  QRTUUID() = default;
-  explicit QRTUUID(const std::array<uint8_t, 16>& bytes) : bytes_(bytes) {}
-  static QRTUUID random();
-  // Accepts the 36-character form with hyphens in either case.
-  static std::optional<QRTUUID> fromString(std::string_view text);
-  static std::optional<QRTUUID> fromBytes(const void* bytes, size_t length);
-
-  const std::array<uint8_t, 16>& bytes() const { return bytes_; }
-  std::string UUIDString() const;  // upper case
-  std::string description() const { return UUIDString(); }
-
-  bool operator==(const QRTUUID& o) const { return bytes_ == o.bytes_; }
-  bool operator!=(const QRTUUID& o) const { return bytes_ != o.bytes_; }
-  bool operator<(const QRTUUID& o) const { return bytes_ < o.bytes_; }
-
- private:
-  std::array<uint8_t, 16> bytes_{};
-};
+using QRTUUID = quarterkit::UUID;

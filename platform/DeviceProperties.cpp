@@ -2,6 +2,7 @@
 
 #include "base/PlistCodec.h"
 #include "platform/DeviceRoot.h"
+#include "platform/HostProfile.h"
 
 namespace platform {
 
@@ -28,7 +29,10 @@ bool booleanProperty(std::string_view key) {
 
 }  // namespace
 
-bool deviceIsInternalBuild() { return booleanProperty("InternalBuild"); }
+bool deviceIsInternalBuild() {
+  if (std::optional<bool> configured = hostConfiguration().internalBuild) return *configured;
+  return booleanProperty("InternalBuild");
+}
 
 uint64_t deviceMultiUserFlags() {
   std::optional<plist::Dictionary> properties = readDictionary("/etc/device-properties.plist");

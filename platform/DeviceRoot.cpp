@@ -6,6 +6,7 @@
 #include <cerrno>
 
 #include "platform/FileIO.h"
+#include "platform/HostProfile.h"
 #include "platform/SafePath.h"
 
 namespace platform {
@@ -29,6 +30,11 @@ void setDeviceRoot(const std::string& root) {
 const std::string& deviceRoot() { return rootStorage(); }
 
 std::string hostPath(std::string_view devicePath) {
+  if (std::optional<std::string> placed = hostProfilePath(devicePath)) return *placed;
+  return rootedPath(devicePath);
+}
+
+std::string rootedPath(std::string_view devicePath) {
   const std::string& root = deviceRoot();
   if (root == "/") return std::string(devicePath);
   std::string path = root;

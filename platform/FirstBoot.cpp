@@ -42,9 +42,11 @@ bool firstBootMarkerExists() {
 bool createFirstBootMarker() {
   std::optional<std::string> bootId = currentBootId();
   if (!bootId) return false;
+  const std::string path = firstBootMarkerPath();
+  const size_t slash = path.rfind('/');
   UniqueFd run;
-  int err = safeMakeDirectory(hostPath("/run"), 0755, false, kAnyOwner, &run);
-  if (!err) err = replaceFileAt(run.get(), "quarterd.fb_check", (*bootId + "\n").data(), bootId->size() + 1, 0400);
+  int err = safeMakeDirectory(path.substr(0, slash), 0755, false, kAnyOwner, &run);
+  if (!err) err = replaceFileAt(run.get(), path.substr(slash + 1), (*bootId + "\n").data(), bootId->size() + 1, 0400);
   if (err) errno = err;
   return err == 0;
 }

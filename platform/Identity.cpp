@@ -18,6 +18,7 @@
 
 #include "base/PlistCodec.h"
 #include "platform/DeviceRoot.h"
+#include "platform/HostProfile.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
 #include "platform/SafePath.h"
@@ -312,7 +313,7 @@ std::optional<PeerCredentials> peerCredentials(int socketFd) {
     return std::nullopt;
   PeerCredentials peer;
   peer.pid = credentials.pid;
-  peer.uid = credentials.uid;
+  peer.uid = protocolUserId(credentials.uid);
   peer.gid = credentials.gid;
 
   int pidfd = -1;

@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "platform/DeviceRoot.h"
+#include "platform/HostProfile.h"
 #include "platform/Log.h"
 
 namespace platform {
@@ -91,8 +92,26 @@ void splitParent(const std::string& relative, std::string* parent, std::string* 
 
 const char* errorText(int err) { return strerror(err); }
 
-// The checks on an item found where a directory was to be made.
-int acceptDirectory(int fd, std::string_view hostPath, uid_t owner) {
+// The host owner of a protocol user; EPERM with a log line when no account
+// stands for it (never a numeric id another account may own).
+int hostOwner(std::string_view hostPath, uid_t owner, uid_t* uid, gid_t* gid) {
+  *uid = *gid = kAnyOwner;
+  if (owner == kAnyOwner) return 0;
+  std::optional<uid_t> user = hostUserId(owner);
+  std::optional<gid_t> group = hostGroupId(owner);
+  if (!user || !group) {
+    QRTLogAs(kLogError, "safeMakeDirectory", "Refusing %s: no host account stands for user %u",
+             std::string(hostPath).c_str(), static_cast<unsigned>(owner));
+    return EPERM;
+  }
+  *uid = *user;
+  *gid = *group;
+  return 0;
+}
+
+// The checks on an item found where a directory was to be made; owner and
+// group are host ids.
+int acceptDirectory(int fd, std::string_view hostPath, uid_t owner, gid_t group) {
   struct stat st;
   if (fstat(fd, &st) != 0) return errno;
   if (!S_ISDIR(st.st_mode)) {
@@ -105,7 +124,7 @@ int acceptDirectory(int fd, std::string_view hostPath, uid_t owner) {
              static_cast<unsigned>(st.st_uid), static_cast<unsigned>(owner));
     return EPERM;
   }
-  if ((st.st_uid != owner || st.st_gid != owner) && fchown(fd, owner, owner) != 0) return errno;
+  if ((st.st_uid != owner || st.st_gid != group) && fchown(fd, owner, group) != 0) return errno;
   return 0;
 }
 
@@ -217,6 +236,9 @@ int safeStat(std::string_view hostPath, struct stat* st) {
 int safeMakeDirectory(std::string_view hostPath, mode_t mode, bool withParents, uid_t owner, UniqueFd* out,
                       bool* created) {
   if (created) *created = false;
+  uid_t hostUid;
+  gid_t hostGid;
+  if (int err = hostOwner(hostPath, owner, &hostUid, &hostGid)) return err;
   std::string relative;
   if (int err = pathBelowDeviceRoot(hostPath, &relative)) return err;
   int root = deviceRootDescriptor();
@@ -225,7 +247,7 @@ int safeMakeDirectory(std::string_view hostPath, mode_t mode, bool withParents, 
   UniqueFd fd;
   int err = openBeneath(root, relative.c_str(), O_RDONLY | O_DIRECTORY, &fd);
   if (err == 0) {
-    if (int refused = acceptDirectory(fd.get(), hostPath, owner)) return refused;
+    if (int refused = acceptDirectory(fd.get(), hostPath, hostUid, hostGid)) return refused;
     *out = std::move(fd);
     return 0;
   }
@@ -251,13 +273,18 @@ int safeMakeDirectory(std::string_view hostPath, mode_t mode, bool withParents, 
       rest.remove_prefix(slash == std::string_view::npos ? rest.size() : slash + 1);
       UniqueFd next;
       if (int merr = makeOne(base, name.c_str(), mode, hostPath, &next, &made)) return merr;
+      // A level made in an ordinary user's home (~/.local/share on a host)
+      // is theirs, or their own programs could not use it.
+      if (made && hostProfile() && hostUid != kAnyOwner && hostUid >= hostOrdinaryUserMinimum() &&
+          fchown(next.get(), hostUid, hostGid) != 0)
+        return errno;
       level = std::move(next);
       base = level.get();
     }
     fd = std::move(level);
   }
   if (created) *created = made;
-  if (int refused = acceptDirectory(fd.get(), hostPath, owner)) return refused;
+  if (int refused = acceptDirectory(fd.get(), hostPath, hostUid, hostGid)) return refused;
   *out = std::move(fd);
   return 0;
 }

@@ -57,10 +57,12 @@ inline constexpr uid_t kAnyOwner = static_cast<uid_t>(-1);
 // Creates the directory (and with withParents every missing level, one
 // mkdirat and one O_NOFOLLOW open at a time) with mode, and hands it back
 // open for reading. An existing item is accepted only when it is a real
-// directory; when owner is given it must also be owned by owner or by root,
-// and is then given to owner (user and group). Otherwise: ELOOP for a link,
-// ENOTDIR for a non-directory, EPERM for a directory of another user, each
-// with a log line. Levels made on the way keep root as their owner.
+// directory; when owner (a protocol user, HostProfile.h) is given it must
+// also be owned by owner's host account or by root, and is then given to it
+// (user and group). Otherwise: ELOOP for a link, ENOTDIR for a non-directory,
+// EPERM for a directory of another user or an owner without a host account,
+// each with a log line. Levels made on the way keep root as their owner,
+// except an ordinary user's in the host profile.
 int safeMakeDirectory(std::string_view hostPath, mode_t mode, bool withParents, uid_t owner, UniqueFd* out,
                       bool* created = nullptr);
 

@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "platform/DeviceRoot.h"
+#include "platform/HostProfile.h"
 
 namespace platform {
 
@@ -97,9 +98,7 @@ std::optional<UserAccount> findUserInFile(const std::function<bool(std::string_v
 
 }  // namespace
 
-std::optional<UserAccount> userByName(const std::string& name) {
-  if (!useSystemDatabase())
-    return findUserInFile([&](std::string_view entry, uint32_t) { return entry == name; });
+std::optional<UserAccount> systemUserByName(const std::string& name) {
   return systemLookup<passwd>(
       [&](passwd* pw, char* buffer, size_t size, passwd** found) {
         return getpwnam_r(name.c_str(), pw, buffer, size, found);
@@ -107,23 +106,67 @@ std::optional<UserAccount> userByName(const std::string& name) {
       accountFromPasswd);
 }
 
+std::optional<GroupAccount> systemGroupByName(const std::string& name) {
+  return systemLookup<group>(
+      [&](group* gr, char* buffer, size_t size, group** found) {
+        return getgrnam_r(name.c_str(), gr, buffer, size, found);
+      },
+      accountFromGroup);
+}
+
+namespace {
+
+// The host profile's view of a system account: the accounts standing for
+// protocol users carry the protocol ids; an ordinary user's containers live
+// under ~/.local/share/quarterd, which stands for the device home.
+std::optional<UserAccount> hostProfileView(std::optional<UserAccount> account) {
+  if (!account) return std::nullopt;
+  uint32_t protocol = protocolUserId(account->uid);
+  if (protocol == kForeignUserId) return std::nullopt;
+  if (protocol != account->uid) {
+    account->uid = protocol;
+    account->gid = protocol;
+  } else if (!account->homeDirectory.empty()) {
+    while (account->homeDirectory.size() > 1 && account->homeDirectory.back() == '/') account->homeDirectory.pop_back();
+    account->homeDirectory += account->homeDirectory == "/" ? ".local/share/quarterd" : "/.local/share/quarterd";
+  }
+  return account;
+}
+
+}  // namespace
+
+std::optional<UserAccount> userByName(const std::string& name) {
+  if (!useSystemDatabase())
+    return findUserInFile([&](std::string_view entry, uint32_t) { return entry == name; });
+  if (hostProfile()) return hostProfileView(systemUserByName(name));
+  return systemUserByName(name);
+}
+
 std::optional<UserAccount> userById(uint32_t uid) {
   if (!useSystemDatabase())
     return findUserInFile([&](std::string_view, uint32_t entry) { return entry == uid; });
-  return systemLookup<passwd>(
+  if (hostProfile()) {
+    if (std::optional<HostAccount> account = hostAccountFor(uid))
+      return UserAccount{account->name, uid, uid, account->homeDirectory};
+    if (std::optional<uid_t> host = hostUserId(uid); !host || protocolUserId(*host) != uid) return std::nullopt;
+  }
+  std::optional<UserAccount> account = systemLookup<passwd>(
       [&](passwd* pw, char* buffer, size_t size, passwd** found) {
         return getpwuid_r(uid, pw, buffer, size, found);
       },
       accountFromPasswd);
+  return hostProfile() ? hostProfileView(std::move(account)) : account;
 }
 
 std::optional<GroupAccount> groupByName(const std::string& name) {
   if (useSystemDatabase()) {
-    return systemLookup<group>(
-        [&](group* gr, char* buffer, size_t size, group** found) {
-          return getgrnam_r(name.c_str(), gr, buffer, size, found);
-        },
-        accountFromGroup);
+    // The protocol's group stands for an account of its own on a host.
+    if (hostProfile() && name == "systemusers") {
+      std::optional<gid_t> gid = hostSystemUsersGroup();
+      if (!gid) return std::nullopt;
+      return GroupAccount{kHostSystemUsersGroup, *gid};
+    }
+    return systemGroupByName(name);
   }
   std::optional<GroupAccount> account;
   scanDatabase("/etc/group", 4, [&](const std::vector<std::string_view>& f) {

@@ -1,6 +1,8 @@
 // Users and groups: R/etc/passwd and R/etc/group under a device root other
 // than "/" (read on every look-up, so tests can edit them live), else the
-// system's own database. Home directories are host paths.
+// system's own database. Home directories are host paths. In the host
+// profile (HostProfile.h) ids are protocol ids, and a home is the base of the
+// user's quarterd tree (~/.local/share/quarterd).
 #pragma once
 
 #include <cstdint>
@@ -28,5 +30,9 @@ std::optional<GroupAccount> groupByName(const std::string& name);
 // The lowest uid of an ordinary (human) user; anything below is the system's
 // or a service's. 501 on a device root.
 uint32_t ordinaryUserMinimum();
+
+// The system's own database, untranslated.
+std::optional<UserAccount> systemUserByName(const std::string& name);
+std::optional<GroupAccount> systemGroupByName(const std::string& name);
 
 }  // namespace platform

@@ -5,6 +5,7 @@
 // directory.
 //
 //   quarter-bench [--socket PATH | --daemon QUARTERD] [--seconds N] [--clients 1,8]
+//   (neither --socket nor --daemon: the installed daemon at /run/quarterd/request.sock)
 //                 [--op create|lookup|info-set|info-get|cs-set|cs-get|all] [--prefill N] [--lookup-first]
 #include <limits.h>
 #include <signal.h>
@@ -428,7 +429,9 @@ Options parseOptions(int argc, char** argv) {
     else if (a == "--prefill") o.prefill = std::max(0, atoi(v.c_str()));
     else usage();
   }
-  if (o.socketPath.empty() == o.daemonBinary.empty()) usage();
+  if (!o.socketPath.empty() && !o.daemonBinary.empty()) usage();
+  // Neither: this machine's daemon.
+  if (o.socketPath.empty() && o.daemonBinary.empty()) o.socketPath = qk::requestSocketPath("");
   if (o.lookupFirst && o.daemonBinary.empty()) {
     fputs("quarter-bench: --lookup-first restarts the daemon: give --daemon\n", stderr);
     exit(2);

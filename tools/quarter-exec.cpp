@@ -27,6 +27,7 @@
 #include "QuarterKit/Upcall.h"
 #include "base/PlistCodec.h"
 #include "platform/DeviceRoot.h"
+#include "platform/HostProfile.h"
 #include "platform/Identity.h"
 #include "platform/SafePath.h"
 #include "platform/UserDatabase.h"
@@ -50,7 +51,8 @@ the system's files and /proc; /dev/tty. It starts with a clean environment and
 no descriptor but 0, 1 and 2. Must be run as root; UID may not be 0.
 
 Options:
-  --root DIR          the device root of the daemon to ask (default /)
+  --root DIR          the device root of the daemon to ask (default QUARTERD_ROOT,
+                      else this machine's daemon at /run/quarterd)
   --user UID          the user to run as and whose containers to use
   --identifier ID     the program's signing identifier; PROGRAM must be registered
                       under it in DIR/etc/quarterd/identities
@@ -115,7 +117,7 @@ constexpr const char* kLibraryDirectories[] = {"/lib",     "/lib64",     "/lib32
 constexpr const char* kMetadataFileName = ".com.norvane.quarter_kit.metadata.plist";
 
 struct Options {
-  std::string root = "/";
+  std::string root;  // empty: the host profile
   std::optional<uint32_t> user;
   std::string identifier;
   std::vector<std::string> command;
@@ -412,9 +414,16 @@ std::vector<std::string> libraryDirectories() {
 int run(const Options& options) {
   if (geteuid() != 0)
     return fail(kExitFailure, "must be run as root: it asks quarterd for the containers, then drops to the user");
-  char root[PATH_MAX];
-  if (options.root.empty() || options.root[0] != '/' || !realpath(options.root.c_str(), root))
-    return fail(kExitUsage, "bad device root " + options.root);
+  char root[PATH_MAX] = "/";
+  std::string rootOption = options.root;
+  if (const char* fromEnvironment = getenv("QUARTERD_ROOT"); rootOption.empty() && fromEnvironment)
+    rootOption = fromEnvironment;
+  if (rootOption.empty()) {
+    platform::enableHostProfile();
+    platform::loadHostProfile();
+  } else if (rootOption[0] != '/' || !realpath(rootOption.c_str(), root)) {
+    return fail(kExitUsage, "bad device root " + rootOption);
+  }
   platform::setDeviceRoot(root);
 
   const std::string& name = options.command.front();
@@ -465,7 +474,7 @@ int run(const Options& options) {
   if (auto system = stringsOf(identity->entitlements, "com.norvane.security.system-container"); !system.empty())
     request.systemContainerId = system.front();
 
-  const std::string socketPath = qk::upcallSocketPath(root);
+  const std::string socketPath = qk::upcallSocketPath(rootOption.empty() ? "" : root);
   std::string error;
   auto client = qk::UpcallClient::connect(socketPath, &error);
   if (!client) return fail(kExitFailure, "cannot reach quarterd at " + socketPath + ": " + error);
@@ -517,8 +526,11 @@ int run(const Options& options) {
   if (prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0)
     return fail(kExitFailure, std::string("cannot set no_new_privs: ") + strerror(errno));
   if (int err = rules.restrictSelf()) return fail(kExitFailure, std::string("cannot enforce Landlock: ") + strerror(err));
-  const gid_t gid = account->gid;
-  if (setgroups(1, &gid) != 0 || setresgid(gid, gid, gid) != 0 || setresuid(*options.user, *options.user, *options.user) != 0)
+  // The protocol's users stand for host accounts of their own on a host.
+  const std::optional<uid_t> uid = platform::hostUserId(*options.user);
+  const std::optional<platform::HostAccount> hostAccount = platform::hostAccountFor(*options.user);
+  const gid_t gid = hostAccount ? hostAccount->gid : account->gid;
+  if (!uid || setgroups(1, &gid) != 0 || setresgid(gid, gid, gid) != 0 || setresuid(*uid, *uid, *uid) != 0)
     return fail(kExitFailure, "cannot drop to user " + std::to_string(*options.user) + ": " + strerror(errno));
 
   std::vector<char*> argv, envp;

@@ -42,7 +42,8 @@ Sends one request to quarterd and prints its reply.
 
 Options:
   --root DIR         talk to the daemon of device root DIR (socket DIR/run/com.norvane.quarterd);
-                     without --root and --socket, the root comes from QUARTERD_ROOT, else /
+                     without --root and --socket, the root comes from QUARTERD_ROOT, else
+                     this machine's daemon answers (socket /run/quarterd/request.sock)
   --socket PATH      talk to the request socket at PATH
   --json             print the whole reply as a JSON object: integers as numbers, 16-byte data
                      as UUID strings, other data as base64 strings, dates as ISO 8601 strings

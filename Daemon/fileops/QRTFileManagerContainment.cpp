@@ -11,6 +11,7 @@
 
 #include "Daemon/fileops/QRTFileManager.h"
 #include "platform/DeviceRoot.h"
+#include "platform/HostProfile.h"
 #include "platform/Log.h"
 #include "platform/SafePath.h"
 
@@ -40,14 +41,14 @@ std::vector<std::string> pathComponents(const std::string& path) {
 // paths use the latter, so a client's /var path is moved there.
 QRTURL neutralisePrivate(const QRTURL& url) {
   std::string relative;
-  if (platform::pathBelowDeviceRoot(url.path(), &relative) != 0) return url;
-  if (relative == "var" || relative.starts_with("var/")) return QRTURL::fileURL(platform::hostPath("/private/" + relative));
+  if (platform::hostProfile() || platform::pathBelowDeviceRoot(url.path(), &relative) != 0) return url;
+  if (relative == "var" || relative.starts_with("var/")) return QRTURL::fileURL(platform::rootedPath("/private/" + relative));
   return url;
 }
 
 // The host path for a path below the device root, with "." and "//" gone.
 std::string normalisedHostPath(const std::string& relative) {
-  return relative == "." ? platform::deviceRoot() : platform::hostPath("/" + relative);
+  return relative == "." ? platform::deviceRoot() : platform::rootedPath("/" + relative);
 }
 
 // dir + target with ".." taken away lexically: the components it undoes were

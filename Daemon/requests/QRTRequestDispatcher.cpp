@@ -236,8 +236,8 @@ bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, uint32_t 
     valid = requestedUserId == callerUserId || requestedUserId == 1;
     effective = callerUserId;
   } else if (requestedUserId == 1) {
-    valid = true;
     effective = QRTGlobalConfiguration::sharedInstance().currentMobileUserId();
+    valid = effective != QRTGlobalConfiguration::kNoDefaultUser;
   } else {
     valid = user_id_valid_for_class(containerClass, requestedUserId);
   }

@@ -10,6 +10,7 @@
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTPerUserConfiguration.h"
 #include "platform/DeviceRoot.h"
+#include "platform/HostProfile.h"
 #include "platform/Log.h"
 #include "platform/SafePath.h"
 #include "platform/UserDatabase.h"
@@ -61,7 +62,12 @@ QRTGlobalConfiguration& QRTGlobalConfiguration::sharedInstance() {
 QRTGlobalConfiguration::QRTGlobalConfiguration()
     : homeDirectory_(QRTURL::fileURL(platform::hostPath("/private/var/root/"), true)),
       emplacerdHomeDirectory_(QRTURL::fileURL(platform::hostPath("/private/var/emplacerd/"), true)) {
-  if (auto mobile = platform::userByName("mobile")) {
+  if (platform::hostProfile()) {
+    // The default user is whoever DefaultUser= names (start-up logs which);
+    // without one, requests for it are refused rather than served as root's.
+    auto user = platform::hostDefaultUser();
+    currentMobileUserId_ = user ? user->uid : kNoDefaultUser;
+  } else if (auto mobile = platform::userByName("mobile")) {
     currentMobileUserId_ = mobile->uid;
     QRTLog(platform::kLogError, "Current mobile user ID is %u", currentMobileUserId_);
   } else {
@@ -282,4 +288,8 @@ bool QRTGlobalConfiguration::migrationFileExistsWithName(const std::string& name
       name.find('\0') != std::string::npos)
     return false;
   return QRTFileManager::defaultManager().itemExistsAtURL(libraryDirectory().URLByAppendingPathComponent(name));
+}
+
+std::optional<uint64_t> QRTGlobalConfiguration::configuredMaxContainersPerClass() {
+  return platform::configuredMaxContainersPerClass();
 }

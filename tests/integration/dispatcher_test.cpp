@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "DaemonFixture.h"
+#include "QuarterKit/Testing.h"
 #include "base/Frame.h"
 
 namespace {
@@ -65,7 +66,7 @@ TEST_F(DispatcherTest, UnreadableFrameClosesOnlyItsConnection) {
   ASSERT_TRUE(healthy && bad);
   // A well-framed payload that is not a property list.
   std::vector<uint8_t> garbage = {12, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0, 'n', 'o', 'p', 'e'};
-  ASSERT_TRUE(bad->sendRaw(garbage.data(), garbage.size()));
+  ASSERT_TRUE(qk::testing::ConnectionAccess::sendRaw(*bad, garbage.data(), garbage.size()));
   auto lost = bad->send(request(30));
   EXPECT_EQ(lost.get(), std::nullopt);
   EXPECT_TRUE(bad->closed());
@@ -75,7 +76,7 @@ TEST_F(DispatcherTest, UnreadableFrameClosesOnlyItsConnection) {
        {frame::encode(7, {}), std::vector<uint8_t>{3, 0, 0, 0}, std::vector<uint8_t>{0, 0, 0, 2}}) {
     if (frameBytes.size() > 12) frameBytes[12 + 8] = 0xA0;  // the dictionary marker becomes an array
     auto conn = connect();
-    ASSERT_TRUE(conn->sendRaw(frameBytes.data(), frameBytes.size()));
+    ASSERT_TRUE(qk::testing::ConnectionAccess::sendRaw(*conn, frameBytes.data(), frameBytes.size()));
     EXPECT_EQ(conn->send(request(30)).get(), std::nullopt);
   }
 

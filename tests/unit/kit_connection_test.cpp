@@ -9,7 +9,9 @@
 
 #include "QuarterKit/QuarterKit.h"
 #include "QuarterKit/Requests.h"
+#include "QuarterKit/Testing.h"
 #include "base/Frame.h"
+#include "base/QRTUUID.h"
 
 namespace {
 
@@ -27,7 +29,7 @@ class FakeServer {
     int sv[2];
     EXPECT_EQ(0, socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, sv));
     fd_ = sv[1];
-    client = qk::Connection::adopt(sv[0]);
+    client = qk::testing::ConnectionAccess::adopt(sv[0]);
   }
   ~FakeServer() { hangUp(); }
 
