@@ -5,12 +5,13 @@
 #include <chrono>
 #include <cstdint>
 #include <functional>
-#include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <utility>
 #include <vector>
+
+#include <nlohmann/json.hpp>
 
 #include "QuarterKit/QuarterKit.h"
 #include "QuarterKit/Requests.h"
@@ -29,6 +30,8 @@ struct UsageError {
 
 struct Global {
   std::string socketPath;
+  std::string deviceRoot;  // empty: the host's own daemon
+  bool socketGiven = false;
   bool json = false;
   std::chrono::milliseconds timeout = std::chrono::seconds(60);
   std::vector<std::string> args;  // the subcommand and its arguments
@@ -47,10 +50,14 @@ struct Args {
 struct Flag {
   const char* name;   // "--class"
   const char* value;  // what the value is ("N"); nullptr for a switch
+  const char* help;
 };
 
-inline const Flag kClassFlag{"--class", "N"}, kUserFlag{"--user", "N"}, kIdentifierFlag{"--identifier", "ID"},
-    kUUIDFlag{"--uuid", "UUID"}, kTransientFlag{"--transient", nullptr};
+inline const Flag kClassFlag{"--class", "CLASS", "the content class, by name or number (see --help)"},
+    kUserFlag{"--user", "N", "the user id (0 to 4294967294); defaults to the owner the class demands"},
+    kIdentifierFlag{"--identifier", "ID", "the program or group identifier (1 to 255 bytes)"},
+    kUUIDFlag{"--uuid", "UUID", "the container's internal UUID; looked up from the others when left out"},
+    kTransientFlag{"--transient", nullptr, "the transient variant of the class"};
 
 struct Subcommand {
   const char* name;      // one word, or two ("info get")
@@ -58,9 +65,9 @@ struct Subcommand {
   std::vector<Flag> flags;
   // Options that must be given; "--a|--b" is satisfied by either.
   std::vector<const char*> required;
-  const char* help;
+  const char* help;  // the first line is the summary
   int (*run)(const Global&, const Args&);
-  bool words = false;  // takes words besides its options
+  const char* words = nullptr;  // the words it takes besides its options ("[KEY=TYPE:VALUE ...]")
 };
 
 // A group of subcommands, in the order the help lists them.
@@ -89,12 +96,23 @@ void parseLong(const std::vector<std::string>& args, size_t first, const std::ve
 uint64_t parseUnsigned(const std::string& text, const std::string& what);
 int64_t parseSigned(const std::string& text, const std::string& what);
 QRTUUID parseUUID(const std::string& text, const std::string& what);
+uint64_t parseUser(const std::string& text, const std::string& what);
+// A content class by name ("app-data") or number (1 to 13).
+uint64_t parseClass(const std::string& text, const std::string& what);
+// The class's name, or its number when it has none.
+std::string className(uint64_t containerClass);
+// The class names, "app-bundle (1), app-data (2), ...", for help texts.
+std::string classList();
+// An identifier as the daemon takes it: 1 to 255 bytes, no control character.
+std::string checkIdentifier(const std::string& text, const std::string& what);
 plist::Value readPlistFile(const std::string& path);
 plist::Value readDictionaryFile(const std::string& path);
 // TYPE:VALUE, TYPE one of u64, i64, bool, str, uuid, data, plist.
 plist::Value parseTyped(const std::string& type, const std::string& text, const std::string& key);
 // KEY=TYPE:VALUE into the request.
 void addAssignment(const std::string& arg, plist::Dictionary& request);
+// Refuses a message the daemon would drop unanswered.
+void checkMessageSize(const plist::Value& message, const std::string& what);
 
 // ---- containers -------------------------------------------------------------
 // The only user id the daemon accepts for bundle and system classes; for
@@ -105,17 +123,44 @@ uint64_t ownerFor(uint64_t containerClass);
 qk::ContainerRef containerArgs(const Args& a, const std::string& prefix = "--");
 
 // ---- sending and showing ---------------------------------------------------
-// How a subcommand shows a reply when --json is not given.
-enum class Output {
-  Whole,  // every key, sorted
-  Keys,   // only the listed keys the reply has
-  List,   // "IDENTIFIER UUID" per container
-  Value,  // the first listed key's value alone, on success
-  Lines,  // the first listed key's array, one element a line, or dictionary, "KEY VALUE" a line
+// Text for people: control characters and invalid UTF-8 escaped, so that
+// what the daemon stores cannot forge a line or steer the terminal.
+std::string printable(std::string_view text);
+// A value in one line (UUIDs as text, nested values in the old-style form).
+std::string plainText(const plist::Value& v);
+nlohmann::json toJson(const plist::Value& v);
+std::string sizeText(uint64_t bytes, bool units);
+
+// Columns aligned under their headers; cells are made printable.
+class Table {
+ public:
+  explicit Table(std::vector<std::string> headers) : rows_{std::move(headers)} {}
+  void add(std::vector<std::string> cells) { rows_.push_back(std::move(cells)); }
+  void print() const;
+
+ private:
+  std::vector<std::vector<std::string>> rows_;
 };
 
-// Connects, sends, prints the reply and returns the exit status.
-int deliver(const Global& global, const std::function<qk::Result(qk::Connection&)>& send,
-            Output output = Output::Whole, const std::vector<std::string>& keys = {});
+// How a successful reply is shown. Without `human` it prints "ok"; without
+// `json` it prints the reply's keys.
+struct Show {
+  using Hints = std::vector<std::pair<uint64_t, const char*>>;
+  Show(std::function<void(const qk::Reply&)> human = {}, std::function<nlohmann::json(const qk::Reply&)> json = {},
+       Hints hints = {})
+      : human(std::move(human)), json(std::move(json)), hints(std::move(hints)) {}
+
+  std::function<void(const qk::Reply&)> human;
+  std::function<nlohmann::json(const qk::Reply&)> json;
+  Hints hints;  // lines that explain an error code for this subcommand
+};
+
+using Send = std::function<qk::Result(qk::Connection&)>;
+
+// Connects, sends, shows the reply and returns the exit status.
+int deliver(const Global& global, const Send& send, const Show& show = {});
+// Fills in the UUID (and identifier) of r by looking the container up when
+// it was not given; the failed look-up's reply otherwise.
+qk::Result resolve(qk::Connection& c, qk::ContainerRef& r);
 
 }  // namespace ctl

@@ -1,15 +1,12 @@
 // Replies shown to people and to scripts.
-#include <algorithm>
+#include <cerrno>
 #include <cmath>
 #include <cstdio>
 #include <ctime>
 #include <iostream>
 
-#include <nlohmann/json.hpp>
-
 #include "Cli.h"
 #include "QuarterKit/Errors.h"
-#include "base/PlistCodec.h"
 
 namespace ctl {
 
@@ -75,6 +72,8 @@ std::string hexText(const plist::Data& d) {
   return out + ">";
 }
 
+}  // namespace
+
 std::string plainText(const plist::Value& v) {
   switch (v.type()) {
     case plist::Type::Boolean: return v.boolean() ? "true" : "false";
@@ -88,6 +87,8 @@ std::string plainText(const plist::Value& v) {
   }
   return "";
 }
+
+namespace {
 
 std::string base64(const plist::Data& d) {
   static const char alphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
@@ -103,6 +104,8 @@ std::string base64(const plist::Data& d) {
   }
   return out;
 }
+
+}  // namespace
 
 nlohmann::json toJson(const plist::Value& v) {
   switch (v.type()) {
@@ -129,78 +132,186 @@ nlohmann::json toJson(const plist::Value& v) {
 }
 
 
-void printList(const qk::Reply& reply) {
-  const plist::Array* ids = reply.array("ReplyIdsArray");
-  const plist::Array* uuids = reply.array("ReplyUUIDsArray");
-  if (!ids || !uuids) return;
-  for (size_t i = 0; i < std::min(ids->size(), uuids->size()); ++i)
-    std::cout << plainText((*ids)[i]) << ' ' << plainText((*uuids)[i]) << '\n';
+namespace {
+
+// The length of a valid UTF-8 sequence at text[i] and its code point; 0 when
+// it is not one.
+size_t decodeUtf8(std::string_view text, size_t i, uint32_t* point) {
+  const auto byte = [&](size_t k) { return static_cast<unsigned char>(text[k]); };
+  const unsigned char b = byte(i);
+  size_t n = b < 0x80 ? 1 : (b >> 5) == 6 ? 2 : (b >> 4) == 14 ? 3 : (b >> 3) == 30 ? 4 : 0;
+  if (n == 0 || i + n > text.size()) return 0;
+  uint32_t p = n == 1 ? b : b & (0x7f >> n);
+  for (size_t k = 1; k < n; ++k) {
+    if ((byte(i + k) & 0xc0) != 0x80) return 0;
+    p = p << 6 | (byte(i + k) & 0x3f);
+  }
+  static const uint32_t kLeast[] = {0, 0, 0x80, 0x800, 0x10000};
+  if (p < kLeast[n] || p > 0x10ffff || (p >= 0xd800 && p <= 0xdfff)) return 0;
+  *point = p;
+  return n;
 }
 
-void printReply(const qk::Reply& reply, const Global& options, Output output,
-                const std::vector<std::string>& keys) {
-  if (options.json) {
-    // A string the daemon sent that is not UTF-8 is shown with U+FFFD, not refused.
-    std::cout << toJson(plist::Value(reply.dictionary())).dump(-1, ' ', false, nlohmann::json::error_handler_t::replace)
-              << '\n';
-    return;
-  }
-  switch (output) {
-    case Output::Whole:
-    case Output::Keys:
-      for (const auto& [key, value] : reply.dictionary()) {
-        bool wanted = output == Output::Whole ? key != "ReplyError"
-                                              : std::find(keys.begin(), keys.end(), key) != keys.end();
-        if (wanted) std::cout << key << ": " << plainText(value) << '\n';
-      }
-      if (output == Output::Whole && reply.ok()) std::cout << "ok\n";
-      return;
-    case Output::List:
-      if (reply.ok()) printList(reply);
-      return;
-    case Output::Value:
-      if (const plist::Value* v = reply.value(keys.front()); v && reply.ok()) std::cout << plainText(*v) << '\n';
-      return;
-    case Output::Lines:
-      if (const plist::Array* a = reply.array(keys.front()); a && reply.ok())
-        for (const plist::Value& e : *a) std::cout << plainText(e) << '\n';
-      if (const plist::Dictionary* d = reply.dictionary(keys.front()); d && reply.ok())
-        for (const auto& [k, e] : *d) std::cout << k << ' ' << plainText(e) << '\n';
-      return;
-  }
+// Characters that end a line, steer the terminal or reorder text.
+bool invisible(uint32_t p) {
+  return p < 0x20 || (p >= 0x7f && p <= 0x9f) || p == 0x2028 || p == 0x2029 || (p >= 0x202a && p <= 0x202e) ||
+         (p >= 0x2066 && p <= 0x2069);
 }
 
-std::unique_ptr<qk::Connection> connectOrExplain(const Global& options) {
-  std::string error;
-  auto connection = qk::Connection::connect(options.socketPath, &error);
-  if (!connection) {
-    std::cerr << "quarterctl: " << error << '\n';
-    return nullptr;
-  }
-  connection->setReplyTimeout(options.timeout);
-  return connection;
-}
-
-int finish(const qk::Connection& connection, const std::optional<qk::Reply>& reply, const Global& options,
-           Output output = Output::Whole, const std::vector<std::string>& keys = {}) {
-  if (!reply) {
-    std::cerr << (connection.closed() ? "quarterctl: the daemon closed the connection without a reply\n"
-                                      : "quarterctl: no reply in time, or a reply that is not a dictionary\n");
-    return kExitUsage;
-  }
-  printReply(*reply, options, output, keys);
-  if (reply->ok()) return kExitOK;
-  std::cerr << "quarterctl: " << qk::describeResult(reply->error()) << '\n';
-  return kExitReplyError;
+size_t displayWidth(std::string_view text) {
+  size_t width = 0;
+  for (unsigned char c : text) width += (c & 0xc0) != 0x80;
+  return width;
 }
 
 }  // namespace
 
-int deliver(const Global& global, const std::function<qk::Result(qk::Connection&)>& send, Output output,
-            const std::vector<std::string>& keys) {
+std::string printable(std::string_view text) {
+  std::string out;
+  char buf[16];
+  for (size_t i = 0; i < text.size();) {
+    uint32_t p = 0;
+    size_t n = decodeUtf8(text, i, &p);
+    if (n == 0) {
+      snprintf(buf, sizeof buf, "\\x%02x", static_cast<unsigned char>(text[i]));
+      out += buf;
+      i += 1;
+      continue;
+    }
+    if (p == '\\') out += "\\\\";
+    else if (p == '\n') out += "\\n";
+    else if (p == '\t') out += "\\t";
+    else if (p == '\r') out += "\\r";
+    else if (invisible(p)) {
+      snprintf(buf, sizeof buf, p < 0x80 ? "\\x%02x" : "\\u%04x", static_cast<unsigned>(p));
+      out += buf;
+    } else {
+      out.append(text.substr(i, n));
+    }
+    i += n;
+  }
+  return out;
+}
+
+void Table::print() const {
+  std::vector<std::vector<std::string>> shown;
+  std::vector<size_t> widths;
+  for (const auto& row : rows_) {
+    shown.emplace_back();
+    for (size_t c = 0; c < row.size(); ++c) {
+      shown.back().push_back(printable(row[c]));
+      if (widths.size() <= c) widths.push_back(0);
+      widths[c] = std::max(widths[c], displayWidth(shown.back().back()));
+    }
+  }
+  for (const auto& row : shown) {
+    std::string line;
+    for (size_t c = 0; c < row.size(); ++c) {
+      line += row[c];
+      if (c + 1 < row.size()) line.append(widths[c] - displayWidth(row[c]) + 2, ' ');
+    }
+    std::cout << line << '\n';
+  }
+}
+
+std::string sizeText(uint64_t bytes, bool units) {
+  if (!units || bytes < 1024) return std::to_string(bytes) + (units ? " B" : "");
+  static const char* const kUnits[] = {"KiB", "MiB", "GiB", "TiB", "PiB", "EiB"};
+  double value = static_cast<double>(bytes) / 1024;
+  size_t unit = 0;
+  for (; value >= 1024 && unit + 1 < std::size(kUnits); ++unit) value /= 1024;
+  char buf[32];
+  snprintf(buf, sizeof buf, value < 10 ? "%.1f %s" : "%.0f %s", value, kUnits[unit]);
+  return buf;
+}
+
+namespace {
+
+std::unique_ptr<qk::Connection> connectOrExplain(const Global& global) {
+  std::string error;
+  auto connection = qk::Connection::connect(global.socketPath, &error);
+  if (!connection) {
+    const int err = errno;
+    std::cerr << "quarterctl: " << printable(error) << '\n';
+    if (err == ENOENT || err == ECONNREFUSED) {
+      if (global.deviceRoot.empty() || global.socketGiven)
+        std::cerr << "quarterctl: is quarterd running? try: systemctl status quarterd\n";
+      else
+        std::cerr << "quarterctl: is quarterd running on this device root? start it with: quarterd --root "
+                  << printable(global.deviceRoot) << '\n';
+    }
+    return nullptr;
+  }
+  connection->setReplyTimeout(global.timeout);
+  return connection;
+}
+
+void printJson(const nlohmann::json& value) {
+  // A string the daemon sent that is not UTF-8 is shown with U+FFFD, not refused.
+  std::cout << value.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace) << '\n';
+}
+
+int reportError(const qk::Reply& reply, const Global& global, const Show& show) {
+  const uint64_t code = reply.error();
+  const char* text = qk::errorText(code);
+  if (global.json) {
+    const char* name = qk::errorName(code);
+    printJson({{"error",
+                {{"code", code},
+                 {"name", name ? nlohmann::json(name) : nlohmann::json(nullptr)},
+                 {"message", text ? text : "unknown error"}}}});
+    return kExitReplyError;
+  }
+  std::cerr << "quarterctl: " << qk::describeResult(code) << '\n';
+  for (const auto& [hinted, hint] : show.hints)
+    if (hinted == code) std::cerr << "quarterctl: " << hint << '\n';
+  return kExitReplyError;
+}
+
+// Every reply key but ReplyError.
+plist::Dictionary otherKeys(const qk::Reply& reply) {
+  plist::Dictionary out = reply.dictionary();
+  out.erase("ReplyError");
+  return out;
+}
+
+}  // namespace
+
+int deliver(const Global& global, const Send& send, const Show& show) {
   auto connection = connectOrExplain(global);
   if (!connection) return kExitUsage;
-  return finish(*connection, send(*connection), global, output, keys);
+  const qk::Result reply = send(*connection);
+  if (!reply) {
+    std::cerr << (connection->closed() ? "quarterctl: the daemon closed the connection without a reply\n"
+                                       : "quarterctl: no reply in time, or a reply that is not a dictionary\n");
+    return kExitUsage;
+  }
+  if (!reply->ok()) return reportError(*reply, global, show);
+  if (global.json) {
+    printJson(show.json ? show.json(*reply) : toJson(plist::Value(otherKeys(*reply))));
+  } else if (show.human) {
+    show.human(*reply);
+  } else {
+    plist::Dictionary keys = otherKeys(*reply);
+    if (keys.empty()) {
+      std::cout << "ok\n";
+    } else {
+      Table table({"KEY", "VALUE"});
+      for (const auto& [key, value] : keys) table.add({key, plainText(value)});
+      table.print();
+    }
+  }
+  return kExitOK;
+}
+
+qk::Result resolve(qk::Connection& c, qk::ContainerRef& r) {
+  if (r.uuid) return qk::Reply(plist::Dictionary{{"ReplyError", 1}});
+  qk::Result found = qk::createOrLookupContainer(c, r.userId, r.identifier, r.containerClass, false, false);
+  if (found && found->ok()) {
+    r.uuid = found->uuid("ReplyUUID");
+    if (auto identifier = found->string("ReplyIdentifier")) r.identifier = identifier;
+  }
+  return found;
 }
 
 }  // namespace ctl

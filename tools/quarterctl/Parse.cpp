@@ -4,6 +4,7 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <iterator>
 #include <fstream>
 
 #include "Cli.h"
@@ -12,8 +13,19 @@
 namespace ctl {
 
 namespace {
-constexpr size_t kMaxPlistFile = 64u * 1024 * 1024;
-}
+
+// A request frame holds at most 16 MiB; the daemon drops a larger one
+// without an answer. A file for one fills most of it.
+constexpr size_t kMaxMessage = 16u * 1024 * 1024 - 8;
+constexpr uint64_t kMaxUser = 4294967294u;  // 2^32 - 1 is no user
+constexpr size_t kMaxIdentifier = 255;
+
+const char* const kClassNames[] = {
+    nullptr,          "app-bundle", "app-data", "addon-bundle",    "addon-data", "vpn-bundle", "vpn-data",
+    "group",          "framework",  "relay-service", "internal-daemon", "temp-dir", "system", "system-group",
+};
+
+}  // namespace
 
 bool Args::has(std::string_view flag) const {
   for (const auto& [name, v] : given)
@@ -110,7 +122,7 @@ plist::Value readPlistFile(const std::string& path) {
   char chunk[65536];
   while (in.read(chunk, sizeof chunk) || in.gcount() > 0) {
     bytes.append(chunk, static_cast<size_t>(in.gcount()));
-    if (bytes.size() > kMaxPlistFile) throw UsageError{path + " is too large"};
+    if (bytes.size() > kMaxMessage) throw UsageError{path + " is larger than the 16 MiB limit of a request"};
   }
   std::string error;
   auto value = plist::parse(bytes.data(), bytes.size(), &error);
@@ -151,6 +163,48 @@ void addAssignment(const std::string& arg, plist::Dictionary& request) {
   request.insert_or_assign(key, parseTyped(arg.substr(eq + 1, colon - eq - 1), arg.substr(colon + 1), key));
 }
 
+uint64_t parseUser(const std::string& text, const std::string& what) {
+  uint64_t v = parseUnsigned(text, what);
+  if (v > kMaxUser) throw UsageError{what + " " + text + " is out of range: user ids are 0 to 4294967294"};
+  return v;
+}
+
+uint64_t parseClass(const std::string& text, const std::string& what) {
+  for (uint64_t n = 1; n < std::size(kClassNames); ++n)
+    if (text == kClassNames[n]) return n;
+  if (!text.empty() && isdigit(static_cast<unsigned char>(text[0]))) {
+    uint64_t n = parseUnsigned(text, what);
+    if (n >= 1 && n < std::size(kClassNames)) return n;
+  }
+  throw UsageError{"unknown class for " + what + ": " + text + "; one of " + classList()};
+}
+
+std::string className(uint64_t containerClass) {
+  return containerClass >= 1 && containerClass < std::size(kClassNames) ? kClassNames[containerClass]
+                                                                         : std::to_string(containerClass);
+}
+
+std::string classList() {
+  std::string out;
+  for (uint64_t n = 1; n < std::size(kClassNames); ++n)
+    out += (n > 1 ? ", " : "") + std::string(kClassNames[n]) + " (" + std::to_string(n) + ")";
+  return out;
+}
+
+std::string checkIdentifier(const std::string& text, const std::string& what) {
+  if (text.empty()) throw UsageError{what + " is empty"};
+  if (text.size() > kMaxIdentifier)
+    throw UsageError{what + " is " + std::to_string(text.size()) + " bytes, longer than the 255-byte limit"};
+  for (unsigned char c : text)
+    if (c < 0x20 || c == 0x7f) throw UsageError{what + " holds a control character: " + printable(text)};
+  return text;
+}
+
+void checkMessageSize(const plist::Value& message, const std::string& what) {
+  if (plist::writeBinary(message).size() > kMaxMessage)
+    throw UsageError{what + " is larger than the 16 MiB limit of a request"};
+}
+
 uint64_t ownerFor(uint64_t containerClass) {
   switch (containerClass) {
     case 1: case 3: case 5: case 8: return 33;
@@ -161,10 +215,16 @@ uint64_t ownerFor(uint64_t containerClass) {
 
 qk::ContainerRef containerArgs(const Args& a, const std::string& prefix) {
   qk::ContainerRef r;
-  if (auto v = a.value(prefix + "class")) r.containerClass = parseUnsigned(*v, prefix + "class");
+  if (auto v = a.value(prefix + "class")) r.containerClass = parseClass(*v, prefix + "class");
   r.userId = ownerFor(r.containerClass);
-  if (auto v = a.value(prefix + "user")) r.userId = parseUnsigned(*v, prefix + "user");
-  r.identifier = a.value(prefix + "identifier");
+  if (auto v = a.value(prefix + "user")) {
+    r.userId = parseUser(*v, prefix + "user");
+    // The daemon answers only "invalid argument" to these.
+    if (ownerFor(r.containerClass) != 1 && r.userId != ownerFor(r.containerClass))
+      throw UsageError{"class " + className(r.containerClass) + " belongs to user " +
+                       std::to_string(ownerFor(r.containerClass)) + "; leave out " + prefix + "user"};
+  }
+  if (auto v = a.value(prefix + "identifier")) r.identifier = checkIdentifier(*v, prefix + "identifier");
   if (auto v = a.value(prefix + "uuid")) r.uuid = parseUUID(*v, prefix + "uuid");
   return r;
 }
