@@ -6,6 +6,7 @@
 
 #include <filesystem>
 #include <map>
+#include <set>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -41,6 +42,16 @@ std::vector<std::map<std::string, std::string>> rows(const std::string& out) {
     }
   }
   return table;
+}
+
+std::string output(const std::string& command) {
+  std::string out;
+  if (FILE* pipe = popen(command.c_str(), "r")) {
+    char buffer[4096];
+    for (size_t n; (n = fread(buffer, 1, sizeof buffer, pipe)) > 0;) out.append(buffer, n);
+    pclose(pipe);
+  }
+  return out;
 }
 
 class QuarterctlTest : public DaemonFixture {
@@ -202,6 +213,66 @@ TEST_F(QuarterctlTest, CodeSigningAndGroups) {
   EXPECT_EQ(gone.err, "quarterctl: error 21 (no such container)\n");
   EXPECT_EQ(run("codesign invalidate-missing").status, 0);
   EXPECT_EQ(run("codesign set --identifier com.example.app").status, 2) << "one of the three is required";
+}
+
+// Each command with its --options, as one source names them; "" holds the global options.
+using Commands = std::map<std::string, std::set<std::string>>;
+
+// The --options in a text; roff writes a dash as \-.
+std::set<std::string> optionsIn(std::string text) {
+  for (size_t at; (at = text.find("\\-")) != std::string::npos;) text.erase(at, 1);
+  std::set<std::string> found;
+  for (size_t at = 0; (at = text.find("--", at)) != std::string::npos; at += 2) {
+    size_t end = text.find_first_not_of("abcdefghijklmnopqrstuvwxyz-", at + 2);
+    found.insert(text.substr(at, end - at));
+  }
+  return found;
+}
+
+TEST(QuarterctlDocs, HelpManPageAndCompletionNameTheSameCommandsAndOptions) {
+  const std::string binary = QRT_QUARTERCTL_PATH;
+  Commands help, page, completion;
+  std::istringstream usage(output(binary + " --help"));
+  bool inCommands = false;
+  for (std::string line; std::getline(usage, line);) {
+    if (line.starts_with("  -")) help[""].merge(optionsIn(line.substr(0, 20)));
+    if (line == "Commands:" || line.empty()) inCommands = line == "Commands:";
+    if (!inCommands || line == "Commands:") continue;
+    const std::string name = line.substr(2, line.find("  ", 2) - 2);
+    std::istringstream own(output(binary + " " + name + " --help"));
+    help[name];
+    for (std::string option; std::getline(own, option);)
+      if (option.starts_with("  --")) help[name].merge(optionsIn(option.substr(0, option.find(' ', 2))));
+  }
+
+  // A heading of the man page: ".B name words \-\-option ..." after a .TP.
+  std::istringstream roff(readFile(std::string(QRT_MAN_DIR) + "/quarterctl.1"));
+  std::string section, previous;
+  for (std::string line; std::getline(roff, line); previous = line) {
+    if (line.starts_with(".SH ")) section = line.substr(4);
+    if (previous != ".TP" || (section != "COMMANDS" && section != "OPTIONS")) continue;
+    for (size_t at; (at = line.find("\\-")) != std::string::npos;) line.erase(at, 1);
+    std::string name;
+    for (std::istringstream words(line.substr(line.find(' ') + 1)); section == "COMMANDS";) {
+      std::string word;
+      if (!(words >> word) || word[0] == '-' || word.find_first_of("\\[(") != std::string::npos) break;
+      name += (name.empty() ? "" : " ") + word;
+    }
+    page[name].merge(optionsIn(line));
+  }
+
+  std::istringstream bash(readFile(std::string(QRT_MAN_DIR) + "/../bash-completion/quarterctl"));
+  for (std::string line; std::getline(bash, line);) {
+    size_t paren = line.find(") opts=\"");
+    if (line.find("globals=\"") != std::string::npos) completion[""] = optionsIn(line);
+    if (paren == std::string::npos) continue;
+    std::string name = line.substr(line.find_first_not_of(' '), paren - line.find_first_not_of(' '));
+    if (name.front() == '"') name = name.substr(1, name.size() - 2);
+    completion[name] = optionsIn(line.substr(paren));
+  }
+  EXPECT_GE(help.size(), 30u);
+  EXPECT_EQ(help, page);
+  EXPECT_EQ(help, completion);
 }
 
 }  // namespace
