@@ -258,7 +258,13 @@ int run(int argc, char** argv) {
       std::cout << usageText();
       return kExitOK;
     }
-    throw UsageError{"unknown command " + args[0] + (args.size() > 1 ? " " + args[1] : "")};
+    std::string second;
+    for (const Group* group : groups())
+      for (const Subcommand& row : group->subcommands)
+        if (std::string_view(row.name).starts_with(args[0] + " "))
+          second += (second.empty() ? "" : ", ") + std::string(row.name).substr(args[0].size() + 1);
+    if (!second.empty()) throw UsageError{args[0] + " needs one of: " + second};
+    throw UsageError{"unknown command " + args[0]};
   }
   if (help || wantsHelp(args, words, *row)) {
     std::cout << subcommandUsage(*row);
