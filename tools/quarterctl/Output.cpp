@@ -72,24 +72,6 @@ std::string hexText(const plist::Data& d) {
   return out + ">";
 }
 
-}  // namespace
-
-std::string plainText(const plist::Value& v) {
-  switch (v.type()) {
-    case plist::Type::Boolean: return v.boolean() ? "true" : "false";
-    case plist::Type::Integer: return integerText(v.integer());
-    case plist::Type::Real: return realText(v.real());
-    case plist::Type::Date: return dateText(v.date());
-    case plist::Type::String: return v.string();
-    case plist::Type::Data: return uuidText(v).value_or(hexText(v.data()));
-    case plist::Type::Array:
-    case plist::Type::Dictionary: return plist::describe(withUUIDStrings(v));
-  }
-  return "";
-}
-
-namespace {
-
 std::string base64(const plist::Data& d) {
   static const char alphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
   std::string out;
@@ -104,35 +86,6 @@ std::string base64(const plist::Data& d) {
   }
   return out;
 }
-
-}  // namespace
-
-nlohmann::json toJson(const plist::Value& v) {
-  switch (v.type()) {
-    case plist::Type::Boolean: return v.boolean();
-    case plist::Type::Integer:
-      if (v.integer().isUnsigned) return v.integer().asUnsigned();
-      return v.integer().asSigned();
-    case plist::Type::Real: return v.real();  // NaN and infinities dump as null
-    case plist::Type::Date: return dateText(v.date());
-    case plist::Type::String: return v.string();
-    case plist::Type::Data: return uuidText(v).value_or(base64(v.data()));
-    case plist::Type::Array: {
-      nlohmann::json out = nlohmann::json::array();
-      for (const plist::Value& e : v.array()) out.push_back(toJson(e));
-      return out;
-    }
-    case plist::Type::Dictionary: {
-      nlohmann::json out = nlohmann::json::object();
-      for (const auto& [k, e] : v.dictionary()) out[k] = toJson(e);
-      return out;
-    }
-  }
-  return nullptr;
-}
-
-
-namespace {
 
 // The length of a valid UTF-8 sequence at text[i] and its code point; 0 when
 // it is not one.
@@ -165,6 +118,44 @@ size_t displayWidth(std::string_view text) {
 }
 
 }  // namespace
+
+std::string plainText(const plist::Value& v) {
+  switch (v.type()) {
+    case plist::Type::Boolean: return v.boolean() ? "true" : "false";
+    case plist::Type::Integer: return integerText(v.integer());
+    case plist::Type::Real: return realText(v.real());
+    case plist::Type::Date: return dateText(v.date());
+    case plist::Type::String: return v.string();
+    case plist::Type::Data: return uuidText(v).value_or(hexText(v.data()));
+    case plist::Type::Array:
+    case plist::Type::Dictionary: return plist::describe(withUUIDStrings(v));
+  }
+  return "";
+}
+
+nlohmann::json toJson(const plist::Value& v) {
+  switch (v.type()) {
+    case plist::Type::Boolean: return v.boolean();
+    case plist::Type::Integer:
+      if (v.integer().isUnsigned) return v.integer().asUnsigned();
+      return v.integer().asSigned();
+    case plist::Type::Real: return v.real();  // NaN and infinities dump as null
+    case plist::Type::Date: return dateText(v.date());
+    case plist::Type::String: return v.string();
+    case plist::Type::Data: return uuidText(v).value_or(base64(v.data()));
+    case plist::Type::Array: {
+      nlohmann::json out = nlohmann::json::array();
+      for (const plist::Value& e : v.array()) out.push_back(toJson(e));
+      return out;
+    }
+    case plist::Type::Dictionary: {
+      nlohmann::json out = nlohmann::json::object();
+      for (const auto& [k, e] : v.dictionary()) out[k] = toJson(e);
+      return out;
+    }
+  }
+  return nullptr;
+}
 
 std::string printable(std::string_view text) {
   std::string out;

@@ -196,7 +196,7 @@ std::string checkIdentifier(const std::string& text, const std::string& what) {
   if (text.size() > kMaxIdentifier)
     throw UsageError{what + " is " + std::to_string(text.size()) + " bytes, longer than the 255-byte limit"};
   for (unsigned char c : text)
-    if (c < 0x20 || c == 0x7f) throw UsageError{what + " holds a control character: " + printable(text)};
+    if (c < 0x20 || c == 0x7f) throw UsageError{what + " holds a control character: " + text};
   return text;
 }
 

@@ -13,10 +13,14 @@
 
 namespace ctl {
 
+namespace {
+
 std::vector<const Group*>& registry() {
   static std::vector<const Group*> groups;
   return groups;
 }
+
+}  // namespace
 
 const std::vector<const Group*>& groups() { return registry(); }
 
@@ -219,7 +223,7 @@ Global parseOptions(int argc, char** argv, bool* help, bool* version) {
   if (rootGiven && options.deviceRoot.empty()) throw UsageError{"--root needs a directory"};
   // QuarterKit knows where the sockets are: under a device root, or the host's.
   if (!options.socketGiven)
-    options.socketPath = qk::requestSocketPath(options.deviceRoot.empty() ? "/" : options.deviceRoot);
+    options.socketPath = options.deviceRoot.empty() ? qk::requestSocketPath() : qk::requestSocketPath(options.deviceRoot);
   options.args.assign(argv + optind, argv + argc);
   return options;
 }
@@ -280,9 +284,10 @@ int main(int argc, char** argv) {
   try {
     return ctl::run(argc, argv);
   } catch (const ctl::UsageError& e) {
-    std::cerr << "quarterctl: " << e.message << "\n(quarterctl --help for usage)\n";
+    // Messages quote what was given, which may come from anywhere.
+    std::cerr << "quarterctl: " << ctl::printable(e.message) << "\n(quarterctl --help for usage)\n";
   } catch (const std::exception& e) {
-    std::cerr << "quarterctl: " << e.what() << '\n';
+    std::cerr << "quarterctl: " << ctl::printable(e.what()) << '\n';
   }
   return ctl::kExitUsage;
 }
