@@ -5,7 +5,11 @@
 #include <sys/wait.h>
 
 #include <filesystem>
+#include <map>
+#include <set>
+#include <sstream>
 #include <string>
+#include <vector>
 
 #include "DaemonFixture.h"
 #include "base/PlistCodec.h"
@@ -15,15 +19,40 @@ namespace {
 // The exit status (-1 when it did not exit normally) and what was printed.
 struct CtlRun { int status = -1; std::string out, err; };
 
-// The value of a "Key: value" line of readable output.
-std::string field(const std::string& out, const std::string& key) {
-  size_t at = out.find(key + ": ");
-  if (at == std::string::npos) return "";
-  at += key.size() + 2;
-  return out.substr(at, out.find('\n', at) - at);
+bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
+
+// The rows of a table, cut at the columns of its header line.
+std::vector<std::map<std::string, std::string>> rows(const std::string& out) {
+  std::istringstream in(out);
+  std::string header, line;
+  std::getline(in, header);
+  std::vector<std::pair<std::string, size_t>> columns;
+  for (size_t at = 0; (at = header.find_first_not_of(' ', at)) != std::string::npos;) {
+    size_t end = header.find(' ', at);
+    columns.emplace_back(header.substr(at, end - at), at);
+    at = end;
+  }
+  std::vector<std::map<std::string, std::string>> table;
+  while (std::getline(in, line) && !line.empty()) {
+    table.emplace_back();
+    for (size_t c = 0; c < columns.size(); ++c) {
+      std::string cell = line.substr(std::min(line.size(), columns[c].second),
+                                     c + 1 < columns.size() ? columns[c + 1].second - columns[c].second : std::string::npos);
+      table.back()[columns[c].first] = cell.substr(0, cell.find_last_not_of(' ') + 1);
+    }
+  }
+  return table;
 }
 
-bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
+std::string output(const std::string& command) {
+  std::string out;
+  if (FILE* pipe = popen(command.c_str(), "r")) {
+    char buffer[4096];
+    for (size_t n; (n = fread(buffer, 1, sizeof buffer, pipe)) > 0;) out.append(buffer, n);
+    pclose(pipe);
+  }
+  return out;
+}
 
 class QuarterctlTest : public DaemonFixture {
  protected:
@@ -40,9 +69,7 @@ class QuarterctlTest : public DaemonFixture {
   }
 
   // Runs the binary with --root and the arguments, as a shell splits them.
-  CtlRun run(const std::string& args, const std::string& binary = "") {
-    return shell((binary.empty() ? ctl : binary) + " --root " + root + " " + args);
-  }
+  CtlRun run(const std::string& args) { return shell(ctl + " --root " + root + " " + args); }
   CtlRun shell(const std::string& command) {
     const std::string out = root + "/ctl.out", err = root + "/ctl.err";
     int status = system((command + " >" + out + " 2>" + err).c_str());
@@ -52,51 +79,49 @@ class QuarterctlTest : public DaemonFixture {
   std::string ctl;
 };
 
-TEST_F(QuarterctlTest, CreateListInfoJsonAndDelete) {
-  CtlRun created = run("create --class 2 --identifier com.example.ctl");
-  ASSERT_EQ(created.status, 0) << created.err;
-  EXPECT_EQ(field(created.out, "ReplyIdentifier"), "com.example.ctl");
-  EXPECT_EQ(field(created.out, "ReplyExisted"), "false");
-  const std::string path = field(created.out, "ReplyPath");
-  EXPECT_EQ(path.rfind(root + "/private/var/mobile/Containers/Data/Application/", 0), 0u) << created.out;
+TEST_F(QuarterctlTest, TablesJsonAndTheContainerFoundWithoutItsUUID) {
+  auto created = rows(run("create --class app-data --identifier com.example.ctl").out);
+  ASSERT_EQ(created.size(), 1u);
+  EXPECT_EQ(created[0]["IDENTIFIER"], "com.example.ctl");
+  EXPECT_EQ(created[0]["EXISTED"], "no");
+  const std::string path = created[0]["PATH"], uuid = created[0]["UUID"];
+  EXPECT_EQ(path.rfind(root + "/private/var/mobile/Containers/Data/Application/", 0), 0u);
   EXPECT_TRUE(std::filesystem::is_directory(path));
-  const std::string uuid = field(created.out, "ReplyUUID");
-  ASSERT_EQ(uuid.size(), 36u) << created.out;
-  EXPECT_EQ(field(run("lookup --class 2 --identifier com.example.ctl").out, "ReplyExisted"), "true");
-  EXPECT_TRUE(contains(run("list --class 2").out, "com.example.ctl " + uuid + "\n"));
+  EXPECT_EQ(rows(run("lookup --class 2 --identifier com.example.ctl").out)[0]["EXISTED"], "yes");
+  auto listed = rows(run("list --class app-data").out);
+  ASSERT_EQ(listed.size(), 1u);
+  EXPECT_EQ(listed[0], (std::map<std::string, std::string>{{"IDENTIFIER", "com.example.ctl"}, {"UUID", uuid}, {"PATH", path}}));
 
-  const std::string info = " --class 2 --identifier com.example.ctl --uuid " + uuid + " --key Colour";
-  for (const std::string value : {"str:deep blue", "u64:18446744073709551615"}) {
-    EXPECT_EQ(run("info set" + info + " --value '" + value + "'").status, 0) << value;
-    CtlRun got = run("info get" + info);
-    EXPECT_EQ(got.status, 0);
-    EXPECT_EQ(got.out, value.substr(4) + "\n");
+  // Info values, with and without --uuid; a hostile key and value stay on their line.
+  const std::string one = " --class app-data --identifier com.example.ctl";
+  for (const auto& [value, shown] : std::vector<std::pair<std::string, std::string>>{
+           {"'str:deep blue'", "deep blue"}, {"u64:18446744073709551615", "18446744073709551615"},
+           {"\"$(printf 'str:two\\nlines\\033[2J')\"", "two\\nlines\\x1b[2J"}}) {
+    for (const std::string& which : {one, one + " --uuid " + uuid}) {
+      EXPECT_EQ(run("info set" + which + " --key \"$(printf 'Col\\nour')\" --value " + value).status, 0) << value;
+      EXPECT_EQ(run("info get" + which + " --key \"$(printf 'Col\\nour')\"").out, shown + "\n");
+    }
   }
-  EXPECT_EQ(run("info set" + info).status, 0) << "no --value removes the key";
-  CtlRun gone = run("info get" + info);
+  EXPECT_TRUE(run("metadata --info" + one).out.ends_with("\nCol\\nour  two\\nlines\\x1b[2J\n"));
+  EXPECT_EQ(run("info set" + one + " --key \"$(printf 'Col\\nour')\"").out, "ok\n") << "no --value removes the key";
+  CtlRun gone = run("info get" + one + " --key \"$(printf 'Col\\nour')\"");
   EXPECT_EQ(gone.status, 1);
   EXPECT_EQ(gone.err, "quarterctl: error 24 (no such info value)\n");
+  const std::string bytes = rows(run("du" + one).out)[0]["SIZE"], size = rows(run("du -h" + one).out)[0]["SIZE"];
+  EXPECT_TRUE(size.ends_with(" KiB") || size == bytes + " B") << bytes << " shown as " << size;
 
-  // --json prints the whole reply as one object.
-  CtlRun json = run("--json lookup --class 2 --identifier com.example.ctl");
-  ASSERT_EQ(json.status, 0) << json.err;
-  EXPECT_EQ(json.out.front(), '{');
-  EXPECT_EQ(json.out.substr(json.out.size() - 2), "}\n");
-  for (const std::string& part : {std::string("\"ReplyError\":1"), std::string("\"ReplyExisted\":true"),
-                                 "\"ReplyUUID\":\"" + uuid + "\""})
-    EXPECT_TRUE(contains(json.out, part)) << json.out;
-  json = run("--json list --class 2");
-  EXPECT_TRUE(contains(json.out, "\"ReplyIdsArray\":[\"com.example.ctl\"]")) << json.out;
-  EXPECT_TRUE(contains(json.out, "\"ReplyUUIDsArray\":[\"" + uuid + "\"]")) << json.out;
-  json = run("--json du --class 2 --identifier com.example.ctl --uuid " + uuid);
-  EXPECT_EQ(json.status, 0);
-  EXPECT_TRUE(contains(json.out, "\"ReplyDiskUsage\":")) << json.out;
-
-  CtlRun deleted = run("delete --class 2 --identifier com.example.ctl");
-  EXPECT_EQ(deleted.status, 0) << deleted.err;
-  EXPECT_EQ(deleted.out, "ok\n");
-  EXPECT_EQ(run("deathrow").status, 0);
-  EXPECT_FALSE(contains(run("list --class 2").out, "com.example.ctl"));
+  // --json: objects, a list an array of them, no ReplyError; an error object on failure.
+  struct { std::string args, json; } scripts[] = {
+      {"lookup" + one, "{\"existed\":true,\"identifier\":\"com.example.ctl\",\"path\":\"" + path + "\",\"uuid\":\"" + uuid + "\"}"},
+      {"list --class 2", "[{\"identifier\":\"com.example.ctl\",\"path\":\"" + path + "\",\"uuid\":\"" + uuid + "\"}]"},
+      {"du" + one, "{\"bytes\":" + bytes + ",\"identifier\":\"com.example.ctl\",\"uuid\":\"" + uuid + "\"}"},
+      {"metadata" + one, "{\"identifier\":\"com.example.ctl\",\"path\":\"" + path + "\",\"transient\":false,\"uuid\":\"" + uuid + "\"}"},
+      {"delete" + one, "{}"},
+      {"delete" + one, "{\"error\":{\"code\":21,\"message\":\"no such container\",\"name\":\"QRTErrorNotFound\"}}"},
+  };
+  for (const auto& [args, json] : scripts) EXPECT_EQ(run("--json " + args).out, json + "\n") << args;
+  EXPECT_EQ(run("deathrow").out, "ok\n");
+  EXPECT_EQ(run("list --class app-data").out, "IDENTIFIER  UUID  PATH\n");
 }
 
 TEST_F(QuarterctlTest, ExitStatusTellsDaemonErrorsFromUsageErrors) {
@@ -104,7 +129,7 @@ TEST_F(QuarterctlTest, ExitStatusTellsDaemonErrorsFromUsageErrors) {
   // whichever way the options and the device root are given.
   struct { std::string command, err; } refusals[] = {
       {ctl + " --root " + root + " delete --class 2 --identifier com.example.none", "error 21 (no such container)"},
-      {ctl + " --root=" + root + " lookup --class=2 --identifier=com.example.none", "error 21 (no such container)"},
+      {ctl + " --root=" + root + " lookup --class=app-data --identifier=com.example.none", "error 21 (no such container)"},
       {"QUARTERD_ROOT=" + root + " " + ctl + " info get --class 2 --identifier com.example.none --uuid "
        "00000000-0000-0000-0000-000000000000 --key k", "error 21 (no such container)"},
       // The original binary has no identity, so no entitlement.
@@ -117,21 +142,40 @@ TEST_F(QuarterctlTest, ExitStatusTellsDaemonErrorsFromUsageErrors) {
     EXPECT_EQ(r.err, "quarterctl: " + err + "\n") << command;
   }
 
-  // Usage and connection trouble: exit 2.
-  for (const std::string args : {"list", "info get --class 2 --identifier a --key k", "create --class 2 --bogus", "create --class", "raw --file",
-                                 "stage --entry 501:2:not-a-uuid:a", "--socket /nonexistent/socket deathrow"}) {
+  // Usage and connection trouble: exit 2, and nothing reaches the daemon.
+  writeFile(root + "/big", "<plist><data>" + std::string(1400000, 'A') + "</data></plist>");
+  struct { std::string args, err; } usage[] = {
+      {"list", "list needs --class"},
+      {"info get --class 2 --identifier a", "info get needs --key"},
+      {"create --class 2 --bogus", "unknown argument to create: --bogus"},
+      {"create --class", "--class needs a value"},
+      {"raw --file", "--file needs a value"},
+      {"stage --entry 501:2:not-a-uuid:a", "not a UUID for --entry"},
+      {"list --class 14", "unknown class for --class: 14; one of app-bundle (1),"},
+      {"create --class app-bundle --user 501", "class app-bundle belongs to user 33"},
+      {"create --class 2 --user 4294967295", "--user 4294967295 is out of range: user ids are 0 to 4294967294"},
+      {"protect --identifier a --protection-class 5", "protection classes are 0 to 4"},
+      {"create --class 2 --identifier " + std::string(256, 'a'), "256 bytes, longer than the 255-byte limit"},
+      {"create --class 2 --identifier \"$(printf 'a\\nb')\"", "--identifier holds a control character: a\\nb"},
+      {"info set --class 2 --identifier a --key k --value plist:" + root + "/big", "value larger than the 1 MiB limit"},
+      {"--socket /x deathrow", "--root and --socket both name the daemon"},
+      {"--root " + root + "/nowhere deathrow", "is quarterd running on this device root? start it with: quarterd --root"},
+  };
+  for (const auto& [args, err] : usage) {
     CtlRun r = run(args);
     EXPECT_EQ(r.status, 2) << args;
-    EXPECT_NE(r.err, "") << args;
+    EXPECT_TRUE(contains(r.err, err)) << args << ": " << r.err;
   }
+  CtlRun down = shell(ctl + " --socket " + root + "/nowhere deathrow");
+  EXPECT_TRUE(contains(down.err, "\nquarterctl: is quarterd running? try: systemctl status quarterd\n")) << down.err;
 }
 
 TEST_F(QuarterctlTest, StageWipeSystemPathAndAssets) {
-  const std::string staged = field(run("create --class 2 --identifier com.example.staged").out, "ReplyUUID");
-  EXPECT_EQ(run("stage --entry 501:2:" + staged + ":com.example.staged").status, 0);
+  const std::string staged = rows(run("create --class 2 --identifier com.example.staged").out)[0]["UUID"];
+  EXPECT_EQ(run("stage --entry 501:app-data:" + staged + ":com.example.staged").status, 0);
   EXPECT_FALSE(contains(run("list --class 2").out, "com.example.staged"));
 
-  const std::string path = field(run("create --class 2 --identifier com.example.keep").out, "ReplyPath");
+  const std::string path = rows(run("create --class 2 --identifier com.example.keep").out)[0]["PATH"];
   writeFile(path + "/Documents/file", "data");
   EXPECT_EQ(run("wipe --class 2 --identifier com.example.keep").status, 0);
   EXPECT_FALSE(exists(path + "/Documents/file"));
@@ -139,11 +183,11 @@ TEST_F(QuarterctlTest, StageWipeSystemPathAndAssets) {
 
   CtlRun sys = run("system-path --identifier com.example.daemon");
   EXPECT_EQ(sys.status, 0) << sys.err;
-  EXPECT_TRUE(std::filesystem::is_directory(field(sys.out, "ReplyPath"))) << sys.out;
+  EXPECT_TRUE(std::filesystem::is_directory(sys.out.substr(0, sys.out.size() - 1))) << sys.out;
 
   ASSERT_EQ(run("create --class 2 --identifier com.example.assets").status, 0);
   CtlRun assets = run("assets-path --identifier com.example.assets --relative");
-  EXPECT_TRUE(field(assets.out, "ReplyPath").starts_with("Library/com.norvane.UserManagedAssets.")) << assets.err;
+  EXPECT_TRUE(assets.out.starts_with("Library/com.norvane.UserManagedAssets.")) << assets.err;
   EXPECT_EQ(run("assets-delete --identifier com.example.assets --source ../x").status, 1);
 }
 
@@ -152,17 +196,16 @@ TEST_F(QuarterctlTest, CodeSigningAndGroups) {
       {"com.norvane.security.application-groups", plist::Array{"group.one", "group.two"}},
       {"com.norvane.security.system-groups", "systemgroup.com.example.shared"}});
   writeFile(root + "/ents.plist", std::string(entitlements.begin(), entitlements.end()));
-  EXPECT_EQ(run("codesign set --identifier com.example.app --entitlements " + root + "/ents.plist --data-class 2").status, 0);
+  EXPECT_EQ(run("codesign set --identifier com.example.app --entitlements " + root + "/ents.plist --data-class app-data").status, 0);
   EXPECT_TRUE(contains(run("codesign get --identifier com.example.app").out, "group.two"));
-  const std::string ids = run("groups ids --identifier com.example.app").out;
-  EXPECT_TRUE(contains(ids, "group.one\n") && contains(ids, "group.two\n") && ids.size() == 20) << ids;
-  CtlRun paths = run("groups paths --identifier com.example.app");
-  ASSERT_EQ(paths.status, 0) << paths.err;
-  const std::string two = paths.out.substr(paths.out.find("group.two ") + 10);
-  EXPECT_TRUE(std::filesystem::is_directory(two.substr(0, two.find('\n')))) << paths.out;
+  EXPECT_EQ(run("groups ids --identifier com.example.app").out, "GROUP\ngroup.one\ngroup.two\n");
+  auto paths = rows(run("groups paths --identifier com.example.app").out);
+  ASSERT_EQ(paths.size(), 2u);
+  EXPECT_EQ(paths[1]["GROUP"], "group.two");
+  EXPECT_TRUE(std::filesystem::is_directory(paths[1]["PATH"]));
   // quarterctl itself is not entitled to the system group.
   EXPECT_EQ(run("system-group-path --group systemgroup.com.example.shared").status, 1);
-  EXPECT_TRUE(contains(run("groups paths --system --identifier com.example.app").out, "systemgroup.com.example.shared "));
+  EXPECT_EQ(rows(run("groups paths --system --identifier com.example.app").out)[0]["GROUP"], "systemgroup.com.example.shared");
 
   EXPECT_EQ(run("codesign set --identifier com.example.app --remove").status, 0);
   CtlRun gone = run("codesign get --identifier com.example.app");
@@ -170,6 +213,66 @@ TEST_F(QuarterctlTest, CodeSigningAndGroups) {
   EXPECT_EQ(gone.err, "quarterctl: error 21 (no such container)\n");
   EXPECT_EQ(run("codesign invalidate-missing").status, 0);
   EXPECT_EQ(run("codesign set --identifier com.example.app").status, 2) << "one of the three is required";
+}
+
+// Each command with its --options, as one source names them; "" holds the global options.
+using Commands = std::map<std::string, std::set<std::string>>;
+
+// The --options in a text; roff writes a dash as \-.
+std::set<std::string> optionsIn(std::string text) {
+  for (size_t at; (at = text.find("\\-")) != std::string::npos;) text.erase(at, 1);
+  std::set<std::string> found;
+  for (size_t at = 0; (at = text.find("--", at)) != std::string::npos; at += 2) {
+    size_t end = text.find_first_not_of("abcdefghijklmnopqrstuvwxyz-", at + 2);
+    found.insert(text.substr(at, end - at));
+  }
+  return found;
+}
+
+TEST(QuarterctlDocs, HelpManPageAndCompletionNameTheSameCommandsAndOptions) {
+  const std::string binary = QRT_QUARTERCTL_PATH;
+  Commands help, page, completion;
+  std::istringstream usage(output(binary + " --help"));
+  bool inCommands = false;
+  for (std::string line; std::getline(usage, line);) {
+    if (line.starts_with("  -")) help[""].merge(optionsIn(line.substr(0, 20)));
+    if (line == "Commands:" || line.empty()) inCommands = line == "Commands:";
+    if (!inCommands || line == "Commands:") continue;
+    const std::string name = line.substr(2, line.find("  ", 2) - 2);
+    std::istringstream own(output(binary + " " + name + " --help"));
+    help[name];
+    for (std::string option; std::getline(own, option);)
+      if (option.starts_with("  --")) help[name].merge(optionsIn(option.substr(0, option.find(' ', 2))));
+  }
+
+  // A heading of the man page: ".B name words \-\-option ..." after a .TP.
+  std::istringstream roff(readFile(std::string(QRT_MAN_DIR) + "/quarterctl.1"));
+  std::string section, previous;
+  for (std::string line; std::getline(roff, line); previous = line) {
+    if (line.starts_with(".SH ")) section = line.substr(4);
+    if (previous != ".TP" || (section != "COMMANDS" && section != "OPTIONS")) continue;
+    for (size_t at; (at = line.find("\\-")) != std::string::npos;) line.erase(at, 1);
+    std::string name;
+    for (std::istringstream words(line.substr(line.find(' ') + 1)); section == "COMMANDS";) {
+      std::string word;
+      if (!(words >> word) || word[0] == '-' || word.find_first_of("\\[(") != std::string::npos) break;
+      name += (name.empty() ? "" : " ") + word;
+    }
+    page[name].merge(optionsIn(line));
+  }
+
+  std::istringstream bash(readFile(std::string(QRT_MAN_DIR) + "/../bash-completion/quarterctl"));
+  for (std::string line; std::getline(bash, line);) {
+    size_t paren = line.find(") opts=\"");
+    if (line.find("globals=\"") != std::string::npos) completion[""] = optionsIn(line);
+    if (paren == std::string::npos) continue;
+    std::string name = line.substr(line.find_first_not_of(' '), paren - line.find_first_not_of(' '));
+    if (name.front() == '"') name = name.substr(1, name.size() - 2);
+    completion[name] = optionsIn(line.substr(paren));
+  }
+  EXPECT_GE(help.size(), 30u);
+  EXPECT_EQ(help, page);
+  EXPECT_EQ(help, completion);
 }
 
 }  // namespace
