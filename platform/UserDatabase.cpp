@@ -178,6 +178,6 @@ std::optional<GroupAccount> groupByName(const std::string& name) {
   return account;
 }
 
-uint32_t ordinaryUserMinimum() { return 501; }
+uint32_t ordinaryUserMinimum() { return hostProfile() ? hostOrdinaryUserMinimum() : 501; }
 
 }  // namespace platform

@@ -28,7 +28,7 @@ std::optional<UserAccount> userById(uint32_t uid);
 std::optional<GroupAccount> groupByName(const std::string& name);
 
 // The lowest uid of an ordinary (human) user; anything below is the system's
-// or a service's. 501 on a device root.
+// or a service's: 501 on a device root, UID_MIN of /etc/login.defs on a host.
 uint32_t ordinaryUserMinimum();
 
 // The system's own database, untranslated.

@@ -203,7 +203,7 @@ size_t QRTGlobalConfiguration::maxContainersPerClass() const {
     if (end != text->c_str()) return n;
   }
 #endif
-  return kMaxContainersPerClass;
+  return platform::configuredMaxContainersPerClass().value_or(kMaxContainersPerClass);
 }
 
 QRTURL QRTGlobalConfiguration::replaceDirectory() {
@@ -290,6 +290,3 @@ bool QRTGlobalConfiguration::migrationFileExistsWithName(const std::string& name
   return QRTFileManager::defaultManager().itemExistsAtURL(libraryDirectory().URLByAppendingPathComponent(name));
 }
 
-std::optional<uint64_t> QRTGlobalConfiguration::configuredMaxContainersPerClass() {
-  return platform::configuredMaxContainersPerClass();
-}

@@ -27,8 +27,6 @@ class QRTGlobalConfiguration {
   // kNoDefaultUser in the host profile when no DefaultUser= names an account.
   uint32_t currentMobileUserId() const { return currentMobileUserId_; }
   static constexpr uint32_t kNoDefaultUser = 4294967294u;
-  // MaxContainersPerClass= of the host profile's configuration, when given.
-  static std::optional<uint64_t> configuredMaxContainersPerClass();
 
   QRTURL sharedContainersDirectory();
   QRTURL bundleDirectory();
