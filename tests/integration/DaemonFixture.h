@@ -107,6 +107,8 @@ std::pair<uint32_t, uint32_t> ownerAndMode(const std::string& path);
 // File helpers; a missing file reads as empty, a missing directory lists nothing.
 void writeFile(const std::string& path, const std::string& text);
 std::string readFile(const std::string& path);
+// What a shell command prints on standard output.
+std::string output(const std::string& command);
 bool exists(const std::string& path);
 std::vector<std::string> listDirectory(const std::string& path);
 std::optional<plist::Dictionary> readPlist(const std::string& path);

@@ -44,16 +44,6 @@ std::vector<std::map<std::string, std::string>> rows(const std::string& out) {
   return table;
 }
 
-std::string output(const std::string& command) {
-  std::string out;
-  if (FILE* pipe = popen(command.c_str(), "r")) {
-    char buffer[4096];
-    for (size_t n; (n = fread(buffer, 1, sizeof buffer, pipe)) > 0;) out.append(buffer, n);
-    pclose(pipe);
-  }
-  return out;
-}
-
 class QuarterctlTest : public DaemonFixture {
  protected:
   void SetUp() override {

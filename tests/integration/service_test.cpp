@@ -124,16 +124,6 @@ TEST_F(ServiceTest, HangupReopensTheLogAfterOutsideRotation) {
   EXPECT_FALSE(contains(readFile(log + ".rotated"), "Log reopened"));
 }
 
-std::string output(const std::string& command) {
-  std::string out;
-  if (FILE* pipe = popen(command.c_str(), "r")) {
-    char buffer[4096];
-    for (size_t n; (n = fread(buffer, 1, sizeof buffer, pipe)) > 0;) out.append(buffer, n);
-    pclose(pipe);
-  }
-  return out;
-}
-
 // Every --long-option a text names; roff writes the dashes as \-.
 // (By hand: std::regex trips a false maybe-uninitialized warning in the
 // sanitizer builds.)
