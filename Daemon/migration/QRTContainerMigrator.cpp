@@ -2,6 +2,7 @@
 
 #include <cerrno>
 #include <cstdlib>
+#include <optional>
 
 #include "Daemon/QRTCrashPoint.h"
 #include "Daemon/QRTDaemon.h"
@@ -16,6 +17,7 @@
 #include "Daemon/store/QRTWhitelist.h"
 #include "platform/DeviceProperties.h"
 #include "platform/DeviceRoot.h"
+#include "platform/HostProfile.h"
 #include "platform/Log.h"
 
 using platform::kLogError;
@@ -26,6 +28,23 @@ namespace {
 constexpr const char* kOldBundleContainerPath = "/private/var/mobile/Containers/Bundle";
 constexpr uint64_t kMultiUserModeFlag = 0x80000000u;
 constexpr uint32_t kBundleOwnerId = 33;
+
+// The installer's account as files carry it: 33 on a device, the account
+// standing for it on a host. Nothing, with a log line, when that is missing.
+struct HostOwner {
+  uid_t uid;
+  gid_t gid;
+};
+std::optional<HostOwner> bundleOwner() {
+  std::optional<uid_t> uid = platform::hostUserId(kBundleOwnerId);
+  std::optional<gid_t> gid = platform::hostGroupId(kBundleOwnerId);
+  if (!uid || !gid) {
+    QRTLog(kLogError, "No account stands for the installer (%u): bundle containers left as they are",
+           static_cast<unsigned>(kBundleOwnerId));
+    return std::nullopt;
+  }
+  return HostOwner{*uid, *gid};
+}
 
 bool isMissing(const QRTErrorRef& error) {
   return error && error->domain() == QRTPOSIXErrorDomain && error->code() == ENOENT;
@@ -106,7 +125,8 @@ bool QRTContainerMigrator::_buildUpgradeSteps(QRTMigrationStatus* status, QRTErr
   QRTFileManager& fm = QRTFileManager::defaultManager();
   // The old place is in a user's home: only a tree of root's or the
   // installer's alone becomes the bundle classes.
-  if (fm.itemExistsAtURL(oldBundles) && fm.itemIsImportableAtURL(oldBundles, oldBundles, kBundleOwnerId)) {
+  const std::optional<HostOwner> owner = fm.itemExistsAtURL(oldBundles) ? bundleOwner() : std::nullopt;
+  if (owner && fm.itemIsImportableAtURL(oldBundles, oldBundles, owner->uid)) {
     QRTLog(kLogNotice, "Moving bundle containers from user to system location");
     const QRTURL bundles = QRTGlobalConfiguration::sharedInstance().bundleDirectory();
     QRTErrorRef error;
@@ -115,7 +135,7 @@ bool QRTContainerMigrator::_buildUpgradeSteps(QRTMigrationStatus* status, QRTErr
       QRTSetError(withError, error);
       return false;
     }
-    if (!fm.itemIsImportableAtURL(bundles, bundles, kBundleOwnerId)) {
+    if (!fm.itemIsImportableAtURL(bundles, bundles, owner->uid)) {
       // Swapped since it was checked: what arrived is not kept.
       const QRTURL removed = bundles.URLByDeletingLastPathComponent().URLByAppendingPathComponent("Bundle.refused", true);
       if (!fm.moveItemAtURL(bundles, removed, &error) || !fm.removeItemAtURL(removed, &error)) {
@@ -232,9 +252,13 @@ bool QRTContainerMigrator::_performBundleContainerOwnershipMigrationWithError(QR
   if (occurred(status.get(), QRTMigrationTypeBundle)) return true;
   QRTLog(kLogNotice, "Changing ownership of bundle container content.");
   const QRTURL bundles = QRTGlobalConfiguration::sharedInstance().bundleDirectory();
+  const std::optional<HostOwner> owner = bundleOwner();
   QRTErrorRef ownerError;
-  if (!QRTFileManager::defaultManager().standardizeOwnershipAtURL(bundles, kBundleOwnerId, kBundleOwnerId,
-                                                                  &ownerError)) {
+  if (!owner) {
+    ownerError = QRT_POSIX_ERROR(EPERM, "No account stands for user %u", static_cast<unsigned>(kBundleOwnerId));
+  }
+  if (!owner || !QRTFileManager::defaultManager().standardizeOwnershipAtURL(bundles, owner->uid, owner->gid,
+                                                                            &ownerError)) {
     QRTSetError(error, QRT_ERROR(QRTErrorChangeOwnerFailed, ownerError, true, "Failed to change owner of %@: %@",
                                  bundles, ownerError));
     return false;

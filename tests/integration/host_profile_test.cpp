@@ -161,6 +161,9 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
     auto metadata = readPlist(seen + "/" + kMetadataFile);
     EXPECT_EQ(u64At(metadata, "QRTMetadataPersona"), row.persona);
   }
+  // The data migration hands the bundle class to the installer's account, not to uid 33.
+  EXPECT_EQ(codeOf(host.call(0, request(24, {}))), 1u);
+  EXPECT_EQ(ownerAndMode(host.inside(store + "Bundle/Application")).first, kInstaller);
   // The home's own .local stays its user's.
   EXPECT_EQ(ownerAndMode(dir + "/home/bob/.local").first, kBob);
   EXPECT_TRUE(listDirectory(dir + "/victim").empty());
