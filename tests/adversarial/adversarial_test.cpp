@@ -260,13 +260,22 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
     }
     return exitStatus(lastPid);
   }
-  // quarterctl raw run by the user as the registered entitled program, or
-  // (bindOver) as their own program mounted over its path in namespaces of
-  // their own; the exit status, 125 when the namespaces are refused.
+  // quarterctl raw run by the user as the registered entitled program with
+  // a library of theirs preloaded (it writes to preloadOut), or (bindOver) as
+  // their own program mounted over its path in namespaces of their own; the
+  // exit status, 125 when the namespaces are refused.
   int runEntitledAs(uid_t uid, bool bindOver, const std::vector<std::string>& raw) {
     const std::string entitled = root + "/usr/bin/entitledctl";
     pid_t pid = fork();
     if (pid == 0) {
+      if (!bindOver) {
+        int out = open(preloadOut().c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+        if (out < 0 || dup2(out, 1) != 1) _exit(126);
+        setenv("LD_PRELOAD", QRT_EXEC_PRELOAD_PATH, 1);
+        // The library is not built with the sanitizer the program may carry.
+        const char* asan = getenv("ASAN_OPTIONS");
+        setenv("ASAN_OPTIONS", (std::string(asan ? asan : "") + ":verify_asan_link_order=0").c_str(), 1);
+      }
       becomeUser(uid);
       if (bindOver) {
         auto map = [](const char* file, const std::string& text) { std::ofstream(file) << text; };
@@ -286,6 +295,8 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
     }
     return exitStatus(pid);
   }
+
+  std::string preloadOut() const { return root + "/preloaded"; }
 
   void plant(const std::function<bool()>& step) { ASSERT_EQ(asUser(kUser, step), 0) << "the user could not plant"; }
 
@@ -589,6 +600,7 @@ const Case kCases[] = {
      [](T& t) {
        t.runEntitledAs(kUser, false, kDeleteSystemContainer);
        EXPECT_TRUE(exists(t.fresh.path)) << "the system container was deleted";
+       EXPECT_NE(readFile(t.preloadOut()).find("preloaded into"), std::string::npos) << "the library did not run";
      }},
     {"NamespaceBindMountOverEntitledProgram_DeleteSystemContainer", registerEntitledCopy,
      [](T& t) {
