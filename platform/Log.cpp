@@ -6,6 +6,8 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <chrono>
+#include <condition_variable>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -15,6 +17,7 @@
 #include <optional>
 #include <unordered_map>
 #include <string_view>
+#include <thread>
 
 #include "platform/FileIO.h"
 #include "platform/SafePath.h"
@@ -177,12 +180,35 @@ void rotateLocked(LogFile& file) {
     syslog(LOG_ERR, "Failed to reopen log %s after rotation: %s", file.path.c_str(), strerror(errno));
 }
 
+thread_local std::optional<uint32_t> tRequestCaller;
+
+void writeLine(int level, const char* function, const std::string& message) {
+  std::string line = formatLine(level, function, message);
+  if (LogSink sink = gSink.load()) {
+    sink(syslogPriority(level), escaped(function ? function : "(null)"), escaped(message));
+    if (gStderr) writeAll(STDERR_FILENO, line);
+    return;
+  }
+  LogFile& file = logFile();
+  std::lock_guard lock(file.mutex);
+  if (file.fd >= 0 && file.sizeLimit > 0 && file.size > 0 && file.size + line.size() > file.sizeLimit)
+    rotateLocked(file);
+  if (file.fd >= 0) {
+    writeAll(file.fd, line);
+    file.size += line.size();
+  } else {
+    syslog(syslogPriority(level), "%s: %s", escaped(function ? function : "(null)").c_str(), escaped(message).c_str());
+  }
+  if (gStderr) writeAll(STDERR_FILENO, line);
+}
+
 // Refusal lines admitted in the current second, per caller uid.
 struct RefusalBudget {
   std::mutex mutex;
   int64_t second = 0;
   std::unordered_map<uint32_t, uint32_t> admitted;
   std::map<uint32_t, uint64_t> leftOut;
+  std::condition_variable leftOutChanged;
 };
 
 RefusalBudget& refusalBudget() {
@@ -220,7 +246,25 @@ void flushRefusalSummary() {
     std::lock_guard lock(budget.mutex);
     summary = turnSecondLocked(budget, monotonicSecond());
   }
-  if (summary) logWrite(kLogError, "logRefusal", *summary);
+  if (summary) writeLine(kLogError, "logRefusal", *summary);
+}
+
+// The summary of a second is written when it is over, even if nothing else
+// is logged after it.
+void startRefusalSummaries(RefusalBudget& budget) {
+  static std::once_flag once;
+  std::call_once(once, [&budget] {
+    std::thread([&budget] {
+      for (;;) {
+        {
+          std::unique_lock lock(budget.mutex);
+          budget.leftOutChanged.wait(lock, [&] { return !budget.leftOut.empty(); });
+        }
+        std::this_thread::sleep_for(std::chrono::seconds(1));
+        flushRefusalSummary();
+      }
+    }).detach();
+  });
 }
 
 }  // namespace
@@ -236,10 +280,12 @@ void logRefusal(uint32_t callerUid, const char* function, const std::string& mes
     if (!admit) {
       ++budget.leftOut[callerUid];
       gRefusalsLeftOut = true;
+      budget.leftOutChanged.notify_one();
     }
   }
-  if (summary) logWrite(kLogError, "logRefusal", *summary);
-  if (admit) logWrite(kLogError, function, message);
+  if (!admit) startRefusalSummaries(budget);
+  if (summary) writeLine(kLogError, "logRefusal", *summary);
+  if (admit) writeLine(kLogError, function, message);
 }
 
 std::string logIdentifier(std::string_view identifier) {
@@ -287,25 +333,17 @@ bool logReopen() {
 }
 
 void logWrite(int level, const char* function, const std::string& message) {
-  flushRefusalSummary();
-  std::string line = formatLine(level, function, message);
-  if (LogSink sink = gSink.load()) {
-    sink(syslogPriority(level), escaped(function ? function : "(null)"), escaped(message));
-    if (gStderr) writeAll(STDERR_FILENO, line);
+  // What a request logs as an error its caller can make at will.
+  if (level <= kLogError && tRequestCaller) {
+    logRefusal(*tRequestCaller, function, message);
     return;
   }
-  LogFile& file = logFile();
-  std::lock_guard lock(file.mutex);
-  if (file.fd >= 0 && file.sizeLimit > 0 && file.size > 0 && file.size + line.size() > file.sizeLimit)
-    rotateLocked(file);
-  if (file.fd >= 0) {
-    writeAll(file.fd, line);
-    file.size += line.size();
-  } else {
-    syslog(syslogPriority(level), "%s: %s", escaped(function ? function : "(null)").c_str(), escaped(message).c_str());
-  }
-  if (gStderr) writeAll(STDERR_FILENO, line);
+  flushRefusalSummary();
+  writeLine(level, function, message);
 }
+
+RefusalScope::RefusalScope(uint32_t callerUid) : previous_(tRequestCaller) { tRequestCaller = callerUid; }
+RefusalScope::~RefusalScope() { tRequestCaller = previous_; }
 
 void syslogWrite(int priority, const std::string& message) { syslog(priority, "%s", escaped(message).c_str()); }
 

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -38,8 +39,24 @@ void logWrite(int level, const char* function, const std::string& message);
 // rest are counted and one line a second says how many were left out.
 inline constexpr uint32_t kRefusalLinesPerSecond = 20;
 void logRefusal(uint32_t callerUid, const char* function, const std::string& message);
+// While a request is served on this thread, its error lines count as its
+// caller's refusals.
+class RefusalScope {
+ public:
+  explicit RefusalScope(uint32_t callerUid);
+  ~RefusalScope();
+  RefusalScope(const RefusalScope&) = delete;
+  RefusalScope& operator=(const RefusalScope&) = delete;
+
+ private:
+  std::optional<uint32_t> previous_;
+};
 // An identifier as a log line shows it: cut to 255 bytes.
 std::string logIdentifier(std::string_view identifier);
+inline std::string logIdentifier(const std::string& identifier) { return logIdentifier(std::string_view(identifier)); }
+inline std::optional<std::string> logIdentifier(const std::optional<std::string>& identifier) {
+  return identifier ? std::optional(logIdentifier(std::string_view(*identifier))) : std::nullopt;
+}
 // Straight to the system log, for lines about the log itself.
 void syslogWrite(int priority, const std::string& message);
 // Closes the file (tests reopen the log on another path).

@@ -77,6 +77,8 @@ void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::R
     return;
   }
   const plist::Dictionary& request = *event.message;
+  const auto& peer = connection->peer();
+  platform::RefusalScope refusals(peer ? peer->uid : UINT32_MAX);
   uint64_t command = QRTMessageU64(request, "Command");
   auto reply = std::make_shared<QRTReply>(connection, event.messageId);
   uint64_t result = QRTErrorNone;

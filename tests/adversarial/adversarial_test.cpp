@@ -22,6 +22,7 @@
 #include <map>
 #include <new>
 #include <sstream>
+#include <thread>
 #include <utility>
 
 #include "DaemonFixture.h"
@@ -639,9 +640,17 @@ const Case kCases[] = {
      [](T& t) {
        t.sendsAs(kUser, 55, {{10, byName(t.other)}});
        const std::string evidence = "from pid " + std::to_string(t.lastPid) + " ";
-       t.sendsAs(kUser, 55, {{17, {{"GroupIdentifier", std::string(16 << 10, 'g')}}}}, 800);
+       // Entitlement refusals and a handler's own refusal (a system container not entitled).
+       EXPECT_EQ(t.sendsAs(kUser, 55, {{17, {{"GroupIdentifier", "systemgroup.com.victim"}}},
+                                       {0, byName(499, 12, "com.example.sysd")}}, 400), 0);
+       std::this_thread::sleep_for(std::chrono::milliseconds(1500));
        const std::string log = t.root + "/private/var/root/Library/Logs/QuarterKit/quarterd.log";
-       EXPECT_NE((readFile(log + ".0") + readFile(log)).find(evidence), std::string::npos) << "the refusal is gone";
+       const std::string text = readFile(log + ".0") + readFile(log);
+       EXPECT_NE(text.find(evidence), std::string::npos) << "the refusal is gone";
+       EXPECT_NE(text.find("Left out refusal lines over 20 a second: uid 501 "), std::string::npos) << "no summary";
+       size_t lines = 0;
+       for (size_t at = 0; (at = text.find("not entitled for system container", at)) != std::string::npos; ++at) ++lines;
+       EXPECT_LE(lines, 60u) << "a handler's refusals are not limited";
      }},
     // Trees of the user's taken into global places at start-up.
     {"PlantedBackup_Reboot",
