@@ -77,7 +77,7 @@ std::optional<QRTContainerCache::ClassMap> QRTContainerCache::buildClassMap(uint
     if (pushMappings &&
         !setSandboxContainerMappingForUser(userId, metadata->identifier(), contentClass, metadata->url())) {
       QRTLog(kLogError, "Failed to set container mapping during create/lookup operation of %@, %llu",
-             metadata->identifier(), static_cast<unsigned long long>(contentClass));
+             platform::logIdentifier(metadata->identifier()), static_cast<unsigned long long>(contentClass));
     }
     map[metadata->identifier()] = std::move(metadata);
   }
@@ -156,7 +156,7 @@ bool QRTContainerCache::checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_
   }
   if (removed && !transient &&
       !setSandboxContainerMappingForUser(userId, metadata->identifier(), contentClass, std::nullopt)) {
-    QRTLog(kLogError, "Failed to remove container mapping of %@, %llu", metadata->identifier(),
+    QRTLog(kLogError, "Failed to remove container mapping of %@, %llu", platform::logIdentifier(metadata->identifier()),
            static_cast<unsigned long long>(contentClass));
   }
   return false;
@@ -182,7 +182,7 @@ QRTMetadataRef QRTContainerCache::containerForUser(uint32_t userId, uint64_t con
     }
     if (!checkEntryOnDisk(found, userId, contentClass, transient, error)) return nullptr;
     QRTLog(kLogDebug, "Cache: %@%@: Found Identifier: %@", QRTContentClassPathName(contentClass), suffix(transient),
-           identifier);
+           platform::logIdentifier(identifier));
     return found;
   } catch (...) {
     QRTSetError(error, QRT_EXCEPTION_ERROR());
@@ -242,7 +242,7 @@ std::optional<std::vector<QRTMetadataRef>> QRTContainerCache::allContainersForUs
       QRTErrorRef entryError;
       if (!checkEntryOnDisk(metadata, userId, contentClass, transient, &entryError)) continue;
       QRTLog(kLogDebug, "Cache: %@%@: ALL Found Identifier: %@", QRTContentClassPathName(contentClass),
-             suffix(transient), metadata->identifier());
+             suffix(transient), platform::logIdentifier(metadata->identifier()));
       live.push_back(std::move(metadata));
     }
     return live;
@@ -278,11 +278,11 @@ bool QRTContainerCache::addContainerMetadata(const QRTMetadataRef& metadata, uin
     if (stored) *stored = entry;
     if (!transient && updateSandbox &&
         !setSandboxContainerMappingForUser(forUser, metadata->identifier(), contentClass, url)) {
-      QRTLog(kLogError, "Failed to set container mapping of %@, %llu", metadata->identifier(),
+      QRTLog(kLogError, "Failed to set container mapping of %@, %llu", platform::logIdentifier(metadata->identifier()),
              static_cast<unsigned long long>(contentClass));
     }
     QRTLog(kLogDebug, "Cache: %@%@: Added Identifier: %@", QRTContentClassPathName(contentClass), suffix(transient),
-           metadata->identifier());
+           platform::logIdentifier(metadata->identifier()));
     return true;
   } catch (...) {
     QRTSetError(error, QRT_EXCEPTION_ERROR());
@@ -302,11 +302,11 @@ bool QRTContainerCache::removeContainerForUser(uint32_t userId, uint64_t content
       map->erase(*identifier);
     }
     if (!transient && !setSandboxContainerMappingForUser(userId, *identifier, contentClass, std::nullopt)) {
-      QRTLog(kLogError, "Failed to remove container mapping of %@, %llu", identifier,
+      QRTLog(kLogError, "Failed to remove container mapping of %@, %llu", platform::logIdentifier(identifier),
              static_cast<unsigned long long>(contentClass));
     }
     QRTLog(kLogDebug, "Cache: %@%@: Removed Identifier: %@", QRTContentClassPathName(contentClass), suffix(transient),
-           identifier);
+           platform::logIdentifier(identifier));
     return true;
   } catch (...) {
     QRTSetError(error, QRT_EXCEPTION_ERROR());
@@ -333,13 +333,13 @@ bool QRTContainerCache::setSandboxContainerMappingForUser(uint32_t userId, const
   const unsigned long long type = itemType;
   if (int status = platform::sandboxSetStateItem(mappingUser, itemType, identifier, nullptr)) {
     QRTLog(kLogError, "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d",
-           mappingUser, type, identifier.c_str(), cls, static_cast<const char*>(nullptr), status);
+           mappingUser, type, platform::logIdentifier(identifier).c_str(), cls, static_cast<const char*>(nullptr), status);
     return false;
   }
   if (!url) return true;
   if (int status = platform::sandboxSetStateItem(mappingUser, itemType, identifier, url->fileSystemRepresentation())) {
     QRTLog(kLogError, "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: %llu, path: %s : %d",
-           mappingUser, type, identifier.c_str(), cls, url->fileSystemRepresentation(), status);
+           mappingUser, type, platform::logIdentifier(identifier).c_str(), cls, url->fileSystemRepresentation(), status);
     return false;
   }
   return true;
