@@ -6,6 +6,7 @@
 #include <cerrno>
 #include <charconv>
 #include <functional>
+#include <mutex>
 #include <string_view>
 #include <vector>
 
@@ -176,6 +177,30 @@ std::optional<GroupAccount> groupByName(const std::string& name) {
     return true;
   });
   return account;
+}
+
+std::vector<uint32_t> allUserIds() {
+  std::vector<uint32_t> ids;
+  if (!useSystemDatabase()) {
+    scanDatabase("/etc/passwd", 7, [&](const std::vector<std::string_view>& f) {
+      if (std::optional<uint32_t> uid = parseId(f[2])) ids.push_back(*uid);
+      return false;
+    });
+    return ids;
+  }
+  // The enumeration's cursor is the process's own.
+  static std::mutex enumeration;
+  std::lock_guard hold(enumeration);
+  setpwent();
+  std::vector<char> buffer(16 << 10);
+  passwd record{};
+  passwd* found = nullptr;
+  while (getpwent_r(&record, buffer.data(), buffer.size(), &found) == 0 && found) {
+    uint32_t uid = hostProfile() ? protocolUserId(record.pw_uid) : record.pw_uid;
+    if (uid != kForeignUserId) ids.push_back(uid);
+  }
+  endpwent();
+  return ids;
 }
 
 uint32_t ordinaryUserMinimum() { return hostProfile() ? hostOrdinaryUserMinimum() : 501; }

@@ -8,6 +8,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace platform {
 
@@ -26,6 +27,9 @@ struct GroupAccount {
 std::optional<UserAccount> userByName(const std::string& name);
 std::optional<UserAccount> userById(uint32_t uid);
 std::optional<GroupAccount> groupByName(const std::string& name);
+
+// Every user's id, as userById takes it (start-up's sweep over users' trees).
+std::vector<uint32_t> allUserIds();
 
 // The lowest uid of an ordinary (human) user; anything below is the system's
 // or a service's: 501 on a device root, UID_MIN of /etc/login.defs on a host.

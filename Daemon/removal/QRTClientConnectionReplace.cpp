@@ -42,11 +42,12 @@ void QRTClientConnection::quarterSetup() {
 }
 
 void QRTClientConnection::quarterCleanup() {
+  QRTGlobalConfiguration& configuration = QRTGlobalConfiguration::sharedInstance();
+  configuration.loadUsersWithLeftovers();
   if (gReplaceRecoveryIncomplete) {
     deleteContainersOnDeathRowWithCompletion(nullptr);
     return;
   }
-  QRTGlobalConfiguration& configuration = QRTGlobalConfiguration::sharedInstance();
   configuration.getPerUserConfigurationForCurrentMobileUser();  // its base's staging is looked at too
   for (const QRTURL& staging : configuration.allStagingDirectories()) {
     QRTErrorRef error;

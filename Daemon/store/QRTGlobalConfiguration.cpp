@@ -194,6 +194,17 @@ std::vector<QRTURL> QRTGlobalConfiguration::allDeathrowDirectories() {
   return allDirectories(deathrowDirectory(), kUserDeathrowName);
 }
 
+void QRTGlobalConfiguration::loadUsersWithLeftovers() {
+  for (uint32_t uid : platform::allUserIds()) {
+    auto user = std::make_shared<QRTPerUserConfiguration>(uid);
+    auto base = user->userBaseDirectoryPath();
+    struct stat st;
+    if (base && (platform::safeStat(base->URLByAppendingPathComponent(kUserStagingName).path(), &st) == 0 ||
+                 platform::safeStat(base->URLByAppendingPathComponent(kUserDeathrowName).path(), &st) == 0))
+      getPerUserConfigurationForUserId(uid);
+  }
+}
+
 size_t QRTGlobalConfiguration::maxContainersPerClass() const {
 #ifdef QRT_TEST_HOOKS
   // Tests lower the bound rather than make ten thousand containers.

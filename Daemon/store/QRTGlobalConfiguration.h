@@ -49,6 +49,9 @@ class QRTGlobalConfiguration {
   // pass the checks, for death-row passes and start-up clean-up.
   std::vector<QRTURL> allStagingDirectories();
   std::vector<QRTURL> allDeathrowDirectories();
+  // Start-up: makes known every user whose base holds such a directory, so
+  // that clean-up and passes reach what an earlier run left there.
+  void loadUsersWithLeftovers();
 
   // How many containers of one class a user other than root may hold.
   size_t maxContainersPerClass() const;

@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <fstream>
 #include <optional>
 #include <string>
 #include <vector>
@@ -211,6 +212,19 @@ TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
   GTEST_SKIP() << "crash points need a build with test hooks";
 #endif
   if (GetParam() && !mountHomeOnTmpfs()) GTEST_SKIP() << "cannot mount a tmpfs for the home";
+  // What a run left in another user's staging and death row is gone after the next start.
+  const std::string other = root + "/private/var/mobile/other/Containers";
+  std::ofstream(root + "/etc/passwd", std::ios::app) << "other:x:502:502::/private/var/mobile/other:/bin/sh\n";
+  ASSERT_EQ(system(("mkdir -p " + other + "/.staging/left " + other + "/.deathrow/dead && chmod 700 " + other +
+                    "/.staging " + other + "/.deathrow && chown 502:502 " + other + " " + other + "/..")
+                       .c_str()),
+            0);
+  killDaemon();
+  startDaemon();
+  ASSERT_TRUE(call(1, {{"ContainerClass", 2}, {"UserID", 501}}));  // served once start-up is over
+  EXPECT_TRUE(listDirectory(other + "/.staging").empty());
+  for (int i = 0; i < 100 && !listDirectory(other + "/.deathrow").empty(); ++i) usleep(20000);
+  EXPECT_TRUE(listDirectory(other + "/.deathrow").empty());
   // A creation is whole or absent; a deletion leaves the content on death row only.
   for (auto [point, command, code] : {std::tuple{"create-after-build", 0, 21u}, {"create-after-move", 0, 1u},
                                       {"delete-after-stage", 10, 21u}}) {
