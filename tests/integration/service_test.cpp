@@ -80,6 +80,9 @@ TEST_F(ServiceTest, ReadyOnlyOnceRequestsAreServedAndStoppingOnSigterm) {
 // kills the process, as under the service manager) serves both sockets, makes
 // user and system containers, and removes both sockets on SIGTERM.
 TEST_F(ServiceTest, ServesUnderTheUnitsSystemCallFilterAndRemovesItsSocketsOnExit) {
+#ifdef __SANITIZE_THREAD__
+  GTEST_SKIP() << "the thread sanitizer's runtime makes calls outside the unit's filter";
+#endif
   const std::string unit = readFile(QRT_UNIT_PATH), key = "\nSystemCallFilter=";
   const size_t at = unit.find(key);
   ASSERT_NE(at, std::string::npos);
