@@ -77,8 +77,8 @@ uint64_t clearInfoKey(const QRTMetadataRef& container, const char* key) {
 }
 
 // The group ids in the metadata file of the container at url, when the file
-// is root's alone (one link, writable by no one else).
-std::optional<plist::Value> groupIdsFromRootsMetadata(const QRTURL& url) {
+// is root's alone (one link, writable by no one else) and names identifier.
+std::optional<plist::Value> groupIdsFromRootsMetadata(const QRTURL& url, const std::string& identifier) {
   const QRTURL file = url.URLByAppendingPathComponent(QRTMetadataFileName);
   platform::Item item;
   if (!QRTFileManager::defaultManager().itemIsImportableAtURL(file, file, 0, &item)) return std::nullopt;
@@ -91,7 +91,13 @@ std::optional<plist::Value> groupIdsFromRootsMetadata(const QRTURL& url) {
   std::optional<plist::Value> value = err ? std::nullopt : plist::parse(bytes.data(), bytes.size(), nullptr, limits);
   const plist::Dictionary* top = value ? value->dictionaryIf() : nullptr;
   const plist::Dictionary* info = top ? dictionaryAt(*top, QRTMetadataInfoKey) : nullptr;
+  const plist::Value* named = top ? plist::find(*top, QRTMetadataIdentifierKey) : nullptr;
   const plist::Value* groups = info ? plist::find(*info, kGroupContainerIDsKey) : nullptr;
+  if (top && (!named || !named->isString() || named->string() != identifier)) {
+    QRTLog(kLogError, "Group ids of %@ not taken from %@: it names another identifier",
+           platform::logIdentifier(identifier), file);
+    return std::nullopt;
+  }
   if (!groups) {
     QRTLog(kLogError, "No group ids readable from %@: %s", file, err ? strerror(err) : "not in the file");
     return std::nullopt;
@@ -178,10 +184,10 @@ void QRTCodeSigningMapping::_onQueue_migrateAppGroupIdsFromDataContainersToFile(
       if (!container->info() || !plist::find(*container->info(), kGroupContainerIDsKey)) continue;
       // Data containers are the user's: their ids count only from a metadata
       // file that root wrote, read from the very file that was checked.
-      std::optional<plist::Value> groupsRead = groupIdsFromRootsMetadata(container->url());
+      const std::string& identifier = container->identifier();
+      std::optional<plist::Value> groupsRead = groupIdsFromRootsMetadata(container->url(), identifier);
       if (!groupsRead) continue;
       const plist::Value* groups = &*groupsRead;
-      const std::string& identifier = container->identifier();
       QRTLog(kLogDebug, "Data container for userId: 501, identifier %@ references container IDs: %@", identifier,
              *groups);
       QRTErrorRef error;
