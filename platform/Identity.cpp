@@ -155,7 +155,8 @@ std::optional<std::vector<uid_t>> usersOf(const plist::Value& value, const std::
   std::vector<uid_t> users;
   for (const plist::Value& item : *array) {
     if (const plist::Integer* id = item.integerIf(); id && id->asUnsigned() < UINT32_MAX) {
-      users.push_back(static_cast<uid_t>(id->asUnsigned()));
+      // Written as the host knows it; compared as peers are, in protocol ids.
+      users.push_back(protocolUserId(static_cast<uid_t>(id->asUnsigned())));
     } else if (const std::string* name = item.stringIf()) {
       if (std::optional<UserAccount> account = userByName(*name)) users.push_back(account->uid);
       else QRTLog(kLogError, "Identity file %s: no account named %s; left out of Users", path.c_str(), name->c_str());
