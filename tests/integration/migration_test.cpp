@@ -7,10 +7,9 @@
 #include <unistd.h>
 
 #include <array>
-#include <chrono>
 #include <filesystem>
+#include <functional>
 #include <map>
-#include <thread>
 
 #include "DaemonFixture.h"
 #include "base/PlistCodec.h"
@@ -45,6 +44,14 @@ void writePlist(const std::string& path, const plist::Dictionary& dictionary) {
 
 // invalid, placeholder, registered by caller, data container class.
 using Row = std::array<int64_t, 4>;
+
+std::string text(sqlite3_stmt* s, int column) { return reinterpret_cast<const char*>(sqlite3_column_text(s, column)); }
+
+std::string crashPointName(const ::testing::TestParamInfo<const char*>& info) {
+  std::string name = *info.param ? info.param : "uninterrupted";
+  for (char& c : name) c = isalnum(static_cast<unsigned char>(c)) ? c : '_';
+  return name;
+}
 
 class MigrationTest : public DaemonFixture {
  protected:
@@ -98,49 +105,40 @@ class MigrationTest : public DaemonFixture {
     writePlist(file, *metadata);
   }
 
-  // The entries of the test's programs, and parent of each child.
-  std::map<std::string, Row> rows(std::map<std::string, std::string>* children = nullptr) const {
-    std::map<std::string, Row> result;
+  // Runs sql on the store, with `bound` (when given) as its parameter.
+  void query(const char* sql, const std::string& bound, const std::function<void(sqlite3_stmt*)>& body) const {
     sqlite3* db = nullptr;
     EXPECT_EQ(sqlite3_open_v2((library() + "/containers.sqlite3").c_str(), &db, SQLITE_OPEN_READONLY, nullptr),
               SQLITE_OK);
-    auto each = [&](const char* sql, auto&& body) {
-      sqlite3_stmt* statement = nullptr;
-      ASSERT_EQ(sqlite3_prepare_v2(db, sql, -1, &statement, nullptr), SQLITE_OK) << sqlite3_errmsg(db);
-      while (sqlite3_step(statement) == SQLITE_ROW) body(statement);
-      sqlite3_finalize(statement);
-    };
-    auto text = [](sqlite3_stmt* s, int i) { return std::string(reinterpret_cast<const char*>(sqlite3_column_text(s, i))); };
-    each("SELECT code_signing_id_text, invalid, placeholder, registered_by_caller, data_container_class "
-         "FROM code_signing_info;",
-         [&](sqlite3_stmt* s) {
-           std::string id = text(s, 0);
-           if (id.rfind(kPrefix, 0) == 0)
-             result[id] = {sqlite3_column_int64(s, 1), sqlite3_column_int64(s, 2), sqlite3_column_int64(s, 3),
-                           sqlite3_column_int64(s, 4)};
-         });
-    if (children) {
-      each("SELECT child_code_signing_id_text, code_signing_id_text FROM child_bundles JOIN code_signing_info "
-           "ON parent_id = code_signing_info.id;",
-           [&](sqlite3_stmt* s) { (*children)[text(s, 0)] = text(s, 1); });
-    }
+    sqlite3_stmt* statement = nullptr;
+    EXPECT_EQ(sqlite3_prepare_v2(db, sql, -1, &statement, nullptr), SQLITE_OK) << sqlite3_errmsg(db);
+    if (!bound.empty()) sqlite3_bind_text(statement, 1, bound.c_str(), -1, SQLITE_TRANSIENT);
+    while (statement && sqlite3_step(statement) == SQLITE_ROW) body(statement);
+    sqlite3_finalize(statement);
     sqlite3_close(db);
+  }
+  // The entries of the test's programs, and parent of each child.
+  std::map<std::string, Row> rows(std::map<std::string, std::string>* children = nullptr) const {
+    std::map<std::string, Row> result;
+    query("SELECT code_signing_id_text, invalid, placeholder, registered_by_caller, data_container_class "
+          "FROM code_signing_info;", "", [&](sqlite3_stmt* s) {
+            if (std::string id = text(s, 0); id.rfind(kPrefix, 0) == 0)
+              result[id] = {sqlite3_column_int64(s, 1), sqlite3_column_int64(s, 2), sqlite3_column_int64(s, 3),
+                            sqlite3_column_int64(s, 4)};
+          });
+    if (children) {
+      query("SELECT child_code_signing_id_text, code_signing_id_text FROM child_bundles JOIN code_signing_info "
+            "ON parent_id = code_signing_info.id;", "", [&](sqlite3_stmt* s) { (*children)[text(s, 0)] = text(s, 1); });
+    }
     return result;
   }
   std::optional<plist::Dictionary> storedInfo(const std::string& identifier) const {
-    sqlite3* db = nullptr;
-    sqlite3_open_v2((library() + "/containers.sqlite3").c_str(), &db, SQLITE_OPEN_READONLY, nullptr);
-    sqlite3_stmt* s = nullptr;
-    sqlite3_prepare_v2(db, "SELECT data FROM code_signing_data JOIN code_signing_info ON cs_info_id = "
-                           "code_signing_info.id WHERE code_signing_id_text = ?;", -1, &s, nullptr);
-    sqlite3_bind_text(s, 1, identifier.c_str(), -1, SQLITE_TRANSIENT);
     std::optional<plist::Dictionary> result;
-    if (sqlite3_step(s) == SQLITE_ROW) {
-      auto v = plist::parse(sqlite3_column_blob(s, 0), static_cast<size_t>(sqlite3_column_bytes(s, 0)));
-      if (v && v->isDictionary()) result = v->dictionary();
-    }
-    sqlite3_finalize(s);
-    sqlite3_close(db);
+    query("SELECT data FROM code_signing_data JOIN code_signing_info ON cs_info_id = code_signing_info.id "
+          "WHERE code_signing_id_text = ? LIMIT 1;", identifier, [&](sqlite3_stmt* s) {
+            auto v = plist::parse(sqlite3_column_blob(s, 0), static_cast<size_t>(sqlite3_column_bytes(s, 0)));
+            if (v && v->isDictionary()) result = v->dictionary();
+          });
     return result;
   }
 
@@ -209,9 +207,7 @@ class DataMigrationTest : public MigrationTest, public ::testing::WithParamInter
 TEST_P(DataMigrationTest, ImportsEveryOlderStoreOnce) {
   ASSERT_NO_FATAL_FAILURE(prepareLegacyStore());
   const std::string point = GetParam();
-  if (!point.empty()) {
-    ASSERT_NO_FATAL_FAILURE(runUntilKilled(point, 24));
-  }
+  if (!point.empty()) { ASSERT_NO_FATAL_FAILURE(runUntilKilled(point, 24)); }
   startDaemon();
   ASSERT_EQ(codeOf(call(24)), 1u);
 
@@ -260,11 +256,7 @@ INSTANTIATE_TEST_SUITE_P(CrashPoints, DataMigrationTest,
                          ::testing::Values("", "codesign-mapping-file-imported", "codesign-groupid-entry-added",
                                            "codesign-legacy-entitlements-imported", "codesign-cached-info-entry-added",
                                            "migrator-data-migration-owned"),
-                         [](const auto& info) {
-                           std::string name = *info.param ? info.param : "uninterrupted";
-                           for (char& c : name) c = isalnum(static_cast<unsigned char>(c)) ? c : '_';
-                           return name;
-                         });
+                         crashPointName);
 
 TEST_F(MigrationTest, MappingFileWhoseEveryEntryFailsStays) {
   ASSERT_EQ(stopDaemon(), 0);
@@ -278,7 +270,7 @@ TEST_F(MigrationTest, MappingFileWhoseEveryEntryFailsStays) {
 
 // ---- build upgrade ----
 
-class BuildUpgradeTest : public MigrationTest, public ::testing::WithParamInterface<const char*> {};
+using BuildUpgradeTest = DataMigrationTest;
 
 TEST_P(BuildUpgradeTest, RunsOncePerNewBuild) {
   Container bundle = make(33, "org.legacy.moved", 1);
@@ -295,9 +287,7 @@ TEST_P(BuildUpgradeTest, RunsOncePerNewBuild) {
   for (const char* name : {"old.log", "old.log.0", "old.log.3"}) writeFile(oldLogs + "/" + name, name);
   writePlist(root + "/etc/system-version.plist", {{"BuildVersion", "24B200"}, {"ReleaseType", "Internal"}});
   reboot();
-  if (*GetParam()) {
-    ASSERT_NO_FATAL_FAILURE(runUntilKilled(GetParam(), std::nullopt));
-  }
+  if (*GetParam()) { ASSERT_NO_FATAL_FAILURE(runUntilKilled(GetParam(), std::nullopt)); }
   startDaemon();
 
   EXPECT_TRUE(logContains("Detected upgrade from 24A100 (Internal) to 24B200 (Internal)"));
@@ -327,11 +317,7 @@ TEST_P(BuildUpgradeTest, RunsOncePerNewBuild) {
 
 INSTANTIATE_TEST_SUITE_P(CrashPoints, BuildUpgradeTest,
                          ::testing::Values("", "migrator-build-upgrade-bundles-moved", "startup-build-upgrade-migrated"),
-                         [](const auto& info) {
-                           std::string name = *info.param ? info.param : "uninterrupted";
-                           for (char& c : name) c = isalnum(static_cast<unsigned char>(c)) ? c : '_';
-                           return name;
-                         });
+                         crashPointName);
 
 // ---- first start after a reboot ----
 
