@@ -19,9 +19,8 @@ const std::set<std::string> kFreshDataContainer{kMetadataFile,    "Documents",  
 // Every entry below base, as paths relative to it.
 std::set<std::string> tree(const std::string& base) {
   std::set<std::string> entries;
-  for (const auto& entry : std::filesystem::recursive_directory_iterator(base)) {
+  for (const auto& entry : std::filesystem::recursive_directory_iterator(base))
     entries.insert(std::filesystem::relative(entry.path(), base).string());
-  }
   return entries;
 }
 
@@ -85,9 +84,8 @@ class CommandTest : public DaemonFixture {
 
 TEST_F(CommandTest, ContainersForUserListsIdentifiersAndUUIDsInStep) {
   Listing made;
-  for (const char* id : {"com.example.a", "com.example.b", "com.example.c"}) {
+  for (const char* id : {"com.example.a", "com.example.b", "com.example.c"})
     made.emplace_back(id, uuidData(make(501, id, 2).uuid));
-  }
   Container temporary = make(501, "com.example.temp", 2, true);
 
   EXPECT_EQ(listed(call(1, {{"UserID", 501u}, {"ContainerClass", 2u}})), made);
@@ -109,9 +107,8 @@ TEST_F(CommandTest, InfoValuesAndMetadataSurviveARestart) {
   const plist::Dictionary values{
       {"text", "hello"}, {"number", -7}, {"big", uint64_t{1} << 40}, {"bytes", plist::Data{0, 1, 2, 255}},
       {"nested", plist::Dictionary{{"list", plist::Array{"x", true, 3}}, {"inner", plist::Dictionary{{"k", "v"}}}}}};
-  for (const auto& [key, value] : values) {
+  for (const auto& [key, value] : values)
     ASSERT_EQ(codeOf(call(5, with(selector(app), {{"Key", key}, {"Value", value}}))), 1u) << key;
-  }
   for (int run = 0; run < 2; ++run) {
     SCOPED_TRACE(run == 0 ? "before restart" : "after restart");
     for (const auto& [key, value] : values) {
@@ -296,9 +293,8 @@ TEST_F(CommandTest, DeathRowMovesWhatItCannotRemoveToTmp) {
 }
 
 TEST_F(CommandTest, WipesKeepIdentityAndPathButNotContent) {
-  Container app = make(501, "com.example.app", 2);
-  Container addon = make(501, "com.example.addon", 4);
-  Container other = make(501, "com.example.other", 4);
+  Container app = make(501, "com.example.app", 2), addon = make(501, "com.example.addon", 4),
+            other = make(501, "com.example.other", 4);
   for (const Container* c : {&app, &addon, &other}) writeFile(c->path + "/Documents/old.txt", "old");
   writeFile(app.path + "/Library/Preferences/prefs.plist", "old");
   auto expectWiped = [&](const Container& before) {

@@ -19,6 +19,7 @@
 #include <future>
 #include <sstream>
 #include <thread>
+#include <tuple>
 #include <vector>
 
 #include "DaemonFixture.h"
@@ -302,13 +303,8 @@ TEST_F(ResourcesTest, SigtermEndsInTimeWithAClientThatNeverReads) {
 // caller's own, a non-integer class is 0, a non-boolean flag is false.
 TEST_F(ResourcesTest, MistypedKeysReadAsMissing) {
   setOwnIdentity("com.example.self", {});
-  struct Case {
-    plist::Dictionary keys;
-    uint64_t code;
-    const char* identifier;
-  };
   const plist::Dictionary base{{"UserID", 0}, {"ContainerClass", 2}, {"CreateIfNecessary", true}};
-  const Case cases[] = {
+  const std::tuple<plist::Dictionary, uint64_t, const char*> cases[] = {  // keys, code, identifier answered
       {with(base, {{"Identifier", 17}}), 1, "com.example.self"},
       {with(base, {{"Identifier", plist::Data{'a', 'b'}}}), 1, "com.example.self"},
       {with(base, {{"Identifier", plist::Array{"com.example.other"}}}), 1, "com.example.self"},
@@ -316,12 +312,10 @@ TEST_F(ResourcesTest, MistypedKeysReadAsMissing) {
       {with(base, {{"Identifier", "com.example.flag"}, {"CreateIfNecessary", 1}}), 21, nullptr},
       {with(base, {{"Identifier", "com.example.cls"}, {"ContainerClass", "2"}}), 38, nullptr},
   };
-  for (const Case& c : cases) {
-    auto reply = call(0, c.keys);
-    EXPECT_EQ(codeOf(reply), c.code) << plist::describe(c.keys);
-    if (c.identifier) {
-      EXPECT_EQ(at(reply, "ReplyIdentifier"), plist::Value(c.identifier)) << plist::describe(c.keys);
-    }
+  for (const auto& [keys, code, identifier] : cases) {
+    auto reply = call(0, keys);
+    EXPECT_EQ(codeOf(reply), code) << plist::describe(keys);
+    if (identifier) { EXPECT_EQ(at(reply, "ReplyIdentifier"), plist::Value(identifier)) << plist::describe(keys); }
   }
 }
 
