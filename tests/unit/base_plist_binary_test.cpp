@@ -143,8 +143,7 @@ TEST(PlistBinaryWriter, UsesSmallestEncodingsAndUniquesValues) {
   EXPECT_EQ(objectBytes(Value(0x12345678)), (Data{0x12, 0x12, 0x34, 0x56, 0x78}));
   EXPECT_EQ(objectBytes(Value(-2)), (Data{0x13, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xfe}));
   Data umax{0x14};
-  umax.insert(umax.end(), 8, 0x00);
-  umax.insert(umax.end(), 8, 0xff);
+  umax.resize(9, 0x00), umax.resize(17, 0xff);
   EXPECT_EQ(objectBytes(Value(UINT64_MAX)), umax);
 
   Trailer t = trailerOf(plist::writeBinary(Value(Array{"k", "k", Dictionary{{"k", "k"}}, true, true})));
@@ -161,8 +160,7 @@ TEST(PlistBinaryWriter, UsesSmallestEncodingsAndUniquesValues) {
 TEST(PlistBinaryReader, AcceptsOtherValidEncodings) {
   // A 4-byte real, a negative value as a 16-byte integer, and a UTF-16 key.
   Data negative{0x14};
-  negative.insert(negative.end(), 15, 0xff);
-  negative.push_back(0xfd);
+  negative.resize(16, 0xff), negative.push_back(0xfd);
   auto v = parseData(assemble({{0xD2, 1, 2, 3, 4}, {0x61, 0x00, 0x66}, {0x51, 'g'}, {0x22, 0x3f, 0xc0, 0, 0}, negative}));
   ASSERT_TRUE(v);
   EXPECT_EQ(*v, Value(Dictionary{{"f", 1.5}, {"g", Value(-3)}}));
@@ -256,9 +254,7 @@ TEST(PlistBinaryReader, RefusesBadStructure) {
 
 TEST(PlistBinaryReader, RefusesUnsupportedOrInvalidObjects) {
   Data wide{0x14, 0, 0, 0, 0, 0, 0, 0, 1}, onesThenPositive{0x14};
-  wide.resize(17, 0);
-  onesThenPositive.resize(9, 0xff);
-  onesThenPositive.resize(17, 0);
+  wide.resize(17, 0), onesThenPositive.resize(9, 0xff), onesThenPositive.resize(17, 0);
   const std::pair<std::vector<Data>, const char*> cases[] = {
       {{{0x00}}, "unsupported object type"},                 // null
       {{{0x80, 1}}, "unsupported object type"},              // UID
