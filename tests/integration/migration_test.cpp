@@ -31,12 +31,6 @@ const char* const kUserClassDirs[] = {"Data/Application", "Data/AddonPlugin",   
 plist::Array strings(std::initializer_list<const char*> items) { return plist::Array(items.begin(), items.end()); }
 plist::Dictionary ents(const char* group) { return {{kAppGroups, strings({group})}}; }
 
-int makeDirs(const std::string& path) {
-  std::error_code ec;
-  std::filesystem::create_directories(path, ec);
-  return ec.value();
-}
-
 void writePlist(const std::string& path, const plist::Dictionary& dictionary) {
   plist::Data bytes = plist::writeBinary(dictionary);
   writeFile(path, std::string(bytes.begin(), bytes.end()));
@@ -337,8 +331,8 @@ TEST_F(MigrationTest, RebootClearsLeftoversAndInstallsBackup) {
   const std::string backup = mobile() + "/Library/Backup/SystemContainers";
   for (const std::string& dir : {caches + "/Staging/left", caches + "/Temp/junk", userTemp + "/junk",
                                  backup + "/Data/org.legacy.restored/Library", backup + "/Shared/systemgroup.org.legacy.restored"})
-    ASSERT_EQ(makeDirs(dir), 0) << dir;
-  for (const std::string& dir : orphans) ASSERT_EQ(makeDirs(dir), 0) << dir;
+    ASSERT_TRUE(std::filesystem::create_directories(dir)) << dir;
+  for (const std::string& dir : orphans) ASSERT_TRUE(std::filesystem::create_directories(dir)) << dir;
   for (const std::string& dir : orphans) writeFile(dir + "/data", "x");
   writeFile(backup + "/Data/org.legacy.restored/Library/prefs", "restored");
   writeFile(backup + "/Data/org.legacy.restored/" + kMetadataFile, "hidden: not restored");
@@ -370,7 +364,7 @@ TEST_F(MigrationTest, RebootClearsLeftoversAndInstallsBackup) {
   EXPECT_EQ(after, before);
 
   // A restart without a reboot leaves a bad name alone.
-  ASSERT_EQ(makeDirs(appClassDir() + "/bad-name"), 0);
+  ASSERT_TRUE(std::filesystem::create_directories(appClassDir() + "/bad-name"));
   restartDaemon();
   EXPECT_TRUE(exists(appClassDir() + "/bad-name"));
 }
