@@ -113,8 +113,14 @@ TEST(KitConnection, ClosingMidFlightReleasesEveryWaiter) {
   EXPECT_FALSE(reply.get());
 }
 
-TEST(KitConnection, BadRepliesFailOnlyWhatTheyMust) {
+// Each failure fails its own request only, until a frame length out of range
+// ends the connection.
+TEST(KitConnection, BadRepliesAndFailedCallsFailOnlyWhatTheyMust) {
   FakeServer server;
+  auto expectAnswered = [&](std::optional<plist::Dictionary> reply, uint64_t n) {
+    ASSERT_TRUE(reply);
+    EXPECT_EQ(n, numberOf(*reply));
+  };
   auto first = server.client->send(numbered(1));
   auto second = server.client->send(numbered(2));
   Message m1 = server.next(), m2 = server.next();
@@ -126,33 +132,24 @@ TEST(KitConnection, BadRepliesFailOnlyWhatTheyMust) {
   server.write(garbage);
   server.echo(m2);
   EXPECT_FALSE(first.get());
-  auto reply = second.get();
-  ASSERT_TRUE(reply);
-  EXPECT_EQ(2u, numberOf(*reply));
-  EXPECT_FALSE(server.client->closed());
+  expectAnswered(second.get(), 2);
 
-  // A frame length out of range ends the connection.
-  auto third = server.client->send(numbered(3));
-  server.next();
-  server.write({3, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0});
-  EXPECT_FALSE(third.get());
-  EXPECT_TRUE(server.client->closed());
-}
-
-TEST(KitConnection, FailedCallsLeaveTheStreamUsable) {
-  FakeServer server;
-  // A timed-out call ignores its late reply.
+  // A timed-out call ignores its late reply; an oversized request fails alone.
   server.client->setReplyTimeout(std::chrono::milliseconds(1));
-  EXPECT_FALSE(qk::perform(*server.client, qk::Request(numbered(1))));
+  EXPECT_FALSE(qk::perform(*server.client, qk::Request(numbered(3))));
   server.client->setReplyTimeout(std::chrono::minutes(1));
   server.echo(server.next());
-  // An oversized request fails alone.
   EXPECT_FALSE(server.client->call({{"Blob", plist::Data(frame::kMaxLength, 0)}}));
   std::thread answer([&] { server.echo(server.next()); });
-  auto reply = server.client->call(numbered(2));
+  expectAnswered(server.client->call(numbered(4)), 4);
   answer.join();
-  ASSERT_TRUE(reply);
-  EXPECT_EQ(2u, numberOf(*reply));
+  EXPECT_FALSE(server.client->closed());
+
+  auto fifth = server.client->send(numbered(5));
+  server.next();
+  server.write({3, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0});
+  EXPECT_FALSE(fifth.get());
+  EXPECT_TRUE(server.client->closed());
 }
 
 // Frames split at every size, big ones (which leave in their own buffer)
