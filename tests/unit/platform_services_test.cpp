@@ -65,19 +65,13 @@ class LogTest : public DeviceRootTest {
     const std::string program = program_invocation_short_name + ("[" + std::to_string(getpid()) + "] ");
     // By hand: std::regex trips a false maybe-uninitialized warning under the sanitizers.
     const std::string stamp = "dddd-dd-dd dd:dd:dd.dddddd ";
-    size_t at = 0;
+    std::string expected, masked = text;  // a digit where the stamp has one reads as 'd'
     for (const std::string& line : lines) {
-      if (text.size() < at + stamp.size()) return false;
-      for (size_t i = 0; i < stamp.size(); ++i) {
-        const char c = text[at + i];
-        if (stamp[i] == 'd' ? !isdigit(static_cast<unsigned char>(c)) : c != stamp[i]) return false;
-      }
-      at += stamp.size();
-      const std::string rest = program + line + "\n";
-      if (text.compare(at, rest.size(), rest) != 0) return false;
-      at += rest.size();
+      for (size_t i = 0, at = expected.size(); i < stamp.size() && at + i < masked.size(); ++i)
+        if (stamp[i] == 'd') masked[at + i] = isdigit(static_cast<unsigned char>(masked[at + i])) ? 'd' : '?';
+      expected += stamp + program + line + "\n";
     }
-    return at == text.size();
+    return masked == expected;
   }
 };
 
