@@ -116,7 +116,8 @@ bool takeBackupDirectory(const std::optional<QRTURL>& directory, const std::opti
     QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace", moveFailure, error);
     return false;
   }
-  return true;
+  // A home swapped between the check and the move brings the user's tree here.
+  return fm.itemIsImportableAtURL(inProgress, *base, 0);
 }
 
 void installBackupDirectory(const QRTURL& directory, uint64_t containerClass, const char* listFailure,
