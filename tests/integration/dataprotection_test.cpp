@@ -12,15 +12,12 @@
 #include <chrono>
 #include <cstring>
 #include <filesystem>
-#include <functional>
 #include <future>
 #include <map>
 #include <string>
 #include <thread>
-#include <tuple>
 
 #include "DaemonFixture.h"
-#include "base/Frame.h"
 #include "base/PlistCodec.h"
 
 namespace fs = std::filesystem;
@@ -61,24 +58,40 @@ uint64_t codeOfOnlyReply(const std::string& socketPath, const plist::Dictionary&
   address.sun_family = AF_UNIX;
   strncpy(address.sun_path, socketPath.c_str(), sizeof address.sun_path - 1);
   EXPECT_EQ(connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
-  frame::Decoder decoder;
-  // Sends the message; the next frame's id and message (0 and nothing once the stream ends).
-  auto exchange = [&](uint64_t id, const plist::Dictionary& message) {
-    const std::vector<uint8_t> bytes = frame::encode(id, message);
-    EXPECT_TRUE(frame::sendAll(fd, bytes.data(), bytes.size()));
-    uint8_t buffer[4096];
-    for (;;) {
-      if (auto f = decoder.next()) return std::pair(f->messageId, frame::decodeMessage(f->payload));
-      ssize_t n = read(fd, buffer, sizeof buffer);
-      if (n <= 0) return std::pair(uint64_t{0}, std::optional<plist::Dictionary>());
-      decoder.append(buffer, static_cast<size_t>(n));
-    }
+  auto send = [&](uint64_t id, const plist::Dictionary& message) {
+    plist::Data body = plist::writeBinary(plist::Value(message));
+    std::string frame(12, '\0');
+    const uint32_t length = static_cast<uint32_t>(body.size() + 8);
+    memcpy(frame.data(), &length, 4);
+    memcpy(frame.data() + 4, &id, 8);
+    frame.append(body.begin(), body.end());
+    EXPECT_EQ(write(fd, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
   };
-  const auto [id, reply] = exchange(1, first);
+  auto receive = [&](uint64_t* id) -> std::optional<plist::Dictionary> {
+    auto readAll = [&](void* into, size_t size) {
+      for (size_t done = 0; done < size;) {
+        ssize_t n = read(fd, static_cast<char*>(into) + done, size - done);
+        if (n <= 0) return false;
+        done += static_cast<size_t>(n);
+      }
+      return true;
+    };
+    uint32_t length = 0;
+    if (!readAll(&length, 4) || length < 8) return std::nullopt;
+    std::string payload(length, '\0');
+    if (!readAll(payload.data(), length)) return std::nullopt;
+    memcpy(id, payload.data(), 8);
+    auto value = plist::parse(payload.data() + 8, length - 8);
+    if (!value || !value->isDictionary()) return std::nullopt;
+    return value->dictionary();
+  };
+  send(1, first);
+  uint64_t id = 0;
+  auto reply = receive(&id);
   EXPECT_EQ(id, 1u);
-  const auto [nextId, next] =
-      exchange(2, request(7, {{"UserID", 501}, {"ContainerClass", 2}, {"Identifier", "com.example.nothing"}}));
-  EXPECT_TRUE(next);
+  send(2, request(7, {{"UserID", 501}, {"ContainerClass", 2}, {"Identifier", "com.example.nothing"}}));
+  uint64_t nextId = 0;
+  EXPECT_TRUE(receive(&nextId));
   EXPECT_EQ(nextId, 2u) << "a second reply to the first request";
   close(fd);
   return codeOf(reply);
@@ -153,10 +166,10 @@ class DataProtectionTest : public DaemonFixture {
     return count;
   }
 
-  // Polls for up to 5 s.
-  static bool eventually(const std::function<bool()>& condition) {
-    for (int i = 0; i < 500 && !condition(); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    return condition();
+  // Waits (up to 5 s) for the path to exist or not.
+  static bool waitFor(const std::string& path, bool present) {
+    for (int i = 0; i < 500 && exists(path) != present; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    return exists(path) == present;
   }
 };
 
@@ -192,7 +205,11 @@ TEST_F(DataProtectionTest, ChangeReachesEveryUserDataItemAndNothingElse) {
 
 TEST_F(DataProtectionTest, EveryRequestGetsOneReply) {
   Container c = makeApp("com.example.checked", 4);
-  const std::tuple<const char*, plist::Dictionary, uint64_t> cases[] = {
+  const struct {
+    const char* what;
+    plist::Dictionary keys;
+    uint64_t code;
+  } cases[] = {
       {"user check fails", with(protect(c.identifier, 1, false), {{"ContainerClass", 1}}), 38},
       {"bundle class", with(protect(c.identifier, 1, false), {{"ContainerClass", 1}, {"UserID", 33}}), 11},
       {"no identifier", without(protect(c.identifier, 1, false), "Identifier"), 11},
@@ -202,9 +219,9 @@ TEST_F(DataProtectionTest, EveryRequestGetsOneReply) {
       {"class out of range", protect(c.identifier, 1ll << 32 | 1, false), 38},
       {"the class it has", protect(c.identifier, 0, false), 1},
   };
-  for (const auto& [what, keys, code] : cases) {
-    SCOPED_TRACE(what);
-    EXPECT_EQ(codeOfOnlyReply(qk::requestSocketPath(root), request(kSetDataProtection, keys)), code);
+  for (const auto& test : cases) {
+    SCOPED_TRACE(test.what);
+    EXPECT_EQ(codeOfOnlyReply(qk::requestSocketPath(root), request(kSetDataProtection, test.keys)), test.code);
   }
   EXPECT_EQ(userData(c), (std::map<int32_t, int>{{3, userData(c)[3]}})) << "a refused request changed something";
   EXPECT_TRUE(listDirectory(pendingDir()).empty());
@@ -282,7 +299,8 @@ TEST_F(DataProtectionTest, ApplicationIsHeldWhileTheChangeRunsAfterUnlock) {
     SCOPED_TRACE(refuse ? "assertions refused" : "assertions granted");
     const std::string id = refuse ? "com.example.refused" : "com.example.held";
     Container c = makeApp(id, 20);
-    plist::Data bytes = plist::writeBinary(plist::Value(plist::Dictionary{{"RefuseTerminationAssertions", refuse}}));
+    plist::Dictionary props{{"RefuseTerminationAssertions", refuse}};
+    plist::Data bytes = plist::writeBinary(plist::Value(props));
     writeFile(root + "/etc/device-properties.plist", std::string(bytes.begin(), bytes.end()));
 
     setLocked(true);
@@ -293,11 +311,13 @@ TEST_F(DataProtectionTest, ApplicationIsHeldWhileTheChangeRunsAfterUnlock) {
     writeFile(root + "/run/quarterd.pausepoint", "protection-walk\n");
     setLocked(false);
     // The pause comes on the run after the unlock, with the assertion held.
-    EXPECT_TRUE(eventually([&] { return occurrences(paused) > pausesBefore; }));
+    for (int i = 0; i < 500 && occurrences(paused) == pausesBefore; ++i)
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    EXPECT_GT(occurrences(paused), pausesBefore);
     EXPECT_EQ(exists(assertionFile(id)), !refuse);
     unlink((root + "/run/quarterd.pausepoint").c_str());
     EXPECT_EQ(codeOf(reply.get()), 1u);
-    EXPECT_TRUE(eventually([&] { return !exists(assertionFile(id)); })) << "the assertion outlived the change";
+    EXPECT_TRUE(waitFor(assertionFile(id), false)) << "the assertion outlived the change";
     EXPECT_EQ(userData(c).count(3), 0u);
     if (refuse) { EXPECT_TRUE(logContains("Failed to acquire termination assertion for " + id)); }
   }
