@@ -124,8 +124,7 @@ bool parseOptions(int argc, char** argv, Options* options) {
       case 'h': options->help = true; break;
       case 'V': options->version = true; break;
       default:
-        fprintf(stderr, "quarterd: %s: %s\n", optopt ? "bad or incomplete option" : "unknown option",
-                argv[optind - 1]);
+        fprintf(stderr, "quarterd: %s: %s\n", optopt ? "bad or incomplete option" : "unknown option", argv[optind - 1]);
         return false;
     }
   }
@@ -300,8 +299,10 @@ int QRTDaemonMain(int argc, char** argv) {
     return 2;
   }
   if (options.help || options.version) {
-    if (options.help) usage(stdout);
-    else printf("quarterd %s\n", QRT_VERSION);
+    if (options.help)
+      usage(stdout);
+    else
+      printf("quarterd %s\n", QRT_VERSION);
     return 0;
   }
   // A client that goes away mid-reply must not end the daemon.

@@ -27,8 +27,8 @@ std::string QRTError::description() const {
 }
 
 QRTErrorRef QRTCreateErrorArgs(const char* function, int line, const std::string& domain, int32_t code,
-                               QRTErrorRef underlying, const plist::Dictionary* userInfo, bool log,
-                               const char* format, std::initializer_list<QRTFormatArg> args) {
+                               QRTErrorRef underlying, const plist::Dictionary* userInfo, bool log, const char* format,
+                               std::initializer_list<QRTFormatArg> args) {
   plist::Dictionary info = userInfo ? *userInfo : plist::Dictionary{};
   if (format) {
     std::string text = QRTFormatArgs(format, args);
@@ -95,8 +95,7 @@ QRTErrorRef QRTErrorForCurrentException(const char* function, int line) {
   } catch (const std::exception& e) {
     name = exceptionName(e);
     reason = e.what();
-  } catch (...) {
-  }
+  } catch (...) {}
   QRTErrorRef error = QRTCreateError(function, line, QRTErrorDomain, QRTErrorException, nullptr, nullptr, true,
                                      "Got exception: %@ : %@", name, reason);
   if (platform::deviceIsInternalBuild()) QRTReportUncaughtException(name, reason);
@@ -107,7 +106,5 @@ QRTErrorRef QRTGuardedCall(const char* function, int line, const std::function<v
   try {
     body();
     return nullptr;
-  } catch (...) {
-    return QRTErrorForCurrentException(function, line);
-  }
+  } catch (...) { return QRTErrorForCurrentException(function, line); }
 }

@@ -73,8 +73,7 @@ using QRTErrorRef = std::shared_ptr<const QRTError>;
 class QRTError {
  public:
   QRTError(std::string domain, int32_t code, plist::Dictionary userInfo, QRTErrorRef underlying)
-      : domain_(std::move(domain)), code_(code), userInfo_(std::move(userInfo)),
-        underlying_(std::move(underlying)) {}
+      : domain_(std::move(domain)), code_(code), userInfo_(std::move(userInfo)), underlying_(std::move(underlying)) {}
 
   const std::string& domain() const { return domain_; }
   int32_t code() const { return code_; }
@@ -96,21 +95,20 @@ class QRTError {
 };
 
 QRTErrorRef QRTCreateErrorArgs(const char* function, int line, const std::string& domain, int32_t code,
-                               QRTErrorRef underlying, const plist::Dictionary* userInfo, bool log,
-                               const char* format, std::initializer_list<QRTFormatArg> args);
+                               QRTErrorRef underlying, const plist::Dictionary* userInfo, bool log, const char* format,
+                               std::initializer_list<QRTFormatArg> args);
 
 template <typename... Args>
 QRTErrorRef QRTCreateError(const char* function, int line, const std::string& domain, int32_t code,
-                           QRTErrorRef underlying, const plist::Dictionary* userInfo, bool log,
-                           const char* format, const Args&... args) {
+                           QRTErrorRef underlying, const plist::Dictionary* userInfo, bool log, const char* format,
+                           const Args&... args) {
   return QRTCreateErrorArgs(function, line, domain, code, std::move(underlying), userInfo, log, format,
                             {QRTFormatArg(args)...});
 }
 
 // POSIX-domain error: code = errno value; no log line, no causing error.
 template <typename... Args>
-QRTErrorRef QRTCreatePOSIXError(const char* function, int line, int errnum, const char* format,
-                                const Args&... args) {
+QRTErrorRef QRTCreatePOSIXError(const char* function, int line, int errnum, const char* format, const Args&... args) {
   return QRTCreateErrorArgs(function, line, QRTPOSIXErrorDomain, errnum, nullptr, nullptr, false, format,
                             {QRTFormatArg(args)...});
 }

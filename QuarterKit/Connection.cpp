@@ -22,7 +22,9 @@ using MaybeReply = std::optional<plist::Dictionary>;
 }  // namespace
 
 struct Connection::Impl {
-  explicit Impl(int socketFd) : fd(socketFd) { reader = std::thread([this] { readLoop(); }); }
+  explicit Impl(int socketFd) : fd(socketFd) {
+    reader = std::thread([this] { readLoop(); });
+  }
   ~Impl() {
     ::shutdown(fd, SHUT_RDWR);
     if (reader.joinable()) reader.join();
@@ -127,8 +129,7 @@ void Connection::Impl::deliver(frame::RawFrame&& f) {
   MaybeReply reply;
   try {
     reply = frame::decodeMessage(f.payload);
-  } catch (const std::exception&) {
-  }
+  } catch (const std::exception&) {}
   promise.set_value(std::move(reply));
 }
 
@@ -190,9 +191,7 @@ std::unique_ptr<Connection> detail::ConnectionAccess::adopt(int fd) {
   }
 }
 
-std::future<MaybeReply> Connection::send(const plist::Dictionary& request) {
-  return impl_->submit(request).second;
-}
+std::future<MaybeReply> Connection::send(const plist::Dictionary& request) { return impl_->submit(request).second; }
 
 MaybeReply Connection::call(const plist::Dictionary& request, std::chrono::milliseconds timeout) {
   auto [id, future] = impl_->submit(request);

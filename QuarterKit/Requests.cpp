@@ -88,8 +88,10 @@ namespace {
 
 // The keys that name one container in most container commands.
 Request& addContainer(Request& r, const ContainerRef& c) {
-  return r.u64("UserID", c.userId).u64("ContainerClass", c.containerClass).string("Identifier", c.identifier).uuid(
-      "UUID", c.uuid);
+  return r.u64("UserID", c.userId)
+      .u64("ContainerClass", c.containerClass)
+      .string("Identifier", c.identifier)
+      .uuid("UUID", c.uuid);
 }
 
 Result onContainer(Connection& c, Command command, const ContainerRef& container) {
@@ -204,8 +206,7 @@ Result groupContainerPaths(Connection& c, uint64_t userId, const std::optional<s
 }
 
 Result groupContainerIdentifiers(Connection& c, uint64_t userId, const std::optional<std::string>& identifier) {
-  return perform(c,
-                 Request(Command::groupContainerIdentifiers).u64("UserID", userId).string("Identifier", identifier));
+  return perform(c, Request(Command::groupContainerIdentifiers).u64("UserID", userId).string("Identifier", identifier));
 }
 
 Result systemContainerPath(Connection& c, const std::optional<std::string>& identifier) {
@@ -242,8 +243,7 @@ Result invalidateCodeSigningInfoForAppsWithoutBundleContainer(Connection& c) {
 }
 
 Result setDataProtection(Connection& c, uint64_t userId, const std::optional<std::string>& identifier,
-                         uint64_t containerClass, int64_t dataProtectionClass, bool isThirdParty,
-                         bool retryIfLocked) {
+                         uint64_t containerClass, int64_t dataProtectionClass, bool isThirdParty, bool retryIfLocked) {
   return perform(c, Request(Command::setDataProtection)
                         .u64("UserID", userId)
                         .string("Identifier", identifier)

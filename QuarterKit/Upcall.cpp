@@ -25,8 +25,6 @@ void appendU32(std::vector<uint8_t>& out, uint32_t v) {
   out.insert(out.end(), b, b + 4);
 }
 
-
-
 void readAnswerItems(std::vector<uint8_t>& bytes, UpcallAnswer* answer) {
   sb_packbuff* pb = sb_packbuff_init_with_buffer(bytes.data(), bytes.size(), true, SB_PACKBUFF_DEALLOC_NONE);
   if (!pb) return;
@@ -112,8 +110,8 @@ bool UpcallClient::send(const UpcallFrame& frame, std::span<const uint8_t> regio
   const uint32_t size = frame.regionSize.value_or(static_cast<uint32_t>(region.size()));
   std::vector<uint8_t> out;
   out.reserve(24 + region.size());
-  for (uint32_t v : {frame.id, frame.bits, frame.descriptorCount, frame.descriptorType, size,
-                     frame.requestSize.value_or(size)})
+  for (uint32_t v :
+       {frame.id, frame.bits, frame.descriptorCount, frame.descriptorType, size, frame.requestSize.value_or(size)})
     appendU32(out, v);
   out.insert(out.end(), region.begin(), region.end());
   return frame::sendAll(fd_, out.data(), out.size());

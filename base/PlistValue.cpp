@@ -97,8 +97,7 @@ void appendDate(std::string& out, const Date& date) {
   civilFromDays(days, year, month, day);
   char buf[96];
   std::snprintf(buf, sizeof buf, "%04" PRId64 "-%02u-%02u %02d:%02d:%02d +0000", year, month, day,
-                static_cast<int>(secs / 3600), static_cast<int>(secs / 60 % 60),
-                static_cast<int>(secs % 60));
+                static_cast<int>(secs / 3600), static_cast<int>(secs / 60 % 60), static_cast<int>(secs % 60));
   out += buf;
 }
 

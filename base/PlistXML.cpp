@@ -24,9 +24,12 @@ std::string_view trim(std::string_view s) {
 
 int digitValue(char c, unsigned base) {
   int v = -1;
-  if (c >= '0' && c <= '9') v = c - '0';
-  else if (c >= 'a' && c <= 'f') v = c - 'a' + 10;
-  else if (c >= 'A' && c <= 'F') v = c - 'A' + 10;
+  if (c >= '0' && c <= '9')
+    v = c - '0';
+  else if (c >= 'a' && c <= 'f')
+    v = c - 'a' + 10;
+  else if (c >= 'A' && c <= 'F')
+    v = c - 'A' + 10;
   return v < static_cast<int>(base) ? v : -1;
 }
 
@@ -38,13 +41,24 @@ size_t findInvalidUTF8(std::string_view s) {
   size_t i = 0, n = s.size();
   while (i < n) {
     unsigned c = p[i];
-    if (c >= 0x01 && c < 0x80) { ++i; continue; }
+    if (c >= 0x01 && c < 0x80) {
+      ++i;
+      continue;
+    }
     size_t len;
     unsigned lo = 0x80, hi = 0xBF;  // allowed range of the second byte
-    if (c >= 0xC2 && c <= 0xDF) len = 2;
-    else if (c >= 0xE0 && c <= 0xEF) { len = 3; if (c == 0xE0) lo = 0xA0; if (c == 0xED) hi = 0x9F; }
-    else if (c >= 0xF0 && c <= 0xF4) { len = 4; if (c == 0xF0) lo = 0x90; if (c == 0xF4) hi = 0x8F; }
-    else return i;
+    if (c >= 0xC2 && c <= 0xDF)
+      len = 2;
+    else if (c >= 0xE0 && c <= 0xEF) {
+      len = 3;
+      if (c == 0xE0) lo = 0xA0;
+      if (c == 0xED) hi = 0x9F;
+    } else if (c >= 0xF0 && c <= 0xF4) {
+      len = 4;
+      if (c == 0xF0) lo = 0x90;
+      if (c == 0xF4) hi = 0x8F;
+    } else
+      return i;
     if (n - i < len || p[i + 1] < lo || p[i + 1] > hi) return i;
     for (size_t k = 2; k < len; ++k)
       if ((p[i + k] & 0xC0) != 0x80) return i;
@@ -157,8 +171,8 @@ std::optional<double> parseDate(std::string_view s) {
   }
   if (i + 1 != s.size() || s[i] != 'Z') return std::nullopt;
   const unsigned month = field[0], day = field[1];
-  if (month < 1 || month > 12 || day < 1 || day > daysInMonth(year, month) || field[2] > 23 ||
-      field[3] > 59 || field[4] > 59)
+  if (month < 1 || month > 12 || day < 1 || day > daysInMonth(year, month) || field[2] > 23 || field[3] > 59 ||
+      field[4] > 59)
     return std::nullopt;
   const int64_t days = daysFromCivil(year, month, day) - daysFromCivil(2001, 1, 1);
   return static_cast<double>(days) * 86400.0 + field[2] * 3600.0 + field[3] * 60.0 + field[4] + fraction;
@@ -279,8 +293,7 @@ bool Reader::doctype() {
   pos_ += 9;  // "<!DOCTYPE"
   size_t nameStart = pos_;
   while (pos_ < in_.size() && isSpace(in_[pos_])) ++pos_;
-  if (pos_ == nameStart || !at("plist") || pos_ + 5 >= in_.size() ||
-      !(isSpace(in_[pos_ + 5]) || in_[pos_ + 5] == '>'))
+  if (pos_ == nameStart || !at("plist") || pos_ + 5 >= in_.size() || !(isSpace(in_[pos_ + 5]) || in_[pos_ + 5] == '>'))
     return fail("document type is not plist");
   char quote = 0;
   for (; pos_ < in_.size(); ++pos_) {
@@ -312,8 +325,8 @@ bool Reader::startTag(Tag& tag) {
   if (at("</")) return fail("unexpected end tag");
   size_t start = ++pos_;
   auto isNameChar = [](char c) {
-    return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || isDigit(c) || c == '_' || c == ':' ||
-           c == '.' || c == '-' || static_cast<unsigned char>(c) >= 0x80;
+    return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || isDigit(c) || c == '_' || c == ':' || c == '.' ||
+           c == '-' || static_cast<unsigned char>(c) >= 0x80;
   };
   while (pos_ < in_.size() && isNameChar(in_[pos_])) ++pos_;
   tag.name = in_.substr(start, pos_ - start);
@@ -432,8 +445,8 @@ bool Reader::value(Value& out, size_t depth) {
 bool Reader::scalar(const Tag& tag, Value& out) {
   const std::string_view name = tag.name;
   std::string content;
-  const bool known = name == "string" || name == "integer" || name == "real" || name == "date" ||
-                     name == "data" || name == "true" || name == "false";
+  const bool known = name == "string" || name == "integer" || name == "real" || name == "date" || name == "data" ||
+                     name == "true" || name == "false";
   if (!known) {
     if (name == "key") return fail("<key> outside <dict>");
     return fail("unknown element <" + std::string(name) + ">");

@@ -141,7 +141,8 @@ std::string naturalText(const Arg* a) {
 void appendPadded(std::string& out, std::string_view text, const Directive& directive, bool usePrecision) {
   if (usePrecision && directive.precision >= 0 && text.size() > static_cast<size_t>(directive.precision))
     text = text.substr(0, static_cast<size_t>(directive.precision));
-  size_t fill = directive.width > 0 && static_cast<size_t>(directive.width) > text.size() ? directive.width - text.size() : 0;
+  size_t fill =
+      directive.width > 0 && static_cast<size_t>(directive.width) > text.size() ? directive.width - text.size() : 0;
   if (!directive.has('-')) out.append(fill, ' ');
   out.append(text);
   if (directive.has('-')) out.append(fill, ' ');
@@ -209,26 +210,26 @@ void appendPointer(std::string& out, const Directive& directive, const Arg* arg)
 // Appends one conversion; false for a conversion we do not know (%n among them).
 bool appendConversion(std::string& out, const Directive& directive, ArgCursor& args) {
   switch (directive.conversion) {
-    case '%':
-      out += '%';
-      return true;
-    case 'd': case 'i': case 'u': case 'x': case 'X': case 'o':
-      appendInteger(out, directive, args.take());
-      return true;
-    case 'f': case 'F': case 'e': case 'E': case 'g': case 'G': case 'a': case 'A':
-      appendReal(out, directive, args.take());
-      return true;
-    case 's': case '@':
-      appendPadded(out, naturalText(args.take()), directive, true);
-      return true;
-    case 'c':
-      appendChar(out, directive, args.take());
-      return true;
-    case 'p':
-      appendPointer(out, directive, args.take());
-      return true;
-    default:
-      return false;
+    case '%': out += '%'; return true;
+    case 'd':
+    case 'i':
+    case 'u':
+    case 'x':
+    case 'X':
+    case 'o': appendInteger(out, directive, args.take()); return true;
+    case 'f':
+    case 'F':
+    case 'e':
+    case 'E':
+    case 'g':
+    case 'G':
+    case 'a':
+    case 'A': appendReal(out, directive, args.take()); return true;
+    case 's':
+    case '@': appendPadded(out, naturalText(args.take()), directive, true); return true;
+    case 'c': appendChar(out, directive, args.take()); return true;
+    case 'p': appendPointer(out, directive, args.take()); return true;
+    default: return false;
   }
 }
 

@@ -57,8 +57,7 @@ QRTUUID QRTUUID::random() {
     try {
       std::random_device device;
       seed ^= (static_cast<uint64_t>(device()) << 32) ^ device();
-    } catch (const std::exception&) {
-    }
+    } catch (const std::exception&) {}
     std::mt19937_64 engine(seed);
     for (auto& b : bytes) b = static_cast<uint8_t>(engine());
   }

@@ -21,8 +21,8 @@ struct LoadStats {
 
 // What one client does until the deadline: push each call's nanoseconds and
 // count the unexpected answers.
-using ClientLoop = std::function<void(Clock::time_point deadline, std::vector<uint32_t>& latenciesNs,
-                                      uint64_t& unexpected)>;
+using ClientLoop =
+    std::function<void(Clock::time_point deadline, std::vector<uint32_t>& latenciesNs, uint64_t& unexpected)>;
 
 inline uint32_t nanosecondsSince(Clock::time_point start) {
   return static_cast<uint32_t>(std::min<int64_t>(
@@ -35,8 +35,7 @@ inline LoadStats runLoad(int clients, double seconds, const ClientLoop& loop) {
   const auto begin = Clock::now();
   const auto deadline = begin + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(seconds));
   std::vector<std::thread> threads;
-  for (int i = 0; i < clients; ++i)
-    threads.emplace_back([&, i] { loop(deadline, latencies[i], unexpected[i]); });
+  for (int i = 0; i < clients; ++i) threads.emplace_back([&, i] { loop(deadline, latencies[i], unexpected[i]); });
   for (auto& t : threads) t.join();
   const double elapsed = std::chrono::duration<double>(Clock::now() - begin).count();
   LoadStats stats;

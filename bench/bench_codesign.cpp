@@ -56,7 +56,8 @@ void BM_DatabaseLookup(benchmark::State& state) {
   Scratch scratch;
   auto db = filledDatabase(scratch);
   int i = 0;
-  for (auto _ : state) benchmark::DoNotOptimize(db->codeSigningEntryWithIdentifier(identifier(i++ % kPrograms), nullptr));
+  for (auto _ : state)
+    benchmark::DoNotOptimize(db->codeSigningEntryWithIdentifier(identifier(i++ % kPrograms), nullptr));
 }
 BENCHMARK(BM_DatabaseLookup);
 
@@ -101,8 +102,8 @@ class Floor {
   void select(const std::string& id) {
     sqlite3_bind_text(select_, 1, id.c_str(), -1, SQLITE_TRANSIENT);
     if (sqlite3_step(select_) == SQLITE_ROW) {
-      benchmark::DoNotOptimize(plist::parse(sqlite3_column_blob(select_, 0),
-                                            static_cast<size_t>(sqlite3_column_bytes(select_, 0))));
+      benchmark::DoNotOptimize(
+          plist::parse(sqlite3_column_blob(select_, 0), static_cast<size_t>(sqlite3_column_bytes(select_, 0))));
     }
     sqlite3_reset(select_);
   }
@@ -186,7 +187,8 @@ void BM_GroupCounting(benchmark::State& state) {
     std::map<std::string, int64_t> counts;
     mapping->iterateGroupIdsWithKey(QRTApplicationGroupsEntitlement, std::nullopt,
                                     [&](const std::string&, const QRTGroupList& groups) {
-                                      for (const std::string& g : groups.value_or(std::vector<std::string>{})) ++counts[g];
+                                      for (const std::string& g : groups.value_or(std::vector<std::string>{}))
+                                        ++counts[g];
                                     });
     benchmark::DoNotOptimize(counts);
   }

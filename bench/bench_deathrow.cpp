@@ -33,9 +33,6 @@ constexpr int kRounds = 3;
   std::exit(1);
 }
 
-
-
-
 void deathRowPass() {
   std::promise<uint64_t> done;
   std::future<uint64_t> result = done.get_future();
@@ -43,7 +40,6 @@ void deathRowPass() {
       [&done](uint64_t code) { done.set_value(code); });
   if (uint64_t code = result.get(); code != QRTErrorNone) fail("death-row pass returned " + std::to_string(code));
 }
-
 
 }  // namespace
 
@@ -78,8 +74,7 @@ int main(int argc, char** argv) {
       theirs();
       ours();
     }
-    auto left = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(
-        QRTURL::fileURL(deathRow, true), nullptr);
+    auto left = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(QRTURL::fileURL(deathRow, true), nullptr);
     if (!left || !left->empty()) fail("death row not empty after the pass");
     std::printf("round %d: death-row pass %.3f s, rm -rf %.3f s\n", round + 1, pass.back(), rmRf.back());
   }

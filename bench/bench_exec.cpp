@@ -65,10 +65,14 @@ int main(int argc, char** argv) {
   int runs = 300;
   for (int i = 1; i + 1 < argc; i += 2) {
     std::string flag = argv[i];
-    if (flag == "--daemon") daemonPath = argv[i + 1];
-    else if (flag == "--exec") execPath = argv[i + 1];
-    else if (flag == "--runs") runs = std::max(10, atoi(argv[i + 1]));
-    else if (flag == "--program") program = argv[i + 1];
+    if (flag == "--daemon")
+      daemonPath = argv[i + 1];
+    else if (flag == "--exec")
+      execPath = argv[i + 1];
+    else if (flag == "--runs")
+      runs = std::max(10, atoi(argv[i + 1]));
+    else if (flag == "--program")
+      program = argv[i + 1];
   }
   if (daemonPath.empty() || execPath.empty()) {
     fprintf(stderr, "usage: bench_exec --daemon QUARTERD --exec QUARTER_EXEC [--runs N] [--program PATH]\n");
@@ -83,9 +87,9 @@ int main(int argc, char** argv) {
   std::filesystem::create_directories(root / "private/var/mobile");
   std::filesystem::create_directories(root / "bin");
   std::ofstream(root / "etc/passwd") << "root:x:0:0::/private/var/root:/bin/sh\n"
-                                         "_installer:x:33:33::/private/var/emplacerd:/bin/false\n"
-                                         "_system:x:499:499::/private/var/empty:/bin/false\n"
-                                         "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
+                                        "_installer:x:33:33::/private/var/emplacerd:/bin/false\n"
+                                        "_system:x:499:499::/private/var/empty:/bin/false\n"
+                                        "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
   std::ofstream(root / "etc/group") << "wheel:x:0:\n_installer:x:33:\nsystemusers:x:499:\nmobile:x:501:\n";
   // The same program in both runs: a copy the registry knows.
   const std::string copy = (root / "bin/program").string();
@@ -108,8 +112,8 @@ int main(int argc, char** argv) {
     std::this_thread::sleep_for(std::chrono::milliseconds(25));
 
   const std::vector<std::string> direct{copy};
-  const std::vector<std::string> confined{execPath, "--root", dir, "--user", "501", "--identifier",
-                                          "com.example.bench", "--", copy};
+  const std::vector<std::string> confined{execPath, "--root", dir, "--user", "501", "--identifier", "com.example.bench",
+                                          "--",     copy};
   for (int i = 0; i < 10; ++i) runOnce(confined);  // the containers exist from here on
   // The launcher's start alone (a second exec, which any launcher costs),
   // so that the upcall and Landlock share shows.
@@ -117,9 +121,10 @@ int main(int argc, char** argv) {
   printf("%-34s p50 %8.1f us   p90 %8.1f us\n", ("direct " + program).c_str(), d.p50, d.p90);
   printf("%-34s p50 %8.1f us   p90 %8.1f us\n", "quarter-exec --version alone", l.p50, l.p90);
   printf("%-34s p50 %8.1f us   p90 %8.1f us\n", "through quarter-exec", c.p50, c.p90);
-  printf("added latency (p50): %.1f us (target < 2000 us), of which the launcher's own exec %.1f us and\n"
-         "the identity look-up, upcall and Landlock set-up %.1f us\n",
-         c.p50 - d.p50, l.p50, c.p50 - d.p50 - l.p50);
+  printf(
+      "added latency (p50): %.1f us (target < 2000 us), of which the launcher's own exec %.1f us and\n"
+      "the identity look-up, upcall and Landlock set-up %.1f us\n",
+      c.p50 - d.p50, l.p50, c.p50 - d.p50 - l.p50);
 
   kill(daemon, SIGTERM);
   waitpid(daemon, nullptr, 0);

@@ -24,8 +24,6 @@ int gFilesPerDirectory = 200;
 constexpr size_t kFileSize = 100;
 constexpr int kRounds = 3;
 
-
-
 void shell(const std::string& command) {
   if (std::system(command.c_str()) != 0) std::fprintf(stderr, "failed: %s\n", command.c_str()), std::exit(1);
 }
@@ -33,7 +31,6 @@ void shell(const std::string& command) {
 void mustSucceed(bool ok, const QRTErrorRef& error) {
   if (!ok) std::fprintf(stderr, "failed: %s\n", error ? error->description().c_str() : "?"), std::exit(1);
 }
-
 
 void report(const char* ours, const std::vector<double>& a, const char* theirs, const std::vector<double>& b) {
   double ma = bench::median(a), mb = bench::median(b);
@@ -71,7 +68,10 @@ int main(int argc, char** argv) {
     const std::string cpTo = scratch + "/cp" + std::to_string(round);
     pair(
         round,
-        [&] { ourCopy.push_back(bench::timed([&] { mustSucceed(fm._copyItemAtURL(QRTURL::fileURL(source), to, true, &error), error); })); },
+        [&] {
+          ourCopy.push_back(
+              bench::timed([&] { mustSucceed(fm._copyItemAtURL(QRTURL::fileURL(source), to, true, &error), error); }));
+        },
         [&] { cpA.push_back(bench::timed([&] { shell("cp -a '" + source + "' '" + cpTo + "'"); })); });
     std::printf("round %d: copy %.3f s, cp -a %.3f s\n", round + 1, ourCopy.back(), cpA.back());
   }
@@ -84,14 +84,17 @@ int main(int argc, char** argv) {
     bench::buildTree(b, gDirectories, gFilesPerDirectory, kFileSize);
     pair(
         round,
-        [&] { ourRemove.push_back(bench::timed([&] { mustSucceed(fm.removeItemAtURL(QRTURL::fileURL(a), &error), error); })); },
+        [&] {
+          ourRemove.push_back(
+              bench::timed([&] { mustSucceed(fm.removeItemAtURL(QRTURL::fileURL(a), &error), error); }));
+        },
         [&] { rmRf.push_back(bench::timed([&] { shell("rm -rf '" + b + "'"); })); });
     std::printf("round %d: remove %.3f s, rm -rf %.3f s\n", round + 1, ourRemove.back(), rmRf.back());
   }
   shell("rm -rf '" + scratch + "'");
 
-  std::printf("\n%d files of %zu bytes in %d directories, median of %d rounds\n\n",
-              gDirectories * gFilesPerDirectory, kFileSize, gDirectories, kRounds);
+  std::printf("\n%d files of %zu bytes in %d directories, median of %d rounds\n\n", gDirectories * gFilesPerDirectory,
+              kFileSize, gDirectories, kRounds);
   report("QRTFileManager _copyItemAtURL", ourCopy, "cp -a", cpA);
   report("QRTFileManager removeItemAtURL", ourRemove, "rm -rf", rmRf);
   return 0;

@@ -30,7 +30,6 @@ int gFilesPerDirectory = 200;
 constexpr int kRounds = 5;
 constexpr const char* kAttribute = "trusted.com.norvane.protection-class";
 
-
 bool setClass(int fd, int32_t cls) {
   const auto v = static_cast<uint32_t>(cls);
   const uint8_t b[4] = {uint8_t(v), uint8_t(v >> 8), uint8_t(v >> 16), uint8_t(v >> 24)};
@@ -62,13 +61,11 @@ void ourWalk(const std::string& root, int32_t cls) {
   using Op = QRTDataProtectionChangeOperation;
   QRTErrorRef error;
   bool locked = false;
-  if (!Op::setProtectionClassOfTreeAtURL(QRTURL::fileURL(root, true), cls, Op::QRTChangeDirectories | Op::QRTChangeFiles,
-                                         &locked, &error) ||
+  if (!Op::setProtectionClassOfTreeAtURL(QRTURL::fileURL(root, true), cls,
+                                         Op::QRTChangeDirectories | Op::QRTChangeFiles, &locked, &error) ||
       locked)
     std::fprintf(stderr, "failed: %s\n", error ? error->description().c_str() : "locked"), std::exit(1);
 }
-
-
 
 }  // namespace
 
@@ -89,12 +86,15 @@ int main(int argc, char** argv) {
     const int32_t cls = round % 2 ? 4 : 3;
     auto a = [&] { ourTimes.push_back(bench::timed([&] { ourWalk(ours, cls); })); };
     auto b = [&] { floorTimes.push_back(bench::timed([&] { floorWalk(AT_FDCWD, theirs.c_str(), cls); })); };
-    if (round % 2) a(), b();
-    else b(), a();
+    if (round % 2)
+      a(), b();
+    else
+      b(), a();
     std::printf("round %d: protection walk %.3f s, openat/fsetxattr floor %.3f s\n", round + 1, ourTimes.back(),
                 floorTimes.back());
   }
-  if (std::system(("rm -rf '" + scratch + "'").c_str()) != 0) std::fprintf(stderr, "cannot remove %s\n", scratch.c_str());
+  if (std::system(("rm -rf '" + scratch + "'").c_str()) != 0)
+    std::fprintf(stderr, "cannot remove %s\n", scratch.c_str());
 
   const double a = bench::median(ourTimes), b = bench::median(floorTimes);
   std::printf("\n%d files in %d directories, median of %d rounds\n\n", gDirectories * gFilesPerDirectory, gDirectories,

@@ -63,9 +63,10 @@ void clientLoop(const std::string& socketPath, Clock::time_point deadline, std::
 }
 
 Stats measure(const std::string& socketPath, int clients, double seconds) {
-  return bench::runLoad(clients, seconds, [&](Clock::time_point deadline, std::vector<uint32_t>& ns, uint64_t& unexpected) {
-    clientLoop(socketPath, deadline, ns, unexpected);
-  });
+  return bench::runLoad(clients, seconds,
+                        [&](Clock::time_point deadline, std::vector<uint32_t>& ns, uint64_t& unexpected) {
+                          clientLoop(socketPath, deadline, ns, unexpected);
+                        });
 }
 
 // ---- the echo server ----------------------------------------------------------
@@ -156,8 +157,9 @@ class Daemon {
               "_installer:x:33:33::/private/var/emplacerd:/bin/false\n"
               "_system:x:499:499::/private/var/empty:/bin/false\n"
               "mobile:x:501:501::/private/var/mobile:/bin/sh\n");
-    writeFile(root_ / "etc/group",
-              "wheel:x:0:root\n_installer:x:33:\nsystemusers:x:498:_installer,_system\n_system:x:499:\nmobile:x:501:\n");
+    writeFile(
+        root_ / "etc/group",
+        "wheel:x:0:root\n_installer:x:33:\nsystemusers:x:498:_installer,_system\n_system:x:499:\nmobile:x:501:\n");
     pid_ = fork();
     if (pid_ == 0) {
       std::string rootArg = root_.string();
@@ -220,9 +222,12 @@ Options parseOptions(int argc, char** argv) {
     std::string a = argv[i];
     if (i + 1 == argc) usage();
     std::string v = argv[++i];
-    if (a == "--socket") o.socketPath = v;
-    else if (a == "--daemon") o.daemonBinary = v;
-    else if (a == "--seconds") o.seconds = std::max(0.1, atof(v.c_str()));
+    if (a == "--socket")
+      o.socketPath = v;
+    else if (a == "--daemon")
+      o.daemonBinary = v;
+    else if (a == "--seconds")
+      o.seconds = std::max(0.1, atof(v.c_str()));
     else if (a == "--clients") {
       o.clients.clear();
       for (size_t pos = 0; pos < v.size();) {
@@ -232,7 +237,8 @@ Options parseOptions(int argc, char** argv) {
         size_t comma = v.find(',', pos);
         pos = comma == std::string::npos ? v.size() : comma + 1;
       }
-    } else usage();
+    } else
+      usage();
   }
   return o;
 }

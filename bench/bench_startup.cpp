@@ -77,7 +77,8 @@ void makeDeviceRoot(const std::string& root) {
   put(root + "/run/device/lockstate", "0\n");
   putPlist(root + "/etc/system-version.plist", {{"BuildVersion", "24A100"}, {"ReleaseType", "Internal"}});
   putPlist(root + "/etc/quarterd/identities/bench.plist",
-           {{"Executable", selfPath()}, {"SigningIdentifier", "com.norvane.bench"},
+           {{"Executable", selfPath()},
+            {"SigningIdentifier", "com.norvane.bench"},
             {"Entitlements", plist::Dictionary{{"com.norvane.private.QuarterKit.allowed", true}}}});
 }
 
@@ -89,10 +90,11 @@ void makeContainers(uint32_t user, uint64_t cls, int count, const std::function<
     const QRTUUID uuid = QRTUUID::random();
     const std::string path = dir->path() + "/" + uuid.UUIDString();
     if (mkdir(path.c_str(), 0755) != 0) fail("mkdir " + path);
-    plist::Dictionary metadata{{QRTMetadataIdentifierKey, "com.bench.c" + std::to_string(cls) + "." + std::to_string(i)},
-                               {QRTMetadataUUIDKey, uuid.UUIDString()},
-                               {QRTMetadataContentClassKey, plist::Value(cls)},
-                               {QRTMetadataPersonaKey, plist::Value(user)}};
+    plist::Dictionary metadata{
+        {QRTMetadataIdentifierKey, "com.bench.c" + std::to_string(cls) + "." + std::to_string(i)},
+        {QRTMetadataUUIDKey, uuid.UUIDString()},
+        {QRTMetadataContentClassKey, plist::Value(cls)},
+        {QRTMetadataPersonaKey, plist::Value(user)}};
     if (plist::Dictionary extra = info(i); !extra.empty()) metadata[QRTMetadataInfoKey] = std::move(extra);
     putPlist(path + "/" + QRTMetadataFileName, metadata);
   }
@@ -103,8 +105,8 @@ void recordEverything() {
   auto status = QRTMigrationStatus::init();
   if (!status) fail("migration status");
   status->writeCurrentBuildInfoToDisk();
-  for (const char* type : {QRTMigrationTypeBundle, QRTMigrationTypeACL, QRTMigrationTypeGroupId,
-                           QRTMigrationTypeCodeSigning})
+  for (const char* type :
+       {QRTMigrationTypeBundle, QRTMigrationTypeACL, QRTMigrationTypeGroupId, QRTMigrationTypeCodeSigning})
     status->setMigrationCompleteForType(type);
 }
 
@@ -186,7 +188,8 @@ int main(int argc, char** argv) {
   platform::logOpen(scratch + "/bench.log", "bench_startup", platform::kLogError);
 
   // ---- 1. start-up with nothing to migrate ----
-  for (const Kind& kind : kStore) makeContainers(kind.user, kind.cls, kind.count, [](int) { return plist::Dictionary{}; });
+  for (const Kind& kind : kStore)
+    makeContainers(kind.user, kind.cls, kind.count, [](int) { return plist::Dictionary{}; });
   {
     auto db = QRTSQLiteDB::initWithParentDirectoryURL(QRTGlobalConfiguration::sharedInstance().libraryDirectory());
     if (!db) fail("database");
@@ -223,36 +226,37 @@ int main(int argc, char** argv) {
   std::printf("%-44s %10s %8s\n", "", "seconds", "ratio");
   std::printf("%-44s %10.3f %8s\n", "cache build of the listed class (4,000)", cacheMedian, "1.00");
   std::printf("%-44s %10.3f %8.2f\n", "cache build of the whole store", median(cache), median(cache) / cacheMedian);
-  std::printf("%-44s %10.3f %8.2f\n", "restart to first served request", median(restart), median(restart) / cacheMedian);
+  std::printf("%-44s %10.3f %8.2f\n", "restart to first served request", median(restart),
+              median(restart) / cacheMedian);
   std::printf("%-44s %10.3f %8.2f\n", "reboot to first served request", median(reboot), median(reboot) / cacheMedian);
 
   const bool startupOnly = argc > 2 && std::string(argv[2]) == "--startup-only";
   if (!startupOnly) {
-  // ---- 2. data migration of 10,000 containers with group identifiers ----
-  if (std::system(("rm -rf '" + root + "/private/var/mobile/Containers/Data/Application'").c_str()) != 0)
-    fail("clear class 2");
-  makeContainers(501, 2, 10000, [](int i) {
-    return plist::Dictionary{{"com.norvane.Emplacer.GroupContainerIDs",
-                              plist::Array{"group.bench." + std::to_string(i % 50)}}};
-  });
-  {
-    // The group migration not yet recorded.
-    auto status = platform::readHostFile(root + "/private/var/root/Library/QuarterKit/qrt_migration_status.plist");
-    auto value = status ? plist::parse(status->data(), status->size()) : std::nullopt;
-    if (!value || !value->isDictionary()) fail("status file");
-    plist::Dictionary dictionary = value->dictionary();
-    dictionary.erase(QRTMigrationTypeGroupId);
-    putPlist(root + "/private/var/root/Library/QuarterKit/qrt_migration_status.plist", dictionary);
-  }
-  daemon.start(quarterd, root);
-  if (firstServed(root, {{"Command", 4}}) != 1) fail("death-row pass");
-  auto start = Clock::now();
-  if (firstServed(root, {{"Command", 24}}) != 1) fail("data migration");
-  const double migration = seconds(start);
-  daemon.stop();
-  std::printf("\ndata migration, 10,000 containers with group identifiers (50 groups), one run\n");
-  std::printf("%-44s %10.3f\n", "command 24, seconds", migration);
-  std::printf("%-44s %10.1f\n", "per container, microseconds", migration / 10000 * 1e6);
+    // ---- 2. data migration of 10,000 containers with group identifiers ----
+    if (std::system(("rm -rf '" + root + "/private/var/mobile/Containers/Data/Application'").c_str()) != 0)
+      fail("clear class 2");
+    makeContainers(501, 2, 10000, [](int i) {
+      return plist::Dictionary{
+          {"com.norvane.Emplacer.GroupContainerIDs", plist::Array{"group.bench." + std::to_string(i % 50)}}};
+    });
+    {
+      // The group migration not yet recorded.
+      auto status = platform::readHostFile(root + "/private/var/root/Library/QuarterKit/qrt_migration_status.plist");
+      auto value = status ? plist::parse(status->data(), status->size()) : std::nullopt;
+      if (!value || !value->isDictionary()) fail("status file");
+      plist::Dictionary dictionary = value->dictionary();
+      dictionary.erase(QRTMigrationTypeGroupId);
+      putPlist(root + "/private/var/root/Library/QuarterKit/qrt_migration_status.plist", dictionary);
+    }
+    daemon.start(quarterd, root);
+    if (firstServed(root, {{"Command", 4}}) != 1) fail("death-row pass");
+    auto start = Clock::now();
+    if (firstServed(root, {{"Command", 24}}) != 1) fail("data migration");
+    const double migration = seconds(start);
+    daemon.stop();
+    std::printf("\ndata migration, 10,000 containers with group identifiers (50 groups), one run\n");
+    std::printf("%-44s %10.3f\n", "command 24, seconds", migration);
+    std::printf("%-44s %10.1f\n", "per container, microseconds", migration / 10000 * 1e6);
   }
 
   platform::logClose();

@@ -106,9 +106,10 @@ int main(int argc, char** argv) {
   const std::string staging = configuration.stagingDirectory().path();
   const std::string floorDir = root + "/floor";
   check(mkdir(floorDir.c_str(), 0755) == 0, floorDir);
-  const plist::Data metadata = plist::writeBinary(plist::Dictionary{
-      {"QRTMetadataIdentifier", "com.example.floor"}, {"QRTMetadataUUID", QRTUUID::random().UUIDString()},
-      {"QRTMetadataContentClass", 2}, {"QRTMetadataPersona", 501}});
+  const plist::Data metadata = plist::writeBinary(plist::Dictionary{{"QRTMetadataIdentifier", "com.example.floor"},
+                                                                    {"QRTMetadataUUID", QRTUUID::random().UUIDString()},
+                                                                    {"QRTMetadataContentClass", 2},
+                                                                    {"QRTMetadataPersona", 501}});
 
   // Alternate the two so that disk state changes hit both alike.
   double daemonSeconds = 0, floorSeconds = 0;
@@ -131,18 +132,20 @@ int main(int argc, char** argv) {
   std::ofstream(root + "/etc/passwd", std::ios::app) << "other:x:502:502::/private/var/other:/bin/sh\n";
   check(mkdir((root + "/private/var/other").c_str(), 0755) == 0, "home 502");
   const std::string classDir = configuration.containerDirectoryURLForUser(502, 2, false)->path();
-  for (int i = 0; i < containers; ++i) floorCreate(staging, classDir, plist::writeBinary(plist::Dictionary{
-      {"QRTMetadataIdentifier", "com.example.c" + std::to_string(i)},
-      {"QRTMetadataUUID", QRTUUID::random().UUIDString()}, {"QRTMetadataContentClass", 2},
-      {"QRTMetadataPersona", 502}}));
+  for (int i = 0; i < containers; ++i)
+    floorCreate(staging, classDir,
+                plist::writeBinary(plist::Dictionary{{"QRTMetadataIdentifier", "com.example.c" + std::to_string(i)},
+                                                     {"QRTMetadataUUID", QRTUUID::random().UUIDString()},
+                                                     {"QRTMetadataContentClass", 2},
+                                                     {"QRTMetadataPersona", 502}}));
   floorReadAll(classDir);  // both sides read from a warm page cache
   auto start = Clock::now();
   size_t parsed = floorReadAll(classDir);
   floorSeconds = since(start);
   start = Clock::now();
   QRTErrorRef error;
-  auto found = QRTContainerCache::sharedInstance().containerForUser(502, 2, std::string("com.example.c0"), false,
-                                                                   &error);
+  auto found =
+      QRTContainerCache::sharedInstance().containerForUser(502, 2, std::string("com.example.c0"), false, &error);
   daemonSeconds = since(start);
   check(found && parsed == static_cast<size_t>(containers), "cache build");
   std::printf("%-28s %10.1f ms %10.1f ms %8.2f\n", ("first look-up, " + std::to_string(containers)).c_str(),

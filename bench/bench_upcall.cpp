@@ -62,16 +62,18 @@ void kernelLoop(const std::string& path, Clock::time_point deadline, std::vector
 }
 
 Stats measure(const std::string& path, int kernels, double seconds) {
-  return bench::runLoad(kernels, seconds, [&](Clock::time_point deadline, std::vector<uint32_t>& ns, uint64_t& unexpected) {
-    kernelLoop(path, deadline, ns, unexpected);
-  });
+  return bench::runLoad(kernels, seconds,
+                        [&](Clock::time_point deadline, std::vector<uint32_t>& ns, uint64_t& unexpected) {
+                          kernelLoop(path, deadline, ns, unexpected);
+                        });
 }
 
 // The reply the daemon gives such a program, with made-up paths of the same length.
 std::vector<uint8_t> echoReply() {
   sb_packbuff* pb = sb_packbuff_new(4096);
-  const std::string dir = "/tmp/quarterd-bench-XXXXXX/private/var/mobile/Containers/Data/Application/"
-                          "00000000-0000-0000-0000-000000000000";
+  const std::string dir =
+      "/tmp/quarterd-bench-XXXXXX/private/var/mobile/Containers/Data/Application/"
+      "00000000-0000-0000-0000-000000000000";
   sb_packbuff_pack_string(pb, 100, "/private/var/mobile", 19);
   sb_packbuff_pack_string(pb, 1, dir.c_str(), dir.size());
   sb_packbuff_pack_string(pb, 2, (dir + "/tmp").c_str(), dir.size() + 4);
@@ -136,8 +138,10 @@ class EchoServer {
       uint16_t type = 0;
       int rc = 0;
       while (pb && rc == 0 && sb_packbuff_get_item_value_type(pb, &type)) {
-        if (type == 3 || type == 5) sb_packbuff_unpack_uint32(pb, &rc);
-        else sb_packbuff_unpack_string(pb, nullptr, &rc);
+        if (type == 3 || type == 5)
+          sb_packbuff_unpack_uint32(pb, &rc);
+        else
+          sb_packbuff_unpack_string(pb, nullptr, &rc);
       }
       sb_packbuff_free(pb);
       std::vector<uint8_t> frame = platform::encodeUpcallReply({m.id + 100, 0, reply_});

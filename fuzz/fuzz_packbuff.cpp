@@ -27,9 +27,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   while (rc == 0 && sb_packbuff_get_item_value_type(pb, &type)) {
     uint8_t* before = pb->item;
     switch (type % 4) {
-      case 0:
-        sb_packbuff_unpack_uint32(pb, &rc);
-        break;
+      case 0: sb_packbuff_unpack_uint32(pb, &rc); break;
       case 1: {
         size_t length = 0;
         const char* s = sb_packbuff_unpack_string(pb, &length, &rc);

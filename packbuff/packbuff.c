@@ -32,7 +32,9 @@ static void write_header(uint8_t* at, uint16_t item_type, uint16_t value_type, u
   memcpy(at + 4, &value, 4);
 }
 
-static size_t pad_for(uint64_t length) { return (length % BYTE_ALIGNMENT) ? BYTE_ALIGNMENT - (length % BYTE_ALIGNMENT) : 0; }
+static size_t pad_for(uint64_t length) {
+  return (length % BYTE_ALIGNMENT) ? BYTE_ALIGNMENT - (length % BYTE_ALIGNMENT) : 0;
+}
 
 /* Offset of the cursor when a whole header lies inside the allocation; the
  * cursor of a hostile or emptied object may lie anywhere. */
@@ -148,8 +150,8 @@ bool sb_packbuff_at_end(const sb_packbuff* pb) {
   return memcmp(pb->item_buffer + off, zero, HEADER_SIZE) == 0;
 }
 
-static int pack_item(sb_packbuff* pb, uint16_t item_type, uint16_t value_type, uint32_t inline_value,
-                     const void* data, size_t length) {
+static int pack_item(sb_packbuff* pb, uint16_t item_type, uint16_t value_type, uint32_t inline_value, const void* data,
+                     size_t length) {
   if (!pb || !pb->item_buffer) return EINVAL;
   if (item_type > SB_PACKBUFF_ITEM_BYTES || item_type == SB_PACKBUFF_ITEM_END) return EINVAL;
   if (item_type == SB_PACKBUFF_ITEM_INLINE) {
@@ -322,9 +324,7 @@ void sb_packbuff_print(const sb_packbuff* pb) {
     uint64_t size = HEADER_SIZE;
     unsigned pad = (unsigned)pad_for(h.value);
     switch (h.item_type) {
-      case SB_PACKBUFF_ITEM_INLINE:
-        printf("inline value: %u\n", h.value);
-        break;
+      case SB_PACKBUFF_ITEM_INLINE: printf("inline value: %u\n", h.value); break;
       case SB_PACKBUFF_ITEM_BYTES:
         size += (uint64_t)h.value + pad;
         printf("bytes (%p, %u pad bytes, size: %u)\n", (const void*)(at + HEADER_SIZE), pad, h.value);
@@ -339,9 +339,7 @@ void sb_packbuff_print(const sb_packbuff* pb) {
         printf("     `%.*s'\n", (int)shown, (const char*)(at + HEADER_SIZE));
         break;
       }
-      default:
-        printf("*Unknown item type* %u\n", h.item_type);
-        break;
+      default: printf("*Unknown item type* %u\n", h.item_type); break;
     }
     if (off + size < off) {
       printf(">> item pointer overflow. <<\n");

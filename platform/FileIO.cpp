@@ -123,7 +123,8 @@ std::string temporaryName(std::string_view name) {
   std::string temp = ".";
   temp += name.substr(0, 200);
   temp += ".";
-  temp += std::to_string(getpid()) + "-" + std::to_string(counter.fetch_add(1)) + "-" + std::to_string(random % 1000000);
+  temp +=
+      std::to_string(getpid()) + "-" + std::to_string(counter.fetch_add(1)) + "-" + std::to_string(random % 1000000);
   return temp;
 }
 

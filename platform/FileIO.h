@@ -62,9 +62,7 @@ int replaceFileAt(int dirfd, std::string_view name, const void* data, size_t siz
 // openat with O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK (and O_NOATIME where the
 // caller may have it); -1 with errno on failure.
 int openNoFollowAt(int dirfd, const char* name, int flags);
-inline int openDirectoryAt(int dirfd, const char* name) {
-  return openNoFollowAt(dirfd, name, O_RDONLY | O_DIRECTORY);
-}
+inline int openDirectoryAt(int dirfd, const char* name) { return openNoFollowAt(dirfd, name, O_RDONLY | O_DIRECTORY); }
 
 // An item pinned by an O_PATH descriptor and checked with fstat: whatever
 // happens to its name afterwards, changes reach this inode and no other.

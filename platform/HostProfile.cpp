@@ -150,8 +150,8 @@ std::vector<HostProfileLine> loadHostProfile() {
   if (std::optional<std::string> text = readHostFile(kHostConfigurationPath, 1u << 20))
     p.configuration = parseHostConfiguration(*text, &problems);
   else if (errno != ENOENT)
-    problems.push_back(QRTFormat("Cannot read %s: %s; every key keeps its default", kHostConfigurationPath,
-                                 strerror(errno)));
+    problems.push_back(
+        QRTFormat("Cannot read %s: %s; every key keeps its default", kHostConfigurationPath, strerror(errno)));
   p.installer = accountNamed(kHostInstallerAccount);
   p.system = accountNamed(kHostSystemAccount);
   if (std::optional<GroupAccount> group = systemGroupByName(kHostSystemUsersGroup)) p.systemUsers = group->gid;
@@ -159,19 +159,22 @@ std::vector<HostProfileLine> loadHostProfile() {
     const bool found = name == kHostInstallerAccount ? p.installer.has_value()
                        : name == kHostSystemAccount  ? p.system.has_value()
                                                      : p.systemUsers.has_value();
-    if (!found) problems.push_back(QRTFormat("No account %s: requests that need it fail (systemd-sysusers makes it)", name));
+    if (!found)
+      problems.push_back(QRTFormat("No account %s: requests that need it fail (systemd-sysusers makes it)", name));
   }
   std::string defaultUser;
   if (const std::optional<std::string>& name = p.configuration.defaultUser) {
     p.defaultUser = accountNamed(*name);
     if (!p.defaultUser)
-      problems.push_back(QRTFormat("DefaultUser=%s names no account: requests for the default user fail", name->c_str()));
+      problems.push_back(
+          QRTFormat("DefaultUser=%s names no account: requests for the default user fail", name->c_str()));
     else
       defaultUser = QRTFormat("Default user is %s (uid %u)", name->c_str(), p.defaultUser->uid);
   } else {
     defaultUser = QRTFormat("No DefaultUser= in %s: requests for the default user fail", kHostConfigurationPath);
   }
-  if (std::optional<std::string> defs = readHostFile("/etc/login.defs", 1u << 20)) p.uidMin = parseLoginDefsUidMin(*defs);
+  if (std::optional<std::string> defs = readHostFile("/etc/login.defs", 1u << 20))
+    p.uidMin = parseLoginDefsUidMin(*defs);
 
   std::vector<HostProfileLine> lines;
   for (std::string& problem : problems) lines.push_back({kLogError, std::move(problem)});

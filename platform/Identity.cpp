@@ -55,9 +55,7 @@ void readExecutable(PeerCredentials* peer) {
 bool stillRunning(int pidfd) {
   pollfd watch{pidfd, POLLIN, 0};
   int ready;
-  do {
-    ready = poll(&watch, 1, 0);
-  } while (ready < 0 && errno == EINTR);
+  do { ready = poll(&watch, 1, 0); } while (ready < 0 && errno == EINTR);
   return ready == 0;
 }
 
@@ -158,8 +156,10 @@ std::optional<std::vector<uid_t>> usersOf(const plist::Value& value, const std::
       // Written as the host knows it; compared as peers are, in protocol ids.
       users.push_back(protocolUserId(static_cast<uid_t>(id->asUnsigned())));
     } else if (const std::string* name = item.stringIf()) {
-      if (std::optional<UserAccount> account = userByName(*name)) users.push_back(account->uid);
-      else QRTLog(kLogError, "Identity file %s: no account named %s; left out of Users", path.c_str(), name->c_str());
+      if (std::optional<UserAccount> account = userByName(*name))
+        users.push_back(account->uid);
+      else
+        QRTLog(kLogError, "Identity file %s: no account named %s; left out of Users", path.c_str(), name->c_str());
     } else {
       return std::nullopt;
     }
@@ -173,11 +173,14 @@ std::optional<Entry> entryOf(const plist::Dictionary& file, const std::string& p
   if (const plist::Value* signing = plist::find(file, "SigningIdentifier"); signing && signing->stringIf())
     whole->signingIdentifier = signing->string();
   plist::Dictionary userLevel;
-  if (const plist::Value* entitlements = plist::find(file, "Entitlements"); entitlements && entitlements->dictionaryIf()) {
+  if (const plist::Value* entitlements = plist::find(file, "Entitlements");
+      entitlements && entitlements->dictionaryIf()) {
     whole->entitlements = entitlements->dictionary();
     for (const auto& [name, value] : *whole->entitlements) {
-      if (name == kUserLevelEntitlement) userLevel.emplace(name, value);
-      else whole->systemLevel = true;
+      if (name == kUserLevelEntitlement)
+        userLevel.emplace(name, value);
+      else
+        whole->systemLevel = true;
     }
   }
   Entry entry;
@@ -214,7 +217,8 @@ void addRegistryFile(int dirfd, const std::string& directory, const std::string&
   struct stat st;
   int err = !fd.valid() ? errno : fstat(fd.get(), &st) != 0 ? errno : 0;
   if (err == 0 && S_ISREG(st.st_mode) && !ownedByRootOnly(st)) {
-    QRTLog(kLogError, "Skipping identity file %s: owned by %u with mode %o; it must be root's and writable by no one else",
+    QRTLog(kLogError,
+           "Skipping identity file %s: owned by %u with mode %o; it must be root's and writable by no one else",
            path.c_str(), static_cast<unsigned>(st.st_uid), static_cast<unsigned>(st.st_mode & 07777));
     return;
   }
@@ -229,7 +233,9 @@ void addRegistryFile(int dirfd, const std::string& directory, const std::string&
   const plist::Value* executable = file ? plist::find(*file, "Executable") : nullptr;
   if (!executable || !executable->stringIf()) {
     QRTLog(kLogError, "Skipping identity file %s: %s", path.c_str(),
-           !value ? error.c_str() : !file ? "not a dictionary" : "no Executable string");
+           !value  ? error.c_str()
+           : !file ? "not a dictionary"
+                   : "no Executable string");
     return;
   }
   std::optional<Entry> entry = entryOf(*file, path, &error);
@@ -246,7 +252,8 @@ IdentityMap loadRegistry(const std::string& directory) {
   struct stat st;
   if (safeOpen(directory, O_RDONLY | O_DIRECTORY, &fd) != 0 || fstat(fd.get(), &st) != 0) return identities;
   if (!ownedByRootOnly(st)) {
-    QRTLog(kLogError, "Skipping the identity registry %s: owned by %u with mode %o; it must be root's and writable by no one else",
+    QRTLog(kLogError,
+           "Skipping the identity registry %s: owned by %u with mode %o; it must be root's and writable by no one else",
            directory.c_str(), static_cast<unsigned>(st.st_uid), static_cast<unsigned>(st.st_mode & 07777));
     return identities;
   }

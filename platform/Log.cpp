@@ -117,16 +117,17 @@ bool openDirectoryLocked(LogFile& file) {
   file.name = file.path.substr(slash == std::string::npos ? 0 : slash + 1);
   file.directory.reset();
   int err = safeOpen(directory, O_RDONLY | O_DIRECTORY, &file.directory);
-  if (err == EXDEV) file.directory.reset(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-  else if (err) errno = err;
+  if (err == EXDEV)
+    file.directory.reset(open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  else if (err)
+    errno = err;
   return file.directory.valid();
 }
 
 bool openFileLocked(LogFile& file) {
-  file.fd = file.directory.valid()
-                ? openat(file.directory.get(), file.name.c_str(),
-                         O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOCTTY | O_NOFOLLOW, 0644)
-                : -1;
+  file.fd = file.directory.valid() ? openat(file.directory.get(), file.name.c_str(),
+                                            O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOCTTY | O_NOFOLLOW, 0644)
+                                   : -1;
   if (file.fd < 0) {
     gFileOpen = false;
     return false;

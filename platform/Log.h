@@ -66,18 +66,16 @@ void logClose();
 
 // QRTLog(level, format, args...): one line under the calling function's name;
 // formatting is skipped when the level is off.
-#define QRTLog(level, ...)                                                   \
-  do {                                                                       \
-    if (::platform::logEnabled(level))                                       \
-      ::platform::logWrite((level), __func__, QRTFormat(__VA_ARGS__));       \
+#define QRTLog(level, ...)                                                                              \
+  do {                                                                                                  \
+    if (::platform::logEnabled(level)) ::platform::logWrite((level), __func__, QRTFormat(__VA_ARGS__)); \
   } while (0)
 #define QRTLogRefusal(callerUid, ...)                                        \
   do {                                                                       \
     if (::platform::logEnabled(::platform::kLogError))                       \
       ::platform::logRefusal((callerUid), __func__, QRTFormat(__VA_ARGS__)); \
   } while (0)
-#define QRTLogAs(level, function, ...)                                       \
-  do {                                                                       \
-    if (::platform::logEnabled(level))                                       \
-      ::platform::logWrite((level), (function), QRTFormat(__VA_ARGS__));     \
+#define QRTLogAs(level, function, ...)                                                                    \
+  do {                                                                                                    \
+    if (::platform::logEnabled(level)) ::platform::logWrite((level), (function), QRTFormat(__VA_ARGS__)); \
   } while (0)

@@ -35,9 +35,7 @@ void runGuarded(const std::string& label, Work& work) {
     work();
   } catch (const std::exception& e) {
     QRTLog(kLogError, "Work item on queue %@ threw: %s", label, e.what());
-  } catch (...) {
-    QRTLog(kLogError, "Work item on queue %@ threw a non-standard exception", label);
-  }
+  } catch (...) { QRTLog(kLogError, "Work item on queue %@ threw a non-standard exception", label); }
 }
 
 // Runs the front item with the lock released; the item is destroyed unlocked
@@ -357,16 +355,13 @@ std::atomic<std::chrono::steady_clock::rep> gExitDeadline{
 
 void terminationThread(sigset_t signals, const std::function<void()>& stopAccepting) {
   int received = 0;
-  while (sigwait(&signals, &received) != 0) {
-  }
+  while (sigwait(&signals, &received) != 0) {}
   const auto deadline = std::chrono::steady_clock::now() + kTerminationGrace;
   gExitDeadline.store(deadline.time_since_epoch().count());
   QRTLog(kLogNotice, "SIGTERM received; %d transactions open", transactionCount());
   try {
     if (stopAccepting) stopAccepting();
-  } catch (const std::exception& e) {
-    QRTLog(kLogError, "Stopping the listener threw: %s", e.what());
-  } catch (...) {
+  } catch (const std::exception& e) { QRTLog(kLogError, "Stopping the listener threw: %s", e.what()); } catch (...) {
   }
   const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
   if (!waitForTransactions(std::max(left, std::chrono::milliseconds(0))))
@@ -427,9 +422,7 @@ void installTerminationHandler(std::function<void()> stopAccepting) {
       QRTLog(kLogError, "Cannot block SIGTERM: %s", strerror(error));
     try {
       std::thread(terminationThread, signals, std::move(stopAccepting)).detach();
-    } catch (const std::system_error& e) {
-      QRTLog(kLogError, "Cannot start the SIGTERM handler: %s", e.what());
-    }
+    } catch (const std::system_error& e) { QRTLog(kLogError, "Cannot start the SIGTERM handler: %s", e.what()); }
   });
 }
 

@@ -28,8 +28,7 @@ class Queue {
   virtual const std::string& label() const = 0;
 };
 
-std::shared_ptr<Queue> makeSerialQueue(const std::string& label,
-                                       QueuePriority priority = QueuePriority::Default);
+std::shared_ptr<Queue> makeSerialQueue(const std::string& label, QueuePriority priority = QueuePriority::Default);
 // A concurrent queue grows its threads when all are busy (work may block on
 // locks) and lets idle ones go.
 std::shared_ptr<Queue> makeConcurrentQueue(const std::string& label);

@@ -87,8 +87,7 @@ void wake(int eventFd, const char* what) {
 
 void drain(int fd) {
   uint64_t value;
-  while (::read(fd, &value, sizeof value) < 0 && errno == EINTR) {
-  }
+  while (::read(fd, &value, sizeof value) < 0 && errno == EINTR) {}
 }
 
 }  // namespace
@@ -146,6 +145,7 @@ class ByteBudget {
     ready.swap(waiters_);
     return ready;
   }
+
  private:
   size_t heldBy(uint32_t user) const {
     auto it = perUser_.find(user);
@@ -213,14 +213,14 @@ struct RequestListener::Impl {
 
   struct Client {
     ConnectionRef connection;
-    uint32_t uid = UINT32_MAX;         // UINT32_MAX: credentials unreadable
-    frame::Decoder decoder;            // touched only by the connection's holder
-    size_t reserved = 0;               // budget held for the frame being read; holder only
+    uint32_t uid = UINT32_MAX;  // UINT32_MAX: credentials unreadable
+    frame::Decoder decoder;     // touched only by the connection's holder
+    size_t reserved = 0;        // budget held for the frame being read; holder only
     std::atomic<int> inFlight{0};
-    std::atomic<bool> parked{false};   // waits for budget
+    std::atomic<bool> parked{false};  // waits for budget
     std::atomic<Clock::rep> lastActive{0};
     std::mutex pauseLock;
-    bool paused = false;               // not armed until its load falls
+    bool paused = false;  // not armed until its load falls
 
     void touch() { lastActive.store(Clock::now().time_since_epoch().count()); }
   };
@@ -229,10 +229,10 @@ struct RequestListener::Impl {
   std::string path;
   int listenFd = -1;
   int epollFd = -1;
-  int wakeFd = -1;       // stop
-  int budgetFd = -1;     // budget freed with waiters queued
-  int backoffFd = -1;    // timer: accept again after running out of descriptors
-  int sweepFd = -1;      // timer: close idle connections
+  int wakeFd = -1;     // stop
+  int budgetFd = -1;   // budget freed with waiters queued
+  int backoffFd = -1;  // timer: accept again after running out of descriptors
+  int sweepFd = -1;    // timer: close idle connections
   std::shared_ptr<ByteBudget> budget;
   std::shared_ptr<Queue> queue;
   RequestHandler handler;
@@ -373,8 +373,10 @@ void RequestListener::Impl::dropClient(const ClientRef& client) {
   if (it != clients.end() && it->second == client) {
     clients.erase(it);
     auto user = perUser.find(client->uid);
-    if (user != perUser.end() && --user->second.open <= 0) perUser.erase(user);
-    else if (user != perUser.end()) user->second.warned = false;
+    if (user != perUser.end() && --user->second.open <= 0)
+      perUser.erase(user);
+    else if (user != perUser.end())
+      user->second.warned = false;
   }
 }
 
@@ -513,8 +515,7 @@ void RequestListener::Impl::serveClient(const ClientRef& client, bool mayServeIn
 
 // The last request is served on this thread if another poller is free; the
 // rest run on the queue, so that a pipelined batch is served concurrently.
-void RequestListener::Impl::dispatch(const ClientRef& client, std::vector<RequestEvent>& events,
-                                     bool mayServeInline) {
+void RequestListener::Impl::dispatch(const ClientRef& client, std::vector<RequestEvent>& events, bool mayServeInline) {
   const bool inlineLast = mayServeInline && !events.empty() && idlePollers.load() > 0;
   const size_t queued = inlineLast ? events.size() - 1 : events.size();
   for (size_t i = 0; i < queued; ++i) {

@@ -137,8 +137,8 @@ int makeOne(int dirfd, const char* name, mode_t mode, std::string_view hostPath,
   if (out->valid()) return 0;
   int err = errno;
   if (err == ELOOP || err == ENOTDIR) {
-    QRTLogAs(kLogError, "safeMakeDirectory", "Refusing %s: %s where a directory belongs",
-             std::string(hostPath).c_str(), err == ELOOP ? "a symbolic link" : "another kind of item");
+    QRTLogAs(kLogError, "safeMakeDirectory", "Refusing %s: %s where a directory belongs", std::string(hostPath).c_str(),
+             err == ELOOP ? "a symbolic link" : "another kind of item");
   }
   return err;
 }

@@ -61,9 +61,7 @@ void installHangupHandler(std::function<void()> reopen) {
     pthread_sigmask(SIG_SETMASK, &all, &previous);
     try {
       std::thread(hangupThread, signals, std::move(reopen)).detach();
-    } catch (const std::system_error& e) {
-      QRTLog(kLogError, "Cannot start the SIGHUP handler: %s", e.what());
-    }
+    } catch (const std::system_error& e) { QRTLog(kLogError, "Cannot start the SIGHUP handler: %s", e.what()); }
     pthread_sigmask(SIG_SETMASK, &previous, nullptr);
   });
 }

@@ -29,9 +29,8 @@ std::map<std::string, int>& holders() {
 }
 
 bool usableName(const std::string& identifier) {
-  return !identifier.empty() && identifier != "." && identifier != ".." &&
-         identifier.find('/') == std::string::npos && identifier.find('\0') == std::string::npos &&
-         identifier.size() < 256;
+  return !identifier.empty() && identifier != "." && identifier != ".." && identifier.find('/') == std::string::npos &&
+         identifier.find('\0') == std::string::npos && identifier.size() < 256;
 }
 
 int openDirectory(UniqueFd* fd) {

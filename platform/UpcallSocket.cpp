@@ -34,7 +34,6 @@ void appendU32(std::vector<uint8_t>& out, uint32_t v) {
   out.insert(out.end(), b, b + 4);
 }
 
-
 }  // namespace
 
 UpcallParse parseUpcallFrame(std::span<const uint8_t> bytes, UpcallMessage* out, size_t* consumed) {
@@ -89,8 +88,7 @@ void UpcallListener::Impl::acceptLoop(const std::shared_ptr<Impl>& self) {
         std::this_thread::sleep_for(std::chrono::milliseconds(100));
         continue;
       }
-      if (!stopping.load())
-        QRTLog(kLogError, "The upcall socket stops accepting: %s", strerror(errno));
+      if (!stopping.load()) QRTLog(kLogError, "The upcall socket stops accepting: %s", strerror(errno));
       return;
     }
     if (connections.fetch_add(1) >= kUpcallMaxConnections) {

@@ -100,19 +100,15 @@ std::optional<UserAccount> findUserInFile(const std::function<bool(std::string_v
 }  // namespace
 
 std::optional<UserAccount> systemUserByName(const std::string& name) {
-  return systemLookup<passwd>(
-      [&](passwd* pw, char* buffer, size_t size, passwd** found) {
-        return getpwnam_r(name.c_str(), pw, buffer, size, found);
-      },
-      accountFromPasswd);
+  return systemLookup<passwd>([&](passwd* pw, char* buffer, size_t size,
+                                  passwd** found) { return getpwnam_r(name.c_str(), pw, buffer, size, found); },
+                              accountFromPasswd);
 }
 
 std::optional<GroupAccount> systemGroupByName(const std::string& name) {
-  return systemLookup<group>(
-      [&](group* gr, char* buffer, size_t size, group** found) {
-        return getgrnam_r(name.c_str(), gr, buffer, size, found);
-      },
-      accountFromGroup);
+  return systemLookup<group>([&](group* gr, char* buffer, size_t size,
+                                 group** found) { return getgrnam_r(name.c_str(), gr, buffer, size, found); },
+                             accountFromGroup);
 }
 
 namespace {
@@ -137,24 +133,20 @@ std::optional<UserAccount> hostProfileView(std::optional<UserAccount> account) {
 }  // namespace
 
 std::optional<UserAccount> userByName(const std::string& name) {
-  if (!useSystemDatabase())
-    return findUserInFile([&](std::string_view entry, uint32_t) { return entry == name; });
+  if (!useSystemDatabase()) return findUserInFile([&](std::string_view entry, uint32_t) { return entry == name; });
   if (hostProfile()) return hostProfileView(systemUserByName(name));
   return systemUserByName(name);
 }
 
 std::optional<UserAccount> userById(uint32_t uid) {
-  if (!useSystemDatabase())
-    return findUserInFile([&](std::string_view, uint32_t entry) { return entry == uid; });
+  if (!useSystemDatabase()) return findUserInFile([&](std::string_view, uint32_t entry) { return entry == uid; });
   if (hostProfile()) {
     if (std::optional<HostAccount> account = hostAccountFor(uid))
       return UserAccount{account->name, uid, uid, account->homeDirectory};
     if (std::optional<uid_t> host = hostUserId(uid); !host || protocolUserId(*host) != uid) return std::nullopt;
   }
   std::optional<UserAccount> account = systemLookup<passwd>(
-      [&](passwd* pw, char* buffer, size_t size, passwd** found) {
-        return getpwuid_r(uid, pw, buffer, size, found);
-      },
+      [&](passwd* pw, char* buffer, size_t size, passwd** found) { return getpwuid_r(uid, pw, buffer, size, found); },
       accountFromPasswd);
   return hostProfile() ? hostProfileView(std::move(account)) : account;
 }

@@ -81,10 +81,9 @@ class BenchDaemon {
               "_system:x:499:499::/private/var/empty:/bin/false\n"
               "mobile:x:501:501::/private/var/mobile:/bin/sh\n");
     writeFile(root_ / "etc/group", "wheel:x:0:\n_installer:x:33:\nsystemusers:x:499:\nmobile:x:501:\n");
-    plist::Dictionary identity{
-        {"Executable", self},
-        {"SigningIdentifier", std::string("com.norvane.quarter-bench")},
-        {"Entitlements", plist::Dictionary{{"com.norvane.private.QuarterKit.allowed", true}}}};
+    plist::Dictionary identity{{"Executable", self},
+                               {"SigningIdentifier", std::string("com.norvane.quarter-bench")},
+                               {"Entitlements", plist::Dictionary{{"com.norvane.private.QuarterKit.allowed", true}}}};
     plist::Data bytes = plist::writeBinary(identity);
     writeFile(root_ / "etc/quarterd/identities/quarter-bench.plist", std::string(bytes.begin(), bytes.end()));
   }
@@ -421,13 +420,20 @@ Options parseOptions(int argc, char** argv) {
     }
     if (i + 1 == argc) usage();
     std::string v = argv[++i];
-    if (a == "--socket") o.socketPath = v;
-    else if (a == "--daemon") o.daemonBinary = v;
-    else if (a == "--seconds") o.seconds = std::max(0.1, atof(v.c_str()));
-    else if (a == "--clients") o.clients = parseCounts(v);
-    else if (a == "--op") o.operations = parseOperation(v);
-    else if (a == "--prefill") o.prefill = std::max(0, atoi(v.c_str()));
-    else usage();
+    if (a == "--socket")
+      o.socketPath = v;
+    else if (a == "--daemon")
+      o.daemonBinary = v;
+    else if (a == "--seconds")
+      o.seconds = std::max(0.1, atof(v.c_str()));
+    else if (a == "--clients")
+      o.clients = parseCounts(v);
+    else if (a == "--op")
+      o.operations = parseOperation(v);
+    else if (a == "--prefill")
+      o.prefill = std::max(0, atoi(v.c_str()));
+    else
+      usage();
   }
   if (!o.socketPath.empty() && !o.daemonBinary.empty()) usage();
   // Neither: this machine's daemon.
@@ -477,8 +483,10 @@ int main(int argc, char** argv) {
       daemon->start();
       options.socketPath = daemon->socketPath();
     }
-    if (options.lookupFirst) lookupFirst(*daemon, std::max(1, options.prefill.value_or(10'000)), 3);
-    else runOperations(options);
+    if (options.lookupFirst)
+      lookupFirst(*daemon, std::max(1, options.prefill.value_or(10'000)), 3);
+    else
+      runOperations(options);
   } catch (const std::exception& e) {
     fprintf(stderr, "quarter-bench: %s\n", e.what());
     return 2;

@@ -94,8 +94,8 @@ enum : uint64_t {
   kTruncate = 1ull << 14,  // ABI 3
   kIoctlDev = 1ull << 15,  // ABI 5
 };
-constexpr uint64_t kNetBindTcp = 1ull << 0;     // ABI 4
-constexpr uint64_t kNetConnectTcp = 1ull << 1;  // ABI 4
+constexpr uint64_t kNetBindTcp = 1ull << 0;               // ABI 4
+constexpr uint64_t kNetConnectTcp = 1ull << 1;            // ABI 4
 constexpr uint64_t kScopeAbstractUnixSocket = 1ull << 0;  // ABI 6
 constexpr uint64_t kScopeSignal = 1ull << 1;              // ABI 6
 // Rights that apply to a file rather than to what lies beneath a directory.
@@ -107,8 +107,8 @@ constexpr uint64_t kContainerRights = kWriteFile | kReadFile | kReadDir | kRemov
 constexpr uint64_t kReadRights = kReadFile | kReadDir;
 // A container's top directory: dotfiles may be made and written there, but
 // nothing removed or replaced, so the daemon's metadata file stays.
-constexpr uint64_t kContainerTopRights = kReadFile | kReadDir | kWriteFile | kTruncate | kMakeDir | kMakeReg |
-                                         kMakeSym | kMakeFifo | kMakeSock;
+constexpr uint64_t kContainerTopRights =
+    kReadFile | kReadDir | kWriteFile | kTruncate | kMakeDir | kMakeReg | kMakeSym | kMakeFifo | kMakeSock;
 // Where system programs may live; each of their files is allowed on its own.
 constexpr const char* kProgramDirectories[] = {"/usr/local/sbin", "/usr/local/bin", "/usr/sbin", "/usr/bin",
                                                "/sbin",           "/bin",           "/usr/games"};
@@ -139,11 +139,13 @@ struct UsageError {
 Options parseOptions(int argc, char** argv) {
   enum { kRoot = 1000, kUser, kIdentifier, kNoNetwork, kAllowUnconfined };
   static const option kLong[] = {
-      {"root", required_argument, nullptr, kRoot},   {"user", required_argument, nullptr, kUser},
+      {"root", required_argument, nullptr, kRoot},
+      {"user", required_argument, nullptr, kUser},
       {"identifier", required_argument, nullptr, kIdentifier},
       {"no-network", no_argument, nullptr, kNoNetwork},
       {"allow-unconfined", no_argument, nullptr, kAllowUnconfined},
-      {"help", no_argument, nullptr, 'h'},           {"version", no_argument, nullptr, 'V'},
+      {"help", no_argument, nullptr, 'h'},
+      {"version", no_argument, nullptr, 'V'},
       {nullptr, 0, nullptr, 0},
   };
   Options options;
@@ -326,11 +328,14 @@ class Ruleset {
     struct stat dir;
     // /bin is /usr/bin on a merged /usr: one walk.
     if (abi_ <= 0 || stat(path, &dir) != 0 || !seen->insert({dir.st_dev, dir.st_ino}).second) return 0;
-    return forEachFile(path, [](const char*) { return true; }, [&](int fd, const struct stat& st) {
-      const bool program = S_ISREG(st.st_mode) && (st.st_mode & 0111) && st.st_uid == 0 && !(st.st_mode & 022);
-      if (!program || excluded.count({st.st_dev, st.st_ino}) || !seen->insert({st.st_dev, st.st_ino}).second) return 0;
-      return allow(fd, kExecute | kReadFile, false);
-    });
+    return forEachFile(
+        path, [](const char*) { return true; },
+        [&](int fd, const struct stat& st) {
+          const bool program = S_ISREG(st.st_mode) && (st.st_mode & 0111) && st.st_uid == 0 && !(st.st_mode & 022);
+          if (!program || excluded.count({st.st_dev, st.st_ino}) || !seen->insert({st.st_dev, st.st_ino}).second)
+            return 0;
+          return allow(fd, kExecute | kReadFile, false);
+        });
   }
 
   // The dynamic loaders (ld-*.so*), which the kernel executes for a program.
@@ -436,8 +441,8 @@ int run(const Options& options) {
   auto identity = platform::identityForExecutable(*program);
   const std::string registry = platform::hostPath("/etc/quarterd/identities");
   if (!identity->signingIdentifier)
-    return fail(kExitFailure, "unknown identifier " + options.identifier + ": " + *program + " has no identity in " +
-                                  registry);
+    return fail(kExitFailure,
+                "unknown identifier " + options.identifier + ": " + *program + " has no identity in " + registry);
   if (*identity->signingIdentifier != options.identifier)
     return fail(kExitFailure, "unknown identifier " + options.identifier + ": " + *program + " is registered as " +
                                   *identity->signingIdentifier + " in " + registry);
@@ -512,7 +517,8 @@ int run(const Options& options) {
     if (int err = rules.allowLoaders(dir.c_str()))
       return fail(kExitFailure, "cannot open up " + dir + ": " + strerror(err));
   for (const char* device : {"/dev/null", "/dev/zero", "/dev/full", "/dev/random", "/dev/urandom", "/dev/tty"})
-    if (int err = rules.allowSystemPath(device, kReadFile | kWriteFile | (strcmp(device, "/dev/tty") ? 0ull : uint64_t{kIoctlDev})))
+    if (int err = rules.allowSystemPath(
+            device, kReadFile | kWriteFile | (strcmp(device, "/dev/tty") ? 0ull : uint64_t{kIoctlDev})))
       return fail(kExitFailure, std::string("cannot open up ") + device + ": " + strerror(err));
   if (int err = rules.allowSystemPath(program->c_str(), kExecute | kReadFile))
     return fail(kExitFailure, "cannot open up " + *program + ": " + strerror(err));
@@ -525,7 +531,8 @@ int run(const Options& options) {
   // it anyway.
   if (prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0)
     return fail(kExitFailure, std::string("cannot set no_new_privs: ") + strerror(errno));
-  if (int err = rules.restrictSelf()) return fail(kExitFailure, std::string("cannot enforce Landlock: ") + strerror(err));
+  if (int err = rules.restrictSelf())
+    return fail(kExitFailure, std::string("cannot enforce Landlock: ") + strerror(err));
   // The protocol's users stand for host accounts of their own on a host.
   const std::optional<uid_t> uid = platform::hostUserId(*options.user);
   const std::optional<platform::HostAccount> hostAccount = platform::hostAccountFor(*options.user);
@@ -556,8 +563,6 @@ int main(int argc, char** argv) {
     return run(options);
   } catch (const UsageError& e) {
     fprintf(stderr, "quarter-exec: %s\n(quarter-exec --help for usage)\n", e.message.c_str());
-  } catch (const std::exception& e) {
-    fprintf(stderr, "quarter-exec: %s\n", e.what());
-  }
+  } catch (const std::exception& e) { fprintf(stderr, "quarter-exec: %s\n", e.what()); }
   return kExitUsage;
 }

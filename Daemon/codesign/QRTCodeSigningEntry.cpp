@@ -17,8 +17,8 @@ size_t hashValue(const plist::Value& value) {
     case plist::Type::Date: return combine(h, std::hash<double>{}(value.date().seconds));
     case plist::Type::String: return combine(h, std::hash<std::string>{}(value.string()));
     case plist::Type::Data:
-      return combine(h, std::hash<std::string_view>{}(std::string_view(
-                            reinterpret_cast<const char*>(value.data().data()), value.data().size())));
+      return combine(h, std::hash<std::string_view>{}(
+                            std::string_view(reinterpret_cast<const char*>(value.data().data()), value.data().size())));
     case plist::Type::Array:
       for (const plist::Value& item : value.array()) h = combine(h, hashValue(item));
       return h;

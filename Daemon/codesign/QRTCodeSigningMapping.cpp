@@ -208,7 +208,8 @@ QRTGroupList QRTCodeSigningMapping::_groupsOfEntry(const QRTCodeSigningEntry& en
   if (type == QRTGroupTypeApplication) {
     return _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, QRTApplicationGroupsEntitlement);
   }
-  QRTGroupList groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, QRTSystemGroupsEntitlement);
+  QRTGroupList groups =
+      _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, QRTSystemGroupsEntitlement);
   if (groups && !groups->empty()) return groups;
   return _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, QRTSystemGroupContainersEntitlement);
 }
@@ -245,10 +246,11 @@ bool QRTCodeSigningMapping::groupReferenceCountsMatchDatabase() {
 // ---- reading ----
 
 std::optional<QRTCodeSigningEntry> QRTCodeSigningMapping::_onQueue_storedEntry(const std::string& identifier,
-                                                                              QRTErrorRef* error) {
+                                                                               QRTErrorRef* error) {
   if (!usableIdentifier(identifier)) return std::nullopt;
   QRTErrorRef readError;
-  std::optional<QRTCodeSigningEntry> entry = codeSigningMappingDB->codeSigningEntryWithIdentifier(identifier, &readError);
+  std::optional<QRTCodeSigningEntry> entry =
+      codeSigningMappingDB->codeSigningEntryWithIdentifier(identifier, &readError);
   if (!entry && readError && !(readError->domain() == QRTErrorDomain && readError->code() == QRTErrorNotInDatabase)) {
     QRTSetError(error, readError);
   }
@@ -275,9 +277,9 @@ std::optional<plist::Dictionary> QRTCodeSigningMapping::_onQueue_codeSigningInfo
   // Before the database, the installer cached the information in the bundle container.
   QRTErrorRef lookupError;
   QRTMetadataRef bundle = QRTContainerCache::sharedInstance().containerForUser(QRTInstallerUserId, QRTClassAppBundle,
-                                                                              identifier, false, &lookupError);
-  const plist::Value* cached = bundle && bundle->info() ? plist::find(*bundle->info(), QRTCachedCodeSigningInfoKey)
-                                                        : nullptr;
+                                                                               identifier, false, &lookupError);
+  const plist::Value* cached =
+      bundle && bundle->info() ? plist::find(*bundle->info(), QRTCachedCodeSigningInfoKey) : nullptr;
   if (!cached || !cached->dictionaryIf()) return std::nullopt;
   plist::Dictionary info = cached->dictionary();
   QRTLog(kLogNotice, "Migrating code signing info from bundle container upon request for %@", identifier);
@@ -353,11 +355,11 @@ QRTGroupList QRTCodeSigningMapping::_withSystemGroupPrefix(QRTGroupList groups) 
 
 QRTGroupList QRTCodeSigningMapping::_systemGroupList(const std::string& identifier,
                                                      const std::optional<plist::Value>& entitlements) {
-  QRTGroupList groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements,
-                                                                      QRTSystemGroupsEntitlement);
+  QRTGroupList groups =
+      _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, QRTSystemGroupsEntitlement);
   if (!groups || groups->empty()) {
-    groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements,
-                                                           QRTSystemGroupContainersEntitlement);
+    groups =
+        _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, QRTSystemGroupContainersEntitlement);
   }
   return groups;
 }
@@ -413,7 +415,8 @@ uint64_t QRTCodeSigningMapping::_onQueue_processCodeSigningInfo(const plist::Dic
     }
     QRTCodeSigningEntry entry;
     const plist::Value* dataClass = option(withOptions, QRTCodeSigningDataContainerClassKey);
-    if (const plist::Integer* i = dataClass ? dataClass->integerIf() : nullptr) entry.dataContainerClass = i->asUnsigned();
+    if (const plist::Integer* i = dataClass ? dataClass->integerIf() : nullptr)
+      entry.dataContainerClass = i->asUnsigned();
     // Adding an entry never drops child rows, so the stored children are the
     // entry's children whatever is written; carrying them keeps a repeated
     // registration equal to the stored entry.
@@ -428,9 +431,9 @@ uint64_t QRTCodeSigningMapping::_onQueue_processCodeSigningInfo(const plist::Dic
         result = error->resultCode();
         return;
       }
-      std::vector<std::string> children =
-          parentEntry && parentEntry->childBundleIdentifiers ? *parentEntry->childBundleIdentifiers
-                                                             : std::vector<std::string>{};
+      std::vector<std::string> children = parentEntry && parentEntry->childBundleIdentifiers
+                                              ? *parentEntry->childBundleIdentifiers
+                                              : std::vector<std::string>{};
       if (std::find(children.begin(), children.end(), identifier) == children.end()) {
         if (children.size() >= kMaxChildBundles) {
           QRTLog(kLogError, "Parent %@ already has %lu child bundles; not adding %@", *parent,
@@ -511,8 +514,8 @@ QRTErrorRef QRTCodeSigningMapping::_setCodeSigningDictionaryValues(const std::ve
                                                                    const std::vector<std::string>& forIdentifiers) {
   if (values.size() != forIdentifiers.size()) {
     return QRT_ERROR(QRTErrorCodeSigningInputMismatch, nullptr, true,
-                     "Can't act on an invalid input: values count: %ld, IDs count: %ld", static_cast<long>(values.size()),
-                     static_cast<long>(forIdentifiers.size()));
+                     "Can't act on an invalid input: values count: %ld, IDs count: %ld",
+                     static_cast<long>(values.size()), static_cast<long>(forIdentifiers.size()));
   }
   QRTErrorRef result;
   for (size_t i = 0; i < values.size(); ++i) {
@@ -565,7 +568,7 @@ void QRTCodeSigningMapping::_onQueue_removeCodeSigningDictionariesForIdentifierA
 // ---- invalidation ----
 
 bool QRTCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
-                                                                                         QRTErrorRef* error) {
+                                                                                          QRTErrorRef* error) {
   generation_.fetch_add(1, std::memory_order_acq_rel);
   return codeSigningMappingDB->invalidateCodeSigningForIdentifierAndAllChildren(identifier, error);
 }

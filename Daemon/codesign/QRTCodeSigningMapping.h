@@ -48,8 +48,7 @@ class QRTCodeSigningMapping {
   uint64_t processCodeSigningInfo(const plist::Dictionary* codeSigningInfo,
                                   const std::optional<std::string>& forIdentifier,
                                   const plist::Dictionary* withOptions);
-  uint64_t processCallerRegisteredEntitlements(const plist::Dictionary& entitlements,
-                                               const std::string& forIdentifier);
+  uint64_t processCallerRegisteredEntitlements(const plist::Dictionary& entitlements, const std::string& forIdentifier);
   // The external view: placeholder and invalid entries read as none.
   std::optional<plist::Dictionary> getCodeSigningInfoForIdentifier(const std::optional<std::string>& identifier);
   uint64_t invalidateCodeSigningInfoForAppsWithoutBundleContainer();
@@ -66,8 +65,9 @@ class QRTCodeSigningMapping {
   QRTGroupList systemGroupIdentifiersForIdentifier(const std::string& identifier);
 
   // Must be called on the queue (the group manager's counting runs there).
-  void iterateGroupIdsWithKey(const std::string& key, const std::optional<std::string>& fallBackKey,
-                              const std::function<void(const std::string& identifier, const QRTGroupList& groups)>& block);
+  void iterateGroupIdsWithKey(
+      const std::string& key, const std::optional<std::string>& fallBackKey,
+      const std::function<void(const std::string& identifier, const QRTGroupList& groups)>& block);
 
   // How many stored programs (invalid and placeholder ones included) name
   // each group of the type. Counted from the database at the first need,
@@ -97,7 +97,7 @@ class QRTCodeSigningMapping {
       const std::optional<QRTCodeSigningEntry>& entry, const std::string& identifier, bool externalRequest);
   std::optional<plist::Value> _onQueue_entitlementsForIdentifier(const std::string& identifier);
   std::optional<plist::Value> _onQueue_entitlementsCodeSigningEntry(const std::optional<QRTCodeSigningEntry>& entry,
-                                                                   const std::string& identifier);
+                                                                    const std::string& identifier);
   bool _onQueue_codeSigningInfoExistForIdentifier(const std::string& identifier);
   bool _onQueue_identifierHasCallerRegisteredEntitlements(const std::string& identifier);
   bool _onQueue_identifierHasSystemContainer(const std::string& identifier);
@@ -105,8 +105,7 @@ class QRTCodeSigningMapping {
   QRTGroupList _onQueue_appGroupIdentifiersForIdentifier(const std::string& identifier);
   QRTGroupList _onQueue_systemGroupIdentifiersForIdentifier(const std::string& identifier);
   uint64_t _onQueue_invalidateCodeSigningInfoForAppsWithoutBundleContainer();
-  bool _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
-                                                                     QRTErrorRef* error);
+  bool _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier, QRTErrorRef* error);
   void _onQueue_removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier);
 
   // Every write of an entry goes through here, so that the kept group

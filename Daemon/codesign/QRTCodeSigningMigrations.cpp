@@ -71,8 +71,8 @@ bool migrationOccurred(const std::unique_ptr<QRTMigrationStatus>& status, const 
 uint64_t clearInfoKey(const QRTMetadataRef& container, const char* key) {
   uint64_t code = QRTErrorNone;
   QRTClientConnection::sharedClientConnection().setInfoValue(std::nullopt, std::string(key), container->uid(),
-                                                              container->uuid(), container->identifier(),
-                                                              container->containerClass(), false, &code);
+                                                             container->uuid(), container->identifier(),
+                                                             container->containerClass(), false, &code);
   return code;
 }
 
@@ -127,7 +127,7 @@ bool QRTCodeSigningMapping::_addMigratedEntry(const QRTCodeSigningEntry& entry, 
 }
 
 std::optional<plist::Dictionary> QRTCodeSigningMapping::_readCodeSigningMappingFromDiskAtURL(const QRTURL& url,
-                                                                                           QRTErrorRef* error) {
+                                                                                             QRTErrorRef* error) {
   return QRT_dictionaryWithContentsOfURL(url, error);
 }
 
@@ -136,7 +136,8 @@ void QRTCodeSigningMapping::_migrateFromMappingFileToDBIfNecessary() {
   QRTErrorRef readError;
   auto file = _readCodeSigningMappingFromDiskAtURL(url, &readError);
   if (!file) {
-    if (!isMissingFile(readError)) QRTLog(kLogError, "Failed to read code signing mapping file at %@ : %@", url, readError);
+    if (!isMissingFile(readError))
+      QRTLog(kLogError, "Failed to read code signing mapping file at %@ : %@", url, readError);
     return;
   }
   QRTLog(kLogNotice, "Migrating code signing info from file to DB");
@@ -174,7 +175,7 @@ void QRTCodeSigningMapping::_onQueue_migrateAppGroupIdsFromDataContainersToFile(
   for (uint64_t containerClass : {QRTClassAppData, QRTClassAddonData, QRTClassVPNData}) {
     QRTErrorRef listError;
     auto containers = QRTContainerCache::sharedInstance().allContainersForUser(QRTDefaultMobileUserId, containerClass,
-                                                                              false, &listError);
+                                                                               false, &listError);
     if (!containers) {
       QRTLog(kLogError, "Failed to fetch list of containers for userId: 501, class %ld : %@",
              static_cast<long>(containerClass), listError);
@@ -243,8 +244,7 @@ void QRTCodeSigningMapping::_onQueue_migrateDataFromLegacyEntitlementsFileToCode
     QRTErrorRef error;
     std::optional<QRTCodeSigningEntry> stored = _onQueue_storedEntry(identifier, &error);
     if (stored && !stored->isInvalid()) {
-      QRTLog(kLogNotice, "Already have code signing info for %@.  No need to migrate legacy entitlements.",
-             identifier);
+      QRTLog(kLogNotice, "Already have code signing info for %@.  No need to migrate legacy entitlements.", identifier);
       continue;
     }
     if (error && !stored) {

@@ -89,11 +89,11 @@ bool isError(const QRTErrorRef& error, QRTErrorCode code) {
 
 // The private building blocks share the connection and the URL.
 struct QRTSQLiteDBStatements {
-  static QRTErrorRef performTwoParameterQuery(sqlite3* db, const QRTURL& url, const char* sql,
-                                              const std::string& one, const std::optional<std::string>& two,
-                                              int expectedChanges) {
+  static QRTErrorRef performTwoParameterQuery(sqlite3* db, const QRTURL& url, const char* sql, const std::string& one,
+                                              const std::optional<std::string>& two, int expectedChanges) {
     Statement statement(db, sql, url);
-    if (!statement.prepared()) return DB_ERROR(nullptr, "sqlite3_prepare(insert) for %@ failed: %s", url, sqlite3_errmsg(db));
+    if (!statement.prepared())
+      return DB_ERROR(nullptr, "sqlite3_prepare(insert) for %@ failed: %s", url, sqlite3_errmsg(db));
     if (!statement.bindText(1, one)) {
       return DB_ERROR(nullptr, "sqlite3_bind_text for identifier=%@ at %@ failed: %s", one, url, sqlite3_errmsg(db));
     }
@@ -105,8 +105,8 @@ struct QRTSQLiteDBStatements {
     }
     const int changes = sqlite3_changes(db);
     if (expectedChanges != -1 && changes != expectedChanges) {
-      return QRT_ERROR(QRTErrorUnexpectedChangeCount, nullptr, false, "sqlite3_changes for %s in %@: %d, but expecting %d",
-                       sql, url, changes, expectedChanges);
+      return QRT_ERROR(QRTErrorUnexpectedChangeCount, nullptr, false,
+                       "sqlite3_changes for %s in %@: %d, but expecting %d", sql, url, changes, expectedChanges);
     }
     return nullptr;
   }
@@ -115,9 +115,11 @@ struct QRTSQLiteDBStatements {
                                                 const QRTCodeSigningEntry& entry, const std::string& identifier,
                                                 bool isUpdate) {
     Statement statement(db, sql, url);
-    if (!statement.prepared()) return DB_ERROR(nullptr, "sqlite3_prepare(insert) for %@ failed: %s", url, sqlite3_errmsg(db));
+    if (!statement.prepared())
+      return DB_ERROR(nullptr, "sqlite3_prepare(insert) for %@ failed: %s", url, sqlite3_errmsg(db));
     if (!statement.bindInt(1, entry.invalid)) {
-      return DB_ERROR(nullptr, "sqlite3_bind_int for invalid=%d at %@ failed: %s", int(entry.invalid), url, sqlite3_errmsg(db));
+      return DB_ERROR(nullptr, "sqlite3_bind_int for invalid=%d at %@ failed: %s", int(entry.invalid), url,
+                      sqlite3_errmsg(db));
     }
     if (!statement.bindInt(2, entry.placeholder)) {
       return DB_ERROR(nullptr, "sqlite3_bind_int for placeholder=%d at %@ failed: %s", int(entry.placeholder), url,
@@ -141,8 +143,8 @@ struct QRTSQLiteDBStatements {
     }
     const int changes = sqlite3_changes(db);
     if (isUpdate && changes != 1) {
-      return QRT_ERROR(QRTErrorUnexpectedChangeCount, nullptr, false, "sqlite3_changes for %s in %@: %d, but expecting 1",
-                       sql, url, changes);
+      return QRT_ERROR(QRTErrorUnexpectedChangeCount, nullptr, false,
+                       "sqlite3_changes for %s in %@: %d, but expecting 1", sql, url, changes);
     }
     return nullptr;
   }
@@ -162,7 +164,8 @@ struct QRTSQLiteDBStatements {
   static QRTErrorRef insertCodeSigningData(sqlite3* db, const QRTURL& url, const QRTCodeSigningEntry& entry,
                                            const std::string& identifier) {
     Statement statement(db, kInsertData, url);
-    if (!statement.prepared()) return DB_ERROR(nullptr, "sqlite3_prepare(insert) for %@ failed: %s", url, sqlite3_errmsg(db));
+    if (!statement.prepared())
+      return DB_ERROR(nullptr, "sqlite3_prepare(insert) for %@ failed: %s", url, sqlite3_errmsg(db));
     const plist::Value info = entry.codeSigningInfo ? plist::Value(*entry.codeSigningInfo) : plist::Value();
     if (!entry.codeSigningInfo) {
       return DB_ERROR(QRT_ERROR(QRTErrorInvalidArgument, nullptr, false, "no code signing info"),
@@ -277,12 +280,12 @@ void QRTSQLiteDB::closeDB() {
   db_ = nullptr;
 }
 
-bool QRTSQLiteDB::addCodeSigningEntry(const QRTCodeSigningEntry* entry, const std::optional<std::string>& withIdentifier,
-                                      QRTErrorRef* error) {
+bool QRTSQLiteDB::addCodeSigningEntry(const QRTCodeSigningEntry* entry,
+                                      const std::optional<std::string>& withIdentifier, QRTErrorRef* error) {
   if (!entry || !withIdentifier) {
-    QRTSetError(error, QRT_ERROR(QRTErrorInvalidArgument, nullptr, true,
-                                 "codeSigningEntry %@ and identifier %@ cannot be nil",
-                                 entry ? QRTFormatArg(*entry) : QRTFormatArg(nullptr), withIdentifier));
+    QRTSetError(error,
+                QRT_ERROR(QRTErrorInvalidArgument, nullptr, true, "codeSigningEntry %@ and identifier %@ cannot be nil",
+                          entry ? QRTFormatArg(*entry) : QRTFormatArg(nullptr), withIdentifier));
     return false;
   }
   QRTErrorRef result = S::transaction(db_, [&]() -> QRTErrorRef {
@@ -332,7 +335,8 @@ std::optional<QRTCodeSigningEntry> QRTSQLiteDB::codeSigningEntryWithIdentifier(c
     }
   }
   if (!entry && !failure) {
-    QRTSetError(error, QRT_ERROR(QRTErrorNotInDatabase, nullptr, false, "Identifier: \"%@\" Not Found in DB", identifier));
+    QRTSetError(error,
+                QRT_ERROR(QRTErrorNotInDatabase, nullptr, false, "Identifier: \"%@\" Not Found in DB", identifier));
     return std::nullopt;
   }
   if (failure) {
@@ -359,8 +363,7 @@ bool QRTSQLiteDB::invalidateCodeSigningWithIdentifier(const std::string& identif
   return true;
 }
 
-bool QRTSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier,
-                                                                   QRTErrorRef* error) {
+bool QRTSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier, QRTErrorRef* error) {
   QRTErrorRef childFailure;
   std::optional<std::vector<std::string>> children = childIdentifiersForParentIdentifier(identifier, &childFailure);
   if (!children && !isError(childFailure, QRTErrorNotInDatabase)) {
@@ -388,7 +391,8 @@ bool QRTSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::st
 QRTErrorRef QRTSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(
     const std::function<void(const std::string& identifier, const QRTCodeSigningEntry& entry)>& block) {
   Statement statement(db_, kSelectAll, url_);
-  if (!statement.prepared()) return DB_ERROR(nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_, sqlite3_errmsg(db_));
+  if (!statement.prepared())
+    return DB_ERROR(nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_, sqlite3_errmsg(db_));
   QRTErrorRef result;
   for (;;) {
     const int rc = sqlite3_step(statement.get());
@@ -417,8 +421,8 @@ QRTErrorRef QRTSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(
   return result;
 }
 
-std::optional<std::vector<std::string>> QRTSQLiteDB::childIdentifiersForParentIdentifier(
-    const std::string& identifier, QRTErrorRef* error) {
+std::optional<std::vector<std::string>> QRTSQLiteDB::childIdentifiersForParentIdentifier(const std::string& identifier,
+                                                                                         QRTErrorRef* error) {
   Statement statement(db_, kSelectChildren, url_);
   if (!statement.prepared()) {
     QRTSetError(error, DB_ERROR(nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_, sqlite3_errmsg(db_)));

@@ -34,8 +34,7 @@ class QRTSQLiteDB {
                            QRTErrorRef* error);
   bool deleteCodeSigningEntryWithIdentifier(const std::optional<std::string>& identifier, QRTErrorRef* error);
   // Error 67 (not logged) when there is no entry.
-  std::optional<QRTCodeSigningEntry> codeSigningEntryWithIdentifier(const std::string& identifier,
-                                                                    QRTErrorRef* error);
+  std::optional<QRTCodeSigningEntry> codeSigningEntryWithIdentifier(const std::string& identifier, QRTErrorRef* error);
   bool invalidateCodeSigningWithIdentifier(const std::string& identifier, QRTErrorRef* error);
   bool invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier, QRTErrorRef* error);
   // The last error met, or null when every row went through.
@@ -43,7 +42,7 @@ class QRTSQLiteDB {
       const std::function<void(const std::string& identifier, const QRTCodeSigningEntry& entry)>& block);
   // Error 67 (not logged) when the parent has no children.
   std::optional<std::vector<std::string>> childIdentifiersForParentIdentifier(const std::string& identifier,
-                                                                            QRTErrorRef* error);
+                                                                              QRTErrorRef* error);
 
  private:
   QRTSQLiteDB(sqlite3* db, QRTURL url) : db_(db), url_(std::move(url)) {}

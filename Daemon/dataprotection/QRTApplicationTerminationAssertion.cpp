@@ -18,10 +18,8 @@ uint8_t platformReason(uint8_t reason) {
   switch (reason) {
     case QRTApplicationTerminationAssertion::ReasonInstallation:
     case QRTApplicationTerminationAssertion::ReasonCacheDeletion:
-    case QRTApplicationTerminationAssertion::ReasonCritical:
-      return reason;
-    default:
-      return QRTApplicationTerminationAssertion::ReasonInstallation;
+    case QRTApplicationTerminationAssertion::ReasonCritical: return reason;
+    default: return QRTApplicationTerminationAssertion::ReasonInstallation;
   }
 }
 
@@ -57,13 +55,13 @@ std::shared_ptr<QRTApplicationTerminationAssertion> QRTApplicationTerminationAss
     QRTLog(kLogError, "Failed to get Ravelhold");
     return nullptr;
   }
-  while (sem_wait(&acquisition->semaphore) != 0 && errno == EINTR) {
-  }
+  while (sem_wait(&acquisition->semaphore) != 0 && errno == EINTR) {}
   if (acquisition->failed) {
     assertion->invalidate();
     return nullptr;
   }
-  return std::shared_ptr<QRTApplicationTerminationAssertion>(new QRTApplicationTerminationAssertion(std::move(assertion)));
+  return std::shared_ptr<QRTApplicationTerminationAssertion>(
+      new QRTApplicationTerminationAssertion(std::move(assertion)));
 }
 
 QRTApplicationTerminationAssertion::~QRTApplicationTerminationAssertion() { invalidate(); }

@@ -154,7 +154,8 @@ bool ProtectionWalk::openRoot(QRTErrorRef* error) {
   }
   if (opened.st_ino != st.st_ino || opened.st_dev != st.st_dev) return true;  // swapped since
   device_ = opened.st_dev;
-  if (!directory) return !(changeType_ & QRTDataProtectionChangeOperation::QRTChangeFiles) || change(fd.get(), false, error);
+  if (!directory)
+    return !(changeType_ & QRTDataProtectionChangeOperation::QRTChangeFiles) || change(fd.get(), false, error);
   return enter(std::move(fd), opened, path_.size(), error);
 }
 
@@ -282,8 +283,8 @@ bool QRTDataProtectionChangeOperation::setProtectionClassOfTreeAtURL(const QRTUR
 QRTURL QRTDataProtectionChangeOperation::urlForProtectionOperationWithIdentifier(const std::string& identifier,
                                                                                  uint64_t containerClass,
                                                                                  uint32_t userId) {
-  const std::string name = QRTFormat("%@-%llu-%u.plist", identifier, static_cast<unsigned long long>(containerClass),
-                                     userId);
+  const std::string name =
+      QRTFormat("%@-%llu-%u.plist", identifier, static_cast<unsigned long long>(containerClass), userId);
   return QRTGlobalConfiguration::sharedInstance().pendingUpdatesDirectory().URLByAppendingPathComponent(name);
 }
 
@@ -329,8 +330,8 @@ std::optional<plist::Dictionary> QRTDataProtectionChangeOperation::_readAndValid
     return invalid(QRT_ERROR(QRTErrorInvalidMetadata, nullptr, false, "Invalid update info UUID String: %@ at %@",
                              foundValue(*d, kInternalIDKey), *url));
   if (!QRTUUID::fromString(uuid->string()))
-    return invalid(QRT_ERROR(QRTErrorInvalidMetadata, nullptr, false, "Invalid update info UUID: %@ at %@",
-                             uuid->string(), *url));
+    return invalid(
+        QRT_ERROR(QRTErrorInvalidMetadata, nullptr, false, "Invalid update info UUID: %@ at %@", uuid->string(), *url));
   return d;
 }
 
@@ -376,7 +377,8 @@ bool QRTDataProtectionChangeOperation::deleteUpdateFileWithIdentifier(const std:
   return false;
 }
 
-QRTDataProtectionChangeOperation::Ref QRTDataProtectionChangeOperation::dataProtectionChangeOperationWithContainerMetadata(
+QRTDataProtectionChangeOperation::Ref
+QRTDataProtectionChangeOperation::dataProtectionChangeOperationWithContainerMetadata(
     QRTMetadataRef metadata, int32_t settingClass, bool retryingIfLocked, uint32_t changeType, QueueRef queue) {
   return std::make_shared<QRTDataProtectionChangeOperation>(std::move(metadata), settingClass, retryingIfLocked,
                                                             changeType, std::nullopt, std::move(queue));
@@ -536,8 +538,9 @@ void QRTDataProtectionChangeOperation::performChangeOperation() {
            m->userId(), m->identifier(), containerClass, newDataProtectionClass_, error);
   }
   if (needToRetry && retryIfLocked_) {
-    QRTLog(kLogNotice, "Retrying container protection update to %d on next unlock for user: %u, id: %@, "
-                       "containerClass: %llu",
+    QRTLog(kLogNotice,
+           "Retrying container protection update to %d on next unlock for user: %u, id: %@, "
+           "containerClass: %llu",
            newDataProtectionClass_, m->userId(), m->identifier(), containerClass);
     // The queue runs only while the device is unlocked.
     run_async_with_transaction(QRTLockStateQueue(), [self = shared_from_this()] {

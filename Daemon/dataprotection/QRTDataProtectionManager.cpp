@@ -45,20 +45,17 @@ QRTDataProtectionManager& QRTDataProtectionManager::defaultManager() {
 }
 
 QRTDataProtectionManager::QRTDataProtectionManager()
-    : protectionOperationFileQueue_(
-          platform::makeSerialQueue("com.norvane.QuarterKit.ProtectionOperationFileQueue")) {}
+    : protectionOperationFileQueue_(platform::makeSerialQueue("com.norvane.QuarterKit.ProtectionOperationFileQueue")) {}
 
 void QRTDataProtectionManager::setDataProtectionOnDataContainerForUser(
-    uint32_t userId, const std::optional<std::string>& identifier, uint64_t containerClass,
-    int32_t dataProtectionClass, bool isSecondOrThirdPartyApp, bool retryIfLocked, Completion withCompletion) {
+    uint32_t userId, const std::optional<std::string>& identifier, uint64_t containerClass, int32_t dataProtectionClass,
+    bool isSecondOrThirdPartyApp, bool retryIfLocked, Completion withCompletion) {
   Completion completion = once(std::move(withCompletion));
   uint64_t code;
   try {
     code = _setDataProtection(userId, identifier, containerClass, dataProtectionClass, isSecondOrThirdPartyApp,
                               retryIfLocked, completion);
-  } catch (...) {
-    code = QRT_EXCEPTION_ERROR()->resultCode();
-  }
+  } catch (...) { code = QRT_EXCEPTION_ERROR()->resultCode(); }
   if (code != 0 && completion) completion(code);
 }
 
@@ -106,11 +103,10 @@ uint64_t QRTDataProtectionManager::_setDataProtection(uint32_t userId, const std
   }
   // Towards a numerically higher class only directories change: files keep theirs.
   const bool towardsLower = current > dataProtectionClass || (current == 0 && dataProtectionClass <= 2);
-  const uint32_t changeType =
-      towardsLower ? (QRTDataProtectionChangeOperation::QRTChangeDirectories |
-                      QRTDataProtectionChangeOperation::QRTChangeFiles |
-                      QRTDataProtectionChangeOperation::QRTChangeFilesOnlyToLowerClass)
-                   : QRTDataProtectionChangeOperation::QRTChangeDirectories;
+  const uint32_t changeType = towardsLower ? (QRTDataProtectionChangeOperation::QRTChangeDirectories |
+                                              QRTDataProtectionChangeOperation::QRTChangeFiles |
+                                              QRTDataProtectionChangeOperation::QRTChangeFilesOnlyToLowerClass)
+                                           : QRTDataProtectionChangeOperation::QRTChangeDirectories;
   auto operation = QRTDataProtectionChangeOperation::dataProtectionChangeOperationWithContainerMetadata(
       metadata, dataProtectionClass, retryIfLocked, changeType, protectionOperationFileQueue_);
   QRTErrorRef writeError;
@@ -134,8 +130,8 @@ void QRTDataProtectionManager::_startDataProtectionChangeOperation(
     *assertion = QRTApplicationTerminationAssertion::initWithBundleIdentifier(
         identifier, QRTApplicationTerminationAssertion::ReasonInstallation);
   });
-  operation->setCompletionBlock([assertion, metadata, newClass, retryIfLocked,
-                                 completion = std::move(withCompletion)](bool wasLocked, const QRTErrorRef& error) {
+  operation->setCompletionBlock([assertion, metadata, newClass, retryIfLocked, completion = std::move(withCompletion)](
+                                    bool wasLocked, const QRTErrorRef& error) {
     uint64_t code = QRTErrorNone;
     if (error) {
       code = error->resultCode();

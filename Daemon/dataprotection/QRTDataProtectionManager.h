@@ -33,9 +33,7 @@ class QRTDataProtectionManager {
                                            Completion withCompletion);
 
   // Every pending-update file is read, written and deleted on it.
-  const std::shared_ptr<platform::Queue>& protectionOperationFileQueue() const {
-    return protectionOperationFileQueue_;
-  }
+  const std::shared_ptr<platform::Queue>& protectionOperationFileQueue() const { return protectionOperationFileQueue_; }
 
  private:
   QRTDataProtectionManager();

@@ -171,9 +171,7 @@ void TreePruner::unlinkVictims(Frame& frame) {
           entryFailed(frame.fd.get(), name, childPath(name), err);
         }
       }
-    } catch (const std::exception&) {
-      keepFirst(ENOMEM);
-    }
+    } catch (const std::exception&) { keepFirst(ENOMEM); }
   };
   std::vector<std::thread> helpers;
   unsigned started = 1;
@@ -404,14 +402,10 @@ int TreeCloner::copyEntry(int sdir, const char* sname, int ddir, const char* dna
     type = typeOfMode(st.st_mode);
   }
   switch (type) {
-    case DT_DIR:
-      return enterDirectory(sdir, sname, ddir, dname);
-    case DT_REG:
-      return copyFile(sdir, sname, ddir, dname);
-    case DT_LNK:
-      return copySymlink(sdir, sname, ddir, dname);
-    default:
-      return copySpecial(sdir, sname, ddir, dname);
+    case DT_DIR: return enterDirectory(sdir, sname, ddir, dname);
+    case DT_REG: return copyFile(sdir, sname, ddir, dname);
+    case DT_LNK: return copySymlink(sdir, sname, ddir, dname);
+    default: return copySpecial(sdir, sname, ddir, dname);
   }
 }
 
@@ -692,8 +686,8 @@ bool TreeWalker::run(QRTErrorRef* error) {
   return ok;
 }
 
-bool TreeWalker::visit(QRTTraversalEntry::Kind kind, int parentFd, const char* name, const struct stat& st,
-                       int level, int error, bool* skip) {
+bool TreeWalker::visit(QRTTraversalEntry::Kind kind, int parentFd, const char* name, const struct stat& st, int level,
+                       int error, bool* skip) {
   QRTTraversalEntry entry;
   entry.path = path_.c_str();
   entry.level = level;
@@ -942,8 +936,7 @@ static bool openEnds(const char* function, const QRTURL& src, const QRTURL& toUR
   return true;
 }
 
-bool QRTFileManager::_copyItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
-                                    QRTErrorRef* error) {
+bool QRTFileManager::_copyItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing, QRTErrorRef* error) {
   SafeParent from, to;
   bool missing;
   int err;
@@ -968,8 +961,7 @@ bool QRTFileManager::copyItemIfExistsAtURL(const QRTURL& src, const QRTURL& toUR
   return _copyItemAtURL(src, toURL, false, error);
 }
 
-bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing,
-                                    QRTErrorRef* error) {
+bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing, QRTErrorRef* error) {
   SafeParent from, to;
   bool missing;
   int err;
@@ -1030,8 +1022,10 @@ bool importableTree(int dirfd, std::string& path, uid_t owner, int depth, const 
     if (n < 0) return (*why = strerror(static_cast<int>(-n))), false;
     bool malformed = false;
     platform::forEachEntry(batch, static_cast<size_t>(n), [&](uint64_t, unsigned char, const char* name) {
-      if (name) names.emplace_back(name);
-      else malformed = true;
+      if (name)
+        names.emplace_back(name);
+      else
+        malformed = true;
     });
     if (malformed) return (*why = "an unreadable entry"), false;
   }
@@ -1075,14 +1069,19 @@ bool QRTFileManager::itemIsImportableAtURL(const QRTURL& url, const QRTURL& from
       if (name.empty()) continue;
       path += "/" + name;
       platform::Item next;
-      if (!S_ISDIR(item.st.st_mode)) why = "below something that is not a directory";
-      else if (int err = platform::openItemAt(item.fd.get(), name.c_str(), &next)) why = strerror(err);
-      else if (!(why = importRefusal(next.st, owner))) item = std::move(next);
+      if (!S_ISDIR(item.st.st_mode))
+        why = "below something that is not a directory";
+      else if (int err = platform::openItemAt(item.fd.get(), name.c_str(), &next))
+        why = strerror(err);
+      else if (!(why = importRefusal(next.st, owner)))
+        item = std::move(next);
     }
     if (!why && S_ISDIR(item.st.st_mode)) {
       UniqueFd dir;
-      if (int err = platform::reopenItem(item, O_RDONLY | O_DIRECTORY, &dir)) why = strerror(err);
-      else importableTree(dir.get(), path, owner, 0, &why);
+      if (int err = platform::reopenItem(item, O_RDONLY | O_DIRECTORY, &dir))
+        why = strerror(err);
+      else
+        importableTree(dir.get(), path, owner, 0, &why);
     }
   }
   if (why) {
@@ -1111,13 +1110,11 @@ std::optional<QRTURL> QRTFileManager::createTemporaryDirectoryInDirectoryURL(con
   return std::nullopt;
 }
 
-std::optional<QRTURL> QRTFileManager::createTemporaryDirectoryInDirectoryURL(const QRTURL& parent,
-                                                                             QRTErrorRef* error) {
+std::optional<QRTURL> QRTFileManager::createTemporaryDirectoryInDirectoryURL(const QRTURL& parent, QRTErrorRef* error) {
   return createTemporaryDirectoryInDirectoryURL(parent, "temp.", error);
 }
 
-bool QRTFileManager::_traverseDirectory(const QRTURL& root, QRTErrorRef* error,
-                                        const QRTTraversalVisitor& withBlock) {
+bool QRTFileManager::_traverseDirectory(const QRTURL& root, QRTErrorRef* error, const QRTTraversalVisitor& withBlock) {
   return TreeWalker(root, withBlock).run(error);
 }
 
@@ -1155,8 +1152,7 @@ bool iterateDirectory(const QRTURL& url, QRTErrorRef* error, Visit visit) {
 
 }  // namespace
 
-std::optional<std::vector<QRTURL>> QRTFileManager::urlsForItemsInDirectoryAtURL(const QRTURL& url,
-                                                                                QRTErrorRef* error) {
+std::optional<std::vector<QRTURL>> QRTFileManager::urlsForItemsInDirectoryAtURL(const QRTURL& url, QRTErrorRef* error) {
   std::vector<QRTURL> urls;
   bool ok = iterateDirectory(url, error, [&](const char* name, bool isDirectory) {
     urls.push_back(url.URLByAppendingPathComponent(name, isDirectory));
@@ -1190,9 +1186,7 @@ bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTW
   int err = 0;
   try {
     bytes = plist::writeBinary(plist::Value(dictionary));
-  } catch (const std::bad_alloc&) {
-    err = ENOMEM;
-  }
+  } catch (const std::bad_alloc&) { err = ENOMEM; }
   SafeParent parent;
   if (!err) err = platform::safeOpenParent(url.path(), &parent);
   if (!err) {
@@ -1225,9 +1219,9 @@ std::optional<plist::Dictionary> QRT_dictionaryWithContentsOfURL(const QRTURL& u
   std::optional<plist::Value> value =
       plist::parse(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size(), &reason, limits);
   if (!value) {
-    QRTSetError(error, QRTCreateError(__func__, __LINE__, QRTPropertyListErrorDomain, QRTPropertyListReadCorruptError,
-                                      nullptr, nullptr, false, "Failed to parse property list at %@: %s", url,
-                                      reason.c_str()));
+    QRTSetError(error,
+                QRTCreateError(__func__, __LINE__, QRTPropertyListErrorDomain, QRTPropertyListReadCorruptError, nullptr,
+                               nullptr, false, "Failed to parse property list at %@: %s", url, reason.c_str()));
     return std::nullopt;
   }
   if (!value->isDictionary()) {
@@ -1252,9 +1246,7 @@ std::string stringWithFileSystemRepresentation(const char* bytes, size_t length)
   return bytes ? std::string(bytes, length) : std::string();
 }
 
-std::string stringWithFileSystemRepresentation(const char* bytes) {
-  return bytes ? std::string(bytes) : std::string();
-}
+std::string stringWithFileSystemRepresentation(const char* bytes) { return bytes ? std::string(bytes) : std::string(); }
 
 int QRTGetProtectionClass(int fd, int32_t* cls) { return platform::getProtectionClass(fd, cls); }
 

@@ -69,8 +69,8 @@ class QRTFileManager {
                             int32_t protectionClass, QRTErrorRef* error);
   bool createDirectoryAtURL(const QRTURL& url, bool withIntermediateDirectories, mode_t mode, uint32_t owner,
                             QRTErrorRef* error);
-  bool createDirectoryAtURL(const QRTURL& url, bool withIntermediateDirectories, mode_t mode,
-                            int32_t protectionClass, QRTErrorRef* error);
+  bool createDirectoryAtURL(const QRTURL& url, bool withIntermediateDirectories, mode_t mode, int32_t protectionClass,
+                            QRTErrorRef* error);
   bool createDirectoryAtURL(const QRTURL& url, bool withIntermediateDirectories, mode_t mode, QRTErrorRef* error);
 
   bool _copyItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing, QRTErrorRef* error);

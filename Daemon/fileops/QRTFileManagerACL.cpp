@@ -245,9 +245,7 @@ void stampItem(const QRTTraversalEntry& entry, const StampLists& lists, bool isC
   }
 }
 
-mode_t ownershipMode(mode_t mode) {
-  return S_ISDIR(mode) || (mode & (S_IXUSR | S_IXGRP | S_IXOTH)) ? 0755 : 0644;
-}
+mode_t ownershipMode(mode_t mode) { return S_ISDIR(mode) || (mode & (S_IXUSR | S_IXGRP | S_IXOTH)) ? 0755 : 0644; }
 
 // Sets owner and mode of one item; changeOwner decides whether chown runs.
 void resetOwnership(const platform::Item& item, bool changeOwner, uid_t uid, gid_t gid, const char* displayPath) {
@@ -264,8 +262,8 @@ void resetOwnership(const platform::Item& item, bool changeOwner, uid_t uid, gid
 
 }  // namespace
 
-bool QRTFileManager::_CreateSystemUserACEInACL(SystemContainerACL* acl, uint32_t withPermissions,
-                                               uint32_t andFlags, QRTErrorRef* withError) {
+bool QRTFileManager::_CreateSystemUserACEInACL(SystemContainerACL* acl, uint32_t withPermissions, uint32_t andFlags,
+                                               QRTErrorRef* withError) {
   if (!acl || !acl->access) {
     QRTSetError(withError, QRT_ACL_ERROR(EINVAL, "acl_create_entry() failed: %s"));
     return false;
@@ -293,8 +291,8 @@ bool QRTFileManager::_CreateSystemUserACEInACL(SystemContainerACL* acl, uint32_t
 }
 
 QRTFileManager::SystemContainerACLPtr QRTFileManager::_CopySystemContainerACLWithNumACEs(int numACEs, bool isDir,
-                                                                                        bool inheritOnly,
-                                                                                        QRTErrorRef* withError) {
+                                                                                         bool inheritOnly,
+                                                                                         QRTErrorRef* withError) {
   SystemContainerACLPtr list(new SystemContainerACL);
   list->access = newList(numACEs, withError);
   if (!list->access) return nullptr;
@@ -323,8 +321,8 @@ bool QRTFileManager::setTopLevelSystemContainerACLAtURL(const QRTURL& url, QRTEr
     if (!err) err = applyList(item, *list, &item.st);
   }
   if (err == 0) return true;
-  QRTSetError(error, QRT_ERROR(QRTErrorACLFailed, listError, false, "Failed to set ACL on %@: %s", url,
-                               errorText(err)));
+  QRTSetError(error,
+              QRT_ERROR(QRTErrorACLFailed, listError, false, "Failed to set ACL on %@: %s", url, errorText(err)));
   return false;
 }
 

@@ -42,7 +42,8 @@ std::vector<std::string> pathComponents(const std::string& path) {
 QRTURL neutralisePrivate(const QRTURL& url) {
   std::string relative;
   if (platform::hostProfile() || platform::pathBelowDeviceRoot(url.path(), &relative) != 0) return url;
-  if (relative == "var" || relative.starts_with("var/")) return QRTURL::fileURL(platform::rootedPath("/private/" + relative));
+  if (relative == "var" || relative.starts_with("var/"))
+    return QRTURL::fileURL(platform::rootedPath("/private/" + relative));
   return url;
 }
 
@@ -153,7 +154,8 @@ std::optional<QRTURL> followLink(QRTFileManager& fm, const QRTURL& suspicious, c
   size_t slash = below.rfind('/');
   std::string relativeTarget = (slash == std::string::npos ? std::string() : below.substr(0, slash)) + "/" + linkTarget;
   if (!fm._validateSymlink(relativeTarget, baseDepth, nullptr)) {
-    QRTLog(kLogError, "Rejecting %@ -> %@, as it is points outside or to the base %@", suspicious, relativeTarget, base);
+    QRTLog(kLogError, "Rejecting %@ -> %@, as it is points outside or to the base %@", suspicious, relativeTarget,
+           base);
     return std::nullopt;
   }
   if (hops >= kMaxLinkHops) {
@@ -187,9 +189,10 @@ std::optional<QRTURL> compareResolved(QRTFileManager& fm, const QRTURL& suspicio
   }
   size_t bi = b[1] == "private" ? 2 : 1, si = s[1] == "private" ? 2 : 1;
   if (b.size() - bi > s.size() - si) {
-    QRTLog(kLogError,
-           "Rejecting %@ with base %@ because base component count is greater than child component count (reals %@ ; %@)",
-           suspicious, base, realSuspicious, realBase);
+    QRTLog(
+        kLogError,
+        "Rejecting %@ with base %@ because base component count is greater than child component count (reals %@ ; %@)",
+        suspicious, base, realSuspicious, realBase);
     return std::nullopt;
   }
   for (size_t k = 0; bi + k < b.size(); ++k) {

@@ -237,8 +237,8 @@ void DirectoryReader::queueDirectory(const std::string& relative, uint64_t index
   const std::string& root = walk_.rootPath();
   const size_t pathLength = root.size() + (relative == "." ? 0 : 1 + relative.size()) + 1 + nameLength;
   if (pathLength >= PATH_MAX) {
-    QRTLogAs(kLogError, "diskUsageForURL", "Failed to create path to child directory by appending \"%s\" to %@",
-             name, pathOf(relative));
+    QRTLogAs(kLogError, "diskUsageForURL", "Failed to create path to child directory by appending \"%s\" to %@", name,
+             pathOf(relative));
     return;
   }
   std::string child;

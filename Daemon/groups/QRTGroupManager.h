@@ -31,8 +31,8 @@ class QRTGroupManager {
       uint32_t userId, QRTClientConnection& clientConnection, const std::optional<std::string>& identifier,
       uint64_t* withError);
   std::optional<std::vector<std::string>> groupContainerIdentifiersForUser(uint32_t userId,
-                                                                          const std::optional<std::string>& identifier,
-                                                                          uint64_t* withError);
+                                                                           const std::optional<std::string>& identifier,
+                                                                           uint64_t* withError);
 
  private:
   using ReferenceCounts = std::map<std::string, int64_t>;

@@ -77,7 +77,8 @@ void QRTContainerMigrator::_moveOldLogFiles() {
   QRTFileManager& fm = QRTFileManager::defaultManager();
   if (auto oldLibrary = user->oldLibraryDirectoryPath()) {
     QRTErrorRef error;
-    if (!fm.removeItemAtURL(*oldLibrary, &error)) QRTLog(kLogError, "Failed to remove old Library directory: %@", error);
+    if (!fm.removeItemAtURL(*oldLibrary, &error))
+      QRTLog(kLogError, "Failed to remove old Library directory: %@", error);
   }
   auto oldLogs = user->oldLoggingPath();
   if (!oldLogs) return;
@@ -104,11 +105,11 @@ void QRTContainerMigrator::_moveOldLogFiles() {
     QRTLog(kLogError, "Failed to get items for deletion: %@ : %@", *oldLogs, listError);
   }
   QRTErrorRef removeError;
-  if (!fm.removeItemAtURL(*oldLogs, &removeError)) QRTLog(kLogError, "Failed to remove old Log directory: %@", removeError);
+  if (!fm.removeItemAtURL(*oldLogs, &removeError))
+    QRTLog(kLogError, "Failed to remove old Log directory: %@", removeError);
 }
 
-bool QRTContainerMigrator::performSynchronousBuildUpgradeMigration(QRTMigrationStatus* status,
-                                                                   QRTErrorRef* withError) {
+bool QRTContainerMigrator::performSynchronousBuildUpgradeMigration(QRTMigrationStatus* status, QRTErrorRef* withError) {
   bool ok = false;
   if (QRTErrorRef thrown = QRT_GUARD([&] { ok = _buildUpgradeSteps(status, withError); })) {
     QRTSetError(withError, thrown);
@@ -137,7 +138,8 @@ bool QRTContainerMigrator::_buildUpgradeSteps(QRTMigrationStatus* status, QRTErr
     }
     if (!fm.itemIsImportableAtURL(bundles, bundles, owner->uid)) {
       // Swapped since it was checked: what arrived is not kept.
-      const QRTURL removed = bundles.URLByDeletingLastPathComponent().URLByAppendingPathComponent("Bundle.refused", true);
+      const QRTURL removed =
+          bundles.URLByDeletingLastPathComponent().URLByAppendingPathComponent("Bundle.refused", true);
       if (!fm.moveItemAtURL(bundles, removed, &error) || !fm.removeItemAtURL(removed, &error)) {
         QRTLog(kLogError, "Failed to remove refused bundle containers : %@", error);
       }
@@ -200,8 +202,9 @@ bool QRTContainerMigrator::_performWhitelistMigrationWithError(QRTErrorRef* erro
         return false;
       }
       if (!QRTFileManager::defaultManager().moveItemAtURL(container->url(), target, &step)) {
-        QRTLog(kLogError, "%s: Failed to move system container %@ from %@ to whitelisted location %@: (error= %@: %lld)",
-               __func__, identifier, container->url(), target, step ? step->domain() : std::string("(null)"),
+        QRTLog(kLogError,
+               "%s: Failed to move system container %@ from %@ to whitelisted location %@: (error= %@: %lld)", __func__,
+               identifier, container->url(), target, step ? step->domain() : std::string("(null)"),
                static_cast<long long>(step ? step->code() : 0));
         QRTSetError(error, step);
         return false;
@@ -257,8 +260,8 @@ bool QRTContainerMigrator::_performBundleContainerOwnershipMigrationWithError(QR
   if (!owner) {
     ownerError = QRT_POSIX_ERROR(EPERM, "No account stands for user %u", static_cast<unsigned>(kBundleOwnerId));
   }
-  if (!owner || !QRTFileManager::defaultManager().standardizeOwnershipAtURL(bundles, owner->uid, owner->gid,
-                                                                            &ownerError)) {
+  if (!owner ||
+      !QRTFileManager::defaultManager().standardizeOwnershipAtURL(bundles, owner->uid, owner->gid, &ownerError)) {
     QRTSetError(error, QRT_ERROR(QRTErrorChangeOwnerFailed, ownerError, true, "Failed to change owner of %@: %@",
                                  bundles, ownerError));
     return false;

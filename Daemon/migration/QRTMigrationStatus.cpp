@@ -60,8 +60,8 @@ std::optional<std::string> QRTMigrationStatus::currentBuildVersion() {
 
 std::unique_ptr<QRTMigrationStatus> QRTMigrationStatus::init() {
   std::unique_ptr<QRTMigrationStatus> status(new QRTMigrationStatus());
-  status->fileURL_ =
-      QRTGlobalConfiguration::sharedInstance().libraryDirectory().URLByAppendingPathComponent(QRTMigrationStatusFileName);
+  status->fileURL_ = QRTGlobalConfiguration::sharedInstance().libraryDirectory().URLByAppendingPathComponent(
+      QRTMigrationStatusFileName);
   if (!status->_readMigrationStatusFromDisk()) {
     QRTLog(kLogError, "Error reading migration file from disk.  This is bad");
     return nullptr;
@@ -167,7 +167,6 @@ bool QRTMigrationStatus::isBuildUpgrade() const {
            currentBuild, currentRelease, lastBuild, lastRelease);
     return false;
   }
-  QRTLog(kLogNotice, "Detected upgrade from %@ (%@) to %@ (%@)", lastBuild, lastRelease, currentBuild,
-         currentRelease);
+  QRTLog(kLogNotice, "Detected upgrade from %@ (%@) to %@ (%@)", lastBuild, lastRelease, currentBuild, currentRelease);
   return true;
 }

@@ -35,7 +35,8 @@ bool QRTClientConnection::_removeItemOrMoveToTempAtURL(const QRTURL& url, QRTErr
                           &moveError)) {
     return true;
   }
-  QRTSetError(error, QRT_ERROR(QRTErrorMoveAsideFailed, moveError, true, "Failed to move dir: %@ to: %@", url, scratch));
+  QRTSetError(error,
+              QRT_ERROR(QRTErrorMoveAsideFailed, moveError, true, "Failed to move dir: %@ to: %@", url, scratch));
   return false;
 }
 
@@ -54,14 +55,15 @@ bool QRTClientConnection::_moveItemAtURLToDeathRow(const QRTURL& url, bool isDir
   {
     std::optional<QRTURL> deathRow = QRTGlobalConfiguration::sharedInstance().deathrowDirectoryForURL(url);
     if (!deathRow) {
-      QRTSetError(error, QRT_ERROR(QRTErrorDeathRowFailed, nullptr, true, "No death row on the file system of %@", url));
+      QRTSetError(error,
+                  QRT_ERROR(QRTErrorDeathRowFailed, nullptr, true, "No death row on the file system of %@", url));
       return false;
     }
     std::lock_guard<std::mutex> handOver(gDeathRowHandOverLock);
     std::optional<QRTURL> holding = files.createTemporaryDirectoryInDirectoryURL(*deathRow, &underlying);
     if (!holding) {
-      QRTSetError(error, QRT_ERROR(QRTErrorDeathRowFailed, underlying, true, "Failed to create unique directory at: %@",
-                                   url));
+      QRTSetError(error,
+                  QRT_ERROR(QRTErrorDeathRowFailed, underlying, true, "Failed to create unique directory at: %@", url));
       return false;
     }
     QRT_PAUSE_POINT("deathrow-hand-over");
@@ -70,8 +72,8 @@ bool QRTClientConnection::_moveItemAtURLToDeathRow(const QRTURL& url, bool isDir
       // Only a missing source means there was nothing to hand over; a
       // missing destination leaves the item where it was.
       if (hasCode(underlying, QRTPOSIXErrorDomain, ENOENT) && files.itemDoesNotExistAtURL(url)) return true;
-      QRTSetError(error, QRT_ERROR(QRTErrorDeathRowFailed, underlying, true, "Failed to move item at: %@ to: %@", url,
-                                   target));
+      QRTSetError(
+          error, QRT_ERROR(QRTErrorDeathRowFailed, underlying, true, "Failed to move item at: %@ to: %@", url, target));
       return false;
     }
   }
@@ -111,9 +113,7 @@ void QRTClientConnection::deleteContainersOnDeathRowWithCompletion(std::function
     uint64_t result;
     try {
       result = sharedClientConnection()._runDeathRowPass();
-    } catch (...) {
-      result = QRT_EXCEPTION_ERROR()->resultCode();
-    }
+    } catch (...) { result = QRT_EXCEPTION_ERROR()->resultCode(); }
     if (completion) completion(result);
   });
 }
@@ -166,7 +166,8 @@ void QRTClientConnection::stageForDeleteContainersWithUsers(const std::vector<ui
       }
       QRTErrorRef moveError;
       if (!files.moveItemAtURL(metadata->url(), target, &moveError)) {
-        QRTLog(platform::kLogDebug, "Couldn't stage for deletion from %@ to %@: %@", metadata->url(), target, moveError);
+        QRTLog(platform::kLogDebug, "Couldn't stage for deletion from %@ to %@: %@", metadata->url(), target,
+               moveError);
         QRTErrorRef removeError;
         if (!files.removeItemAtURL(metadata->url(), &removeError)) {
           QRT_ERROR(QRTErrorDeleteFailed, removeError, true, "Failed to delete container at %@: %@", metadata->url(),
@@ -185,9 +186,7 @@ void QRTClientConnection::stageForDeleteContainersWithUsers(const std::vector<ui
         return;
       }
     }
-  } catch (...) {
-    reportCode(QRT_EXCEPTION_ERROR(), withError);
-  }
+  } catch (...) { reportCode(QRT_EXCEPTION_ERROR(), withError); }
 }
 
 void QRTClientConnection::deleteContainerForUser(uint32_t userId, const std::optional<std::string>& withIdentifier,
@@ -197,16 +196,15 @@ void QRTClientConnection::deleteContainerForUser(uint32_t userId, const std::opt
     auto metadata =
         createOrLookupContainerForUser(userId, withIdentifier, false, containerClass, transient, true, &code);
     if (!metadata) {
-      QRTLog(platform::kLogError, "Failed to lookup existing container to delete-identifier: %@, class: %ld, transient: %d",
-             withIdentifier, static_cast<long>(containerClass), transient);
+      QRTLog(platform::kLogError,
+             "Failed to lookup existing container to delete-identifier: %@, class: %ld, transient: %d", withIdentifier,
+             static_cast<long>(containerClass), transient);
       if (withError) *withError = code;
       return;
     }
     stageForDeleteContainersWithUsers({metadata->uid()}, {metadata->uuid()}, {metadata->identifier()},
                                       {metadata->containerClass()}, true, withError);
-  } catch (...) {
-    reportCode(QRT_EXCEPTION_ERROR(), withError);
-  }
+  } catch (...) { reportCode(QRT_EXCEPTION_ERROR(), withError); }
 }
 
 void QRTClientConnection::deleteDataContainerContentForUser(uint32_t userId,
@@ -254,7 +252,5 @@ void QRTClientConnection::deleteDataContainerContentForUser(uint32_t userId,
       QRTLog(platform::kLogError, "Failed replace operation during delete all content");
       return fail(code);
     }
-  } catch (...) {
-    reportCode(QRT_EXCEPTION_ERROR(), withError);
-  }
+  } catch (...) { reportCode(QRT_EXCEPTION_ERROR(), withError); }
 }

@@ -62,7 +62,6 @@ void QRTClientConnection::quarterCleanup() {
   deleteContainersOnDeathRowWithCompletion(nullptr);
 }
 
-
 // ---- Replace ----
 // A journal written before the first move lets the start-up recovery put the
 // old container back when the daemon dies before the new one is in place.
@@ -289,8 +288,8 @@ QRTErrorRef swapContainers(ReplaceJob& job, bool* restore) {
     QRT_CRASH_POINT("replace-after-cache-remove");
     if (QRTIsBundleClass(job.classOld)) {
       QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
-      if (mapping && !mapping->invalidateCodeSigningInfoForIdentifierAndItsChildren(job.oldContainer->identifier(),
-                                                                                           &underlying)) {
+      if (mapping &&
+          !mapping->invalidateCodeSigningInfoForIdentifierAndItsChildren(job.oldContainer->identifier(), &underlying)) {
         QRTLogAs(kLogError, kReplace, "Failed to invalidate code signing info for %@", job.identifierOld);
         return underlying;
       }
@@ -311,8 +310,8 @@ QRTErrorRef swapContainers(ReplaceJob& job, bool* restore) {
 // and the destination are both empty. Only then does staging go back.
 // Returns false when the move back failed, with error 35; *moved, when
 // given, tells whether anything went back.
-bool moveStagingBackIfAside(const QRTURL& old, const QRTURL& staging, const QRTURL& destination,
-                            const char* function, const char* logFormat, bool* moved, QRTErrorRef* error) {
+bool moveStagingBackIfAside(const QRTURL& old, const QRTURL& staging, const QRTURL& destination, const char* function,
+                            const char* logFormat, bool* moved, QRTErrorRef* error) {
   QRTFileManager& files = QRTFileManager::defaultManager();
   if (moved) *moved = false;
   if (!files.itemDoesNotExistAtURL(old) || !files.itemDoesNotExistAtURL(destination)) return true;
@@ -350,8 +349,7 @@ void restoreOldContainer(ReplaceJob& job, bool afterException) noexcept {
   if (moved && job.oldLeftCache &&
       !QRTContainerCache::sharedInstance().addContainerMetadata(job.oldContainer, job.userIdOld, job.oldURL,
                                                                 job.oldContainer->transient(), true, &cacheError)) {
-    QRTLogAs(kLogError, kReplace, "Failed to add restored container to cache: %@ : %@", job.oldContainer,
-             cacheError);
+    QRTLogAs(kLogError, kReplace, "Failed to add restored container to cache: %@ : %@", job.oldContainer, cacheError);
   }
 }
 
@@ -363,12 +361,12 @@ QRTErrorRef cleanUpReplace(QRTClientConnection& client, const ReplaceJob& job, b
   QRTErrorRef result;
   QRTErrorRef underlying;
   if (!client._moveItemAtURLToDeathRow(job.staging, true, false, &underlying)) {
-    result = QRT_ERROR_AS(kReplace, QRTErrorRemoveItemFailed, underlying, "Failed to remove staging dir: %@",
-                          job.staging);
+    result =
+        QRT_ERROR_AS(kReplace, QRTErrorRemoveItemFailed, underlying, "Failed to remove staging dir: %@", job.staging);
   }
   if (!client._moveItemAtURLToDeathRow(job.journal, false, startDeletionThread, &underlying)) {
-    result = QRT_ERROR_AS(kReplace, QRTErrorRemoveItemFailed, underlying, "Failed to remove replace file: %@",
-                          job.journal);
+    result =
+        QRT_ERROR_AS(kReplace, QRTErrorRemoveItemFailed, underlying, "Failed to remove replace file: %@", job.journal);
   }
   QRT_CRASH_POINT("replace-after-cleanup");
   return result;
@@ -377,8 +375,8 @@ QRTErrorRef cleanUpReplace(QRTClientConnection& client, const ReplaceJob& job, b
 // Whichever content is live at the destination of a UUID-preserving replace
 // carries the preserved UUID. A failure keeps the journal for the next start.
 bool restorePreservedUUID(const QRTURL& destination, const QRTUUID& uuid, QRTErrorRef* error) {
-  if (QRTFileManager::defaultManager().itemDoesNotExistAtURL(destination.URLByAppendingPathComponent(
-          QRTMetadataFileName))) {
+  if (QRTFileManager::defaultManager().itemDoesNotExistAtURL(
+          destination.URLByAppendingPathComponent(QRTMetadataFileName))) {
     return true;
   }
   QRTErrorRef underlying;
@@ -429,11 +427,10 @@ void QRTClientConnection::replaceContainer(const std::optional<QRTUUID>& replace
       auto stagingDirectory = job.oldContainer ? configuration.stagingDirectoryForURL(job.oldURL)
                                                : std::optional<QRTURL>(configuration.stagingDirectory());
       if (!stagingDirectory) {
-        error = QRT_ERROR_AS(kReplace, QRTErrorMoveToStagingFailed, nullptr, "No staging directory for %@",
-                             job.oldURL);
+        error = QRT_ERROR_AS(kReplace, QRTErrorMoveToStagingFailed, nullptr, "No staging directory for %@", job.oldURL);
       } else if (job.staging = stagingDirectory->URLByAppendingPathComponent(name, true);
                  !_writeToDiskReplaceAt(job.journal, job.oldURL, job.newURL, job.staging, job.destination,
-                                 job.preserveOldUUID ? job.oldUUID : std::nullopt, &error)) {
+                                        job.preserveOldUUID ? job.oldUUID : std::nullopt, &error)) {
         QRTLog(kLogError, "Failed to write replace file: %@", error);
       } else {
         QRT_CRASH_POINT("replace-after-journal");
@@ -450,9 +447,7 @@ void QRTClientConnection::replaceContainer(const std::optional<QRTUUID>& replace
   try {
     if (restore) restoreOldContainer(job, false);
     if (QRTErrorRef cleanupError = cleanUpReplace(*this, job, startDeletionThread)) error = cleanupError;
-  } catch (...) {
-    error = QRT_EXCEPTION_ERROR();
-  }
+  } catch (...) { error = QRT_EXCEPTION_ERROR(); }
   reportCode(error, withError);
 }
 
@@ -484,8 +479,8 @@ std::optional<std::map<std::string, QRTURL>> QRTClientConnection::_readAndValida
   QRTErrorRef readError;
   std::optional<plist::Dictionary> journal = QRT_dictionaryWithContentsOfURL(url, &readError);
   if (!journal) {
-    QRTSetError(error, QRT_ERROR(QRTErrorReplaceJournalFailed, readError, true, "Failed to read replace file at URL %@",
-                                 url));
+    QRTSetError(error,
+                QRT_ERROR(QRTErrorReplaceJournalFailed, readError, true, "Failed to read replace file at URL %@", url));
     return std::nullopt;
   }
   std::map<std::string, QRTURL> urls;

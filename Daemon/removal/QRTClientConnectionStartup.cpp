@@ -109,8 +109,8 @@ bool takeBackupDirectory(const std::optional<QRTURL>& directory, const std::opti
   const QRTURL inProgress = withExtension(*directory, "inprogress");
   QRTErrorRef error;
   if (!fm.removeItemAtURL(inProgress, &error)) {
-    QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace", "Failed to remove existing inprogress system containers: %@",
-             error);
+    QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace",
+             "Failed to remove existing inprogress system containers: %@", error);
   }
   if (!fm.moveItemAtURL(*directory, inProgress, &error)) {
     QRTLogAs(kLogError, "QRTMoveSystemContainersIntoPlace", moveFailure, error);
@@ -203,7 +203,8 @@ void QRTClientConnection::_cleanupOrphanedDataForUser(uint32_t userId, uint64_t 
   const QRTWhitelist& whitelist = QRTWhitelist::sharedWhitelist();
   for (const QRTURL& entry : *entries) {
     const std::string name = entry.lastPathComponent();
-    const bool wellFormed = QRTUUID::fromString(name).has_value() || whitelist.containerIdIsWellknown(name, containerClass);
+    const bool wellFormed =
+        QRTUUID::fromString(name).has_value() || whitelist.containerIdIsWellknown(name, containerClass);
     if (wellFormed) {
       // Only a metadata file known to be missing orphans a well-named container.
       if (!metadataMissing(entry)) continue;
@@ -211,9 +212,11 @@ void QRTClientConnection::_cleanupOrphanedDataForUser(uint32_t userId, uint64_t 
     }
     if (platform::deviceIsInternalBuild()) {
       QRTLog(kLogError,
-             "***INTERNAL BUILD REQUEST: If you see this, file a Bugline in \"QuarterKit | all\" with the following data:");
-      QRTLog(kLogError, "\tSomeone is writing invalid data to a container, which has now been orphaned. Here are the "
-                        "invalid files:");
+             "***INTERNAL BUILD REQUEST: If you see this, file a Bugline in \"QuarterKit | all\" with the following "
+             "data:");
+      QRTLog(kLogError,
+             "\tSomeone is writing invalid data to a container, which has now been orphaned. Here are the "
+             "invalid files:");
       fm.printDirectoryStructureAtURL(entry);
       QRTLog(kLogError, "***END INTERNAL BUILD REQUEST");
     }
@@ -247,5 +250,6 @@ void QRTClientConnection::rebootQuarterCleanup() {
   for (uint64_t cls : {QRTClassAppBundle, QRTClassAddonBundle, QRTClassVPNBundle, QRTClassFrameworkBundle}) {
     _cleanupOrphanedDataForUser(QRTInstallerUserId, cls);
   }
-  for (uint64_t cls : {QRTClassSystemData, QRTClassSystemGroup}) _cleanupOrphanedDataForUser(QRTSystemContainerUserId, cls);
+  for (uint64_t cls : {QRTClassSystemData, QRTClassSystemGroup})
+    _cleanupOrphanedDataForUser(QRTSystemContainerUserId, cls);
 }

@@ -64,7 +64,8 @@ void QRTHandleGroupContainerIdentifiers(const plist::Dictionary& request, const 
   if (!mappingOr66(result)) return;
   auto identifiers = QRTGroupManager::defaultManager().groupContainerIdentifiersForUser(
       userId, QRTMessageIdentifier(request, client.clientBundleIdentifier()), result);
-  if (identifiers) reply->dictionary["ReplyGroupIdentifiersArray"] = plist::Array(identifiers->begin(), identifiers->end());
+  if (identifiers)
+    reply->dictionary["ReplyGroupIdentifiersArray"] = plist::Array(identifiers->begin(), identifiers->end());
 }
 
 void QRTHandleSystemGroupContainerPaths(const plist::Dictionary& request, const QRTReplyRef& reply,
@@ -82,9 +83,8 @@ void QRTHandleSystemGroupContainerPath(const plist::Dictionary& request, const Q
   const std::optional<std::string> group = QRTMessageString(request, "GroupIdentifier");
   // Entitlement is judged by the caller's own identifier, whatever it names,
   // and counts only for a caller whose uid may hold system-level entitlements.
-  const QRTGroupList entitled = caller && client.rights().systemEntitled
-                                    ? mapping->systemGroupIdentifiersForIdentifier(*caller)
-                                    : std::nullopt;
+  const QRTGroupList entitled =
+      caller && client.rights().systemEntitled ? mapping->systemGroupIdentifiersForIdentifier(*caller) : std::nullopt;
   std::optional<std::string> path;
   if (group && entitled && std::find(entitled->begin(), entitled->end(), *group) != entitled->end()) {
     auto paths = QRTGroupManager::defaultManager().groupContainerPathsForUser(QRTSystemContainerUserId, client,
@@ -135,7 +135,8 @@ void QRTHandleCodeSigningInfoForIdentifier(const plist::Dictionary& request, con
                                            QRTClientConnection&, uint64_t* result) {
   QRTCodeSigningMapping* mapping = mappingOr66(result);
   if (!mapping) return;
-  std::optional<plist::Dictionary> info = mapping->getCodeSigningInfoForIdentifier(QRTMessageString(request, "Identifier"));
+  std::optional<plist::Dictionary> info =
+      mapping->getCodeSigningInfoForIdentifier(QRTMessageString(request, "Identifier"));
   if (!info) {
     *result = QRTErrorNotFound;
     return;

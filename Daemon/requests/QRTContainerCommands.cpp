@@ -91,8 +91,8 @@ std::optional<uint64_t> classAndUser(const plist::Dictionary& request, const QRT
 
 }  // namespace
 
-void QRTHandleContainersForUser(const plist::Dictionary& request, const QRTReplyRef& reply,
-                                QRTClientConnection& client, uint64_t* result) {
+void QRTHandleContainersForUser(const plist::Dictionary& request, const QRTReplyRef& reply, QRTClientConnection& client,
+                                uint64_t* result) {
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
@@ -129,8 +129,8 @@ void QRTHandleReplaceContainer(const plist::Dictionary& request, const QRTReplyR
                           QRTMessageString(request, "NewIdentifier"), oldClass, newClass, false, false, result);
 }
 
-void QRTHandleStageContainerForDelete(const plist::Dictionary& request, const QRTReplyRef&,
-                                      QRTClientConnection& client, uint64_t* result) {
+void QRTHandleStageContainerForDelete(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
+                                      uint64_t* result) {
   std::vector<std::optional<uint64_t>> classes;
   std::vector<std::optional<QRTUUID>> uuids;
   if (const plist::Value* v = QRTMessageObject(request, "ContainerClassesArray"); v && v->arrayIf()) {
@@ -153,8 +153,8 @@ void QRTHandleStageContainerForDelete(const plist::Dictionary& request, const QR
     for (size_t i = 0; i < requested.size() && i < classes.size(); ++i) {
       const plist::Integer* n = requested[i].integerIf();
       uint32_t effective = 0;
-      if (!validateUserId(static_cast<uint32_t>(n ? n->asUnsigned() : 0), classes[i].value_or(0),
-                          client, &effective, result)) {
+      if (!validateUserId(static_cast<uint32_t>(n ? n->asUnsigned() : 0), classes[i].value_or(0), client, &effective,
+                          result)) {
         return;
       }
       users.push_back(effective);
@@ -184,12 +184,12 @@ void QRTHandleSetInfoValue(const plist::Dictionary& request, const QRTReplyRef&,
   if (!containerClass) return;
   const plist::Value* value = QRTMessageObject(request, "Value");
   client.setInfoValue(value ? std::optional<plist::Value>(*value) : std::nullopt, QRTMessageString(request, "Key"),
-                      userId, QRTMessageUUID(request, "UUID"), QRTMessageString(request, "Identifier"),
-                      *containerClass, true, result);
+                      userId, QRTMessageUUID(request, "UUID"), QRTMessageString(request, "Identifier"), *containerClass,
+                      true, result);
 }
 
-void QRTHandleInfoValueForKey(const plist::Dictionary& request, const QRTReplyRef& reply,
-                              QRTClientConnection& client, uint64_t* result) {
+void QRTHandleInfoValueForKey(const plist::Dictionary& request, const QRTReplyRef& reply, QRTClientConnection& client,
+                              uint64_t* result) {
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
@@ -222,8 +222,8 @@ void QRTHandleRecreateDefaultStructure(const plist::Dictionary& request, const Q
                                          QRTMessageString(request, "Identifier"), *containerClass, result);
 }
 
-void QRTHandleRegenerateDirectoryUUID(const plist::Dictionary& request, const QRTReplyRef&,
-                                      QRTClientConnection& client, uint64_t* result) {
+void QRTHandleRegenerateDirectoryUUID(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
+                                      uint64_t* result) {
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
@@ -240,8 +240,8 @@ void QRTHandleDeleteContainer(const plist::Dictionary& request, const QRTReplyRe
                                 QRTMessageBool(request, "Transient"), result);
 }
 
-void QRTHandleWipeAddonDataContainer(const plist::Dictionary& request, const QRTReplyRef&,
-                                     QRTClientConnection& client, uint64_t* result) {
+void QRTHandleWipeAddonDataContainer(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
+                                     uint64_t* result) {
   // Only the wipe list decides, whatever else the caller may look up.
   client.setAllowOtherIdLookup(false);
   uint32_t userId = 0;
@@ -263,7 +263,6 @@ void QRTHandleDiskUsage(const plist::Dictionary& request, const QRTReplyRef& rep
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
-  reply->dictionary["ReplyDiskUsage"] =
-      client.diskUsageForUserId(userId, QRTMessageUUID(request, "UUID"), QRTMessageString(request, "Identifier"),
-                                *containerClass, result);
+  reply->dictionary["ReplyDiskUsage"] = client.diskUsageForUserId(
+      userId, QRTMessageUUID(request, "UUID"), QRTMessageString(request, "Identifier"), *containerClass, result);
 }

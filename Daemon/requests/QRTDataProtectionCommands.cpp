@@ -6,8 +6,8 @@
 #include "Daemon/dataprotection/QRTDataProtectionManager.h"
 #include "platform/Log.h"
 
-void QRTHandleSetDataProtection(const plist::Dictionary& request, const QRTReplyRef& reply,
-                                QRTClientConnection& client, uint64_t* result) {
+void QRTHandleSetDataProtection(const plist::Dictionary& request, const QRTReplyRef& reply, QRTClientConnection& client,
+                                uint64_t* result) {
   const uint64_t containerClass = QRTMessageU64(request, "ContainerClass");
   uint32_t userId = 0;
   const auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));

@@ -4,5 +4,5 @@
 
 #include "Daemon/requests/QRTRequestDispatcher.h"
 
-void QRTHandleSetDataProtection(const plist::Dictionary& request, const QRTReplyRef& reply,
-                                QRTClientConnection& client, uint64_t* result);
+void QRTHandleSetDataProtection(const plist::Dictionary& request, const QRTReplyRef& reply, QRTClientConnection& client,
+                                uint64_t* result);

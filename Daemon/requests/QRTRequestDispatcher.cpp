@@ -33,7 +33,8 @@ void QRTReply::send(uint64_t code) {
   connection_->send(messageId_, plist::Dictionary{{"ReplyError", static_cast<uint64_t>(QRTErrorException)}});
 }
 
-#define SERVED(n, name, handler, entitlement, flag) {n, name, handler, entitlement, flag}
+#define SERVED(n, name, handler, entitlement, flag) \
+  { n, name, handler, entitlement, flag }
 const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
     SERVED(0, "createOrLookupContainer", QRTHandleCreateOrLookupContainer, QRTEntitlementNone, 1),
     SERVED(1, "containersForUser", QRTHandleContainersForUser, QRTEntitlementAllowed, 1),
@@ -216,11 +217,11 @@ std::optional<QRTClientConnection> checkEntitlementsAndInitClientObject(const pl
 
 void QRTLogEntitlementRefusal(uint32_t callerUid, int pid, const std::optional<std::string>& signingIdentifier,
                               const char* entitlement) {
-  platform::logRefusal(callerUid, "checkEntitlementsAndInitClientObject",
-                       QRTFormat("connection attempt from pid %d (%@) missing required entitlement: %s", pid,
-                                 signingIdentifier ? std::optional(platform::logIdentifier(*signingIdentifier))
-                                                   : std::nullopt,
-                                 entitlement));
+  platform::logRefusal(
+      callerUid, "checkEntitlementsAndInitClientObject",
+      QRTFormat("connection attempt from pid %d (%@) missing required entitlement: %s", pid,
+                signingIdentifier ? std::optional(platform::logIdentifier(*signingIdentifier)) : std::nullopt,
+                entitlement));
 }
 
 bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, uint32_t callerUserId, bool systemProcess,
@@ -296,8 +297,8 @@ bool requestIdentifiersValid(const plist::Dictionary& request, uint32_t callerUi
     const std::string* identifier = value.stringIf();
     if (!identifier || QRTIdentifierIsValid(*identifier)) return true;
     QRTLogRefusal(callerUid, "Invalid %s %@ (%llu bytes) in command %llu from client %u", key,
-                  platform::logIdentifier(*identifier), static_cast<unsigned long long>(identifier->size()), static_cast<unsigned long long>(command),
-                  callerUid);
+                  platform::logIdentifier(*identifier), static_cast<unsigned long long>(identifier->size()),
+                  static_cast<unsigned long long>(command), callerUid);
     return false;
   };
   for (const char* key : {"Identifier", "GroupIdentifier", "OldIdentifier", "NewIdentifier"}) {

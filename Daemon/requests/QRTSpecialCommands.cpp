@@ -30,9 +30,7 @@ void QRTHandleRetryTest(const plist::Dictionary& request, const QRTReplyRef&, QR
     return;
   }
   uint32_t userId = 0;
-  if (!validateUserId(static_cast<uint32_t>(QRTMessageU64(request, "UserID")), 2, client, &userId,
-                      result))
-    return;
+  if (!validateUserId(static_cast<uint32_t>(QRTMessageU64(request, "UserID")), 2, client, &userId, result)) return;
   client.retryTestForUser(userId, QRTMessageU64(request, "NumRetryCrashes"), result);
 }
 
@@ -57,8 +55,8 @@ void QRTHandleUserManagedAssetsPath(const plist::Dictionary& request, const QRTR
   if (url) reply->dictionary["ReplyPath"] = url->path();
 }
 
-void QRTHandleDeleteUserManagedAsset(const plist::Dictionary& request, const QRTReplyRef&,
-                                     QRTClientConnection& client, uint64_t* result) {
+void QRTHandleDeleteUserManagedAsset(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
+                                     uint64_t* result) {
   client.deleteUserManagedAssetForUser(mobileUser(), QRTMessageString(request, "Identifier"),
                                        QRTMessageString(request, "SourcePath"), result);
 }

@@ -91,9 +91,7 @@ int32_t readRequest(sb_packbuff* pb, KernRequest* request) {
         if (!(s = unpackToString(pb, "QK_KERN_REQUEST_SYSTEM_GROUP_CONTAINER_ID"))) return 5;
         request->systemGroupIds.push_back(*s);
         break;
-      default:
-        QRTLog(kLogError, "unexpected value: %u\n", unsigned{type});
-        return 4;
+      default: QRTLog(kLogError, "unexpected value: %u\n", unsigned{type}); return 4;
     }
   }
   // Stopping short of a whole end marker is a cut buffer, not a finished one.
@@ -144,7 +142,8 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
     if (m) {
       out->dataContainer = m->url();
     } else {
-      QRTLog(kLogError, "createOrLookupContainerForUser: Failed with error: %llu", static_cast<unsigned long long>(error));
+      QRTLog(kLogError, "createOrLookupContainerForUser: Failed with error: %llu",
+             static_cast<unsigned long long>(error));
       ok = false;
     }
   }
@@ -204,8 +203,9 @@ bool packAnswer(sb_packbuff* pb, const Resolved& r) {
   auto packPath = [pb](uint16_t type, const std::optional<QRTURL>& url) {
     if (!url) return true;
     int rc = sb_packbuff_pack_string(pb, type, url->path().c_str(), url->path().size());
-    if (rc) QRTLog(kLogError, "sb_packbuff_pack_string() fails: %d; type: %u, path: %s\n", rc, unsigned{type},
-                   url->path().c_str());
+    if (rc)
+      QRTLog(kLogError, "sb_packbuff_pack_string() fails: %d; type: %u, path: %s\n", rc, unsigned{type},
+             url->path().c_str());
     return rc == 0;
   };
   auto packPairs = [pb](const std::vector<std::pair<std::string, std::string>>& pairs, uint16_t keyType,

@@ -56,13 +56,12 @@ constexpr const char* kGroupSubDirectories[] = {"Library", "Library/Caches"};
 
 }  // namespace
 
-bool QRTClientConnection::_createDefaultDirectory(const QRTURL& url, mode_t mode, uint32_t owner,
-                                                  QRTErrorRef* error) {
+bool QRTClientConnection::_createDefaultDirectory(const QRTURL& url, mode_t mode, uint32_t owner, QRTErrorRef* error) {
   return QRTFileManager::defaultManager().createDirectoryAtURL(url, true, mode, owner, -1, error);
 }
 
-bool QRTClientConnection::_createTopLevelContainerDirectory(const QRTURL& url, uint64_t containerClass,
-                                                            uint32_t owner, QRTErrorRef* error) {
+bool QRTClientConnection::_createTopLevelContainerDirectory(const QRTURL& url, uint64_t containerClass, uint32_t owner,
+                                                            QRTErrorRef* error) {
   uint32_t directoryOwner = owner;
   if (QRTIsBundleClass(containerClass)) directoryOwner = QRTInstallerUserId;
   if (QRTIsSystemClass(containerClass)) directoryOwner = 0;
@@ -101,8 +100,8 @@ QRTMetadataRef QRTClientConnection::_buildInStaging(const QRTURL& staging, uint3
                                                     QRTErrorRef* error) {
   QRTErrorRef underlying;
   if (!_createTopLevelContainerDirectory(staging, containerClass, userId, &underlying)) {
-    QRTSetError(error, QRT_ERROR(QRTErrorCreateStagingFailed, underlying, true, "Failed to create staging dir at %@ : %@",
-                                 staging, underlying));
+    QRTSetError(error, QRT_ERROR(QRTErrorCreateStagingFailed, underlying, true,
+                                 "Failed to create staging dir at %@ : %@", staging, underlying));
     return nullptr;
   }
   auto metadata = std::make_shared<const QRTMetadata>(userId, QRTUUID::random(), containerClass, identifier,
@@ -127,8 +126,9 @@ QRTMetadataRef QRTClientConnection::_createNewContainer(uint32_t userId, const s
   }
   // Built on the class directory's own file system, so that it is only ever renamed.
   std::optional<QRTURL> stagingDirectory =
-      classDirectory ? configuration.stagingDirectoryForURL(classDirectory->URLByAppendingPathComponent(finalName, true))
-                     : std::nullopt;
+      classDirectory
+          ? configuration.stagingDirectoryForURL(classDirectory->URLByAppendingPathComponent(finalName, true))
+          : std::nullopt;
   if (!stagingDirectory) {
     QRTSetError(error, QRT_ERROR(classDirectory ? QRTErrorCreateStagingFailed : QRTErrorMoveStagingToLiveFailed,
                                  nullptr, true, "No staging directory for %@ in %@", identifier, classDirectory));
@@ -167,15 +167,17 @@ QRTMetadataRef QRTClientConnection::_createNewContainer(uint32_t userId, const s
   // Nothing half-made stays behind: the staging directory goes to death row.
   QRTErrorRef cleanupError;
   if (!_moveItemAtURLToDeathRow(staging, true, true, &cleanupError)) {
-    QRTSetError(error, QRT_ERROR(QRTErrorRemoveStagingFailed, cleanupError, true, "Failed to remove staging dir: %@",
-                                 staging));
+    QRTSetError(
+        error, QRT_ERROR(QRTErrorRemoveStagingFailed, cleanupError, true, "Failed to remove staging dir: %@", staging));
   }
   return nullptr;
 }
 
-QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(
-    uint32_t userId, const std::optional<std::string>& identifier, bool createIfNecessary, uint64_t containerClass,
-    bool transient, bool useLocking, uint64_t* withError) {
+QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(uint32_t userId,
+                                                                   const std::optional<std::string>& identifier,
+                                                                   bool createIfNecessary, uint64_t containerClass,
+                                                                   bool transient, bool useLocking,
+                                                                   uint64_t* withError) {
   if (!identifier || containerClass < 1 || containerClass > 13) {
     reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
                          "Can't act on an invalid object: userId: %u, ID: %@, class: %ld", userId, identifier,
@@ -197,8 +199,7 @@ QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(
            "to do this. File a Bugline in \"QuarterKit | all\"",
            clientBundleIdentifier_, static_cast<long>(containerClass), identifier);
   }
-  if (containerClass == 12 && !allowOtherIdLookup_ &&
-      (!codeSigningGrantsSystemContainer(*identifier) || foreign)) {
+  if (containerClass == 12 && !allowOtherIdLookup_ && (!codeSigningGrantsSystemContainer(*identifier) || foreign)) {
     reportCode(QRT_ERROR(QRTErrorNotEntitled, nullptr, true, "%@ not entitled for system container with identifier %@",
                          clientBundleIdentifier_, identifier),
                withError);
@@ -209,9 +210,7 @@ QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(
   QRTMetadataRef result;
   try {
     result = _lookupOrCreate(userId, *identifier, createIfNecessary, containerClass, transient, useLocking, &error);
-  } catch (...) {
-    error = QRT_EXCEPTION_ERROR();
-  }
+  } catch (...) { error = QRT_EXCEPTION_ERROR(); }
   if (!result) reportCode(error, withError);
   return result;
 }
@@ -241,8 +240,8 @@ QRTMetadataRef QRTClientConnection::_lookupOrCreate(uint32_t userId, const std::
     return nullptr;
   }
   if (!createIfNecessary) {
-    QRTSetError(error, QRT_ERROR(QRTErrorNotFound, nullptr, false, "Container with identifier: \"%@\" Not Found",
-                                 identifier));
+    QRTSetError(error,
+                QRT_ERROR(QRTErrorNotFound, nullptr, false, "Container with identifier: \"%@\" Not Found", identifier));
     return nullptr;
   }
   // A user's containers, and so the cache's memory for them, stay bounded.

@@ -77,8 +77,8 @@ class QRTClientConnection {
                                  const std::optional<std::string>& identifier, uint64_t containerClass,
                                  uint64_t* withError);
   // A nil value removes the key.
-  void setInfoValue(const std::optional<plist::Value>& value, const std::optional<std::string>& forKey,
-                    uint32_t userId, const std::optional<QRTUUID>& uuid, const std::optional<std::string>& identifier,
+  void setInfoValue(const std::optional<plist::Value>& value, const std::optional<std::string>& forKey, uint32_t userId,
+                    const std::optional<QRTUUID>& uuid, const std::optional<std::string>& identifier,
                     uint64_t containerClass, bool useLocking, uint64_t* withError);
   std::optional<plist::Value> infoValueForKey(const std::optional<std::string>& key, uint32_t userId,
                                               const std::optional<QRTUUID>& uuid,
@@ -132,6 +132,7 @@ class QRTClientConnection {
  private:
   bool _createTopLevelContainerDirectory(const QRTURL& url, uint64_t containerClass, uint32_t owner,
                                          QRTErrorRef* error);
+
  public:
   // Also used when a container's default structure is made again.
   bool _createSubDirectories(const QRTURL& url, uint32_t userId, uint64_t containerClass, QRTErrorRef* error);

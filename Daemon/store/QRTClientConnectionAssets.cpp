@@ -35,9 +35,9 @@ QRTMetadataRef appDataContainer(uint32_t userId, const std::string& identifier, 
   QRTErrorRef lookup;
   QRTMetadataRef m = QRTContainerCache::sharedInstance().containerForUser(userId, 2, identifier, false, &lookup);
   if (!m) {
-    *error = QRT_ERROR(QRTErrorInvalidParameter, lookup, true,
-                       "Failed to create app data container for user managed assets path for %@: %@", identifier,
-                       lookup);
+    *error =
+        QRT_ERROR(QRTErrorInvalidParameter, lookup, true,
+                  "Failed to create app data container for user managed assets path for %@: %@", identifier, lookup);
   }
   return m;
 }
@@ -103,8 +103,8 @@ std::optional<QRTURL> containedURL(const QRTURL& container, const std::string& r
 }  // namespace
 
 std::optional<QRTURL> QRTClientConnection::userManagedAssetsPathForUser(uint32_t userId,
-                                                                       const std::optional<std::string>& identifier,
-                                                                       bool isRelative, uint64_t* withError) {
+                                                                        const std::optional<std::string>& identifier,
+                                                                        bool isRelative, uint64_t* withError) {
   QRTErrorRef error;
   try {
     if (!identifier) {
@@ -124,8 +124,8 @@ std::optional<QRTURL> QRTClientConnection::userManagedAssetsPathForUser(uint32_t
     QRTIdentifierLock lock(m->uuid().UUIDString(), true);
     // Read again under the lock: another request may have made it meanwhile.
     QRTErrorRef ignored;
-    if (QRTMetadataRef current = QRTContainerCache::sharedInstance().containerForUser(userId, 2, identifier, false,
-                                                                                       &ignored))
+    if (QRTMetadataRef current =
+            QRTContainerCache::sharedInstance().containerForUser(userId, 2, identifier, false, &ignored))
       m = current;
     if (!m->userManagedAssetsDirName()) {
       m = makeAssetsDirectory(m, userId, &error);
@@ -134,11 +134,13 @@ std::optional<QRTURL> QRTClientConnection::userManagedAssetsPathForUser(uint32_t
         return std::nullopt;
       }
     } else {
-      QRTURL dir = m->url().URLByAppendingPathComponent("Library", true)
+      QRTURL dir = m->url()
+                       .URLByAppendingPathComponent("Library", true)
                        .URLByAppendingPathComponent(*m->userManagedAssetsDirName(), true);
       if (!QRTFileManager::defaultManager().itemExistsAtURL(dir)) {
-        reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true, "User Managed Assets path does not exist: %@", dir),
-                   withError);
+        reportCode(
+            QRT_ERROR(QRTErrorInvalidParameter, nullptr, true, "User Managed Assets path does not exist: %@", dir),
+            withError);
         return std::nullopt;
       }
     }
@@ -157,39 +159,38 @@ void QRTClientConnection::deleteUserManagedAssetForUser(uint32_t userId, const s
   QRTErrorRef error;
   try {
     if (!identifier || !relativePath) {
-      return reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true, "Can't act on invalid input: ID: %@, Path: %@",
-                                  identifier, relativePath),
+      return reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
+                                  "Can't act on invalid input: ID: %@, Path: %@", identifier, relativePath),
                         withError);
     }
     QRTMetadataRef m = appDataContainer(userId, *identifier, &error);
     if (!m) return reportCode(error, withError);
     QRTIdentifierLock lock(m->uuid().UUIDString(), true);
     QRTErrorRef ignored;
-    if (QRTMetadataRef current = QRTContainerCache::sharedInstance().containerForUser(userId, 2, identifier, false,
-                                                                                       &ignored))
+    if (QRTMetadataRef current =
+            QRTContainerCache::sharedInstance().containerForUser(userId, 2, identifier, false, &ignored))
       m = current;
     if (m->url().empty() || !m->userManagedAssetsDirName()) {
       return reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
                                   "No userManagedAssetsDirName or URL in container metadata object: %@", m),
                         withError);
     }
-    QRTURL assets = m->url().URLByAppendingPathComponent("Library", true)
+    QRTURL assets = m->url()
+                        .URLByAppendingPathComponent("Library", true)
                         .URLByAppendingPathComponent(*m->userManagedAssetsDirName(), true);
     // The asset must lie inside the assets directory; the item itself (a
     // link, when it is one) is what goes to death row, never a link's target.
     QRTURL asset = QRTURL::fileURL(assets.path() + "/" + *relativePath);
     if (isAbsolute(*relativePath) || !QRTFileManager::defaultManager().realPathForURL(asset, assets) ||
         asset == assets) {
-      return reportCode(QRT_ERROR(QRTErrorInvalidPath, nullptr, true, "Invalid asset path %@ for %@ at %@", *relativePath,
-                                  identifier, assets),
+      return reportCode(QRT_ERROR(QRTErrorInvalidPath, nullptr, true, "Invalid asset path %@ for %@ at %@",
+                                  *relativePath, identifier, assets),
                         withError);
     }
     if (!_moveItemAtURLToDeathRow(asset, false, false, &error)) {
       reportCode(QRT_ERROR(QRTErrorDeathRowFailed, error, true, "Failed to remove asset at %@", asset), withError);
     }
-  } catch (...) {
-    reportCode(QRT_EXCEPTION_ERROR(), withError);
-  }
+  } catch (...) { reportCode(QRT_EXCEPTION_ERROR(), withError); }
 }
 
 std::optional<QRTURL> QRTClientConnection::stageSharedContentForIdentifier(
@@ -212,7 +213,8 @@ std::optional<QRTURL> QRTClientConnection::stageSharedContentForIdentifier(
     }
     QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
     QRTGroupList groups;
-    if (mapping && clientBundleIdentifier_) groups = mapping->systemGroupIdentifiersForIdentifier(*clientBundleIdentifier_);
+    if (mapping && clientBundleIdentifier_)
+      groups = mapping->systemGroupIdentifiersForIdentifier(*clientBundleIdentifier_);
     if (!groups || std::find(groups->begin(), groups->end(), *identifier) == groups->end()) {
       return fail(QRT_ERROR(QRTErrorNotEntitled, nullptr, true, "%@ not entitled for system group container %@",
                             clientBundleIdentifier_, identifier));
@@ -229,8 +231,8 @@ std::optional<QRTURL> QRTClientConnection::stageSharedContentForIdentifier(
     // The items themselves are moved (a rename never follows a link), once
     // both names are known to lie inside the container.
     if (isAbsolute(*sourceRelativePath) || !containedURL(m->url(), *sourceRelativePath) || source == m->url()) {
-      return fail(QRT_ERROR(QRTErrorInvalidPath, nullptr, true, "Invalid source URL %@ for %@ at %@", source, identifier,
-                            m->url()));
+      return fail(QRT_ERROR(QRTErrorInvalidPath, nullptr, true, "Invalid source URL %@ for %@ at %@", source,
+                            identifier, m->url()));
     }
     if (isAbsolute(*destRelativePath) || !containedURL(m->url(), *destRelativePath) || dest == m->url()) {
       return fail(QRT_ERROR(QRTErrorInvalidPath, nullptr, true, "Invalid dest URL %@ for %@ at %@", dest, identifier,
@@ -246,9 +248,7 @@ std::optional<QRTURL> QRTClientConnection::stageSharedContentForIdentifier(
                             identifier, source, dest, error));
     }
     return dest;
-  } catch (...) {
-    return fail(QRT_EXCEPTION_ERROR());
-  }
+  } catch (...) { return fail(QRT_EXCEPTION_ERROR()); }
 }
 
 void QRTClientConnection::setNetworkExtensionForUser(uint32_t userId, const std::optional<std::string>& identifier,
@@ -256,7 +256,8 @@ void QRTClientConnection::setNetworkExtensionForUser(uint32_t userId, const std:
   try {
     if (!identifier) {
       return reportCode(
-          QRT_ERROR(QRTErrorInvalidParameter, nullptr, true, "Can't act on invalid input: ID: %@", identifier), withError);
+          QRT_ERROR(QRTErrorInvalidParameter, nullptr, true, "Can't act on invalid input: ID: %@", identifier),
+          withError);
     }
     if (containerClass != 2 && containerClass != 6) {
       return reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
@@ -280,13 +281,11 @@ void QRTClientConnection::setNetworkExtensionForUser(uint32_t userId, const std:
     }
     if (!QRTContainerCache::sharedInstance().setSandboxContainerMappingForUser(userId, "com.norvane.tunnelworker",
                                                                                containerClass, m->url())) {
-      reportCode(QRT_ERROR(QRTErrorInvalidRequest, nullptr, true, "Failed to set sandbox mapping for tunnelworker to %@",
-                           m->url()),
+      reportCode(QRT_ERROR(QRTErrorInvalidRequest, nullptr, true,
+                           "Failed to set sandbox mapping for tunnelworker to %@", m->url()),
                  withError);
     }
-  } catch (...) {
-    reportCode(QRT_EXCEPTION_ERROR(), withError);
-  }
+  } catch (...) { reportCode(QRT_EXCEPTION_ERROR(), withError); }
 }
 
 void QRTClientConnection::retryTestForUser(uint32_t userId, uint64_t withNumCrashes, uint64_t* withError) {
@@ -323,7 +322,5 @@ void QRTClientConnection::retryTestForUser(uint32_t userId, uint64_t withNumCras
       QRTLog(kLogError, "Failed to delete retry container at : %@", m->url());
       if (withError) *withError = code;
     }
-  } catch (...) {
-    reportCode(QRT_EXCEPTION_ERROR(), withError);
-  }
+  } catch (...) { reportCode(QRT_EXCEPTION_ERROR(), withError); }
 }

@@ -35,14 +35,13 @@ bool validSelector(const char* function, uint32_t userId, const std::optional<QR
 }
 
 QRTMetadataRef lookupByUUID(const char* function, uint32_t userId, const QRTUUID& uuid,
-                                          const std::optional<std::string>& identifier, uint64_t containerClass,
-                                          QRTErrorRef* error) {
+                            const std::optional<std::string>& identifier, uint64_t containerClass, QRTErrorRef* error) {
   auto metadata =
       QRTContainerCache::sharedInstance().containerForUser(userId, containerClass, identifier, uuid.UUIDString());
   if (!metadata) {
     QRTSetError(error, QRTCreateError(function, __LINE__, QRTErrorDomain, QRTErrorNotFound, nullptr, nullptr, true,
-                                      "No Container with userId: %u UUID: %@, identifier: %@, Class: %ld", userId,
-                                      uuid, identifier, static_cast<long>(containerClass)));
+                                      "No Container with userId: %u UUID: %@, identifier: %@, Class: %ld", userId, uuid,
+                                      identifier, static_cast<long>(containerClass)));
   }
   return metadata;
 }
@@ -52,10 +51,10 @@ QRTMetadataRef lookupByUUID(const char* function, uint32_t userId, const QRTUUID
 std::optional<std::vector<QRTMetadataRef>> QRTClientConnection::containersForUser(uint32_t userId, uint64_t withClass,
                                                                                   bool transient, uint64_t* withError) {
   if (withClass < 1 || withClass > 13) {
-    reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
-                         "Can't act on an invalid container-userId: %u, class: %ld", userId,
-                         static_cast<long>(withClass)),
-               withError);
+    reportCode(
+        QRT_ERROR(QRTErrorInvalidParameter, nullptr, true, "Can't act on an invalid container-userId: %u, class: %ld",
+                  userId, static_cast<long>(withClass)),
+        withError);
     return std::nullopt;
   }
   QRTErrorRef error;
@@ -63,9 +62,7 @@ std::optional<std::vector<QRTMetadataRef>> QRTClientConnection::containersForUse
     QRTAllIdentifiersLock lock(false);
     auto list = QRTContainerCache::sharedInstance().allContainersForUser(userId, withClass, transient, &error);
     if (list) return list;
-  } catch (...) {
-    error = QRT_EXCEPTION_ERROR();
-  }
+  } catch (...) { error = QRT_EXCEPTION_ERROR(); }
   reportCode(error, withError);
   return std::nullopt;
 }
@@ -81,18 +78,15 @@ QRTMetadataRef QRTClientConnection::metadataForUser(uint32_t userId, const std::
         return metadata;
       }
     }
-  } catch (...) {
-    error = QRT_EXCEPTION_ERROR();
-  }
+  } catch (...) { error = QRT_EXCEPTION_ERROR(); }
   reportCode(error, withError);
   return nullptr;
 }
 
 void QRTClientConnection::setInfoValue(const std::optional<plist::Value>& value,
                                        const std::optional<std::string>& forKey, uint32_t userId,
-                                       const std::optional<QRTUUID>& uuid,
-                                       const std::optional<std::string>& identifier, uint64_t containerClass,
-                                       bool useLocking, uint64_t* withError) {
+                                       const std::optional<QRTUUID>& uuid, const std::optional<std::string>& identifier,
+                                       uint64_t containerClass, bool useLocking, uint64_t* withError) {
   QRTErrorRef error;
   try {
     if (!validSelector(__func__, userId, uuid, containerClass, &error)) return reportCode(error, withError);
@@ -116,17 +110,16 @@ void QRTClientConnection::setInfoValue(const std::optional<plist::Value>& value,
     QRTErrorRef cacheError;
     if (!QRTContainerCache::sharedInstance().addContainerMetadata(changed, changed->uid(), changed->url(),
                                                                   changed->transient(), false, &cacheError)) {
-      reportCode(QRT_ERROR(QRTErrorCacheAddFailed, cacheError, true, "Failed to add to cache: %@, url: %@, transient: %d",
-                           changed, changed->url(), changed->transient()),
-                 withError);
+      reportCode(
+          QRT_ERROR(QRTErrorCacheAddFailed, cacheError, true, "Failed to add to cache: %@, url: %@, transient: %d",
+                    changed, changed->url(), changed->transient()),
+          withError);
     }
-  } catch (...) {
-    reportCode(QRT_EXCEPTION_ERROR(), withError);
-  }
+  } catch (...) { reportCode(QRT_EXCEPTION_ERROR(), withError); }
 }
 
-std::optional<plist::Value> QRTClientConnection::infoValueForKey(const std::optional<std::string>& key,
-                                                                 uint32_t userId, const std::optional<QRTUUID>& uuid,
+std::optional<plist::Value> QRTClientConnection::infoValueForKey(const std::optional<std::string>& key, uint32_t userId,
+                                                                 const std::optional<QRTUUID>& uuid,
                                                                  const std::optional<std::string>& identifier,
                                                                  uint64_t containerClass, bool useLocking,
                                                                  uint64_t* withError) {
@@ -148,9 +141,7 @@ std::optional<plist::Value> QRTClientConnection::infoValueForKey(const std::opti
       if (const plist::Value* value = info ? plist::find(*info, *key) : nullptr) return *value;
       error = QRT_ERROR(QRTErrorInfoValueNotFound, nullptr, false, "Didn't find info value for key: %@", key);
     }
-  } catch (...) {
-    error = QRT_EXCEPTION_ERROR();
-  }
+  } catch (...) { error = QRT_EXCEPTION_ERROR(); }
   reportCode(error, withError);
   return std::nullopt;
 }
@@ -170,27 +161,25 @@ void QRTClientConnection::recreateDefaultStructureForUser(uint32_t userId, const
         !QRTFileManager::defaultManager().standardizeACLsForSystemContainerAtURL(metadata->url(), &error)) {
       reportCode(error, withError);
     }
-  } catch (...) {
-    reportCode(QRT_EXCEPTION_ERROR(), withError);
-  }
+  } catch (...) { reportCode(QRT_EXCEPTION_ERROR(), withError); }
 }
 
-std::vector<QRTMetadataRef> QRTClientConnection::_containersToRename(
-    uint32_t userId, const QRTUUID& uuid, const std::optional<std::string>& identifier, uint64_t containerClass,
-    QRTErrorRef* error) {
+std::vector<QRTMetadataRef> QRTClientConnection::_containersToRename(uint32_t userId, const QRTUUID& uuid,
+                                                                     const std::optional<std::string>& identifier,
+                                                                     uint64_t containerClass, QRTErrorRef* error) {
   std::vector<QRTMetadataRef> chosen;
   const bool multiUser = QRTIsPerUserClass(containerClass) && (platform::deviceMultiUserFlags() & 0x80000000u);
   if (!multiUser) {
-    if (auto metadata = lookupByUUID("regenerateDirectoryUUIDForUser", userId, uuid, identifier, containerClass,
-                                     error)) {
+    if (auto metadata =
+            lookupByUUID("regenerateDirectoryUUIDForUser", userId, uuid, identifier, containerClass, error)) {
       chosen.push_back(std::move(metadata));
     }
     return chosen;
   }
   // Every user of the device: on this platform, the current mobile user.
   for (uint32_t user : {QRTGlobalConfiguration::sharedInstance().currentMobileUserId()}) {
-    auto metadata = QRTContainerCache::sharedInstance().containerForUser(user, containerClass, identifier, false,
-                                                                        nullptr);
+    auto metadata =
+        QRTContainerCache::sharedInstance().containerForUser(user, containerClass, identifier, false, nullptr);
     if (metadata) {
       chosen.push_back(std::move(metadata));
     } else {
@@ -218,14 +207,14 @@ void QRTClientConnection::regenerateDirectoryUUIDForUser(uint32_t userId,
     for (const auto& metadata : chosen) {
       const QRTURL oldURL = metadata->url();
       if (!QRTUUID::fromString(oldURL.lastPathComponent())) {
-        return reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
-                                    "Non-UUID last path component: %@ for identifier: %@, userId: %u, Class: %ld",
-                                    oldURL.lastPathComponent(), identifier, metadata->uid(),
-                                    static_cast<long>(containerClass)),
-                          withError);
+        return reportCode(
+            QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
+                      "Non-UUID last path component: %@ for identifier: %@, userId: %u, Class: %ld",
+                      oldURL.lastPathComponent(), identifier, metadata->uid(), static_cast<long>(containerClass)),
+            withError);
       }
-      QRTURL newURL = oldURL.URLByDeletingLastPathComponent().URLByAppendingPathComponent(
-          QRTUUID::random().UUIDString(), true);
+      QRTURL newURL =
+          oldURL.URLByDeletingLastPathComponent().URLByAppendingPathComponent(QRTUUID::random().UUIDString(), true);
       QRTErrorRef moveError;
       if (!QRTFileManager::defaultManager().moveItemAtURL(oldURL, newURL, &moveError)) {
         return reportCode(QRT_ERROR(QRTErrorMoveToNewUUIDFailed, moveError, true,
@@ -235,15 +224,13 @@ void QRTClientConnection::regenerateDirectoryUUIDForUser(uint32_t userId,
       QRTErrorRef cacheError;
       if (!QRTContainerCache::sharedInstance().addContainerMetadata(metadata, metadata->uid(), newURL,
                                                                     metadata->transient(), true, &cacheError)) {
-        return reportCode(QRT_ERROR(QRTErrorCacheAddFailed, cacheError, true,
-                                    "Failed to add to cache: %@, url: %@, transient: %d", metadata, newURL,
-                                    metadata->transient()),
-                          withError);
+        return reportCode(
+            QRT_ERROR(QRTErrorCacheAddFailed, cacheError, true, "Failed to add to cache: %@, url: %@, transient: %d",
+                      metadata, newURL, metadata->transient()),
+            withError);
       }
     }
-  } catch (...) {
-    reportCode(QRT_EXCEPTION_ERROR(), withError);
-  }
+  } catch (...) { reportCode(QRT_EXCEPTION_ERROR(), withError); }
 }
 
 void QRTClientConnection::_regenerateAllSystemContainerPaths() {
@@ -251,7 +238,7 @@ void QRTClientConnection::_regenerateAllSystemContainerPaths() {
   for (uint64_t containerClass : {uint64_t{QRTClassSystemData}, uint64_t{QRTClassSystemGroup}}) {
     QRTErrorRef error;
     auto list = QRTContainerCache::sharedInstance().allContainersForUser(QRTSystemContainerUserId, containerClass,
-                                                                        false, false, &error);
+                                                                         false, false, &error);
     if (!list) {
       QRTLog(platform::kLogError, "Failed to get list of system containers for migration: %@", error);
       continue;
@@ -273,8 +260,8 @@ void QRTClientConnection::_regenerateAllSystemContainerPaths() {
 }
 
 uint64_t QRTClientConnection::diskUsageForUserId(uint32_t userId, const std::optional<QRTUUID>& uuid,
-                                                 const std::optional<std::string>& identifier,
-                                                 uint64_t containerClass, uint64_t* withError) {
+                                                 const std::optional<std::string>& identifier, uint64_t containerClass,
+                                                 uint64_t* withError) {
   static constexpr const char* kStaticDiskUsage = "com.norvane.Emplacer.StaticDiskUsage";
   QRTErrorRef error;
   try {
@@ -291,8 +278,8 @@ uint64_t QRTClientConnection::diskUsageForUserId(uint32_t userId, const std::opt
     const bool bundle = QRTIsBundleClass(containerClass);
     if (bundle) {
       uint64_t code = QRTErrorNone;
-      auto stored = infoValueForKey(std::string(kStaticDiskUsage), userId, uuid, identifier, containerClass, false,
-                                    &code);
+      auto stored =
+          infoValueForKey(std::string(kStaticDiskUsage), userId, uuid, identifier, containerClass, false, &code);
       if (code != QRTErrorNone && code != QRTErrorInfoValueNotFound) {
         QRTLog(platform::kLogError, "Error looking up info value for userId: %u, identifier: %@, Class: %llu: %llu",
                userId, identifier, static_cast<unsigned long long>(containerClass),

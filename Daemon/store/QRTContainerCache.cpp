@@ -25,13 +25,13 @@ std::string cacheKey(uint32_t userId, uint64_t contentClass) {
 bool validInput(uint64_t contentClass, const std::optional<std::string>& identifier, const char* identifierMessage,
                 const char* function, int line, QRTErrorRef* error) {
   if (!validClass(contentClass)) {
-    QRTSetError(error, QRTCreateError(function, line, QRTErrorDomain, QRTErrorCacheInvalidInput, nullptr, nullptr,
-                                      true, "Invalid Content Class: %ld", static_cast<long>(contentClass)));
+    QRTSetError(error, QRTCreateError(function, line, QRTErrorDomain, QRTErrorCacheInvalidInput, nullptr, nullptr, true,
+                                      "Invalid Content Class: %ld", static_cast<long>(contentClass)));
     return false;
   }
   if (!identifier) {
-    QRTSetError(error, QRTCreateError(function, line, QRTErrorDomain, QRTErrorCacheInvalidInput, nullptr, nullptr,
-                                      true, identifierMessage, identifier));
+    QRTSetError(error, QRTCreateError(function, line, QRTErrorDomain, QRTErrorCacheInvalidInput, nullptr, nullptr, true,
+                                      identifierMessage, identifier));
     return false;
   }
   return true;
@@ -59,15 +59,15 @@ std::optional<QRTContainerCache::ClassMap> QRTContainerCache::buildClassMap(uint
   if (!items) return std::nullopt;
 
   ClassMap map;
-  const bool pushMappings = populateSandboxCache && !transient &&
-                            (contentClass == 10 || contentClass == 12 || contentClass == 13);
+  const bool pushMappings =
+      populateSandboxCache && !transient && (contentClass == 10 || contentClass == 12 || contentClass == 13);
   // Planted directories beyond a user's bound are not read: they could not
   // have been made through requests.
   const size_t limit = userId == 0 ? SIZE_MAX : QRTGlobalConfiguration::sharedInstance().maxContainersPerClass();
   for (const QRTURL& item : *items) {
     if (map.size() >= limit) {
-      QRTLog(kLogError, "Cache: %@%@: more than %llu containers; the rest are left out",
-             cacheKey(userId, contentClass), suffix(transient), static_cast<unsigned long long>(limit));
+      QRTLog(kLogError, "Cache: %@%@: more than %llu containers; the rest are left out", cacheKey(userId, contentClass),
+             suffix(transient), static_cast<unsigned long long>(limit));
       break;
     }
     QRTErrorRef readError;
@@ -84,10 +84,9 @@ std::optional<QRTContainerCache::ClassMap> QRTContainerCache::buildClassMap(uint
   return map;
 }
 
-QRTContainerCache::ClassMap* QRTContainerCache::_getCacheForUserId(std::unique_lock<std::mutex>& hold,
-                                                                   uint32_t userId, uint64_t contentClass,
-                                                                   bool transient, bool populateSandboxCache,
-                                                                   QRTErrorRef* error) {
+QRTContainerCache::ClassMap* QRTContainerCache::_getCacheForUserId(std::unique_lock<std::mutex>& hold, uint32_t userId,
+                                                                   uint64_t contentClass, bool transient,
+                                                                   bool populateSandboxCache, QRTErrorRef* error) {
   if (!user_id_valid_for_class(contentClass, userId)) {
     QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Invalid cache get-userId %u for class %ld",
                                  userId, static_cast<long>(contentClass)));
@@ -112,9 +111,8 @@ QRTContainerCache::ClassMap* QRTContainerCache::_getCacheForUserId(std::unique_l
   return &(caches[key] = std::move(*built));
 }
 
-QRTContainerCache::ClassMap* QRTContainerCache::lockedClassMap(std::unique_lock<std::mutex>& hold,
-                                                               const char* function, uint32_t userId,
-                                                               uint64_t contentClass, bool transient,
+QRTContainerCache::ClassMap* QRTContainerCache::lockedClassMap(std::unique_lock<std::mutex>& hold, const char* function,
+                                                               uint32_t userId, uint64_t contentClass, bool transient,
                                                                bool populateSandboxCache, QRTErrorRef* error) {
   QRTErrorRef buildError;
   ClassMap* map = _getCacheForUserId(hold, userId, contentClass, transient, populateSandboxCache, &buildError);
@@ -136,10 +134,10 @@ bool QRTContainerCache::checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_
   }
   QRTURL file = metadata->url().URLByAppendingPathComponent(QRTMetadataFileName);
   if (!QRTFileManager::defaultManager().itemDoesNotExistAtURL(file)) return true;
-  QRTSetError(error, QRT_ERROR(QRTErrorCacheInconsistent, nullptr, true,
-                               "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", className,
-                               suffix(transient), file, metadata->identifier(),
-                               static_cast<unsigned long long>(contentClass)));
+  QRTSetError(
+      error, QRT_ERROR(QRTErrorCacheInconsistent, nullptr, true,
+                       "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", className,
+                       suffix(transient), file, metadata->identifier(), static_cast<unsigned long long>(contentClass)));
   // Only this very entry: a container made again under the identifier since
   // the look-up stays.
   bool removed = false;
@@ -217,11 +215,8 @@ QRTMetadataRef QRTContainerCache::containerForUser(uint32_t userId, uint64_t con
   return nullptr;
 }
 
-std::optional<std::vector<QRTMetadataRef>> QRTContainerCache::allContainersForUser(uint32_t userId,
-                                                                                   uint64_t contentClass,
-                                                                                   bool transient,
-                                                                                   bool populateSandboxCache,
-                                                                                   QRTErrorRef* error) {
+std::optional<std::vector<QRTMetadataRef>> QRTContainerCache::allContainersForUser(
+    uint32_t userId, uint64_t contentClass, bool transient, bool populateSandboxCache, QRTErrorRef* error) {
   if (!validClass(contentClass)) {
     QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Invalid Content Class: %ld",
                                  static_cast<long>(contentClass)));
@@ -320,10 +315,21 @@ bool QRTContainerCache::setSandboxContainerMappingForUser(uint32_t userId, const
   uint64_t itemType;
   uint32_t mappingUser = userId;
   switch (containerClass) {
-    case 2: case 4: case 6: case 9: case 10: case 11: itemType = 1; break;
+    case 2:
+    case 4:
+    case 6:
+    case 9:
+    case 10:
+    case 11: itemType = 1; break;
     case 7: itemType = 2; break;
-    case 12: itemType = 4; mappingUser = 0; break;
-    case 13: itemType = 8; mappingUser = 0; break;
+    case 12:
+      itemType = 4;
+      mappingUser = 0;
+      break;
+    case 13:
+      itemType = 8;
+      mappingUser = 0;
+      break;
     default:
       QRTLog(kLogError, "Unsupported class for setting sandbox container mapping: %llu",
              static_cast<unsigned long long>(containerClass));
@@ -332,14 +338,16 @@ bool QRTContainerCache::setSandboxContainerMappingForUser(uint32_t userId, const
   const unsigned long long cls = containerClass;
   const unsigned long long type = itemType;
   if (int status = platform::sandboxSetStateItem(mappingUser, itemType, identifier, nullptr)) {
-    QRTLog(kLogError, "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d",
-           mappingUser, type, platform::logIdentifier(identifier).c_str(), cls, static_cast<const char*>(nullptr), status);
+    QRTLog(
+        kLogError, "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d",
+        mappingUser, type, platform::logIdentifier(identifier).c_str(), cls, static_cast<const char*>(nullptr), status);
     return false;
   }
   if (!url) return true;
   if (int status = platform::sandboxSetStateItem(mappingUser, itemType, identifier, url->fileSystemRepresentation())) {
     QRTLog(kLogError, "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: %llu, path: %s : %d",
-           mappingUser, type, platform::logIdentifier(identifier).c_str(), cls, url->fileSystemRepresentation(), status);
+           mappingUser, type, platform::logIdentifier(identifier).c_str(), cls, url->fileSystemRepresentation(),
+           status);
     return false;
   }
   return true;

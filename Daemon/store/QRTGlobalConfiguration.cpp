@@ -151,7 +151,7 @@ QRTURL QRTGlobalConfiguration::deathrowDirectory() {
 }
 
 std::optional<QRTURL> QRTGlobalConfiguration::directoryOnFileSystemOf(const QRTURL& url, const QRTURL& daemonDirectory,
-                                                                     const char* name) {
+                                                                      const char* name) {
   // The parent: url itself may not exist yet, or be on its way out.
   const QRTURL parent = url.URLByDeletingLastPathComponent();
   if (sameFileSystem(parent, daemonDirectory)) return daemonDirectory;
@@ -300,4 +300,3 @@ bool QRTGlobalConfiguration::migrationFileExistsWithName(const std::string& name
     return false;
   return QRTFileManager::defaultManager().itemExistsAtURL(libraryDirectory().URLByAppendingPathComponent(name));
 }
-

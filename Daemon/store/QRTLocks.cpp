@@ -12,8 +12,8 @@ QRTLocksState& gQRTLocks = *new QRTLocksState;
 namespace {
 
 [[noreturn]] void lockAssertionFailed(const char* expression, const char* function, int line) {
-  std::string text = QRTFormat("Assertion failed: (%s), function %s, file Daemon/QRTLocks, line %d.",
-                               expression, function, line);
+  std::string text =
+      QRTFormat("Assertion failed: (%s), function %s, file Daemon/QRTLocks, line %d.", expression, function, line);
   QRTLogAs(platform::kLogError, function, "%s", text.c_str());
   fprintf(stderr, "%s\n", text.c_str());
   fflush(stderr);
@@ -22,18 +22,17 @@ namespace {
 
 // A broken invariant means a lock was paired wrongly: stop rather than go on
 // with bookkeeping that no longer matches the locks.
-#define QRTLocksAssert(expression)                                            \
-  do {                                                                        \
-    if (!(expression)) lockAssertionFailed(#expression, __func__, __LINE__);  \
+#define QRTLocksAssert(expression)                                           \
+  do {                                                                       \
+    if (!(expression)) lockAssertionFailed(#expression, __func__, __LINE__); \
   } while (0)
 
 // Debug lines must not turn a lock or unlock into a throwing call.
-#define QRTLocksDebug(...)                        \
-  do {                                            \
-    try {                                         \
-      QRTLog(platform::kLogDebug, __VA_ARGS__);   \
-    } catch (...) {                               \
-    }                                             \
+#define QRTLocksDebug(...)                      \
+  do {                                          \
+    try {                                       \
+      QRTLog(platform::kLogDebug, __VA_ARGS__); \
+    } catch (...) {}                            \
   } while (0)
 
 const char* modeName(bool writing) { return writing ? "writing" : "reading"; }
@@ -64,9 +63,8 @@ void waitToEnter(std::unique_lock<std::mutex>& hold, std::condition_variable& co
   if (allowed() && locks.allWritersWaiting == 0) return;
   const uint64_t releases = locks.allWriterReleases;
   ++locks.lockersWaiting;
-  condition.wait(hold, [&] {
-    return allowed() && (locks.allWritersWaiting == 0 || locks.allWriterReleases != releases);
-  });
+  condition.wait(hold,
+                 [&] { return allowed() && (locks.allWritersWaiting == 0 || locks.allWriterReleases != releases); });
   --locks.lockersWaiting;
   if (locks.allWriterReleases != releases && locks.lockersToAdmit > 0 && --locks.lockersToAdmit == 0) {
     locks.allWriterCondition.notify_all();
@@ -113,9 +111,8 @@ void acquireRecord(std::unique_lock<std::mutex>& hold, QRTIdentifierLockRecord& 
     QRTLocksAssert(previousState == 0);
   } else {
     const bool holdsOthers = tLocksHeld > 0;
-    record.released.wait(hold, [&] {
-      return record.lockState.load() != -1 && (record.waitingWriters == 0 || holdsOthers);
-    });
+    record.released.wait(hold,
+                         [&] { return record.lockState.load() != -1 && (record.waitingWriters == 0 || holdsOthers); });
     int32_t readersNow = record.lockState.fetch_add(1) + 1;
     QRTLocksAssert(readersNow > 0);
   }
@@ -151,7 +148,8 @@ void releaseRead(QRTIdentifierLockRecord& record) {
 // each record in order.
 void takeSortedList(const std::vector<std::string>& sorted, bool writing) {
   if (sorted.empty()) return;
-  for (const std::string& identifier : sorted) QRTLocksDebug("Waiting to lock %@ for %s", identifier, modeName(writing));
+  for (const std::string& identifier : sorted)
+    QRTLocksDebug("Waiting to lock %@ for %s", identifier, modeName(writing));
   {
     std::unique_lock<std::mutex> hold(gQRTLocks.mutex);
     waitToEnterIdentifiers(hold, writing);
@@ -235,9 +233,8 @@ void _lock_all_identifiers(bool writing) {
       --locks.allWritersWaiting;
       locks.allReaderWriterState = -1;
     } else {
-      waitToEnter(hold, locks.allReaderCondition, [&] {
-        return locks.identifierWriterCount == 0 && locks.allReaderWriterState != -1;
-      });
+      waitToEnter(hold, locks.allReaderCondition,
+                  [&] { return locks.identifierWriterCount == 0 && locks.allReaderWriterState != -1; });
       ++locks.allReaderWriterState;
     }
     ++tLocksHeld;

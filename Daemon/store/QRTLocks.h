@@ -18,9 +18,9 @@
 // with gQRTLocks.mutex; once a writer waits, new readers queue behind it.
 struct QRTIdentifierLockRecord {
   std::condition_variable released;
-  uint64_t referenceCount = 0;          // takers not yet unlocked, waiters included
-  int32_t waitingWriters = 0;           // takers waiting to write
-  std::atomic<int32_t> lockState{0};    // -1 written, n > 0 read by n, 0 free
+  uint64_t referenceCount = 0;        // takers not yet unlocked, waiters included
+  int32_t waitingWriters = 0;         // takers waiting to write
+  std::atomic<int32_t> lockState{0};  // -1 written, n > 0 read by n, 0 free
 };
 
 struct QRTLocksState {

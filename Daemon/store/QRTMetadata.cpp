@@ -14,9 +14,8 @@ std::string describeValue(const plist::Value* value) { return value ? plist::des
 // The directory in which a container of the class must lie, derived from the
 // container's own path: the store root three levels up plus the class's path name.
 QRTURL expectedClassDirectory(const QRTURL& containerURL, uint64_t containerClass) {
-  QRTURL storeRoot = containerURL.URLByDeletingLastPathComponent()
-                         .URLByDeletingLastPathComponent()
-                         .URLByDeletingLastPathComponent();
+  QRTURL storeRoot =
+      containerURL.URLByDeletingLastPathComponent().URLByDeletingLastPathComponent().URLByDeletingLastPathComponent();
   return storeRoot.URLByAppendingPathComponent(QRTContentClassPathName(containerClass), true);
 }
 
@@ -25,8 +24,13 @@ QRTURL expectedClassDirectory(const QRTURL& containerURL, uint64_t containerClas
 QRTMetadata::QRTMetadata(uint32_t uid, QRTUUID uuid, uint64_t containerClass, std::string identifier,
                          std::optional<plist::Dictionary> info, QRTURL url,
                          std::optional<std::string> userManagedAssetsDirName, bool transient)
-    : transient_(transient), uid_(uid), identifier_(std::move(identifier)), uuid_(uuid), url_(std::move(url)),
-      userManagedAssetsDirName_(std::move(userManagedAssetsDirName)), info_(std::move(info)),
+    : transient_(transient),
+      uid_(uid),
+      identifier_(std::move(identifier)),
+      uuid_(uuid),
+      url_(std::move(url)),
+      userManagedAssetsDirName_(std::move(userManagedAssetsDirName)),
+      info_(std::move(info)),
       containerClass_(containerClass) {}
 
 #define QRT_METADATA_WITH(field, value)             \
@@ -121,8 +125,8 @@ bool QRTMetadata::writeMetadataToDiskWithError(QRTErrorRef* error) const {
   QRTErrorRef writeError;
   if (!QRT_writeToURL(dictionary, url_.URLByAppendingPathComponent(QRTMetadataFileName),
                       QRTWriteAtomic | QRTWriteFileProtectionNone, &writeError)) {
-    QRTSetError(error, QRT_ERROR(QRTErrorWriteFailed, writeError, true,
-                                 "Failed to write metadata dictionary to URL %@", url_));
+    QRTSetError(
+        error, QRT_ERROR(QRTErrorWriteFailed, writeError, true, "Failed to write metadata dictionary to URL %@", url_));
     return false;
   }
   return true;
@@ -140,17 +144,17 @@ bool QRTMetadata::rewriteUUIDAtUrl(const QRTURL& url, const QRTUUID& uuid, QRTEr
   if (current && current->isString() && current->string() == uuid.UUIDString()) return true;
   (*dictionary)[QRTMetadataUUIDKey] = uuid.UUIDString();
   if (!QRT_writeToURL(*dictionary, file, QRTWriteAtomic | QRTWriteFileProtectionNone, &underlying)) {
-    QRTSetError(error, QRT_ERROR(QRTErrorWriteFailed, underlying, true,
-                                 "Failed to write metadata dictionary to URL %@", url));
+    QRTSetError(error,
+                QRT_ERROR(QRTErrorWriteFailed, underlying, true, "Failed to write metadata dictionary to URL %@", url));
     return false;
   }
   return true;
 }
 
-#define QRT_INVALID_METADATA(...)                                                          \
-  do {                                                                                     \
+#define QRT_INVALID_METADATA(...)                                                       \
+  do {                                                                                  \
     QRTSetError(error, QRT_ERROR(QRTErrorInvalidMetadata, nullptr, true, __VA_ARGS__)); \
-    return nullptr;                                                                        \
+    return nullptr;                                                                     \
   } while (0)
 
 std::shared_ptr<QRTMetadata> QRTMetadata::readAndValidateMetadataAtUrl(const QRTURL& url, uint32_t forUser,
@@ -193,8 +197,7 @@ std::shared_ptr<QRTMetadata> QRTMetadata::readAndValidateMetadataAtUrl(const QRT
 
   const plist::Value* assetsDirName = plist::find(*dictionary, QRTMetadataUserManagedAssetsDirNameKey);
   if (assetsDirName && !assetsDirName->isString())
-    QRT_INVALID_METADATA("Invalid metadata User Managed Dir Name String: %@ at %@", describeValue(assetsDirName),
-                         url);
+    QRT_INVALID_METADATA("Invalid metadata User Managed Dir Name String: %@ at %@", describeValue(assetsDirName), url);
 
   if (checkClassPath) {
     QRTURL expected = expectedClassDirectory(url, containerClass);

@@ -62,8 +62,7 @@ std::optional<QRTURL> QRTPerUserConfiguration::cachedDirectory(std::optional<QRT
 }
 
 std::optional<QRTURL> QRTPerUserConfiguration::userBaseDirectory() {
-  return cachedDirectory(userBaseDirectory_, "Containers", __func__,
-                         "Failed to create user base dir at \"%@\": %@");
+  return cachedDirectory(userBaseDirectory_, "Containers", __func__, "Failed to create user base dir at \"%@\": %@");
 }
 
 std::optional<QRTURL> QRTPerUserConfiguration::transientDirectory() {
@@ -87,10 +86,12 @@ std::optional<QRTURL> QRTPerUserConfiguration::oldLibraryDirectoryPath() const {
   return homeRelative("Library/QuarterKit");
 }
 
-std::optional<QRTURL> QRTPerUserConfiguration::oldLoggingPath() const { return homeRelative("Library/Logs/QuarterKit"); }
+std::optional<QRTURL> QRTPerUserConfiguration::oldLoggingPath() const {
+  return homeRelative("Library/Logs/QuarterKit");
+}
 
 std::optional<QRTURL> QRTPerUserConfiguration::containerDirectoryURLForContentClass(uint64_t contentClass,
-                                                                                   bool transient) {
+                                                                                    bool transient) {
   std::lock_guard<std::recursive_mutex> hold(lock_);
   if (!QRTIsPerUserClass(contentClass)) {
     QRTLog(platform::kLogError, "Invalid class for a per user container directory: %llu",

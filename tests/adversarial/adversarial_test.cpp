@@ -86,8 +86,10 @@ std::string differences(const Snapshot& before, const Snapshot& after) {
   auto note = [&](const std::string& line) { text += ++count <= 8 ? "\n  " + line : ""; };
   for (const auto& [path, item] : before) {
     auto now = after.find(path);
-    if (now == after.end()) note("removed " + path);
-    else if (!(now->second == item)) note("changed " + path + ": " + describe(item) + "  =>  " + describe(now->second));
+    if (now == after.end())
+      note("removed " + path);
+    else if (!(now->second == item))
+      note("changed " + path + ": " + describe(item) + "  =>  " + describe(now->second));
   }
   for (const auto& [path, item] : after)
     if (!before.count(path)) note("created " + path + ": " + describe(item));
@@ -302,13 +304,16 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
   void plant(const std::function<bool()>& step) { ASSERT_EQ(asUser(kUser, step), 0) << "the user could not plant"; }
 
   static plist::Dictionary stage(const Container& c) {
-    return {{"ContainerClassesArray", plist::Array{c.cls}}, {"UserIDsArray", plist::Array{c.user}},
-            {"UUIDsArray", plist::Array{uuidData(c.uuid)}}, {"IdentifiersArray", plist::Array{c.identifier}}};
+    return {{"ContainerClassesArray", plist::Array{c.cls}},
+            {"UserIDsArray", plist::Array{c.user}},
+            {"UUIDsArray", plist::Array{uuidData(c.uuid)}},
+            {"IdentifiersArray", plist::Array{c.identifier}}};
   }
   static plist::Dictionary replace(const Container& old, const Container& fresh) {
-    return {{"OldContainerUUID", uuidData(old.uuid)}, {"OldContainerClass", old.cls}, {"OldContainerUserID", old.user},
-            {"OldIdentifier", old.identifier}, {"NewContainerUUID", uuidData(fresh.uuid)},
-            {"NewContainerClass", fresh.cls}, {"NewContainerUserID", fresh.user}, {"NewIdentifier", fresh.identifier}};
+    return {{"OldContainerUUID", uuidData(old.uuid)},   {"OldContainerClass", old.cls},
+            {"OldContainerUserID", old.user},           {"OldIdentifier", old.identifier},
+            {"NewContainerUUID", uuidData(fresh.uuid)}, {"NewContainerClass", fresh.cls},
+            {"NewContainerUserID", fresh.user},         {"NewIdentifier", fresh.identifier}};
   }
   static plist::Dictionary creation(const std::string& identifier, bool transient = false) {
     return with(byName(kUser, 2, identifier), {{"CreateIfNecessary", true}, {"Transient", transient}});
@@ -383,7 +388,9 @@ std::string outsideDir(const T& t) { return t.outside; }
 std::string otherContainer(const T& t) { return t.other.path; }
 // Each command on the app container's selector.
 Requests onApp(std::vector<uint64_t> commands) {
-  return [=](T& t) { for (uint64_t c : commands) t.send(c, selector(t.app)); };
+  return [=](T& t) {
+    for (uint64_t c : commands) t.send(c, selector(t.app));
+  };
 }
 // The command on a container by name, then a death-row pass.
 Requests byNameThenPass(uint64_t command, Container T::*c = &T::app) {
@@ -425,9 +432,11 @@ bool plantContainer(const std::string& dir, const std::string& identifier, uint6
                     const plist::Dictionary& info) {
   std::error_code error;
   std::filesystem::create_directories(dir + "/Library", error);
-  const plist::Data bytes = plist::writeBinary(plist::Dictionary{
-      {"QRTMetadataIdentifier", identifier}, {"QRTMetadataUUID", QRTUUID::random().UUIDString()},
-      {"QRTMetadataContentClass", cls}, {"QRTMetadataPersona", persona}, {"QRTMetadataInfo", info}});
+  const plist::Data bytes = plist::writeBinary(plist::Dictionary{{"QRTMetadataIdentifier", identifier},
+                                                                 {"QRTMetadataUUID", QRTUUID::random().UUIDString()},
+                                                                 {"QRTMetadataContentClass", cls},
+                                                                 {"QRTMetadataPersona", persona},
+                                                                 {"QRTMetadataInfo", info}});
   writeFile(dir + "/" + kMetadataFile, std::string(bytes.begin(), bytes.end()));
   writeFile(dir + "/Library/planted", "the user's");
   return exists(dir + "/Library/planted");
@@ -439,12 +448,15 @@ void reboot(T& t) {
   t.startDaemon();
 }
 std::string newUUIDIn(const std::string& dir) { return dir + "/" + QRTUUID::random().UUIDString(); }
-void expectReply(const T& t, const std::string& reply) { EXPECT_NE(t.trace_.find(reply), std::string::npos) << t.trace_; }
+void expectReply(const T& t, const std::string& reply) {
+  EXPECT_NE(t.trace_.find(reply), std::string::npos) << t.trace_;
+}
 
 const Case kCases[] = {
     // The metadata file.
-    swapped("MetadataLinkToDevicePasswd_SetInfo", appItem(kMetadataFile), [](const T& t) { return t.root + "/etc/passwd"; },
-            [](T& t) { t.send(5, with(selector(t.app), kSet)); }),
+    swapped(
+        "MetadataLinkToDevicePasswd_SetInfo", appItem(kMetadataFile), [](const T& t) { return t.root + "/etc/passwd"; },
+        [](T& t) { t.send(5, with(selector(t.app), kSet)); }),
     {"MetadataHardLinkToOutsideFile_SetInfo",
      [](T& t) {
        ASSERT_EQ(unlink(t.in(t.app, kMetadataFile).c_str()), 0);
@@ -470,15 +482,19 @@ const Case kCases[] = {
        t.restartDaemon();
      },
      [](T& t) {
-       t.sends({{0, byName(t.app)}, {7, selector(t.app)}, {6, with(selector(t.app), {{"Key", "k"}})},
+       t.sends({{0, byName(t.app)},
+                {7, selector(t.app)},
+                {6, with(selector(t.app), {{"Key", "k"}})},
                 {23, selector(t.app)}});
      }},
     // Default sub-directories: recreated and given to the user.
     swapped("DocumentsLinkToOutside_Recreate", appItem("Documents"), outsideDir, onApp({8})),
     swapped("LibraryLinkToOutside_RecreateMissing", appItem("Library"), outsideDir, onApp({22})),
-    swapped("TmpLinkToDeviceEtc_Recreate", appItem("tmp"), [](const T& t) { return t.root + "/etc"; }, onApp({8})),
-    swapped("DocumentsLinkToOtherUsersDocuments_RecreateMissing", appItem("Documents"),
-            [](const T& t) { return t.in(t.other, "Documents"); }, onApp({22})),
+    swapped(
+        "TmpLinkToDeviceEtc_Recreate", appItem("tmp"), [](const T& t) { return t.root + "/etc"; }, onApp({8})),
+    swapped(
+        "DocumentsLinkToOtherUsersDocuments_RecreateMissing", appItem("Documents"),
+        [](const T& t) { return t.in(t.other, "Documents"); }, onApp({22})),
     {"TmpAndCachesHardLinkedToOutsideFiles_Recreate",
      [](T& t) {
        t.plant(
@@ -497,44 +513,56 @@ const Case kCases[] = {
        });
      },
      [](T& t) { t.send(0, T::creation("com.example.new")); }},
-    swapped("ContainersLinkToOutside_Create", [](const T& t) { return t.containers(); }, outsideDir,
-            [](T& t) {
-              t.sends({{0, T::creation("com.example.new")},
-                       {0, with(T::creation("com.example.new"), {{"ContainerClass", 6}})}});
-            }),
-    swapped("HomeLibraryLinkToOutside_CreateTransient", [](const T& t) { return t.home() + "/Library"; }, outsideDir,
-            [](T& t) { t.send(0, T::creation("com.example.new", true)); }),
-    swapped("HomeLibraryLinkToDaemonLibrary_CreateTransient", [](const T& t) { return t.home() + "/Library"; },
-            [](const T& t) { return t.root + "/private/var/root/Library"; },
-            [](T& t) { t.send(0, T::creation("com.example.new", true)); }),
+    swapped(
+        "ContainersLinkToOutside_Create", [](const T& t) { return t.containers(); }, outsideDir,
+        [](T& t) {
+          t.sends({{0, T::creation("com.example.new")},
+                   {0, with(T::creation("com.example.new"), {{"ContainerClass", 6}})}});
+        }),
+    swapped(
+        "HomeLibraryLinkToOutside_CreateTransient", [](const T& t) { return t.home() + "/Library"; }, outsideDir,
+        [](T& t) { t.send(0, T::creation("com.example.new", true)); }),
+    swapped(
+        "HomeLibraryLinkToDaemonLibrary_CreateTransient", [](const T& t) { return t.home() + "/Library"; },
+        [](const T& t) { return t.root + "/private/var/root/Library"; },
+        [](T& t) { t.send(0, T::creation("com.example.new", true)); }),
     // The container directory itself.
     swapped("ContainerLinkToOutside_StageAndPass", appPath, outsideDir,
-            [](T& t) { t.sends({{3, T::stage(t.app)}, {4, {}}}); }),
+            [](T& t) {
+              t.sends({{3, T::stage(t.app)}, {4, {}}});
+            }),
     swapped("ContainerLinkToOtherUsersContainer_DeleteAndPass", appPath, otherContainer, byNameThenPass(10)),
     swapped("ContainerLinkToOtherUsersContainer_RegenerateUUID", appPath, otherContainer, onApp({9, 8})),
     swapped("ContainerLinkToOtherUsersContainer_DiskUsage", appPath, otherContainer, onApp({23})),
     swapped("ContainerLinkToOtherUsersContainer_Wipe", appPath, otherContainer, byNameThenPass(12)),
-    swapped("AddonContainerLinkToOtherUsersContainer_WipeAddon", [](const T& t) { return t.addon.path; },
-            otherContainer, byNameThenPass(11, &T::addon)),
+    swapped(
+        "AddonContainerLinkToOtherUsersContainer_WipeAddon", [](const T& t) { return t.addon.path; }, otherContainer,
+        byNameThenPass(11, &T::addon)),
     {"OldContainerLinkToOtherUsersContainer_Replace",
      [](T& t) {
        freshApp(t);
        t.plant([&] { return swapForLink(t.app.path, t.other.path); });
      },
-     [](T& t) { t.sends({{2, T::replace(t.app, t.fresh)}, {4, {}}}); }},
+     [](T& t) {
+       t.sends({{2, T::replace(t.app, t.fresh)}, {4, {}}});
+     }},
     {"NewContainerLinkToOtherUsersContainer_Replace",
      [](T& t) {
        freshApp(t);
        t.plant([&] { return swapForLink(t.fresh.path, t.other.path); });
      },
-     [](T& t) { t.sends({{2, T::replace(t.app, t.fresh)}, {8, selector(t.app)}, {4, {}}}); }},
+     [](T& t) {
+       t.sends({{2, T::replace(t.app, t.fresh)}, {8, selector(t.app)}, {4, {}}});
+     }},
     // Hard links to files outside, inside a container that is then worked on.
     {"HardLinksInContainer_DeleteAndPass", hardLinks, byNameThenPass(10)},
     {"HardLinksInContainer_WipeAndPass", hardLinks, byNameThenPass(12)},
     {"HardLinksInContainer_UsageRegenerateRecreate", hardLinks, onApp({23, 9, 22})},
     {"FifoInContainer_UsageAndDelete",
      [](T& t) { t.plant([&] { return mkfifo(t.in(t.app, "Documents/pipe").c_str(), 0644) == 0; }); },
-     [](T& t) { t.sends({{23, selector(t.app)}, {10, byName(t.app)}, {4, {}}}); }},
+     [](T& t) {
+       t.sends({{23, selector(t.app)}, {10, byName(t.app)}, {4, {}}});
+     }},
     // Swaps while requests run.
     // A link to a decoy that passes for the container (it has the metadata
     // file), with links to targets where the default directories belong.
@@ -564,7 +592,9 @@ const Case kCases[] = {
        }
        ASSERT_EQ(system(("chown -R 501:501 " + t.in(t.app, "Documents")).c_str()), 0);
      },
-     [](T& t) { t.sends({{3, T::stage(t.app)}, {4, {}}}); },
+     [](T& t) {
+       t.sends({{3, T::stage(t.app)}, {4, {}}});
+     },
      // The staged container stays the user's, and reachable, inside the death-row directory.
      [](const T& t) {
        static int i = 0;
@@ -618,8 +648,10 @@ const Case kCases[] = {
     {"ServiceAccountActsForOthers_TransientAndRootsHome",
      [](T& t) { std::ofstream(t.root + "/etc/passwd", std::ios::app) << "svc:x:120:120::/:/bin/false\n", freshApp(t); },
      [](T& t) {
-       EXPECT_EQ(t.sendsAs(120, 38, {{0, T::creation("com.example.app", true)},
-                                     {0, with(T::creation("com.example.app"), {{"UserID", 0}})}}), 0);
+       EXPECT_EQ(t.sendsAs(120, 38,
+                           {{0, T::creation("com.example.app", true)},
+                            {0, with(T::creation("com.example.app"), {{"UserID", 0}})}}),
+                 0);
        EXPECT_TRUE(exists(t.fresh.path)) << "the user's transient container was sent to death row";
      }},
     {"GlobalClassesWithoutEntitlement_CreateAndTransient",
@@ -628,28 +660,36 @@ const Case kCases[] = {
        writeFile(t.fresh.path + "/payload", "the installer's");
      },
      [](T& t) {
-       const plist::Dictionary create{{"CreateIfNecessary", true}}, transient{{"CreateIfNecessary", true}, {"Transient", true}};
-       EXPECT_EQ(t.sendsAs(kUser, 55, {{0, with(byName(33, 1, "com.example.bundle"), transient)},
-                                       {0, with(byName(33, 3, "com.victim.app"), create)},
-                                       {0, with(byName(499, 13, "systemgroup.com.victim"), create)}}), 0);
+       const plist::Dictionary create{{"CreateIfNecessary", true}},
+           transient{{"CreateIfNecessary", true}, {"Transient", true}};
+       EXPECT_EQ(t.sendsAs(kUser, 55,
+                           {{0, with(byName(33, 1, "com.example.bundle"), transient)},
+                            {0, with(byName(33, 3, "com.victim.app"), create)},
+                            {0, with(byName(499, 13, "systemgroup.com.victim"), create)}}),
+                 0);
        EXPECT_EQ(readFile(t.fresh.path + "/payload"), "the installer's");
        EXPECT_NE(t.createOrLookup(33, "com.victim.app", 3, false).error, 1u) << "a bundle container was made";
-       EXPECT_NE(t.createOrLookup(499, "systemgroup.com.victim", 13, false).error, 1u) << "a system group container was made";
+       EXPECT_NE(t.createOrLookup(499, "systemgroup.com.victim", 13, false).error, 1u)
+           << "a system group container was made";
      }},
     {"RefusalsFlushingTheLog_800In200ms", [](T&) {},
      [](T& t) {
        t.sendsAs(kUser, 55, {{10, byName(t.other)}});
        const std::string evidence = "from pid " + std::to_string(t.lastPid) + " ";
        // Entitlement refusals and a handler's own refusal (a system container not entitled).
-       EXPECT_EQ(t.sendsAs(kUser, 55, {{17, {{"GroupIdentifier", "systemgroup.com.victim"}}},
-                                       {0, byName(499, 12, "com.example.sysd")}}, 400), 0);
+       EXPECT_EQ(
+           t.sendsAs(kUser, 55,
+                     {{17, {{"GroupIdentifier", "systemgroup.com.victim"}}}, {0, byName(499, 12, "com.example.sysd")}},
+                     400),
+           0);
        std::this_thread::sleep_for(std::chrono::milliseconds(1500));
        const std::string log = t.root + "/private/var/root/Library/Logs/QuarterKit/quarterd.log";
        const std::string text = readFile(log + ".0") + readFile(log);
        EXPECT_NE(text.find(evidence), std::string::npos) << "the refusal is gone";
        EXPECT_NE(text.find("Left out refusal lines over 20 a second: uid 501 "), std::string::npos) << "no summary";
        size_t lines = 0;
-       for (size_t at = 0; (at = text.find("not entitled for system container", at)) != std::string::npos; ++at) ++lines;
+       for (size_t at = 0; (at = text.find("not entitled for system container", at)) != std::string::npos; ++at)
+         ++lines;
        EXPECT_LE(lines, 60u) << "a handler's refusals are not limited";
      }},
     // Trees of the user's taken into global places at start-up.
@@ -692,7 +732,9 @@ const Case kCases[] = {
        t.restartDaemon();
      },
      [](T& t) { t.send(24); }, nullptr,
-     [](T& t) { EXPECT_EQ(t.logText().find("Migrating app group entitlements for com.victim.sysd"), std::string::npos); }},
+     [](T& t) {
+       EXPECT_EQ(t.logText().find("Migrating app group entitlements for com.victim.sysd"), std::string::npos);
+     }},
     // Metadata that expands far past what a request could write (one string, shared 88 times).
     {"PlantedLargeMetadata_Lookup",
      [](T& t) {
@@ -706,9 +748,11 @@ const Case kCases[] = {
      },
      [](T& t) { t.send(0, byName(kUser, 2, "com.example.big")); }, nullptr, [](T& t) { expectReply(t, "0:21"); }},
     // Bounds on what one user holds.
-    {"MassCreation_BoundPerClass",
-     [](T& t) { writeFile(t.root + "/run/quarterd.maxcontainers", "3"); },
-     [](T& t) { for (int i = 0; i < 4; ++i) t.send(0, T::creation("com.example.mass" + std::to_string(i))); }, nullptr,
+    {"MassCreation_BoundPerClass", [](T& t) { writeFile(t.root + "/run/quarterd.maxcontainers", "3"); },
+     [](T& t) {
+       for (int i = 0; i < 4; ++i) t.send(0, T::creation("com.example.mass" + std::to_string(i)));
+     },
+     nullptr,
      [](T& t) {
        EXPECT_EQ(listDirectory(t.containers() + "/Data/Application").size(), 3u) << t.trace_;
        expectReply(t, "0:38");

@@ -40,7 +40,8 @@ int main(int argc, char** argv) {
   for (; i + 1 < argc && strcmp(argv[i], "--") != 0; i += 2)
     if (strcmp(argv[i], "--filter") == 0) group = argv[i + 1];
   scmp_filter_ctx filter = seccomp_init(group ? SCMP_ACT_KILL_PROCESS : SCMP_ACT_ALLOW);
-  if (!filter || i >= argc - 1) return fprintf(stderr, "usage: seccomp_run (--filter @G | --deny NAME)... -- CMD...\n"), 2;
+  if (!filter || i >= argc - 1)
+    return fprintf(stderr, "usage: seccomp_run (--filter @G | --deny NAME)... -- CMD...\n"), 2;
   // Always allowed by the service manager, whatever the list.
   const char* implicit[] = {"execve", "exit", "exit_group", "getrlimit", "rt_sigreturn", "sigreturn", "setrlimit"};
   for (size_t k = 0; group && k < sizeof implicit / sizeof *implicit; ++k)

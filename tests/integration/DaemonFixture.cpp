@@ -132,8 +132,10 @@ bool DaemonFixture::mountHomeOnTmpfs() {
   stopDaemon();
   const bool mounted = rename(home.c_str(), disk.c_str()) == 0 && mkdir(home.c_str(), 0755) == 0 &&
                        mount("quarterd-test", home.c_str(), "tmpfs", 0, "size=96m") == 0;
-  if (mounted) mountedHome = home;
-  else rmdir(home.c_str());
+  if (mounted)
+    mountedHome = home;
+  else
+    rmdir(home.c_str());
   EXPECT_EQ(system(("cp -a " + disk + "/. " + home + (mounted ? "" : " && rm -rf " + disk)).c_str()), 0);
   startDaemon();
   return mounted;
@@ -197,8 +199,11 @@ std::optional<plist::Dictionary> DaemonFixture::call(uint64_t command, plist::Di
 
 Container DaemonFixture::createOrLookup(uint64_t user, const std::string& identifier, uint64_t cls, bool create,
                                         bool transient, uint64_t command) {
-  auto reply = call(command, {{"UserID", user}, {"ContainerClass", cls}, {"Identifier", identifier},
-                              {"CreateIfNecessary", create}, {"Transient", transient}});
+  auto reply = call(command, {{"UserID", user},
+                              {"ContainerClass", cls},
+                              {"Identifier", identifier},
+                              {"CreateIfNecessary", create},
+                              {"Transient", transient}});
   Container c;
   c.user = user;
   c.cls = cls;

@@ -31,7 +31,8 @@ class CodesignTest : public DaemonFixture {
   void beInstaller() { setOwnIdentity("com.example.installer", {{kAllowed, true}}); }
 
   uint64_t registerProgram(const std::string& id, plist::Dictionary entitlements, plist::Dictionary options = {}) {
-    return codeOf(call(18, {{"Identifier", id}, {"CodeSigningInfo", info(std::move(entitlements))},
+    return codeOf(call(18, {{"Identifier", id},
+                            {"CodeSigningInfo", info(std::move(entitlements))},
                             {"OptionsDictionary", std::move(options)}}));
   }
   uint64_t unregister(const std::string& id) { return codeOf(call(18, {{"Identifier", id}})); }
@@ -101,8 +102,9 @@ TEST_F(CodesignTest, SystemGroupRefusalsAndOwnEntitlements) {
   EXPECT_TRUE(exists(own["group.self"]));
   EXPECT_EQ(codeOf(call(17, {{"GroupIdentifier", "systemgroup.com.norvane.sharedpclogging"}})), 55u);
   EXPECT_EQ(codeOf(call(17, {{"GroupIdentifier", "systemgroup.com.example.notmine"}})), 55u);
-  EXPECT_TRUE(logContains("com.example.self is not entitled for system group identifier: "
-                          "systemgroup.com.example.notmine."));
+  EXPECT_TRUE(
+      logContains("com.example.self is not entitled for system group identifier: "
+                  "systemgroup.com.example.notmine."));
   EXPECT_EQ(logText().find("sharedpclogging"), std::string::npos);
 }
 
@@ -117,7 +119,8 @@ TEST_F(CodesignTest, WithdrawnSystemContainerEntitlementTakesTheContainer) {
   ASSERT_EQ(registerProgram("com.example.sys", {{kSystemContainer, false}}), 1u);
   EXPECT_FALSE(exists(path));
   EXPECT_EQ(lookup(499, "com.example.sys", 12), 21u);
-  EXPECT_TRUE(logContains("Deleting system container for ID: com.example.sys because it is no longer in the entitlements"));
+  EXPECT_TRUE(
+      logContains("Deleting system container for ID: com.example.sys because it is no longer in the entitlements"));
   setOwnIdentity("com.example.sys", {{kSystemContainer, true}});
   EXPECT_EQ(codeOf(call(15, {})), 55u);
 }
@@ -182,31 +185,38 @@ TEST_F(CodesignTest, DatabaseIsTheDaemonsAlone) {
 
 TEST_F(CodesignTest, HostileRegistrationsAreRefusedOrIgnored) {
   ASSERT_EQ(registerProgram("com.example.kept", {{kAppGroups, "group.kept"}}), 1u);
-  struct Case { const char* what; plist::Dictionary keys; uint64_t code; const char* log; };
+  struct Case {
+    const char* what;
+    plist::Dictionary keys;
+    uint64_t code;
+    const char* log;
+  };
   const std::vector<Case> cases = {
       {"info a string", {{"Identifier", "com.example.kept"}, {"CodeSigningInfo", "x"}}, 38, nullptr},
       {"options an array",
        {{"Identifier", "com.example.kept"}, {"CodeSigningInfo", info({})}, {"OptionsDictionary", strings({"a"})}},
-       38, nullptr},
+       38,
+       nullptr},
       {"no identifier", {{"CodeSigningInfo", info({})}}, 18, nullptr},
       {"options of the wrong types",
-       {{"Identifier", "com.example.typed"}, {"CodeSigningInfo", info({})},
+       {{"Identifier", "com.example.typed"},
+        {"CodeSigningInfo", info({})},
         {"OptionsDictionary", plist::Dictionary{{"com.norvane.QuarterKit.DataContainerClass", "2"},
                                                 {"RegByCaller", "yes"},
                                                 {"com.norvane.QuarterKit.ParentBundleID", 7}}}},
-       1, nullptr},
+       1,
+       nullptr},
       {"non-string groups",
        {{"Identifier", "com.example.nonstring"},
         {"CodeSigningInfo", info({{kAppGroups, plist::Array{plist::Value("group.a"), plist::Value(3)}}})}},
-       1, "Entitlement com.norvane.security.application-groups for com.example.nonstring contains non-string values; "
-          "ignoring."},
+       1,
+       "Entitlement com.norvane.security.application-groups for com.example.nonstring contains non-string values; "
+       "ignoring."},
       {"control characters", {{"Identifier", "com.example.\x01\n\x7f"}, {"CodeSigningInfo", info({})}}, 11, nullptr},
   };
   for (const Case& c : cases) {
     EXPECT_EQ(codeOf(call(18, c.keys)), c.code) << c.what;
-    if (c.log) {
-      EXPECT_TRUE(logContains(c.log)) << c.what;
-    }
+    if (c.log) { EXPECT_TRUE(logContains(c.log)) << c.what; }
   }
   // Nothing refused touched the stored entry or its group.
   EXPECT_TRUE(registered("com.example.kept"));
@@ -226,9 +236,11 @@ TEST_F(CodesignTest, TenThousandChildBundlesHitTheLimitAndGoWithTheirParent) {
   for (int base = 0; base < 10000; base += 50) {
     std::vector<std::future<std::optional<plist::Dictionary>>> replies;
     for (int i = base; i < base + 50; ++i) {
-      replies.push_back(connection->send(request(
-          18, {{"Identifier", "com.example.child." + std::to_string(i)}, {"CodeSigningInfo", info({})},
-               {"OptionsDictionary", plist::Dictionary{{"com.norvane.QuarterKit.ParentBundleID", "com.example.parent"}}}})));
+      replies.push_back(connection->send(
+          request(18, {{"Identifier", "com.example.child." + std::to_string(i)},
+                       {"CodeSigningInfo", info({})},
+                       {"OptionsDictionary",
+                        plist::Dictionary{{"com.norvane.QuarterKit.ParentBundleID", "com.example.parent"}}}})));
     }
     for (size_t i = 0; i < replies.size(); ++i) {
       uint64_t code = codeOf(replies[i].get());

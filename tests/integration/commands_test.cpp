@@ -55,7 +55,12 @@ Listing listed(const std::optional<plist::Dictionary>& reply) {
   return pairs;
 }
 
-struct CodeCase { const char* what; uint64_t command; plist::Dictionary keys; uint64_t expected; };
+struct CodeCase {
+  const char* what;
+  uint64_t command;
+  plist::Dictionary keys;
+  uint64_t expected;
+};
 
 class CommandTest : public DaemonFixture {
  protected:
@@ -105,7 +110,10 @@ TEST_F(CommandTest, InfoValuesAndMetadataSurviveARestart) {
   const plist::Dictionary infoRequest = with(selector(app), {{"InfoDictRequested", true}});
   EXPECT_FALSE(at(call(7, infoRequest), "ReplyInfoDictionary")) << "no info yet";
   const plist::Dictionary values{
-      {"text", "hello"}, {"number", -7}, {"big", uint64_t{1} << 40}, {"bytes", plist::Data{0, 1, 2, 255}},
+      {"text", "hello"},
+      {"number", -7},
+      {"big", uint64_t{1} << 40},
+      {"bytes", plist::Data{0, 1, 2, 255}},
       {"nested", plist::Dictionary{{"list", plist::Array{"x", true, 3}}, {"inner", plist::Dictionary{{"k", "v"}}}}}};
   for (const auto& [key, value] : values)
     ASSERT_EQ(codeOf(call(5, with(selector(app), {{"Key", key}, {"Value", value}}))), 1u) << key;
@@ -238,8 +246,10 @@ TEST_F(CommandTest, StageForDeleteTakesParallelArrays) {
   Container c = make(501, "com.example.c", 2), d = make(501, "com.example.d", 2);
   auto cIsLive = [&] { return createOrLookup(501, "com.example.c", 2, false).error == 1u; };
   auto entries = [](plist::Array classes, plist::Array users, plist::Array uuids, plist::Array identifiers) {
-    return plist::Dictionary{{"ContainerClassesArray", classes}, {"UserIDsArray", users},
-                             {"UUIDsArray", uuids}, {"IdentifiersArray", identifiers}};
+    return plist::Dictionary{{"ContainerClassesArray", classes},
+                             {"UserIDsArray", users},
+                             {"UUIDsArray", uuids},
+                             {"IdentifiersArray", identifiers}};
   };
 
   // Valid entries around invalid ones: a class out of range, a non-string
@@ -274,9 +284,10 @@ TEST_F(CommandTest, StageForDeleteTakesParallelArrays) {
 TEST_F(CommandTest, DeathRowMovesWhatItCannotRemoveToTmp) {
   settleDeathRow();
   const std::string dead = deadDirectory();
-  ASSERT_EQ(system(("mkdir -p " + root + "/tmp " + dead + "/temp.ABC123/gone " + dead + "/stuck/locked " + dead +
-                     "/.hidden").c_str()),
-            0);
+  ASSERT_EQ(
+      system(("mkdir -p " + root + "/tmp " + dead + "/temp.ABC123/gone " + dead + "/stuck/locked " + dead + "/.hidden")
+                 .c_str()),
+      0);
   writeFile(dead + "/temp.ABC123/gone/file", "x");
   writeFile(dead + "/stuck/locked/file", "x");
   writeFile(dead + "/stuck/loose", "x");

@@ -74,8 +74,10 @@ TEST_F(ConcurrencyTest, ReadsSeeWholeMetadataWhileItChangesAndOneCreatorMakesEac
     int64_t seen = 0;
     auto check = [&](const std::optional<plist::Value>& value) {
       if (!value) return;
-      if (!value->isInteger() || value->integer().asSigned() < seen || value->integer().asSigned() > kSets) ++badReads;
-      else seen = value->integer().asSigned();
+      if (!value->isInteger() || value->integer().asSigned() < seen || value->integer().asSigned() > kSets)
+        ++badReads;
+      else
+        seen = value->integer().asSigned();
     };
     while (!setterDone) {
       auto got = call(6, with(selector(app), {{"Key", "counter"}}));
@@ -140,7 +142,9 @@ TEST_F(ConcurrencyTest, TransientRecreationDeletionAndPassesLoseNoContainer) {
       auto ids = at(reply, "ReplyIdsArray"), uuids = at(reply, "ReplyUUIDsArray");
       if (!ids || !uuids || !ids->isArray() || !uuids->isArray()) continue;
       plist::Array classes(ids->array().size(), plist::Value(2u)), users(ids->array().size(), plist::Value(501u));
-      call(3, {{"ContainerClassesArray", classes}, {"UserIDsArray", users}, {"UUIDsArray", uuids->array()},
+      call(3, {{"ContainerClassesArray", classes},
+               {"UserIDsArray", users},
+               {"UUIDsArray", uuids->array()},
                {"IdentifiersArray", ids->array()}});
     }
   };

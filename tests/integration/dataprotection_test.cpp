@@ -133,8 +133,12 @@ class DataProtectionTest : public DaemonFixture {
   }
 
   static plist::Dictionary protect(const std::string& id, int64_t cls, bool retry, bool thirdParty = false) {
-    return {{"UserID", 501},       {"ContainerClass", 2},          {"Identifier", id},
-            {"DataProtectionClass", cls}, {"IsThirdParty", thirdParty}, {"RetryIfLocked", retry}};
+    return {{"UserID", 501},
+            {"ContainerClass", 2},
+            {"Identifier", id},
+            {"DataProtectionClass", cls},
+            {"IsThirdParty", thirdParty},
+            {"RetryIfLocked", retry}};
   }
 
   // The user data items of c by class.
@@ -156,7 +160,8 @@ class DataProtectionTest : public DaemonFixture {
   }
 
   static std::string retrying(const std::string& id, int32_t cls) {
-    return "Retrying container protection update to " + std::to_string(cls) + " on next unlock for user: 501, id: " + id;
+    return "Retrying container protection update to " + std::to_string(cls) +
+           " on next unlock for user: 501, id: " + id;
   }
 
   size_t occurrences(const std::string& text) const {
@@ -243,8 +248,8 @@ TEST_F(DataProtectionTest, LockedDeviceHoldsOrRefusesTheChange) {
     SCOPED_TRACE(test.what);
     const std::string id = std::string("com.example.locked") + std::to_string(&test - cases);
     Container c = makeApp(id, 20, test.from);
-    ASSERT_EQ(codeOf(call(5, with(selector(c), {{"Key", "com.norvane.Emplacer.ContentProtectionClass"},
-                                                 {"Value", test.from}}))),
+    ASSERT_EQ(codeOf(call(5, with(selector(c),
+                                  {{"Key", "com.norvane.Emplacer.ContentProtectionClass"}, {"Value", test.from}}))),
               1u);
     setLocked(true);
     auto reply = protectLater(protect(id, test.to, test.retry));
@@ -272,7 +277,8 @@ TEST_F(DataProtectionTest, KilledChangeIsCompletedAtStart) {
   fs::create_directories(pendingDir());
   writeFile(pendingDir() + "/com.example.garbage-2-501.plist", "garbage");
   const std::vector<std::string> garbageOnly{"com.example.garbage-2-501.plist"};
-  for (const char* point : {"protection-after-pending-write", "protection-mid-walk", "protection-before-pending-delete"}) {
+  for (const char* point :
+       {"protection-after-pending-write", "protection-mid-walk", "protection-before-pending-delete"}) {
     SCOPED_TRACE(point);
     const std::string id = std::string("com.example.") + point;
     Container c = makeApp(id, 40);

@@ -48,10 +48,10 @@ TEST_F(DispatcherTest, MessageWithoutCommandIsCommandZero) {
 }
 
 TEST_F(DispatcherTest, NamedEntitlementsOpenTheirOwnRowsOnly) {
-  setOwnIdentity("com.example.migrator", {{"com.norvane.private.QuarterKit.dataMigration", true},
-                                          {"com.norvane.private.QuarterKit.userManagedAssets", false},
-                                          {"com.norvane.private.QuarterKit.wipeContainer",
-                                           plist::Array{"com.example.addon"}}});
+  setOwnIdentity("com.example.migrator",
+                 {{"com.norvane.private.QuarterKit.dataMigration", true},
+                  {"com.norvane.private.QuarterKit.userManagedAssets", false},
+                  {"com.norvane.private.QuarterKit.wipeContainer", plist::Array{"com.example.addon"}}});
   for (uint64_t command : {24, 11}) EXPECT_NE(replyError(request(command)), kNotEntitled) << command;
   for (uint64_t command : {28, 1}) EXPECT_EQ(replyError(request(command)), kNotEntitled) << command;
 

@@ -63,7 +63,8 @@ class ExecTest : public DaemonFixture {
     EXPECT_TRUE(pty >= 0 && grantpt(pty) == 0 && unlockpt(pty) == 0);
     pid_t child = fork();
     if (child == 0) {
-      int o = open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0666), e = open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0666);
+      int o = open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0666),
+          e = open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0666);
       int i = open(input.c_str(), O_RDONLY);
       if (o < 0 || e < 0 || i < 0 || dup2(o, 1) < 0 || dup2(e, 2) < 0 || dup2(i, 0) < 0 || dup2(i, 99) < 0) _exit(120);
       if (setsid() < 0 || open(ptsname(pty), O_RDWR | O_CLOEXEC) < 0) _exit(123);
@@ -104,12 +105,14 @@ TEST_F(ExecTest, ProgramReachesItsContainersAndNothingElse) {
   const std::string database = root + "/private/var/root/Library/QuarterKit/containers.sqlite3";
   const std::string metadata = std::string("/") + kMetadataFile;
 
-  struct Case { std::string access, expected; } cases[] = {
+  struct Case {
+    std::string access, expected;
+  } cases[] = {
       {"w:" + data + "/Documents/note", "ok"},
       {"w:" + data + "/tmp/scratch", "ok"},
       {"w:" + group + "/Library/note", "ok"},
-      {"w:" + data + metadata, "EACCES"},          // the daemon's file inside the program's own container
-      {"w:" + data + "/.dotfile", "ok"},  // made at the top, where nothing may be removed
+      {"w:" + data + metadata, "EACCES"},  // the daemon's file inside the program's own container
+      {"w:" + data + "/.dotfile", "ok"},   // made at the top, where nothing may be removed
       {"u:" + data + metadata, "EACCES"},
       {"w:" + otherProgram.path + "/Documents/x", "EACCES"},  // same user: only Landlock stands in the way
       {"r:" + otherProgram.path + metadata, "EACCES"},
@@ -138,7 +141,8 @@ TEST_F(ExecTest, ProgramReachesItsContainersAndNothingElse) {
     args.push_back(c.access);
     expected += c.expected + "\n";
   }
-  args.insert(args.end(), {entitled, "--root", root, "create", "--class", "2", "--user", "502", "--identifier", "stolen"});
+  args.insert(args.end(),
+              {entitled, "--root", root, "create", "--class", "2", "--user", "502", "--identifier", "stolen"});
   Launched run = launch(args, 0, {}, QRT_EXEC_PRELOAD_PATH);
   ASSERT_EQ(run.status, 0) << run.err;
   EXPECT_EQ(run.out, expected);
@@ -163,15 +167,38 @@ TEST_F(ExecTest, RefusesWithClearMessages) {
     std::vector<std::string> command;
   } cases[] = {
       {with({}), 501, 1, "must be run as root", "", {}},
-      {{"--root", root, "--user", "501", "--identifier", "com.example.nobody", "--", probe}, 0, 1,
-       "unknown identifier com.example.nobody: " + probe + " is registered as com.example.a", "", {}},
-      {{"--root", root, "--user", "501", "--identifier", "com.example.a", "--", "/bin/true"}, 0, 1,
-       "unknown identifier com.example.a: /usr/bin/true has no identity", "", {}},
-      {{"--root", root, "--user", "777", "--identifier", "com.example.a", "--", probe}, 0, 1, "no account for user 777", "", {}},
-      {{"--root", root, "--user", "0", "--identifier", "com.example.a", "--", probe}, 0, 2, "--user 0: root cannot be", "", {}},
+      {{"--root", root, "--user", "501", "--identifier", "com.example.nobody", "--", probe},
+       0,
+       1,
+       "unknown identifier com.example.nobody: " + probe + " is registered as com.example.a",
+       "",
+       {}},
+      {{"--root", root, "--user", "501", "--identifier", "com.example.a", "--", "/bin/true"},
+       0,
+       1,
+       "unknown identifier com.example.a: /usr/bin/true has no identity",
+       "",
+       {}},
+      {{"--root", root, "--user", "777", "--identifier", "com.example.a", "--", probe},
+       0,
+       1,
+       "no account for user 777",
+       "",
+       {}},
+      {{"--root", root, "--user", "0", "--identifier", "com.example.a", "--", probe},
+       0,
+       2,
+       "--user 0: root cannot be",
+       "",
+       {}},
       {{"--root", root, "--identifier", "com.example.a", "--", probe}, 0, 2, "--user is required", "", {}},
       {{"--root", root, "--user", "501", "--identifier", "com.example.a"}, 0, 2, "no program given", "", {}},
-      {{"--root", root, "--user", "501", "--identifier", "com.example.a", "--", "/no/such"}, 0, 127, "cannot find", "", {}},
+      {{"--root", root, "--user", "501", "--identifier", "com.example.a", "--", "/no/such"},
+       0,
+       127,
+       "cannot find",
+       "",
+       {}},
       {with({}), 0, 1, "the kernel offers no Landlock", "", noLandlock},
       {with({"--allow-unconfined"}), 0, 0, "warning: " + probe + " runs without any confinement", "", noLandlock},
       {with({}, {"n:1"}), 0, 0, "", "ECONNREFUSED\n", {}},

@@ -108,9 +108,14 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
   writeFile(dir + "/etc/passwd", readFile("/etc/passwd") +
                                      "quarterd-installer:x:990:990::/var/lib/quarterd/installer:/usr/sbin/nologin\n"
                                      "quarterd-system:x:991:991::/nonexistent:/usr/sbin/nologin\n"
-                                     "alice:x:1500:1500::" + dir + "/home/alice:/bin/sh\n"
-                                     "bob:x:1501:1501::" + dir + "/home/bob:/bin/sh\n"
-                                     "carol:x:1502:1502::" + dir + "/home/carol:/bin/sh\n");
+                                     "alice:x:1500:1500::" +
+                                     dir +
+                                     "/home/alice:/bin/sh\n"
+                                     "bob:x:1501:1501::" +
+                                     dir +
+                                     "/home/bob:/bin/sh\n"
+                                     "carol:x:1502:1502::" +
+                                     dir + "/home/carol:/bin/sh\n");
   writeFile(dir + "/etc/group", readFile("/etc/group") +
                                     "quarterd-installer:x:990:\nquarterd-system:x:991:\nquarterd-systemusers:x:992:\n"
                                     "alice:x:1500:\nbob:x:1501:\n");
@@ -157,9 +162,7 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
     std::string path = stringAt(reply, "ReplyPath").value_or("");
     ASSERT_EQ(path.rfind(row.pathPrefix, 0), 0u) << path;
     const std::string seen = path.starts_with("/var/") ? host.inside(path) : path;
-    if (row.owner != UINT32_MAX) {
-      EXPECT_EQ(ownerAndMode(seen).first, row.owner);
-    }
+    if (row.owner != UINT32_MAX) { EXPECT_EQ(ownerAndMode(seen).first, row.owner); }
     auto metadata = readPlist(seen + "/" + kMetadataFile);
     EXPECT_EQ(u64At(metadata, "QRTMetadataPersona"), row.persona);
   }
@@ -169,8 +172,8 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
   // The home's own .local stays its user's.
   EXPECT_EQ(ownerAndMode(dir + "/home/bob/.local").first, kBob);
   EXPECT_TRUE(listDirectory(dir + "/victim").empty());
-  EXPECT_EQ(system(("getfacl -n " + host.inside(store) + "Data/System/* 2>/dev/null | grep -q '^group:" +
-                    std::to_string(kSystemUsers) + ":'")
+  EXPECT_EQ(system(("getfacl -n " + host.inside(store) +
+                    "Data/System/* 2>/dev/null | grep -q '^group:" + std::to_string(kSystemUsers) + ":'")
                        .c_str()),
             0);
 

@@ -25,7 +25,7 @@ constexpr const char* kPrefix = "org.legacy.";
 // Class directories by path name, global and per-user.
 const char* const kGlobalClassDirs[] = {"Bundle/Application", "Bundle/AddonPlugin", "Bundle/VPNPlugin",
                                         "Bundle/Framework",   "Data/System",        "Shared/SystemGroup"};
-const char* const kUserClassDirs[] = {"Data/Application", "Data/AddonPlugin",   "Data/VPNPlugin", "Shared/AppGroup",
+const char* const kUserClassDirs[] = {"Data/Application",  "Data/AddonPlugin",    "Data/VPNPlugin", "Shared/AppGroup",
                                       "Data/RelayService", "Data/InternalDaemon", "Data/TempDir"};
 
 plist::Array strings(std::initializer_list<const char*> items) { return plist::Array(items.begin(), items.end()); }
@@ -77,8 +77,8 @@ class MigrationTest : public DaemonFixture {
   std::string pathOf(const std::string& identifier) const {
     for (const auto& [file, bytes] : snapshot()) {
       auto metadata = plist::parse(bytes.data(), bytes.size());
-      const plist::Value* id = metadata && metadata->isDictionary()
-                                   ? plist::find(metadata->dictionary(), "QRTMetadataIdentifier") : nullptr;
+      const plist::Value* id =
+          metadata && metadata->isDictionary() ? plist::find(metadata->dictionary(), "QRTMetadataIdentifier") : nullptr;
       if (id && id->isString() && id->string() == identifier) return parentOf(file);
     }
     return "";
@@ -114,25 +114,31 @@ class MigrationTest : public DaemonFixture {
   // The entries of the test's programs, and parent of each child.
   std::map<std::string, Row> rows(std::map<std::string, std::string>* children = nullptr) const {
     std::map<std::string, Row> result;
-    query("SELECT code_signing_id_text, invalid, placeholder, registered_by_caller, data_container_class "
-          "FROM code_signing_info;", "", [&](sqlite3_stmt* s) {
-            if (std::string id = text(s, 0); id.rfind(kPrefix, 0) == 0)
-              result[id] = {sqlite3_column_int64(s, 1), sqlite3_column_int64(s, 2), sqlite3_column_int64(s, 3),
-                            sqlite3_column_int64(s, 4)};
-          });
+    query(
+        "SELECT code_signing_id_text, invalid, placeholder, registered_by_caller, data_container_class "
+        "FROM code_signing_info;",
+        "", [&](sqlite3_stmt* s) {
+          if (std::string id = text(s, 0); id.rfind(kPrefix, 0) == 0)
+            result[id] = {sqlite3_column_int64(s, 1), sqlite3_column_int64(s, 2), sqlite3_column_int64(s, 3),
+                          sqlite3_column_int64(s, 4)};
+        });
     if (children) {
-      query("SELECT child_code_signing_id_text, code_signing_id_text FROM child_bundles JOIN code_signing_info "
-            "ON parent_id = code_signing_info.id;", "", [&](sqlite3_stmt* s) { (*children)[text(s, 0)] = text(s, 1); });
+      query(
+          "SELECT child_code_signing_id_text, code_signing_id_text FROM child_bundles JOIN code_signing_info "
+          "ON parent_id = code_signing_info.id;",
+          "", [&](sqlite3_stmt* s) { (*children)[text(s, 0)] = text(s, 1); });
     }
     return result;
   }
   std::optional<plist::Dictionary> storedInfo(const std::string& identifier) const {
     std::optional<plist::Dictionary> result;
-    query("SELECT data FROM code_signing_data JOIN code_signing_info ON cs_info_id = code_signing_info.id "
-          "WHERE code_signing_id_text = ? LIMIT 1;", identifier, [&](sqlite3_stmt* s) {
-            auto v = plist::parse(sqlite3_column_blob(s, 0), static_cast<size_t>(sqlite3_column_bytes(s, 0)));
-            if (v && v->isDictionary()) result = v->dictionary();
-          });
+    query(
+        "SELECT data FROM code_signing_data JOIN code_signing_info ON cs_info_id = code_signing_info.id "
+        "WHERE code_signing_id_text = ? LIMIT 1;",
+        identifier, [&](sqlite3_stmt* s) {
+          auto v = plist::parse(sqlite3_column_blob(s, 0), static_cast<size_t>(sqlite3_column_bytes(s, 0)));
+          if (v && v->isDictionary()) result = v->dictionary();
+        });
     return result;
   }
 
@@ -153,11 +159,13 @@ class MigrationTest : public DaemonFixture {
                                    {"DataContainerClass", 2}}},
                 {"org.legacy.mapped",
                  plist::Dictionary{{"CodeSigningInfo", plist::Dictionary{{kEntitlementsKey, ents("group.m")}}},
-                                   {"Placeholder", true}, {"DataContainerClass", 4},
+                                   {"Placeholder", true},
+                                   {"DataContainerClass", 4},
                                    {"ChildBundleIds", strings({"org.legacy.mapped.child"})}}},
                 {"org.legacy.broken", plist::Dictionary{{"DataContainerClass", 2}}}});
     writePlist(library() + "/qrt_entitlements.plist",
-               {{"org.legacy.legacy", ents("group.l")}, {"org.legacy.selfreg", ents("group.s")},
+               {{"org.legacy.legacy", ents("group.l")},
+                {"org.legacy.selfreg", ents("group.s")},
                 {"org.legacy.app", ents("group.old")},
                 {"com.norvane.QuarterKit.ChildPluginBundleIDs",
                  plist::Dictionary{{"org.legacy.legacy", strings({"org.legacy.legacy.child"})}}},
@@ -219,19 +227,21 @@ TEST_P(DataMigrationTest, ImportsEveryOlderStoreOnce) {
   std::map<std::string, std::string> children;
   const std::map<std::string, Row> expected{
       {"org.legacy.groups2", {0, 0, 0, 2}},  // from the mapping file; its group key only dropped
-      {"org.legacy.mapped", {0, 1, 0, 4}},   {"org.legacy.groups1", {1, 0, 0, 2}},
-      {"org.legacy.plugin", {1, 0, 0, 4}},   {"org.legacy.legacy", {1, 1, 0, 0}},
+      {"org.legacy.mapped", {0, 1, 0, 4}},
+      {"org.legacy.groups1", {1, 0, 0, 2}},
+      {"org.legacy.plugin", {1, 0, 0, 4}},
+      {"org.legacy.legacy", {1, 1, 0, 0}},
       {"org.legacy.selfreg", {0, 0, 1, 0}},
       {"org.legacy.app", {0, 0, 0, 2}},  // the bundle's valid information replaces the invalid legacy one
-      {"org.legacy.addon", {0, 0, 0, 4}},    {"org.legacy.fw", {0, 0, 0, 0}}};
+      {"org.legacy.addon", {0, 0, 0, 4}},
+      {"org.legacy.fw", {0, 0, 0, 0}}};
   EXPECT_EQ(rows(&children), expected);
   EXPECT_EQ(children, (std::map<std::string, std::string>{{"org.legacy.mapped.child", "org.legacy.mapped"},
                                                           {"org.legacy.legacy.child", "org.legacy.legacy"}}));
   EXPECT_EQ(storedInfo("org.legacy.groups1"),
             (plist::Dictionary{{kEntitlementsKey, plist::Dictionary{{kAppGroups, strings({"group.one"})}}}}));
-  EXPECT_EQ(storedInfo("org.legacy.addon"), (plist::Dictionary{{"Entitlements", ents("addon")},
-                                                               {kEntitlementsKey, ents("addon")},
-                                                               {"Team", "addon"}}));
+  EXPECT_EQ(storedInfo("org.legacy.addon"),
+            (plist::Dictionary{{"Entitlements", ents("addon")}, {kEntitlementsKey, ents("addon")}, {"Team", "addon"}}));
 
   EXPECT_FALSE(exists(library() + "/qrt_code_signing_info.plist"));
   EXPECT_FALSE(exists(library() + "/qrt_entitlements.plist"));
@@ -302,15 +312,17 @@ TEST_P(BuildUpgradeTest, RunsOncePerNewBuild) {
   reboot();
   restartDaemon();
   restartDaemon();
-  EXPECT_TRUE(logContains(
-      "Current build version (24B200 / Internal) equal to last version recorded (24B200 / Internal); skipping upgrade"));
+  EXPECT_TRUE(
+      logContains("Current build version (24B200 / Internal) equal to last version recorded (24B200 / Internal); "
+                  "skipping upgrade"));
   EXPECT_EQ(count("Detected upgrade from"), upgrades);
   EXPECT_EQ(plist::find(*readPlist(statusFile()), "LastBuildInfo")->dictionary().at("BuildVersion"),
             plist::Value("24B200"));
 }
 
 INSTANTIATE_TEST_SUITE_P(CrashPoints, BuildUpgradeTest,
-                         ::testing::Values("", "migrator-build-upgrade-bundles-moved", "startup-build-upgrade-migrated"),
+                         ::testing::Values("", "migrator-build-upgrade-bundles-moved",
+                                           "startup-build-upgrade-migrated"),
                          crashPointName);
 
 // ---- first start after a reboot ----
@@ -329,8 +341,9 @@ TEST_F(MigrationTest, RebootClearsLeftoversAndInstallsBackup) {
   const std::string orphans[] = {appClassDir() + "/not-a-uuid", appClassDir() + "/" + QRTUUID::random().UUIDString(),
                                  sysDir + "/" + QRTUUID::random().UUIDString(), sysDir + "/com.norvane.lazyloadd"};
   const std::string backup = mobile() + "/Library/Backup/SystemContainers";
-  for (const std::string& dir : {caches + "/Staging/left", caches + "/Temp/junk", userTemp + "/junk",
-                                 backup + "/Data/org.legacy.restored/Library", backup + "/Shared/systemgroup.org.legacy.restored"})
+  for (const std::string& dir :
+       {caches + "/Staging/left", caches + "/Temp/junk", userTemp + "/junk",
+        backup + "/Data/org.legacy.restored/Library", backup + "/Shared/systemgroup.org.legacy.restored"})
     ASSERT_TRUE(std::filesystem::create_directories(dir)) << dir;
   for (const std::string& dir : orphans) ASSERT_TRUE(std::filesystem::create_directories(dir)) << dir;
   for (const std::string& dir : orphans) writeFile(dir + "/data", "x");

@@ -17,7 +17,10 @@
 namespace {
 
 // The exit status (-1 when it did not exit normally) and what was printed.
-struct CtlRun { int status = -1; std::string out, err; };
+struct CtlRun {
+  int status = -1;
+  std::string out, err;
+};
 
 bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
 
@@ -36,8 +39,9 @@ std::vector<std::map<std::string, std::string>> rows(const std::string& out) {
   while (std::getline(in, line) && !line.empty()) {
     table.emplace_back();
     for (size_t c = 0; c < columns.size(); ++c) {
-      std::string cell = line.substr(std::min(line.size(), columns[c].second),
-                                     c + 1 < columns.size() ? columns[c + 1].second - columns[c].second : std::string::npos);
+      std::string cell =
+          line.substr(std::min(line.size(), columns[c].second),
+                      c + 1 < columns.size() ? columns[c + 1].second - columns[c].second : std::string::npos);
       table.back()[columns[c].first] = cell.substr(0, cell.find_last_not_of(' ') + 1);
     }
   }
@@ -80,12 +84,14 @@ TEST_F(QuarterctlTest, TablesJsonAndTheContainerFoundWithoutItsUUID) {
   EXPECT_EQ(rows(run("lookup --class 2 --identifier com.example.ctl").out)[0]["EXISTED"], "yes");
   auto listed = rows(run("list --class app-data").out);
   ASSERT_EQ(listed.size(), 1u);
-  EXPECT_EQ(listed[0], (std::map<std::string, std::string>{{"IDENTIFIER", "com.example.ctl"}, {"UUID", uuid}, {"PATH", path}}));
+  EXPECT_EQ(listed[0],
+            (std::map<std::string, std::string>{{"IDENTIFIER", "com.example.ctl"}, {"UUID", uuid}, {"PATH", path}}));
 
   // Info values, with and without --uuid; a hostile key and value stay on their line.
   const std::string one = " --class app-data --identifier com.example.ctl";
   for (const auto& [value, shown] : std::vector<std::pair<std::string, std::string>>{
-           {"'str:deep blue'", "deep blue"}, {"u64:18446744073709551615", "18446744073709551615"},
+           {"'str:deep blue'", "deep blue"},
+           {"u64:18446744073709551615", "18446744073709551615"},
            {"\"$(printf 'str:two\\nlines\\033[2J')\"", "two\\nlines\\x1b[2J"}}) {
     for (const std::string& which : {one, one + " --uuid " + uuid}) {
       EXPECT_EQ(run("info set" + which + " --key \"$(printf 'Col\\nour')\" --value " + value).status, 0) << value;
@@ -101,11 +107,15 @@ TEST_F(QuarterctlTest, TablesJsonAndTheContainerFoundWithoutItsUUID) {
   EXPECT_TRUE(size.ends_with(" KiB") || size == bytes + " B") << bytes << " shown as " << size;
 
   // --json: objects, a list an array of them, no ReplyError; an error object on failure.
-  struct { std::string args, json; } scripts[] = {
-      {"lookup" + one, "{\"existed\":true,\"identifier\":\"com.example.ctl\",\"path\":\"" + path + "\",\"uuid\":\"" + uuid + "\"}"},
+  struct {
+    std::string args, json;
+  } scripts[] = {
+      {"lookup" + one,
+       "{\"existed\":true,\"identifier\":\"com.example.ctl\",\"path\":\"" + path + "\",\"uuid\":\"" + uuid + "\"}"},
       {"list --class 2", "[{\"identifier\":\"com.example.ctl\",\"path\":\"" + path + "\",\"uuid\":\"" + uuid + "\"}]"},
       {"du" + one, "{\"bytes\":" + bytes + ",\"identifier\":\"com.example.ctl\",\"uuid\":\"" + uuid + "\"}"},
-      {"metadata" + one, "{\"identifier\":\"com.example.ctl\",\"path\":\"" + path + "\",\"transient\":false,\"uuid\":\"" + uuid + "\"}"},
+      {"metadata" + one,
+       "{\"identifier\":\"com.example.ctl\",\"path\":\"" + path + "\",\"transient\":false,\"uuid\":\"" + uuid + "\"}"},
       {"delete" + one, "{}"},
       {"delete" + one, "{\"error\":{\"code\":21,\"message\":\"no such container\",\"name\":\"QRTErrorNotFound\"}}"},
   };
@@ -117,11 +127,16 @@ TEST_F(QuarterctlTest, TablesJsonAndTheContainerFoundWithoutItsUUID) {
 TEST_F(QuarterctlTest, ExitStatusTellsDaemonErrorsFromUsageErrors) {
   // The daemon's refusal: exit 1 with the code named on standard error,
   // whichever way the options and the device root are given.
-  struct { std::string command, err; } refusals[] = {
+  struct {
+    std::string command, err;
+  } refusals[] = {
       {ctl + " --root " + root + " delete --class 2 --identifier com.example.none", "error 21 (no such container)"},
-      {ctl + " --root=" + root + " lookup --class=app-data --identifier=com.example.none", "error 21 (no such container)"},
-      {"QUARTERD_ROOT=" + root + " " + ctl + " info get --class 2 --identifier com.example.none --uuid "
-       "00000000-0000-0000-0000-000000000000 --key k", "error 21 (no such container)"},
+      {ctl + " --root=" + root + " lookup --class=app-data --identifier=com.example.none",
+       "error 21 (no such container)"},
+      {"QUARTERD_ROOT=" + root + " " + ctl +
+           " info get --class 2 --identifier com.example.none --uuid "
+           "00000000-0000-0000-0000-000000000000 --key k",
+       "error 21 (no such container)"},
       // The original binary has no identity, so no entitlement.
       {std::string(QRT_QUARTERCTL_PATH) + " --root " + root + " deathrow", "error 55 (not entitled)"},
   };
@@ -134,7 +149,9 @@ TEST_F(QuarterctlTest, ExitStatusTellsDaemonErrorsFromUsageErrors) {
 
   // Usage and connection trouble: exit 2, and nothing reaches the daemon.
   writeFile(root + "/big", "<plist><data>" + std::string(1400000, 'A') + "</data></plist>");
-  struct { std::string args, err; } usage[] = {
+  struct {
+    std::string args, err;
+  } usage[] = {
       {"list", "list needs --class"},
       {"info get --class 2 --identifier a", "info get needs --key"},
       {"create --class 2 --bogus", "unknown argument to create: --bogus"},
@@ -149,7 +166,8 @@ TEST_F(QuarterctlTest, ExitStatusTellsDaemonErrorsFromUsageErrors) {
       {"create --class 2 --identifier \"$(printf 'a\\nb')\"", "--identifier holds a control character: a\\nb"},
       {"info set --class 2 --identifier a --key k --value plist:" + root + "/big", "value larger than the 1 MiB limit"},
       {"--socket /x deathrow", "--root and --socket both name the daemon"},
-      {"--root " + root + "/nowhere deathrow", "is quarterd running on this device root? start it with: quarterd --root"},
+      {"--root " + root + "/nowhere deathrow",
+       "is quarterd running on this device root? start it with: quarterd --root"},
   };
   for (const auto& [args, err] : usage) {
     CtlRun r = run(args);
@@ -182,11 +200,14 @@ TEST_F(QuarterctlTest, StageWipeSystemPathAndAssets) {
 }
 
 TEST_F(QuarterctlTest, CodeSigningAndGroups) {
-  const plist::Data entitlements = plist::writeBinary(plist::Dictionary{
-      {"com.norvane.security.application-groups", plist::Array{"group.one", "group.two"}},
-      {"com.norvane.security.system-groups", "systemgroup.com.example.shared"}});
+  const plist::Data entitlements = plist::writeBinary(
+      plist::Dictionary{{"com.norvane.security.application-groups", plist::Array{"group.one", "group.two"}},
+                        {"com.norvane.security.system-groups", "systemgroup.com.example.shared"}});
   writeFile(root + "/ents.plist", std::string(entitlements.begin(), entitlements.end()));
-  EXPECT_EQ(run("codesign set --identifier com.example.app --entitlements " + root + "/ents.plist --data-class app-data").status, 0);
+  EXPECT_EQ(
+      run("codesign set --identifier com.example.app --entitlements " + root + "/ents.plist --data-class app-data")
+          .status,
+      0);
   EXPECT_TRUE(contains(run("codesign get --identifier com.example.app").out, "group.two"));
   EXPECT_EQ(run("groups ids --identifier com.example.app").out, "GROUP\ngroup.one\ngroup.two\n");
   auto paths = rows(run("groups paths --identifier com.example.app").out);
@@ -195,7 +216,8 @@ TEST_F(QuarterctlTest, CodeSigningAndGroups) {
   EXPECT_TRUE(std::filesystem::is_directory(paths[1]["PATH"]));
   // quarterctl itself is not entitled to the system group.
   EXPECT_EQ(run("system-group-path --group systemgroup.com.example.shared").status, 1);
-  EXPECT_EQ(rows(run("groups paths --system --identifier com.example.app").out)[0]["GROUP"], "systemgroup.com.example.shared");
+  EXPECT_EQ(rows(run("groups paths --system --identifier com.example.app").out)[0]["GROUP"],
+            "systemgroup.com.example.shared");
 
   EXPECT_EQ(run("codesign set --identifier com.example.app --remove").status, 0);
   CtlRun gone = run("codesign get --identifier com.example.app");

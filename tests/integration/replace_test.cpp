@@ -23,8 +23,10 @@ const char* kMarkerFile = "replace-marker";
 std::string markerAt(const std::string& containerPath) { return readFile(containerPath + "/" + kMarkerFile); }
 
 plist::Dictionary replaceKeys(const Container* old, const Container& fresh) {
-  plist::Dictionary keys{{"NewContainerUUID", uuidData(fresh.uuid)}, {"NewContainerClass", 2},
-                         {"NewContainerUserID", 501}, {"NewIdentifier", fresh.identifier}};
+  plist::Dictionary keys{{"NewContainerUUID", uuidData(fresh.uuid)},
+                         {"NewContainerClass", 2},
+                         {"NewContainerUserID", 501},
+                         {"NewIdentifier", fresh.identifier}};
   if (old) {
     keys["OldContainerUUID"] = uuidData(old->uuid);
     keys["OldContainerClass"] = 2;
@@ -146,7 +148,12 @@ TEST_F(ReplaceTest, RefusalsChangeNothing) {
   Container old = make("com.example.keep", false, "keep-old");
   Container fresh = make("com.example.keep", true, "keep-new");
   // Each refusal changes one key of a valid request.
-  struct Refusal { const char* name; const char* key; std::optional<plist::Value> value; uint64_t code; };
+  struct Refusal {
+    const char* name;
+    const char* key;
+    std::optional<plist::Value> value;
+    uint64_t code;
+  };
   const Refusal refusals[] = {
       {"same container", "NewContainerUUID", uuidData(old.uuid), 22},
       {"class mismatch", "NewContainerClass", 4, 23},
@@ -226,8 +233,8 @@ TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
   for (int i = 0; i < 100 && !listDirectory(other + "/.deathrow").empty(); ++i) usleep(20000);
   EXPECT_TRUE(listDirectory(other + "/.deathrow").empty());
   // A creation is whole or absent; a deletion leaves the content on death row only.
-  for (auto [point, command, code] : {std::tuple{"create-after-build", 0, 21u}, {"create-after-move", 0, 1u},
-                                      {"delete-after-stage", 10, 21u}}) {
+  for (auto [point, command, code] :
+       {std::tuple{"create-after-build", 0, 21u}, {"create-after-move", 0, 1u}, {"delete-after-stage", 10, 21u}}) {
     SCOPED_TRACE(point);
     const std::string id = std::string("com.example.") + point;
     if (command == 10) make(id, false, id);
@@ -240,8 +247,8 @@ TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
   }
   // Each point with whether the new content has reached its place by then.
   const std::pair<const char*, bool> points[] = {
-      {"replace-after-journal", false},  {"replace-after-stage", false},     {"replace-after-cache-remove", false},
-      {"replace-after-move-new", true},  {"replace-after-keep-uuid", true}, {"replace-before-cleanup", true},
+      {"replace-after-journal", false}, {"replace-after-stage", false},    {"replace-after-cache-remove", false},
+      {"replace-after-move-new", true}, {"replace-after-keep-uuid", true}, {"replace-before-cleanup", true},
       {"replace-after-cleanup", true},
   };
   for (const auto& [point, newInPlace] : points) {
@@ -278,7 +285,13 @@ TEST_F(ReplaceTest, StartUpRecoveryActsOnlyOnValidJournals) {
   const std::string filled = root + "/filled-destination";
   ASSERT_EQ(mkdir(filled.c_str(), 0755), 0);
   // raw: bytes written instead of the valid journal; key: one of its keys set to `to`, or erased.
-  struct Journal { const char* name; bool movesBack; const char* raw; const char* key; std::optional<plist::Value> to; };
+  struct Journal {
+    const char* name;
+    bool movesBack;
+    const char* raw;
+    const char* key;
+    std::optional<plist::Value> to;
+  };
   const Journal journals[] = {
       {"valid", true, nullptr, nullptr, std::nullopt},
       {"garbage", false, "not a property list", nullptr, std::nullopt},

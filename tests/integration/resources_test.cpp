@@ -95,9 +95,7 @@ int waitFor(pid_t pid, std::chrono::milliseconds timeout) {
 }
 
 // The largest request a frame holds: the dictionary's own bytes plus padding.
-plist::Dictionary largestRequest() {
-  return request(30, {{"Pad", plist::Data(frame::kMaxLength - 8 - 256, 0x5a)}});
-}
+plist::Dictionary largestRequest() { return request(30, {{"Pad", plist::Data(frame::kMaxLength - 8 - 256, 0x5a)}}); }
 
 using ResourcesTest = DaemonFixture;
 
@@ -287,8 +285,10 @@ TEST_F(ResourcesTest, SigtermEndsInTimeWithAClientThatNeverReads) {
   size_t sent = 0;
   for (auto end = Clock::now() + 2s; sent < bytes.size() && Clock::now() < end;) {
     ssize_t n = send(fd, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL);
-    if (n > 0) sent += static_cast<size_t>(n);
-    else std::this_thread::sleep_for(10ms);
+    if (n > 0)
+      sent += static_cast<size_t>(n);
+    else
+      std::this_thread::sleep_for(10ms);
   }
   ASSERT_GT(sent, 0u);
   const auto start = Clock::now();
@@ -304,7 +304,8 @@ TEST_F(ResourcesTest, SigtermEndsInTimeWithAClientThatNeverReads) {
 TEST_F(ResourcesTest, MistypedKeysReadAsMissing) {
   setOwnIdentity("com.example.self", {});
   const plist::Dictionary base{{"UserID", 0}, {"ContainerClass", 2}, {"CreateIfNecessary", true}};
-  const std::tuple<plist::Dictionary, uint64_t, const char*> cases[] = {  // keys, code, identifier answered
+  const std::tuple<plist::Dictionary, uint64_t, const char*> cases[] = {
+      // keys, code, identifier answered
       {with(base, {{"Identifier", 17}}), 1, "com.example.self"},
       {with(base, {{"Identifier", plist::Data{'a', 'b'}}}), 1, "com.example.self"},
       {with(base, {{"Identifier", plist::Array{"com.example.other"}}}), 1, "com.example.self"},

@@ -146,7 +146,9 @@ std::set<std::string> longOptions(std::string text) {
 
 // quarterctl's page has its own test, with its completion.
 TEST(ManPages, AgreeWithHelpOnEveryOption) {
-  struct { std::string binary, page; } tools[] = {
+  struct {
+    std::string binary, page;
+  } tools[] = {
       {QRT_DAEMON_PATH, "quarterd.8"},
       {QRT_EXEC_PATH, "quarter-exec.1"},
   };

@@ -37,7 +37,8 @@ TEST_F(SpecialCommandsTest, UserManagedAssetsStayInsideTheirDirectory) {
   pid_t pid = fork();
   if (pid == 0) {
     if (setresgid(501, 501, 501) != 0 || setresuid(501, 501, 501) != 0) _exit(2);
-    bool ok = mkdir((assets + "/sub").c_str(), 0755) == 0 && symlink(outside.c_str(), (assets + "/out_dir").c_str()) == 0 &&
+    bool ok = mkdir((assets + "/sub").c_str(), 0755) == 0 &&
+              symlink(outside.c_str(), (assets + "/out_dir").c_str()) == 0 &&
               symlink((outside + "/file").c_str(), (assets + "/out_file").c_str()) == 0 &&
               symlink("sub", (assets + "/mid").c_str()) == 0 &&
               symlink("../../../../../../outside", (assets + "/up").c_str()) == 0;
@@ -52,9 +53,8 @@ TEST_F(SpecialCommandsTest, UserManagedAssetsStayInsideTheirDirectory) {
     const char* path;
     uint64_t code;
   };
-  for (Case c : {Case{"../../Library", 10}, Case{"sub/../sub/file", 10}, Case{"out_dir/file", 10},
-                 Case{"out_dir", 10}, Case{"out_file", 10}, Case{"mid/file", 10}, Case{"up", 10},
-                 Case{"/etc/passwd", 10}, Case{"", 10}}) {
+  for (Case c : {Case{"../../Library", 10}, Case{"sub/../sub/file", 10}, Case{"out_dir/file", 10}, Case{"out_dir", 10},
+                 Case{"out_file", 10}, Case{"mid/file", 10}, Case{"up", 10}, Case{"/etc/passwd", 10}, Case{"", 10}}) {
     EXPECT_EQ(codeOf(call(29, {{"Identifier", "com.example.app"}, {"SourcePath", c.path}})), c.code) << c.path;
   }
   EXPECT_EQ(readFile(outside + "/file"), "not yours");
@@ -74,7 +74,8 @@ TEST_F(SpecialCommandsTest, NetworkExtensionOnlyForTheBroker) {
   plist::Dictionary keys{{"Identifier", "com.example.vpn"}, {"ContainerClass", uint64_t{6}}};
   EXPECT_EQ(codeOf(call(27, keys)), 49u);
   EXPECT_TRUE(listDirectory(root + "/private/var/mobile/Containers/Data/VPNPlugin").empty());
-  setOwnIdentity("com.norvane.tunnelbroker", plist::Dictionary{{"com.norvane.private.QuarterKit.networkExtension", true}});
+  setOwnIdentity("com.norvane.tunnelbroker",
+                 plist::Dictionary{{"com.norvane.private.QuarterKit.networkExtension", true}});
   EXPECT_EQ(codeOf(call(27, with(keys, {{"ContainerClass", uint64_t{4}}}))), 11u);
   ASSERT_EQ(codeOf(call(27, with(keys, {{"UserID", uint64_t{0}}}))), 1u);
   Container vpn = createOrLookup(501, "com.example.vpn", 6, false);
@@ -92,9 +93,9 @@ TEST_F(SpecialCommandsTest, SharedContentRefusesDotsAndTheUnentitled) {
 
   // Entitled through its own entitlements: the content moves inside the
   // container, and never through a link the owner planted.
-  setOwnIdentity("com.example.caller", plist::Dictionary{{"com.norvane.private.QuarterKit.stageSharedContent", true},
-                                                         {"com.norvane.security.system-groups",
-                                                          plist::Array{"systemgroup.com.example"}}});
+  setOwnIdentity("com.example.caller",
+                 plist::Dictionary{{"com.norvane.private.QuarterKit.stageSharedContent", true},
+                                   {"com.norvane.security.system-groups", plist::Array{"systemgroup.com.example"}}});
   EXPECT_EQ(codeOf(call(26, keys)), 21u) << "the system group container is made on demand, not here";
   auto group = at(call(16), "ReplyGroupContainerDict");
   ASSERT_TRUE(group && group->dictionaryIf() && plist::find(*group->dictionaryIf(), "systemgroup.com.example"));

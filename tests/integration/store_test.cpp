@@ -30,9 +30,10 @@ TEST_F(StoreTest, NewDataContainerIsCompleteOnDiskAndMapped) {
   ASSERT_NE(made.uuid, QRTUUID());
   EXPECT_NE(made.uuid, *directoryUUID);
 
-  EXPECT_EQ(readPlist(made.path + "/" + kMetadataFile),
-            (plist::Dictionary{{"QRTMetadataIdentifier", "com.example.app"}, {"QRTMetadataUUID", made.uuid.UUIDString()},
-                               {"QRTMetadataContentClass", 2u}, {"QRTMetadataPersona", 501u}}));
+  EXPECT_EQ(readPlist(made.path + "/" + kMetadataFile), (plist::Dictionary{{"QRTMetadataIdentifier", "com.example.app"},
+                                                                           {"QRTMetadataUUID", made.uuid.UUIDString()},
+                                                                           {"QRTMetadataContentClass", 2u},
+                                                                           {"QRTMetadataPersona", 501u}}));
 
   auto entries = listDirectory(made.path);
   EXPECT_EQ(std::set<std::string>(entries.begin(), entries.end()),
@@ -128,7 +129,8 @@ TEST_F(StoreTest, KillDuringCreationsLeavesNoIncompleteContainer) {
   std::vector<std::thread> clients;
   for (int t = 0; t < 4; ++t)
     clients.emplace_back([&, t] {
-      for (int i = 0; !stop && i < 1000; ++i) createOrLookup(501, "com.example.burst" + std::to_string(t * 1000 + i), 2);
+      for (int i = 0; !stop && i < 1000; ++i)
+        createOrLookup(501, "com.example.burst" + std::to_string(t * 1000 + i), 2);
     });
   std::this_thread::sleep_for(std::chrono::milliseconds(400));
   killDaemon();

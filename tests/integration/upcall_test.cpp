@@ -43,10 +43,12 @@ TEST_F(UpcallTest, StartingProcessGetsItsContainers) {
   personaOnly.personaId = 0;
   // The installer's registration says the program's data container is a plug-in's.
   setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true}});
-  EXPECT_EQ(codeOf(call(18, {{"Identifier", "com.example.mapped"},
-                             {"CodeSigningInfo", plist::Dictionary{{"com.norvane.QuarterKit.Entitlements", plist::Dictionary{}}}},
-                             {"OptionsDictionary", plist::Dictionary{{"com.norvane.QuarterKit.DataContainerClass", 4}}}})),
-            1u);
+  EXPECT_EQ(
+      codeOf(call(18,
+                  {{"Identifier", "com.example.mapped"},
+                   {"CodeSigningInfo", plist::Dictionary{{"com.norvane.QuarterKit.Entitlements", plist::Dictionary{}}}},
+                   {"OptionsDictionary", plist::Dictionary{{"com.norvane.QuarterKit.DataContainerClass", 4}}}})),
+      1u);
   const Case cases[] = {
       {"application", app("com.example.app"), "com.example.app", 2},
       {"container id wins", both, "com.example.container", 2},
@@ -89,8 +91,9 @@ TEST_F(UpcallTest, StartingProcessGetsItsContainers) {
   ASSERT_TRUE(withGroups && withGroups->readable);
   EXPECT_EQ(withGroups->status, 1u);
   using Pairs = std::vector<std::pair<std::string, std::string>>;
-  EXPECT_EQ(withGroups->groups, (Pairs{{"group.com.example.b", createOrLookup(501, "group.com.example.b", 7, false).path},
-                                       {"group.com.example.a", createOrLookup(501, "group.com.example.a", 7, false).path}}));
+  EXPECT_EQ(withGroups->groups,
+            (Pairs{{"group.com.example.b", createOrLookup(501, "group.com.example.b", 7, false).path},
+                   {"group.com.example.a", createOrLookup(501, "group.com.example.a", 7, false).path}}));
   // (A client needs the system container's entitlement to look it up.)
   ASSERT_TRUE(withGroups->systemContainer);
   EXPECT_EQ(parentOf(*withGroups->systemContainer), root + "/private/var/containers/Data/System");

@@ -28,8 +28,7 @@ TEST(QRTFormatTest, PrintfConversions) {
   EXPECT_EQ(QRTFormat("%s|%-5s|%5s|%.2s", "abc", "ab", "ab", "abcdef"), "abc|ab   |   ab|ab");
   EXPECT_EQ(QRTFormat("%s", static_cast<const char*>(nullptr)), "(null)");
   EXPECT_EQ(QRTFormat("%s %d", std::string("text"), std::string("obj")), "text obj");
-  EXPECT_EQ(QRTFormat("%p %p", reinterpret_cast<const void*>(0x1234), static_cast<const void*>(nullptr)),
-            "0x1234 0x0");
+  EXPECT_EQ(QRTFormat("%p %p", reinterpret_cast<const void*>(0x1234), static_cast<const void*>(nullptr)), "0x1234 0x0");
   EXPECT_EQ(QRTFormat("100%% sure, %5%"), "100% sure, %");
   EXPECT_EQ(QRTFormat("%*d|%-*d|%.*s", 4, 1, 3, 2, 2, "abcdef"), "   1|2  |ab");
   EXPECT_EQ(QRTFormat("%*d|", -3, 5), "5  |");

@@ -104,7 +104,10 @@ TEST(PlistBinaryForeign, ReadsAnotherWritersFileExactly) {
   std::iota(uuid.begin(), uuid.end(), 0);
   const Value shared(Array{1, 2, "x"});
   const Value expected(Dictionary{
-      {"d", Date{611411696}}, {"f", false}, {"t", true}, {"u", uuid},
+      {"d", Date{611411696}},
+      {"f", false},
+      {"t", true},
+      {"u", uuid},
       {"r", Array{0.5, -1.25e300}},
       {"i", Array{0, 255, 256, 65536, int64_t{1} << 32, INT64_MAX, -1, INT64_MIN, UINT64_MAX}},
       {"s", Array{"", "h\xc3\xa9llo", "\xf0\x9f\x98\x80 astral", "fifteen letters"}},
@@ -161,7 +164,8 @@ TEST(PlistBinaryReader, AcceptsOtherValidEncodings) {
   // A 4-byte real, a negative value as a 16-byte integer, and a UTF-16 key.
   Data negative{0x14};
   negative.resize(16, 0xff), negative.push_back(0xfd);
-  auto v = parseData(assemble({{0xD2, 1, 2, 3, 4}, {0x61, 0x00, 0x66}, {0x51, 'g'}, {0x22, 0x3f, 0xc0, 0, 0}, negative}));
+  auto v =
+      parseData(assemble({{0xD2, 1, 2, 3, 4}, {0x61, 0x00, 0x66}, {0x51, 'g'}, {0x22, 0x3f, 0xc0, 0, 0}, negative}));
   ASSERT_TRUE(v);
   EXPECT_EQ(*v, Value(Dictionary{{"f", 1.5}, {"g", Value(-3)}}));
 }
@@ -256,8 +260,8 @@ TEST(PlistBinaryReader, RefusesUnsupportedOrInvalidObjects) {
   Data wide{0x14, 0, 0, 0, 0, 0, 0, 0, 1}, onesThenPositive{0x14};
   wide.resize(17, 0), onesThenPositive.resize(9, 0xff), onesThenPositive.resize(17, 0);
   const std::pair<std::vector<Data>, const char*> cases[] = {
-      {{{0x00}}, "unsupported object type"},                 // null
-      {{{0x80, 1}}, "unsupported object type"},              // UID
+      {{{0x00}}, "unsupported object type"},                  // null
+      {{{0x80, 1}}, "unsupported object type"},               // UID
       {{{0xC1, 1}, {0x51, 'x'}}, "unsupported object type"},  // set
       {{{0x71, 'x'}}, "unsupported object type"},
       {{{0x15, 1}}, "bad integer size"},
@@ -307,7 +311,8 @@ TEST(PlistDescribe, ScalarsAndContainers) {
       {Value(Array{"a", 1, Array{}}), "( a, 1, ( ) )"},
   };
   for (const auto& [value, text] : cases) EXPECT_EQ(plist::describe(value), text);
-  Value d(Dictionary{{"key", "value"}, {"k2", Array{"/a/b:c.d-e_f$+", "x y", "", "q\"\\\n\x01"}},
+  Value d(Dictionary{{"key", "value"},
+                     {"k2", Array{"/a/b:c.d-e_f$+", "x y", "", "q\"\\\n\x01"}},
                      {"two words", Dictionary{{"n", 1}}}});
   EXPECT_EQ(plist::describe(d),
             "{ k2 = ( /a/b:c.d-e_f$+, \"x y\", \"\", \"q\\\"\\\\\\n\\001\" ); key = value; "

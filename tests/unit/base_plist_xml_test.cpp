@@ -77,22 +77,30 @@ TEST(PlistXMLTest, ReadsSigningToolDocument) {
 
 TEST(PlistXMLTest, ReadsEveryElementType) {
   const std::pair<std::string, Value> cases[] = {
-      {"<string/>", ""}, {"<string>  keeps\n spaces </string>", "  keeps\n spaces "},
-      {"<dict></dict>", Dictionary{}}, {"<dict><key/><string>empty key</string></dict>", Dictionary{{"", "empty key"}}},
-      {"<array></array>", Array{}}, {"<true></true>", true}, {"<data></data>", Data{}},
+      {"<string/>", ""},
+      {"<string>  keeps\n spaces </string>", "  keeps\n spaces "},
+      {"<dict></dict>", Dictionary{}},
+      {"<dict><key/><string>empty key</string></dict>", Dictionary{{"", "empty key"}}},
+      {"<array></array>", Array{}},
+      {"<true></true>", true},
+      {"<data></data>", Data{}},
       {"<data>AQI</data>", Data{1, 2}},  // padding optional
-      {"<real>-2.5e3</real>", -2500.0}, {"<real> 1 </real>", 1.0},
-      {"<real>+infinity</real>", INFINITY}, {"<real>-inf</real>", -INFINITY},
-      {"<date>1970-01-01T00:00:00Z</date>", Date{-978307200}}, {"<date>2024-02-29T23:59:59Z</date>", Date{730943999}},
-      {"<date>0001-01-01T00:00:00Z</date>", Date{-63113904000}}, {"<date>2001-01-01T00:00:00.5Z</date>", Date{0.5}},
+      {"<real>-2.5e3</real>", -2500.0},
+      {"<real> 1 </real>", 1.0},
+      {"<real>+infinity</real>", INFINITY},
+      {"<real>-inf</real>", -INFINITY},
+      {"<date>1970-01-01T00:00:00Z</date>", Date{-978307200}},
+      {"<date>2024-02-29T23:59:59Z</date>", Date{730943999}},
+      {"<date>0001-01-01T00:00:00Z</date>", Date{-63113904000}},
+      {"<date>2001-01-01T00:00:00.5Z</date>", Date{0.5}},
   };
   for (const auto& [body, value] : cases) EXPECT_EQ(parseBody(body), value) << body;
   EXPECT_TRUE(std::isnan(parseBody("<real>nan</real>")->real()));
   EXPECT_TRUE(parseBody("<date>99999-12-31T23:59:59Z</date>"));  // no range limit
-  for (const char* bad : {"<real>1.5x</real>", "<real></real>", "<date>2023-02-29T00:00:00Z</date>",
-                          "<date>2001-13-01T00:00:00Z</date>", "<date>2001-01-01T24:00:00Z</date>",
-                          "<date>2001-01-01 00:00:00Z</date>", "<date>2001-01-01T00:00:00</date>",
-                          "<date>01-01-01T00:00:00Z</date>", "<date></date>"})
+  for (const char* bad :
+       {"<real>1.5x</real>", "<real></real>", "<date>2023-02-29T00:00:00Z</date>", "<date>2001-13-01T00:00:00Z</date>",
+        "<date>2001-01-01T24:00:00Z</date>", "<date>2001-01-01 00:00:00Z</date>", "<date>2001-01-01T00:00:00</date>",
+        "<date>01-01-01T00:00:00Z</date>", "<date></date>"})
     EXPECT_FALSE(parseBody(bad)) << bad;
 }
 
@@ -102,14 +110,19 @@ TEST(PlistXMLTest, IntegerRange) {
     return v ? std::optional<Integer>(v->integer()) : std::nullopt;
   };
   const std::pair<const char*, Integer> cases[] = {
-      {"18446744073709551615", {UINT64_MAX, true}}, {"9223372036854775808", {1ull << 63, true}},
-      {"9223372036854775807", {INT64_MAX, false}}, {"-9223372036854775808", {1ull << 63, false}},
-      {" -42 ", {uint64_t(-42), false}}, {"+7", {7, false}}, {"-0", {0, false}}, {"0x1F", {31, false}},
+      {"18446744073709551615", {UINT64_MAX, true}},
+      {"9223372036854775808", {1ull << 63, true}},
+      {"9223372036854775807", {INT64_MAX, false}},
+      {"-9223372036854775808", {1ull << 63, false}},
+      {" -42 ", {uint64_t(-42), false}},
+      {"+7", {7, false}},
+      {"-0", {0, false}},
+      {"0x1F", {31, false}},
       {"0xFFFFFFFFFFFFFFFF", {UINT64_MAX, true}},
   };
   for (const auto& [text, value] : cases) EXPECT_EQ(integer(text), value) << text;
-  for (const char* bad : {"18446744073709551616", "-9223372036854775809", "0x10000000000000000", "", "-",
-                          "0x", "1.0", "12a", "1 2", "--1"})
+  for (const char* bad : {"18446744073709551616", "-9223372036854775809", "0x10000000000000000", "", "-", "0x", "1.0",
+                          "12a", "1 2", "--1"})
     EXPECT_FALSE(integer(bad)) << bad;
 }
 
@@ -128,18 +141,34 @@ TEST(PlistXMLTest, RefusesMalformedAndHostileDocuments) {
   const std::string documents[] = {
       "<?xml version=\"1.0\"?><!DOCTYPE plist [<!ENTITY x \"boom\">]><plist><string>&x;</string></plist>",
       "<?xml version=\"1.0\"?><!ENTITY x SYSTEM \"file:///etc/passwd\"><plist><string/></plist>",
-      "<!DOCTYPE html><plist><string/></plist>", "<dict></dict>", "",
+      "<!DOCTYPE html><plist><string/></plist>",
+      "<dict></dict>",
+      "",
       kHeader + std::string("<string>a</string></plist><plist/>"),
   };
   // Each after the usual header, before "</plist>".
   const std::string bodies[] = {
-      "<data>AAE*</data>", "<data>A===</data>", "<data>AA==AA</data>",
-      "<string>\xC0\xAF</string>", "<string>\xED\xA0\x80</string>", "<string>abc\xE2\x82</string>",
-      std::string("<string>a\0b</string>", 20), "<array><string>x</string>", "<array></dict>",
-      "<string>a</string><string>b</string>", "", "<key>a</key>", "<dict><key>a</key></dict>",
-      "<dict><string>a</string><true/></dict>", "<dict><key>a</key><true/><key>a</key><false/></dict>",
-      "<array>text<true/></array>", "<set><true/></set>", "<true>yes</true>", "<string>a<b/></string>",
-      "<string>a<!-- open</string>", "<array attr=oops></array>",
+      "<data>AAE*</data>",
+      "<data>A===</data>",
+      "<data>AA==AA</data>",
+      "<string>\xC0\xAF</string>",
+      "<string>\xED\xA0\x80</string>",
+      "<string>abc\xE2\x82</string>",
+      std::string("<string>a\0b</string>", 20),
+      "<array><string>x</string>",
+      "<array></dict>",
+      "<string>a</string><string>b</string>",
+      "",
+      "<key>a</key>",
+      "<dict><key>a</key></dict>",
+      "<dict><string>a</string><true/></dict>",
+      "<dict><key>a</key><true/><key>a</key><false/></dict>",
+      "<array>text<true/></array>",
+      "<set><true/></set>",
+      "<true>yes</true>",
+      "<string>a<b/></string>",
+      "<string>a<!-- open</string>",
+      "<array attr=oops></array>",
   };
   std::vector<std::string> all(std::begin(documents), std::end(documents));
   for (const std::string& body : bodies) all.push_back(kHeader + body + "</plist>");

@@ -8,7 +8,8 @@
 namespace {
 
 QRTCodeSigningEntry entryWith(const std::string& marker, std::optional<std::vector<std::string>> children = {}) {
-  QRTCodeSigningEntry entry(plist::Dictionary{{"com.norvane.QuarterKit.Entitlements", plist::Dictionary{{"m", marker}}}});
+  QRTCodeSigningEntry entry(
+      plist::Dictionary{{"com.norvane.QuarterKit.Entitlements", plist::Dictionary{{"m", marker}}}});
   entry.childBundleIdentifiers = std::move(children);
   return entry;
 }
@@ -79,7 +80,8 @@ TEST_F(CodeSigningDBTest, DeleteCascadesAndCountsRows) {
   EXPECT_EQ(error->code(), QRTErrorInvalidArgument);
   EXPECT_TRUE(db->deleteCodeSigningEntryWithIdentifier("parent", nullptr));
   EXPECT_EQ(count("SELECT (SELECT count(*) FROM code_signing_info) + (SELECT count(*) FROM code_signing_data) + "
-                  "(SELECT count(*) FROM child_bundles)"), 0);
+                  "(SELECT count(*) FROM child_bundles)"),
+            0);
 }
 
 TEST_F(CodeSigningDBTest, InvalidateMarksParentAndChildrenAndToleratesUnknown) {
@@ -102,14 +104,18 @@ TEST_F(CodeSigningDBTest, UndecodableRowsFailLookupAndVanishFromEnumeration) {
   sqlite3_open((dir / "containers.sqlite3").c_str(), &raw);
   const plist::Data array = plist::writeBinary(plist::Array{"not", "a", "dictionary"});
   sqlite3_stmt* st = nullptr;
-  sqlite3_prepare_v2(raw, "UPDATE code_signing_data SET data=? WHERE cs_info_id=(SELECT id FROM code_signing_info "
-                          "WHERE code_signing_id_text='array')", -1, &st, nullptr);
+  sqlite3_prepare_v2(raw,
+                     "UPDATE code_signing_data SET data=? WHERE cs_info_id=(SELECT id FROM code_signing_info "
+                     "WHERE code_signing_id_text='array')",
+                     -1, &st, nullptr);
   sqlite3_bind_blob(st, 1, array.data(), static_cast<int>(array.size()), SQLITE_TRANSIENT);
   sqlite3_step(st);
   sqlite3_finalize(st);
-  sqlite3_exec(raw, "UPDATE code_signing_data SET data=x'00ff' WHERE cs_info_id=(SELECT id FROM code_signing_info "
-                    "WHERE code_signing_id_text='garbage'); DELETE FROM code_signing_data WHERE cs_info_id=(SELECT id "
-                    "FROM code_signing_info WHERE code_signing_id_text='nodata');", nullptr, nullptr, nullptr);
+  sqlite3_exec(raw,
+               "UPDATE code_signing_data SET data=x'00ff' WHERE cs_info_id=(SELECT id FROM code_signing_info "
+               "WHERE code_signing_id_text='garbage'); DELETE FROM code_signing_data WHERE cs_info_id=(SELECT id "
+               "FROM code_signing_info WHERE code_signing_id_text='nodata');",
+               nullptr, nullptr, nullptr);
   sqlite3_close(raw);
   db = QRTSQLiteDB::initWithParentDirectoryURL(QRTURL::fileURL(dir.path(), true));
   ASSERT_TRUE(db);
@@ -149,7 +155,8 @@ TEST(CodeSigningEntryTest, EqualityHashAndDictionaryForm) {
   EXPECT_EQ(small.hash(), wide.hash());
   EXPECT_EQ(QRTCodeSigningEntry::fromSerializedDictionary(a.serialize()), a);
   EXPECT_EQ(QRTCodeSigningEntry::fromSerializedDictionary(wide.serialize()), wide);
-  const QRTCodeSigningEntry bare = QRTCodeSigningEntry::fromSerializedDictionary({{"CodeSigningInfo", plist::Dictionary{}}});
+  const QRTCodeSigningEntry bare =
+      QRTCodeSigningEntry::fromSerializedDictionary({{"CodeSigningInfo", plist::Dictionary{}}});
   EXPECT_EQ(bare, QRTCodeSigningEntry(plist::Dictionary{}));
   QRTCodeSigningEntry flagged = entryWith("m");
   flagged.invalid = flagged.registeredByCaller = true;

@@ -63,8 +63,8 @@ TEST(DataProtectionWalk, ClassRulesPerKindThroughADeepTree) {
 
     bool locked = true;
     QRTErrorRef error;
-    ASSERT_TRUE(Op::setProtectionClassOfTreeAtURL(QRTURL::fileURL(top, true), test.target, test.changeType, &locked,
-                                                  &error))
+    ASSERT_TRUE(
+        Op::setProtectionClassOfTreeAtURL(QRTURL::fileURL(top, true), test.target, test.changeType, &locked, &error))
         << (error ? error->description() : "");
     EXPECT_FALSE(locked);
     for (int cls = 0; cls <= 4; ++cls) EXPECT_EQ(classOf(top + "/file" + std::to_string(cls)), test.files[cls]) << cls;
@@ -78,15 +78,19 @@ TEST(DataProtectionWalk, ClassRulesPerKindThroughADeepTree) {
 
 TEST(DataProtectionPendingFile, OnlyCompleteFilesAreAccepted) {
   TempDir dir;
-  const plist::Dictionary valid{
-      {"QRTDataOperationIdentifier", "com.example.app"}, {"QRTDataOperationContainerClass", 2},
-      {"QRTDataOperationUserId", 501},                   {"QRTDataOperationProtectionClass", 1},
-      {"QRTDataOperationChangeType", 7},                 {"QRTDataOperationRetryIfLocked", true},
-      {"QRTDataOperationInternalID", "0F2C4B7E-5A61-4C0B-9D7E-3B1A2C4D5E6F"}};
+  const plist::Dictionary valid{{"QRTDataOperationIdentifier", "com.example.app"},
+                                {"QRTDataOperationContainerClass", 2},
+                                {"QRTDataOperationUserId", 501},
+                                {"QRTDataOperationProtectionClass", 1},
+                                {"QRTDataOperationChangeType", 7},
+                                {"QRTDataOperationRetryIfLocked", true},
+                                {"QRTDataOperationInternalID", "0F2C4B7E-5A61-4C0B-9D7E-3B1A2C4D5E6F"}};
   auto changed = [&](const char* key, std::optional<plist::Value> value) {
     plist::Dictionary d = valid;
-    if (value) d[key] = *value;
-    else d.erase(key);
+    if (value)
+      d[key] = *value;
+    else
+      d.erase(key);
     return d;
   };
   const struct {
@@ -109,8 +113,8 @@ TEST(DataProtectionPendingFile, OnlyCompleteFilesAreAccepted) {
     const std::string path = dir / (std::string(test.what) + ".plist");
     if (test.content) {
       plist::Data bytes = plist::writeBinary(plist::Value(*test.content));
-      std::ofstream(path, std::ios::binary).write(reinterpret_cast<const char*>(bytes.data()),
-                                                  static_cast<std::streamsize>(bytes.size()));
+      std::ofstream(path, std::ios::binary)
+          .write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
     }
     QRTErrorRef error;
     auto read = Op::_readAndValidateDataProtectionUpdateAtURL(QRTURL::fileURL(path), &error);

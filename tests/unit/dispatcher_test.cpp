@@ -20,14 +20,29 @@ TEST(ValidateUserId, EffectiveUserByClassAndCaller) {
   platform::setDeviceRoot(root.path());
   constexpr uint32_t kRefused = 0xffffffff;  // with error 38
   const uint32_t cases[][5] = {
-      // requested user, class, caller, caller is a system process, effective user. Global classes belong to their fixed users...
-      {33, 1, 0, 1, 33}, {33, 8, 501, 0, 33}, {501, 1, 0, 1, kRefused}, {499, 12, 0, 1, 499}, {0, 12, 0, 1, kRefused},
+      // requested user, class, caller, caller is a system process, effective user. Global classes belong to their fixed
+      // users...
+      {33, 1, 0, 1, 33},
+      {33, 8, 501, 0, 33},
+      {501, 1, 0, 1, kRefused},
+      {499, 12, 0, 1, 499},
+      {0, 12, 0, 1, kRefused},
       {1, 13, 0, 1, kRefused},
       // ...ordinary callers, and low uids without system-level entitlements, get their own user...
-      {1, 2, 600, 0, 600}, {600, 2, 600, 0, 600}, {501, 2, 600, 0, kRefused}, {0, 7, 600, 0, kRefused},
-      {501, 2, 120, 0, kRefused}, {0, 2, 120, 0, kRefused}, {1, 2, 120, 0, 120}, {501, 2, 600, 1, kRefused},
+      {1, 2, 600, 0, 600},
+      {600, 2, 600, 0, 600},
+      {501, 2, 600, 0, kRefused},
+      {0, 7, 600, 0, kRefused},
+      {501, 2, 120, 0, kRefused},
+      {0, 2, 120, 0, kRefused},
+      {1, 2, 120, 0, 120},
+      {501, 2, 600, 1, kRefused},
       // ...system callers name any user of a per-user class (1: the current mobile user).
-      {1, 2, 33, 1, 502}, {1, 0, 0, 1, 502}, {0, 2, 0, 1, 0}, {777, 11, 500, 1, 777}, {501, 0, 0, 1, kRefused},
+      {1, 2, 33, 1, 502},
+      {1, 0, 0, 1, 502},
+      {0, 2, 0, 1, 0},
+      {777, 11, 500, 1, 777},
+      {501, 0, 0, 1, kRefused},
       {501, 14, 0, 1, kRefused},
   };
   for (const auto& [requested, cls, caller, system, expected] : cases) {
@@ -46,9 +61,15 @@ TEST(MessageReaders, MissingOrMistypedValuesReadAsNothing) {
   bytes[0] = 0xAB;
   const plist::Data uuid(bytes.begin(), bytes.end());
   const std::pair<const char*, plist::Value> values[] = {
-      {"u64", UINT64_MAX}, {"i64", -5},       {"bool", true},          {"string", "com.example"},
-      {"uuid", uuid},      {"data", plist::Data{1, 2, 3}},             {"real", 2.5},
-      {"array", plist::Array{"com.example"}}, {"dict", plist::Dictionary{{"k", 1}}},
+      {"u64", UINT64_MAX},
+      {"i64", -5},
+      {"bool", true},
+      {"string", "com.example"},
+      {"uuid", uuid},
+      {"data", plist::Data{1, 2, 3}},
+      {"real", 2.5},
+      {"array", plist::Array{"com.example"}},
+      {"dict", plist::Dictionary{{"k", 1}}},
   };
   plist::Dictionary message;
   for (const auto& [key, value] : values) message[key] = value;

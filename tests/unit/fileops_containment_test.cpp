@@ -37,11 +37,16 @@ TEST(Containment, ClientPathsStayInsideTheBase) {
   ASSERT_EQ(chown(base.c_str(), 501, 501), 0);
   ASSERT_EQ(chown((base + "/sub").c_str(), 501, 501), 0);
   // ln -s target name, relative to the base.
-  const std::vector<std::pair<std::string, std::string>> links = {
-      {outside, "out_dir"},         {outside + "/file", "out_file"}, {base + "/file", "abs_in"},
-      {"../../../../../outside", "rel_out"}, {"sub", "mid"},         {"../file", "sub/rel_in"},
-      {"../../c2/x", "sub/rel_up2"}, {"sub/rel_in", "chain"},        {"loop_b", "loop_a"},
-      {"loop_a", "loop_b"}};
+  const std::vector<std::pair<std::string, std::string>> links = {{outside, "out_dir"},
+                                                                  {outside + "/file", "out_file"},
+                                                                  {base + "/file", "abs_in"},
+                                                                  {"../../../../../outside", "rel_out"},
+                                                                  {"sub", "mid"},
+                                                                  {"../file", "sub/rel_in"},
+                                                                  {"../../c2/x", "sub/rel_up2"},
+                                                                  {"sub/rel_in", "chain"},
+                                                                  {"loop_b", "loop_a"},
+                                                                  {"loop_a", "loop_b"}};
   ASSERT_TRUE(asUser501([&] {
     for (const auto& [target, name] : links)
       if (symlink(target.c_str(), (base + "/" + name).c_str()) != 0) return false;
@@ -99,14 +104,11 @@ TEST(Containment, ClientPathsStayInsideTheBase) {
     bool ok;
     int32_t end;
   };
-  for (DepthCase d : {DepthCase{"/a/b", 0, true, 2}, DepthCase{"../x", 3, false, 0},
-                      DepthCase{"/sub/../x", 2, true, 3}, DepthCase{"/sub/../../x", 2, false, 0},
-                      DepthCase{"./a//.", 1, true, 2}}) {
+  for (DepthCase d : {DepthCase{"/a/b", 0, true, 2}, DepthCase{"../x", 3, false, 0}, DepthCase{"/sub/../x", 2, true, 3},
+                      DepthCase{"/sub/../../x", 2, false, 0}, DepthCase{"./a//.", 1, true, 2}}) {
     int32_t end = -1;
     EXPECT_EQ(fm._validateSymlink(std::string(d.path), d.start, &end), d.ok) << d.path;
-    if (d.ok) {
-      EXPECT_EQ(end, d.end) << d.path;
-    }
+    if (d.ok) { EXPECT_EQ(end, d.end) << d.path; }
   }
   EXPECT_FALSE(fm._validateSymlink(std::nullopt, 0, nullptr));
   platform::logClose();

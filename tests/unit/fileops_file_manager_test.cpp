@@ -255,8 +255,8 @@ TEST_F(FileManagerTest, TraversalSeesDirectoriesTwiceAndCanSkipOrStop) {
   };
   ASSERT_TRUE(fm_._traverseDirectory(url("r"), &error_, record));
   std::sort(seen.begin() + 1, seen.end() - 1);
-  EXPECT_EQ(seen, (std::vector<std::string>{"pre:r:0", "file:r/f:1", "link:r/l:1", "post:r/skip:1",
-                                            "pre:r/skip:1", "post:r:0"}));
+  EXPECT_EQ(seen, (std::vector<std::string>{"pre:r:0", "file:r/f:1", "link:r/l:1", "post:r/skip:1", "pre:r/skip:1",
+                                            "post:r:0"}));
   int calls = 0;
   EXPECT_FALSE(fm_._traverseDirectory(url("r"), &error_, [&](QRTTraversalEntry&, QRTErrorRef* e) {
     *e = QRT_POSIX_ERROR(EIO, "visitor gave up");

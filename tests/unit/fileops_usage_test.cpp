@@ -68,7 +68,8 @@ TEST_F(UsageTest, CountsAllocatedBytesOfEverythingButDirectoriesAndEachInodeOnce
 
 TEST_F(UsageTest, RootThatIsNoDirectoryMeasuresZeroAndIsLogged) {
   makeFile("file", 5000);
-  for (const char* rel : {"missing", "file"}) EXPECT_EQ(fm_.diskUsageForURL(url(rel)), 0u) << rel;  // links: hostile suite
+  for (const char* rel : {"missing", "file"})
+    EXPECT_EQ(fm_.diskUsageForURL(url(rel)), 0u) << rel;  // links: hostile suite
   EXPECT_EQ(fm_.diskUsageForURL(QRTURL()), 0u);
 }
 
@@ -108,8 +109,8 @@ TEST_F(UsageTest, ClassIsSetAndReadOnFilesAndDirectoriesUnlessThePredicateDeclin
       url("f"), 2, [&](int32_t current) { return seen = current, false; }, &error_));
   EXPECT_EQ(seen, 4);
   EXPECT_EQ(classOf("f"), 4);
-  EXPECT_TRUE(fm_.setDataProtectionClassOfItemAtURL(url("f"), 2, [](int32_t current) { return current == 4; },
-                                                    &error_));
+  EXPECT_TRUE(fm_.setDataProtectionClassOfItemAtURL(
+      url("f"), 2, [](int32_t current) { return current == 4; }, &error_));
   EXPECT_EQ(classOf("f"), 2);
   EXPECT_FALSE(error_);
   // Links are refused with the others in the hostile suite.

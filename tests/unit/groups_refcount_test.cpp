@@ -32,11 +32,14 @@ class GroupRefcountTest : public ::testing::Test {
   static void TearDownTestSuite() { gTmp.reset(); }
 
   static uint64_t registerGroups(const std::string& program, const std::vector<std::string>& groups) {
-    plist::Dictionary info{{QRTCodeSigningEntitlementsKey,
-                            plist::Dictionary{{QRTApplicationGroupsEntitlement, plist::Array(groups.begin(), groups.end())}}}};
+    plist::Dictionary info{
+        {QRTCodeSigningEntitlementsKey,
+         plist::Dictionary{{QRTApplicationGroupsEntitlement, plist::Array(groups.begin(), groups.end())}}}};
     return mapping().processCodeSigningInfo(&info, program, nullptr);
   }
-  static uint64_t drop(const std::string& program) { return mapping().processCodeSigningInfo(nullptr, program, nullptr); }
+  static uint64_t drop(const std::string& program) {
+    return mapping().processCodeSigningInfo(nullptr, program, nullptr);
+  }
   static QRTCodeSigningMapping& mapping() { return *QRTCodeSigningMapping::sharedInstance(); }
 
   // Makes the program's group containers the way command 13 does.

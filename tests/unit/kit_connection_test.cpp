@@ -188,15 +188,24 @@ TEST(KitRequest, ValuesAreEncodedAndReadTheWayTheDaemonDoes) {
   auto uuid = QRTUUID::fromString("0A1B2C3D-4E5F-4061-8293-A4B5C6D7E8F9");
   ASSERT_TRUE(uuid);
   const plist::Dictionary m = qk::Request(qk::Command::replaceContainer)
-                                  .uuid("U", *uuid).uuid("Absent", std::nullopt).string("S", std::nullopt)
-                                  .u64("Big", UINT64_MAX).u64("Small", 7).i64("Negative", -2)
+                                  .uuid("U", *uuid)
+                                  .uuid("Absent", std::nullopt)
+                                  .string("S", std::nullopt)
+                                  .u64("Big", UINT64_MAX)
+                                  .u64("Small", 7)
+                                  .i64("Negative", -2)
                                   .message();
-  EXPECT_EQ(m, (plist::Dictionary{{"Command", 2}, {"U", plist::Data(uuid->bytes().begin(), uuid->bytes().end())},
-                                  {"Big", plist::Integer{UINT64_MAX, true}}, {"Small", plist::Integer{7, false}},
+  EXPECT_EQ(m, (plist::Dictionary{{"Command", 2},
+                                  {"U", plist::Data(uuid->bytes().begin(), uuid->bytes().end())},
+                                  {"Big", plist::Integer{UINT64_MAX, true}},
+                                  {"Small", plist::Integer{7, false}},
                                   {"Negative", -2}}));
 
-  qk::Reply reply({{"ReplyError", 1}, {"ReplyPath", 5}, {"ReplyUUID", plist::Data(15, 0)},
-                   {"ReplyIdsArray", plist::Array{"a", 3, "b"}}, {"ReplyExisted", "yes"}});
+  qk::Reply reply({{"ReplyError", 1},
+                   {"ReplyPath", 5},
+                   {"ReplyUUID", plist::Data(15, 0)},
+                   {"ReplyIdsArray", plist::Array{"a", 3, "b"}},
+                   {"ReplyExisted", "yes"}});
   EXPECT_TRUE(reply.ok());
   EXPECT_FALSE(reply.string("ReplyPath") || reply.uuid("ReplyUUID") || reply.boolean("ReplyExisted"));
   EXPECT_EQ(0u, reply.u64("Missing"));

@@ -56,7 +56,9 @@ class Holder {
     thread_.join();
   }
   bool acquired() const { return acquired_; }
-  bool waitAcquired() const { return eventually([this] { return acquired_.load(); }); }
+  bool waitAcquired() const {
+    return eventually([this] { return acquired_.load(); });
+  }
 
  private:
   std::promise<void> release_;

@@ -65,8 +65,14 @@ TEST(Packbuff, HostileBuffersAreRefused) {
   add("empty", ERANGE, [](Bytes&) {});
   add("half an end marker", ERANGE, [](Bytes& b) { b.assign(4, 0); });
   add("header only", ERANGE, [](Bytes& b) { header(b, 2, 1, 6); });
-  add("data cut short", ERANGE, [](Bytes& b) { header(b, 2, 1, 6); data(b, "abc", 0); });
-  add("no end marker", ERANGE, [](Bytes& b) { header(b, 2, 1, 6); data(b, std::string("abcde\0", 6), 2); });
+  add("data cut short", ERANGE, [](Bytes& b) {
+    header(b, 2, 1, 6);
+    data(b, "abc", 0);
+  });
+  add("no end marker", ERANGE, [](Bytes& b) {
+    header(b, 2, 1, 6);
+    data(b, std::string("abcde\0", 6), 2);
+  });
   add("end marker cut", ERANGE, [](Bytes& b) {
     header(b, 2, 1, 6);
     data(b, std::string("abcde\0", 6), 2);
@@ -77,13 +83,33 @@ TEST(Packbuff, HostileBuffersAreRefused) {
     data(b, std::string("abcdefg\0", 8), 0);
     end(b);
   });
-  add("length near 4 GiB", ERANGE, [](Bytes& b) { header(b, 3, 2, 0xFFFFFFFFu); end(b); });
+  add("length near 4 GiB", ERANGE, [](Bytes& b) {
+    header(b, 3, 2, 0xFFFFFFFFu);
+    end(b);
+  });
   add("inline then cut", ERANGE, [](Bytes& b) { header(b, 1, 0, 7); });
-  add("string without NUL", EINVAL, [](Bytes& b) { header(b, 2, 1, 3); data(b, "abc", 5); end(b); });
-  add("empty string", EINVAL, [](Bytes& b) { header(b, 2, 1, 0); end(b); });
-  add("inner NUL", EINVAL, [](Bytes& b) { header(b, 2, 1, 4); data(b, std::string("a\0b\0", 4), 4); end(b); });
-  add("unknown item type", EINVAL, [](Bytes& b) { header(b, 9, 1, 0); end(b); });
-  add("inline read as string", EINVAL, [](Bytes& b) { header(b, 1, 1, 5); end(b); });
+  add("string without NUL", EINVAL, [](Bytes& b) {
+    header(b, 2, 1, 3);
+    data(b, "abc", 5);
+    end(b);
+  });
+  add("empty string", EINVAL, [](Bytes& b) {
+    header(b, 2, 1, 0);
+    end(b);
+  });
+  add("inner NUL", EINVAL, [](Bytes& b) {
+    header(b, 2, 1, 4);
+    data(b, std::string("a\0b\0", 4), 4);
+    end(b);
+  });
+  add("unknown item type", EINVAL, [](Bytes& b) {
+    header(b, 9, 1, 0);
+    end(b);
+  });
+  add("inline read as string", EINVAL, [](Bytes& b) {
+    header(b, 1, 1, 5);
+    end(b);
+  });
   add("valid", 0, [](Bytes& b) {
     header(b, 1, 0, 42);
     header(b, 2, 1, 6);

@@ -59,7 +59,8 @@ TEST(SerialQueue, RunsItemsOneAtATimeInOrderPerProducer) {
   std::vector<std::thread> producers;
   for (int p = 0; p < kProducers; ++p) {
     producers.emplace_back([&, p] {
-      for (int i = 0; i < kItems; ++i) queue->async([&, p, i] {
+      for (int i = 0; i < kItems; ++i)
+        queue->async([&, p, i] {
           if (running.fetch_add(1) != 0) overlapped = true;
           seen.emplace_back(p, i);
           running.fetch_sub(1);
@@ -152,7 +153,11 @@ TEST(BothQueues, SuspendKeepsItemsAndNestsAndDestroyingRunsOrWaitsForPendingWork
     EXPECT_TRUE(ran.waitFor(3));
 
     std::atomic<int> done{0};
-    for (int i = 0; i < 50; ++i) queue->async([&] { std::this_thread::sleep_for(100us); ++done; });
+    for (int i = 0; i < 50; ++i)
+      queue->async([&] {
+        std::this_thread::sleep_for(100us);
+        ++done;
+      });
     queue.reset();
     EXPECT_EQ(done, 50);
   }

@@ -145,9 +145,10 @@ TEST_F(LogTest, FailedRotationStepIsReportedOnStandardError) {
 // ---- user database and identities ----
 
 TEST_F(DeviceRootTest, UserDatabaseReadsTheRootsFilesOnEveryLookup) {
-  writeFile(at("/etc/passwd"), "# accounts\nbroken:x:12\nbadid:x:abc:1::/x:/bin/sh\n"
-                               "_installer:x:33:33::/private/var/emplacerd:/bin/false\n"
-                               "mobile:x:501:501::/private/var/mobile:/bin/sh\n");
+  writeFile(at("/etc/passwd"),
+            "# accounts\nbroken:x:12\nbadid:x:abc:1::/x:/bin/sh\n"
+            "_installer:x:33:33::/private/var/emplacerd:/bin/false\n"
+            "mobile:x:501:501::/private/var/mobile:/bin/sh\n");
   writeFile(at("/etc/group"), "wheel:x:0:root\nsystemusers:x:498:\n");
   std::optional<UserAccount> mobile = userByName("mobile");
   ASSERT_TRUE(mobile);
@@ -224,13 +225,20 @@ TEST_F(DeviceRootTest, PeerIdentityIsTheFileAndTheUid) {
   const plist::Dictionary all{*groups.begin(), {"com.norvane.private.QuarterKit.allowed", true}};
   const plist::Array none;
   const std::tuple<plist::Array, plist::Dictionary, uid_t, int, int, ino_t, int> rows[] = {
-      {none, all, 0, 0644, 0755, 0, 1}, {none, all, 501, 0644, 0755, 0, 0}, {none, all, 120, 0644, 0755, 0, 0},
-      {{"svc"}, all, 120, 0644, 0755, 0, 1}, {{120}, all, 0, 0644, 0755, 0, 0}, {{"mobile"}, all, 0, 0644, 0755, 0, -1},
-      {{501}, groups, 501, 0644, 0755, 0, 0}, {none, all, 0, 0664, 0755, 0, -1}, {none, all, 0, 0644, 0777, 0, -1},
+      {none, all, 0, 0644, 0755, 0, 1},
+      {none, all, 501, 0644, 0755, 0, 0},
+      {none, all, 120, 0644, 0755, 0, 0},
+      {{"svc"}, all, 120, 0644, 0755, 0, 1},
+      {{120}, all, 0, 0644, 0755, 0, 0},
+      {{"mobile"}, all, 0, 0644, 0755, 0, -1},
+      {{501}, groups, 501, 0644, 0755, 0, 0},
+      {none, all, 0, 0664, 0755, 0, -1},
+      {none, all, 0, 0644, 0777, 0, -1},
       {none, all, 0, 0644, 0755, 1, -1},  // another file at the path (a mount in the peer's namespace)
   };
   for (const auto& [users, entitlements, uid, fileMode, dirMode, otherFile, expected] : rows) {
-    plist::Dictionary entry{{"Executable", "/usr/bin/true"}, {"SigningIdentifier", "t"}, {"Entitlements", entitlements}};
+    plist::Dictionary entry{
+        {"Executable", "/usr/bin/true"}, {"SigningIdentifier", "t"}, {"Entitlements", entitlements}};
     if (!users.empty()) entry["Users"] = users;
     writePlist(file, entry);
     fs::permissions(file, static_cast<fs::perms>(fileMode));

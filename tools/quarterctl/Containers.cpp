@@ -40,20 +40,22 @@ qk::Result onOne(qk::Connection& c, qk::ContainerRef& r, const std::function<qk:
 int createOrLookup(G g, A a, bool create) {
   qk::ContainerRef r = containerArgs(a);
   const bool transient = a.has("--transient");
-  return deliver(g, [&](qk::Connection& c) {
-    return qk::createOrLookupContainer(c, r.userId, r.identifier, r.containerClass, create, transient);
-  }, {[](const qk::Reply& reply) {
-        Table table({"IDENTIFIER", "UUID", "EXISTED", "PATH"});
-        table.add({reply.string("ReplyIdentifier").value_or(""), uuidText(reply.uuid("ReplyUUID")),
-                   reply.boolean("ReplyExisted") ? "yes" : "no", reply.string("ReplyPath").value_or("")});
-        table.print();
-      },
-      [](const qk::Reply& reply) -> nlohmann::json {
-        return {{"identifier", orNull(reply.string("ReplyIdentifier"))},
-                {"uuid", uuidText(reply.uuid("ReplyUUID"))},
-                {"path", orNull(reply.string("ReplyPath"))},
-                {"existed", reply.boolean("ReplyExisted")}};
-      }});
+  return deliver(g,
+                 [&](qk::Connection& c) {
+                   return qk::createOrLookupContainer(c, r.userId, r.identifier, r.containerClass, create, transient);
+                 },
+                 {[](const qk::Reply& reply) {
+                    Table table({"IDENTIFIER", "UUID", "EXISTED", "PATH"});
+                    table.add({reply.string("ReplyIdentifier").value_or(""), uuidText(reply.uuid("ReplyUUID")),
+                               reply.boolean("ReplyExisted") ? "yes" : "no", reply.string("ReplyPath").value_or("")});
+                    table.print();
+                  },
+                  [](const qk::Reply& reply) -> nlohmann::json {
+                    return {{"identifier", orNull(reply.string("ReplyIdentifier"))},
+                            {"uuid", uuidText(reply.uuid("ReplyUUID"))},
+                            {"path", orNull(reply.string("ReplyPath"))},
+                            {"existed", reply.boolean("ReplyExisted")}};
+                  }});
 }
 
 // The path of each listed container, asked for with a window of requests in
@@ -88,25 +90,28 @@ int list(G g, A a) {
   std::vector<std::string> ids;
   std::vector<QRTUUID> uuids;
   std::vector<std::optional<std::string>> paths;
-  return deliver(g, [&](qk::Connection& c) {
-    qk::Result reply = qk::containersForUser(c, r.userId, r.containerClass, transient);
-    if (reply && reply->ok()) {
-      ids = reply->strings("ReplyIdsArray");
-      uuids = reply->uuids("ReplyUUIDsArray");
-      paths = pathsOf(c, r, ids, uuids);
-    }
-    return reply;
-  }, {[&](const qk::Reply&) {
-        Table table({"IDENTIFIER", "UUID", "PATH"});
-        for (size_t i = 0; i < paths.size(); ++i) table.add({ids[i], uuids[i].UUIDString(), paths[i].value_or("-")});
-        table.print();
+  return deliver(
+      g,
+      [&](qk::Connection& c) {
+        qk::Result reply = qk::containersForUser(c, r.userId, r.containerClass, transient);
+        if (reply && reply->ok()) {
+          ids = reply->strings("ReplyIdsArray");
+          uuids = reply->uuids("ReplyUUIDsArray");
+          paths = pathsOf(c, r, ids, uuids);
+        }
+        return reply;
       },
-      [&](const qk::Reply&) {
-        nlohmann::json out = nlohmann::json::array();
-        for (size_t i = 0; i < paths.size(); ++i)
-          out.push_back({{"identifier", ids[i]}, {"uuid", uuids[i].UUIDString()}, {"path", orNull(paths[i])}});
-        return out;
-      }});
+      {[&](const qk::Reply&) {
+         Table table({"IDENTIFIER", "UUID", "PATH"});
+         for (size_t i = 0; i < paths.size(); ++i) table.add({ids[i], uuids[i].UUIDString(), paths[i].value_or("-")});
+         table.print();
+       },
+       [&](const qk::Reply&) {
+         nlohmann::json out = nlohmann::json::array();
+         for (size_t i = 0; i < paths.size(); ++i)
+           out.push_back({{"identifier", ids[i]}, {"uuid", uuids[i].UUIDString()}, {"path", orNull(paths[i])}});
+         return out;
+       }});
 }
 
 int infoGet(G g, A a) {
@@ -136,18 +141,19 @@ int infoSet(G g, A a) {
   }
   Show show;
   show.hints = {{38, "a container's metadata, every info value included, holds at most 1 MiB"}};
-  return deliver(g, [&](qk::Connection& c) { return onOne(c, r, [&] { return qk::setInfoValue(c, r, key, value); }); },
-                 show);
+  return deliver(
+      g, [&](qk::Connection& c) { return onOne(c, r, [&] { return qk::setInfoValue(c, r, key, value); }); }, show);
 }
 
 int metadata(G g, A a) {
   qk::ContainerRef r = containerArgs(a);
   const bool info = a.has("--info");
-  return deliver(g, [&](qk::Connection& c) { return onOne(c, r, [&] { return qk::metadataForContainer(c, r, info); }); },
+  return deliver(g,
+                 [&](qk::Connection& c) { return onOne(c, r, [&] { return qk::metadataForContainer(c, r, info); }); },
                  {[&](const qk::Reply& reply) {
                     Table table({"IDENTIFIER", "UUID", "TRANSIENT", "PATH"});
-                    table.add({r.identifier.value_or(""), uuidText(r.uuid), reply.boolean("ReplyTransient") ? "yes" : "no",
-                               reply.string("ReplyPath").value_or("")});
+                    table.add({r.identifier.value_or(""), uuidText(r.uuid),
+                               reply.boolean("ReplyTransient") ? "yes" : "no", reply.string("ReplyPath").value_or("")});
                     table.print();
                     if (!info) return;
                     std::cout << '\n';
@@ -172,16 +178,17 @@ int metadata(G g, A a) {
 int du(G g, A a) {
   qk::ContainerRef r = containerArgs(a);
   const bool units = a.has("--human-readable");
-  return deliver(g, [&](qk::Connection& c) { return onOne(c, r, [&] { return qk::diskUsage(c, r); }); },
-                 {[&](const qk::Reply& reply) {
-                    Table table({"IDENTIFIER", "UUID", "SIZE"});
-                    table.add({r.identifier.value_or(""), uuidText(r.uuid), sizeText(reply.u64("ReplyDiskUsage"), units)});
-                    table.print();
-                  },
-                  [&](const qk::Reply& reply) -> nlohmann::json {
-                    return {{"identifier", orNull(r.identifier)}, {"uuid", uuidText(r.uuid)},
-                            {"bytes", reply.u64("ReplyDiskUsage")}};
-                  }});
+  return deliver(
+      g, [&](qk::Connection& c) { return onOne(c, r, [&] { return qk::diskUsage(c, r); }); },
+      {[&](const qk::Reply& reply) {
+         Table table({"IDENTIFIER", "UUID", "SIZE"});
+         table.add({r.identifier.value_or(""), uuidText(r.uuid), sizeText(reply.u64("ReplyDiskUsage"), units)});
+         table.print();
+       },
+       [&](const qk::Reply& reply) -> nlohmann::json {
+         return {
+             {"identifier", orNull(r.identifier)}, {"uuid", uuidText(r.uuid)}, {"bytes", reply.u64("ReplyDiskUsage")}};
+       }});
 }
 
 // Runs a command with no reply keys on one container.
@@ -204,7 +211,8 @@ StageEntry parseEntry(const std::string& text) {
   size_t c = b == std::string::npos ? b : text.find(':', b + 1);
   if (c == std::string::npos) throw UsageError{"expected USER:CLASS:UUID:IDENTIFIER, got: " + text};
   return {parseUser(text.substr(0, a), "--entry user"), parseClass(text.substr(a + 1, b - a - 1), "--entry class"),
-          parseUUID(text.substr(b + 1, c - b - 1), "--entry"), checkIdentifier(text.substr(c + 1), "--entry identifier")};
+          parseUUID(text.substr(b + 1, c - b - 1), "--entry"),
+          checkIdentifier(text.substr(c + 1), "--entry identifier")};
 }
 
 int stage(G g, A a) {
@@ -218,7 +226,8 @@ int stage(G g, A a) {
     uuids.push_back(e.uuid);
     identifiers.push_back(e.identifier);
   }
-  return deliver(g, [&](qk::Connection& c) { return qk::stageContainerForDelete(c, users, uuids, identifiers, classes); });
+  return deliver(g,
+                 [&](qk::Connection& c) { return qk::stageContainerForDelete(c, users, uuids, identifiers, classes); });
 }
 
 int wipe(G g, A a) {
@@ -259,72 +268,125 @@ int protect(G g, A a) {
 int systemPath(G g, A a) {
   std::optional<std::string> identifier;
   if (auto v = a.value("--identifier")) identifier = checkIdentifier(*v, "--identifier");
-  return deliver(g, [&](qk::Connection& c) { return qk::systemContainerPath(c, identifier); },
-                 {[](const qk::Reply& reply) { std::cout << printable(reply.string("ReplyPath").value_or("")) << '\n'; },
-                  [](const qk::Reply& reply) -> nlohmann::json { return {{"path", orNull(reply.string("ReplyPath"))}}; }});
+  return deliver(
+      g, [&](qk::Connection& c) { return qk::systemContainerPath(c, identifier); },
+      {[](const qk::Reply& reply) { std::cout << printable(reply.string("ReplyPath").value_or("")) << '\n'; },
+       [](const qk::Reply& reply) -> nlohmann::json {
+         return {{"path", orNull(reply.string("ReplyPath"))}};
+       }});
 }
 
-const Group kContainers{10, {
-    {"create", "0", {kClassFlag, kUserFlag, kIdentifierFlag, kTransientFlag}, {"--class"},
-     "Creates the container, or finds it when it exists.\nWithout --identifier, the caller's own.",
-     [](G g, A a) { return createOrLookup(g, a, true); }},
-    {"lookup", "0", {kClassFlag, kUserFlag, kIdentifierFlag, kTransientFlag}, {"--class"},
-     "Finds an existing container; creates nothing.", [](G g, A a) { return createOrLookup(g, a, false); }},
-    {"list", "1, 7", {kClassFlag, kUserFlag, kTransientFlag}, {"--class"},
-     "Lists the containers of a class and user, with their paths.", list},
-    {"info get", "6", with(kOne, {kKeyFlag}), {"--class", "--identifier", "--key"}, "Prints one info value of a container.",
-     infoGet},
-    {"info set", "5", with(kOne, {kKeyFlag, {"--value", "TYPE:VALUE", "the value, typed as for raw; left out, the key goes"}}),
-     {"--class", "--identifier", "--key"}, "Sets an info value of a container, or removes it.", infoSet},
-    {"metadata", "7", with(kOne, {{"--info", nullptr, "adds the container's info values"}}), kOneRequired,
-     "Prints a container's path and transient flag.", metadata},
-    {"recreate", "8", kOne, kOneRequired, "Creates the container's default sub-directories again.",
-     onContainer<qk::recreateDefaultStructure>},
-    {"recreate-structure", "22", kOne, kOneRequired, "The same as recreate, through its second command number.",
-     onContainer<qk::recreateContainerStructure>},
-    {"regenerate-uuid", "9", kOne, kOneRequired, "Gives the container's directory a new name.\nThe internal UUID stays.",
-     onContainer<qk::regenerateDirectoryUUID>},
-    {"delete", "10", {kClassFlag, kUserFlag, kIdentifierFlag, kTransientFlag}, {"--class", "--identifier"},
-     "Stages a container for deletion (see deathrow).",
-     [](G g, A a) {
-       qk::ContainerRef r = containerArgs(a);
-       const bool transient = a.has("--transient");
-       return deliver(g, [&](qk::Connection& c) {
-         return qk::deleteContainer(c, r.userId, r.identifier, r.containerClass, transient);
-       });
-     }},
-    {"stage", "3", {{"--entry", "USER:CLASS:UUID:IDENTIFIER", "one container; repeat it for more"}}, {"--entry"},
-     "Stages containers for deletion, one --entry per container.", stage},
-    {"wipe", "12, 11",
-     {kClassFlag, kUserFlag, kIdentifierFlag,
-      {"--addon", nullptr, "wipes an addon-data container under the wipeContainer entitlement; no --class"}},
-     {"--identifier"}, "Replaces a data container's content by fresh content.", wipe},
-    {"replace", "2",
-     {{"--old-uuid", "UUID", "the container replaced"}, {"--old-class", "CLASS", "its class"},
-      {"--old-user", "N", "its user"}, {"--old-identifier", "ID", "its identifier"},
-      {"--new-uuid", "UUID", "the container that takes its place"}, {"--new-class", "CLASS", "its class"},
-      {"--new-user", "N", "its user"}, {"--new-identifier", "ID", "its identifier"}},
-     {"--new-class"},
-     "Puts the new container in the old one's place.\n"
-     "Without --old-uuid it makes a transient container permanent.",
-     replace},
-    {"deathrow", "4", {}, {}, "Destroys everything staged for deletion.\nThe answer comes when the pass is done.",
-     [](G g, A) { return deliver(g, [](qk::Connection& c) { return qk::deleteContainersOnDeathRow(c); }); }},
-    {"du", "23", with(kOne, {{"--human-readable", nullptr, "-h: sizes in KiB, MiB, GiB (powers of 1024)"}}),
-     kOneRequired, "Prints the bytes a container uses.", du},
-    {"system-path", "15", {kIdentifierFlag}, {}, "Creates or looks up a system container and prints its path.",
-     systemPath},
-    {"protect", "21",
-     {kIdentifierFlag, {"--protection-class", "N", "the protection class, 0 to 4 (the daemon refuses 2)"},
-      {"--class", "CLASS", "the data container's class (default app-data)"}, kUserFlag,
-      {"--third-party", nullptr, "the program is not built in: only 0, 1 and 3"},
-      {"--retry-if-locked", nullptr, "a locked device holds the change until the next unlock"}},
-     {"--identifier", "--protection-class"},
-     "Sets the protection class of a data container's items.\n"
-     "Every item of its Documents, Library, tmp and Purchases; the answer comes when the change\n"
-     "is done.",
-     protect},
-}};
+const Group kContainers{
+    10,
+    {
+        {"create",
+         "0",
+         {kClassFlag, kUserFlag, kIdentifierFlag, kTransientFlag},
+         {"--class"},
+         "Creates the container, or finds it when it exists.\nWithout --identifier, the caller's own.",
+         [](G g, A a) { return createOrLookup(g, a, true); }},
+        {"lookup",
+         "0",
+         {kClassFlag, kUserFlag, kIdentifierFlag, kTransientFlag},
+         {"--class"},
+         "Finds an existing container; creates nothing.",
+         [](G g, A a) { return createOrLookup(g, a, false); }},
+        {"list",
+         "1, 7",
+         {kClassFlag, kUserFlag, kTransientFlag},
+         {"--class"},
+         "Lists the containers of a class and user, with their paths.",
+         list},
+        {"info get",
+         "6",
+         with(kOne, {kKeyFlag}),
+         {"--class", "--identifier", "--key"},
+         "Prints one info value of a container.",
+         infoGet},
+        {"info set",
+         "5",
+         with(kOne, {kKeyFlag, {"--value", "TYPE:VALUE", "the value, typed as for raw; left out, the key goes"}}),
+         {"--class", "--identifier", "--key"},
+         "Sets an info value of a container, or removes it.",
+         infoSet},
+        {"metadata", "7", with(kOne, {{"--info", nullptr, "adds the container's info values"}}), kOneRequired,
+         "Prints a container's path and transient flag.", metadata},
+        {"recreate", "8", kOne, kOneRequired, "Creates the container's default sub-directories again.",
+         onContainer<qk::recreateDefaultStructure>},
+        {"recreate-structure", "22", kOne, kOneRequired, "The same as recreate, through its second command number.",
+         onContainer<qk::recreateContainerStructure>},
+        {"regenerate-uuid", "9", kOne, kOneRequired,
+         "Gives the container's directory a new name.\nThe internal UUID stays.",
+         onContainer<qk::regenerateDirectoryUUID>},
+        {"delete",
+         "10",
+         {kClassFlag, kUserFlag, kIdentifierFlag, kTransientFlag},
+         {"--class", "--identifier"},
+         "Stages a container for deletion (see deathrow).",
+         [](G g, A a) {
+           qk::ContainerRef r = containerArgs(a);
+           const bool transient = a.has("--transient");
+           return deliver(g, [&](qk::Connection& c) {
+             return qk::deleteContainer(c, r.userId, r.identifier, r.containerClass, transient);
+           });
+         }},
+        {"stage",
+         "3",
+         {{"--entry", "USER:CLASS:UUID:IDENTIFIER", "one container; repeat it for more"}},
+         {"--entry"},
+         "Stages containers for deletion, one --entry per container.",
+         stage},
+        {"wipe",
+         "12, 11",
+         {kClassFlag,
+          kUserFlag,
+          kIdentifierFlag,
+          {"--addon", nullptr, "wipes an addon-data container under the wipeContainer entitlement; no --class"}},
+         {"--identifier"},
+         "Replaces a data container's content by fresh content.",
+         wipe},
+        {"replace",
+         "2",
+         {{"--old-uuid", "UUID", "the container replaced"},
+          {"--old-class", "CLASS", "its class"},
+          {"--old-user", "N", "its user"},
+          {"--old-identifier", "ID", "its identifier"},
+          {"--new-uuid", "UUID", "the container that takes its place"},
+          {"--new-class", "CLASS", "its class"},
+          {"--new-user", "N", "its user"},
+          {"--new-identifier", "ID", "its identifier"}},
+         {"--new-class"},
+         "Puts the new container in the old one's place.\n"
+         "Without --old-uuid it makes a transient container permanent.",
+         replace},
+        {"deathrow",
+         "4",
+         {},
+         {},
+         "Destroys everything staged for deletion.\nThe answer comes when the pass is done.",
+         [](G g, A) { return deliver(g, [](qk::Connection& c) { return qk::deleteContainersOnDeathRow(c); }); }},
+        {"du", "23", with(kOne, {{"--human-readable", nullptr, "-h: sizes in KiB, MiB, GiB (powers of 1024)"}}),
+         kOneRequired, "Prints the bytes a container uses.", du},
+        {"system-path",
+         "15",
+         {kIdentifierFlag},
+         {},
+         "Creates or looks up a system container and prints its path.",
+         systemPath},
+        {"protect",
+         "21",
+         {kIdentifierFlag,
+          {"--protection-class", "N", "the protection class, 0 to 4 (the daemon refuses 2)"},
+          {"--class", "CLASS", "the data container's class (default app-data)"},
+          kUserFlag,
+          {"--third-party", nullptr, "the program is not built in: only 0, 1 and 3"},
+          {"--retry-if-locked", nullptr, "a locked device holds the change until the next unlock"}},
+         {"--identifier", "--protection-class"},
+         "Sets the protection class of a data container's items.\n"
+         "Every item of its Documents, Library, tmp and Purchases; the answer comes when the change\n"
+         "is done.",
+         protect},
+    }};
 
 const Registration kRegistration(kContainers);
 

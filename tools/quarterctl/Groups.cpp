@@ -33,7 +33,8 @@ std::optional<plist::Value> codeSigningInfo(A a) {
 
 plist::Dictionary codeSigningOptions(A a) {
   plist::Dictionary options;
-  if (auto v = a.value("--data-class")) options["com.norvane.QuarterKit.DataContainerClass"] = parseClass(*v, "--data-class");
+  if (auto v = a.value("--data-class"))
+    options["com.norvane.QuarterKit.DataContainerClass"] = parseClass(*v, "--data-class");
   if (auto v = identifierArg(a, "--parent")) options["com.norvane.QuarterKit.ParentBundleID"] = *v;
   if (a.has("--placeholder")) options["com.norvane.QuarterKit.PlaceholderEntitlements"] = true;
   if (a.has("--by-caller")) options["RegByCaller"] = true;
@@ -44,20 +45,23 @@ int groupPaths(G g, A a) {
   const uint64_t user = userArg(a);
   const auto identifier = identifierArg(a);
   const bool system = a.has("--system");
-  return deliver(g, [&](qk::Connection& c) {
-    return system ? qk::systemGroupContainerPaths(c, identifier) : qk::groupContainerPaths(c, user, identifier);
-  }, {[](const qk::Reply& reply) {
-        Table table({"GROUP", "PATH"});
-        if (const plist::Dictionary* d = reply.dictionary("ReplyGroupContainerDict"))
-          for (const auto& [group, path] : *d) table.add({group, plainText(path)});
-        table.print();
-      },
-      [](const qk::Reply& reply) {
-        nlohmann::json out = nlohmann::json::array();
-        if (const plist::Dictionary* d = reply.dictionary("ReplyGroupContainerDict"))
-          for (const auto& [group, path] : *d) out.push_back({{"group", group}, {"path", toJson(path)}});
-        return out;
-      }});
+  return deliver(g,
+                 [&](qk::Connection& c) {
+                   return system ? qk::systemGroupContainerPaths(c, identifier)
+                                 : qk::groupContainerPaths(c, user, identifier);
+                 },
+                 {[](const qk::Reply& reply) {
+                    Table table({"GROUP", "PATH"});
+                    if (const plist::Dictionary* d = reply.dictionary("ReplyGroupContainerDict"))
+                      for (const auto& [group, path] : *d) table.add({group, plainText(path)});
+                    table.print();
+                  },
+                  [](const qk::Reply& reply) {
+                    nlohmann::json out = nlohmann::json::array();
+                    if (const plist::Dictionary* d = reply.dictionary("ReplyGroupContainerDict"))
+                      for (const auto& [group, path] : *d) out.push_back({{"group", group}, {"path", toJson(path)}});
+                    return out;
+                  }});
 }
 
 int groupIds(G g, A a) {
@@ -80,12 +84,13 @@ int groupIds(G g, A a) {
 int systemGroupPath(G g, A a) {
   const std::string group = checkIdentifier(*a.value("--group"), "--group");
   const auto identifier = identifierArg(a);
-  return deliver(g, [&](qk::Connection& c) { return qk::systemGroupContainerPath(c, group, identifier); },
-                 {[](const qk::Reply& reply) { std::cout << printable(reply.string("ReplyPath").value_or("")) << '\n'; },
-                  [](const qk::Reply& reply) -> nlohmann::json {
-                    auto path = reply.string("ReplyPath");
-                    return {{"path", path ? nlohmann::json(*path) : nlohmann::json(nullptr)}};
-                  }});
+  return deliver(
+      g, [&](qk::Connection& c) { return qk::systemGroupContainerPath(c, group, identifier); },
+      {[](const qk::Reply& reply) { std::cout << printable(reply.string("ReplyPath").value_or("")) << '\n'; },
+       [](const qk::Reply& reply) -> nlohmann::json {
+         auto path = reply.string("ReplyPath");
+         return {{"path", path ? nlohmann::json(*path) : nlohmann::json(nullptr)}};
+       }});
 }
 
 int codesignSet(G g, A a) {
@@ -98,47 +103,72 @@ int codesignSet(G g, A a) {
 
 int codesignGet(G g, A a) {
   const auto identifier = identifierArg(a);
-  return deliver(g, [&](qk::Connection& c) { return qk::codeSigningInfoForIdentifier(c, identifier); },
-                 {[](const qk::Reply& reply) {
-                    Table table({"KEY", "VALUE"});
-                    if (const plist::Dictionary* d = reply.dictionary("ReplyInfoDictionary"))
-                      for (const auto& [key, value] : *d) table.add({key, plainText(value)});
-                    table.print();
-                  },
-                  [&](const qk::Reply& reply) -> nlohmann::json {
-                    const plist::Dictionary* d = reply.dictionary("ReplyInfoDictionary");
-                    return {{"identifier", *identifier},
-                            {"info", d ? toJson(plist::Value(*d)) : nlohmann::json::object()}};
-                  }});
+  return deliver(
+      g, [&](qk::Connection& c) { return qk::codeSigningInfoForIdentifier(c, identifier); },
+      {[](const qk::Reply& reply) {
+         Table table({"KEY", "VALUE"});
+         if (const plist::Dictionary* d = reply.dictionary("ReplyInfoDictionary"))
+           for (const auto& [key, value] : *d) table.add({key, plainText(value)});
+         table.print();
+       },
+       [&](const qk::Reply& reply) -> nlohmann::json {
+         const plist::Dictionary* d = reply.dictionary("ReplyInfoDictionary");
+         return {{"identifier", *identifier}, {"info", d ? toJson(plist::Value(*d)) : nlohmann::json::object()}};
+       }});
 }
 
 const Flag kGroupUser{"--user", "N", "the user id (0 to 4294967294); default 1, the current mobile user"};
 
-const Group kGroups{20, {
-    {"groups paths", "13, 16",
-     {kGroupUser, kIdentifierFlag, {"--system", nullptr, "the system group containers instead (user 499)"}}, {},
-     "Prints the group containers of a program, creating them.", groupPaths},
-    {"groups ids", "14", {kGroupUser, kIdentifierFlag}, {}, "Prints the application group identifiers of a program.",
-     groupIds},
-    {"system-group-path", "17", {{"--group", "GROUP", "the system group identifier"}, kIdentifierFlag}, {"--group"},
-     "Prints the path of an entitled system group container.\nIt is made when missing.", systemGroupPath},
-    {"codesign set", "18",
-     {kIdentifierFlag, {"--entitlements", "PLIST", "a property-list file of entitlements to register"},
-      {"--cs-info", "PLIST", "a whole code-signing dictionary to register"},
-      {"--remove", nullptr, "deletes the entry and what only it kept alive"},
-      {"--data-class", "CLASS", "the class of the program's data container"},
-      {"--parent", "ID", "the identifier of the program that contains this one"},
-      {"--placeholder", nullptr, "the entitlements of a placeholder"},
-      {"--by-caller", nullptr, "registered by the program itself"}},
-     {"--identifier", "--entitlements|--cs-info|--remove"},
-     "Registers or removes a program's code-signing information.", codesignSet},
-    {"codesign get", "19", {kIdentifierFlag}, {"--identifier"}, "Prints a program's registered code-signing information.",
-     codesignGet},
-    {"codesign invalidate-missing", "20", {}, {}, "Invalidates entries of programs without a bundle container.",
-     [](G g, A) {
-       return deliver(g, [](qk::Connection& c) { return qk::invalidateCodeSigningInfoForAppsWithoutBundleContainer(c); });
-     }},
-}};
+const Group kGroups{
+    20,
+    {
+        {"groups paths",
+         "13, 16",
+         {kGroupUser, kIdentifierFlag, {"--system", nullptr, "the system group containers instead (user 499)"}},
+         {},
+         "Prints the group containers of a program, creating them.",
+         groupPaths},
+        {"groups ids",
+         "14",
+         {kGroupUser, kIdentifierFlag},
+         {},
+         "Prints the application group identifiers of a program.",
+         groupIds},
+        {"system-group-path",
+         "17",
+         {{"--group", "GROUP", "the system group identifier"}, kIdentifierFlag},
+         {"--group"},
+         "Prints the path of an entitled system group container.\nIt is made when missing.",
+         systemGroupPath},
+        {"codesign set",
+         "18",
+         {kIdentifierFlag,
+          {"--entitlements", "PLIST", "a property-list file of entitlements to register"},
+          {"--cs-info", "PLIST", "a whole code-signing dictionary to register"},
+          {"--remove", nullptr, "deletes the entry and what only it kept alive"},
+          {"--data-class", "CLASS", "the class of the program's data container"},
+          {"--parent", "ID", "the identifier of the program that contains this one"},
+          {"--placeholder", nullptr, "the entitlements of a placeholder"},
+          {"--by-caller", nullptr, "registered by the program itself"}},
+         {"--identifier", "--entitlements|--cs-info|--remove"},
+         "Registers or removes a program's code-signing information.",
+         codesignSet},
+        {"codesign get",
+         "19",
+         {kIdentifierFlag},
+         {"--identifier"},
+         "Prints a program's registered code-signing information.",
+         codesignGet},
+        {"codesign invalidate-missing",
+         "20",
+         {},
+         {},
+         "Invalidates entries of programs without a bundle container.",
+         [](G g, A) {
+           return deliver(
+               g, [](qk::Connection& c) { return qk::invalidateCodeSigningInfoForAppsWithoutBundleContainer(c); });
+         }},
+    }};
 
 const Registration kRegistration(kGroups);
 

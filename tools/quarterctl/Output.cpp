@@ -169,10 +169,14 @@ std::string printable(std::string_view text) {
       i += 1;
       continue;
     }
-    if (p == '\\') out += "\\\\";
-    else if (p == '\n') out += "\\n";
-    else if (p == '\t') out += "\\t";
-    else if (p == '\r') out += "\\r";
+    if (p == '\\')
+      out += "\\\\";
+    else if (p == '\n')
+      out += "\\n";
+    else if (p == '\t')
+      out += "\\t";
+    else if (p == '\r')
+      out += "\\r";
     else if (invisible(p)) {
       snprintf(buf, sizeof buf, p < 0x80 ? "\\x%02x" : "\\u%04x", static_cast<unsigned>(p));
       out += buf;

@@ -21,8 +21,8 @@ constexpr uint64_t kMaxUser = 4294967294u;  // 2^32 - 1 is no user
 constexpr size_t kMaxIdentifier = 255;
 
 const char* const kClassNames[] = {
-    nullptr,          "app-bundle", "app-data", "addon-bundle",    "addon-data", "vpn-bundle", "vpn-data",
-    "group",          "framework",  "relay-service", "internal-daemon", "temp-dir", "system", "system-group",
+    nullptr, "app-bundle", "app-data",      "addon-bundle",    "addon-data", "vpn-bundle", "vpn-data",
+    "group", "framework",  "relay-service", "internal-daemon", "temp-dir",   "system",     "system-group",
 };
 
 }  // namespace
@@ -55,7 +55,8 @@ void parseLong(const std::vector<std::string>& args, size_t first, const std::ve
   for (std::string& a : storage) argv.push_back(a.data());
   argv.push_back(nullptr);
   std::vector<option> table;
-  for (const LongOption& o : longs) table.push_back({o.name, o.hasValue ? required_argument : no_argument, nullptr, o.val});
+  for (const LongOption& o : longs)
+    table.push_back({o.name, o.hasValue ? required_argument : no_argument, nullptr, o.val});
   table.push_back({nullptr, 0, nullptr, 0});
   const int argc = static_cast<int>(storage.size());
   optind = 0;  // a full restart: this runs once per word list
@@ -181,7 +182,7 @@ uint64_t parseClass(const std::string& text, const std::string& what) {
 
 std::string className(uint64_t containerClass) {
   return containerClass >= 1 && containerClass < std::size(kClassNames) ? kClassNames[containerClass]
-                                                                         : std::to_string(containerClass);
+                                                                        : std::to_string(containerClass);
 }
 
 std::string classList() {
@@ -207,8 +208,12 @@ void checkMessageSize(const plist::Value& message, const std::string& what) {
 
 uint64_t ownerFor(uint64_t containerClass) {
   switch (containerClass) {
-    case 1: case 3: case 5: case 8: return 33;
-    case 12: case 13: return 499;
+    case 1:
+    case 3:
+    case 5:
+    case 8: return 33;
+    case 12:
+    case 13: return 499;
     default: return 1;
   }
 }

@@ -33,7 +33,8 @@ Registration::Registration(const Group& group) {
 
 namespace {
 
-const char kUsageHead[] = R"(usage: quarterctl [--root DIR | --socket PATH] [--json] [--timeout SECONDS] COMMAND [OPTIONS]
+const char kUsageHead[] =
+    R"(usage: quarterctl [--root DIR | --socket PATH] [--json] [--timeout SECONDS] COMMAND [OPTIONS]
        quarterctl COMMAND --help
 
 Sends one request to quarterd and prints its reply.
@@ -171,8 +172,9 @@ Args parseArgs(const Subcommand& row, std::vector<std::string> args, size_t firs
     longs.push_back({row.flags[i].name + 2, row.flags[i].value != nullptr, kBase + static_cast<int>(i)});
     human = human || std::string_view(row.flags[i].name) == "--human-readable";
   }
-  if (human) std::replace(args.begin() + static_cast<std::ptrdiff_t>(first), args.end(), std::string("-h"),
-                          std::string("--human-readable"));
+  if (human)
+    std::replace(args.begin() + static_cast<std::ptrdiff_t>(first), args.end(), std::string("-h"),
+                 std::string("--human-readable"));
   parseLong(args, first, longs, row.name, row.words != nullptr, [&](int c, const char* value) {
     if (c == 1) return a.words.push_back(value);
     a.given.emplace_back(row.flags[static_cast<size_t>(c - kBase)].name, value ? value : "");
@@ -196,16 +198,25 @@ Global parseOptions(int argc, char** argv, bool* help, bool* version) {
   bool rootGiven = false;
   enum { kRoot = 1000, kSocket, kJson, kTimeout };
   static const option kLong[] = {
-      {"root", required_argument, nullptr, kRoot}, {"socket", required_argument, nullptr, kSocket},
-      {"json", no_argument, nullptr, kJson},       {"timeout", required_argument, nullptr, kTimeout},
-      {"help", no_argument, nullptr, 'h'},         {"version", no_argument, nullptr, 'V'},
+      {"root", required_argument, nullptr, kRoot},
+      {"socket", required_argument, nullptr, kSocket},
+      {"json", no_argument, nullptr, kJson},
+      {"timeout", required_argument, nullptr, kTimeout},
+      {"help", no_argument, nullptr, 'h'},
+      {"version", no_argument, nullptr, 'V'},
       {nullptr, 0, nullptr, 0},
   };
   opterr = 0;
   for (int c; (c = getopt_long(argc, argv, "+:hV", kLong, nullptr)) != -1;) {
     switch (c) {
-      case kRoot: options.deviceRoot = optarg; rootGiven = true; break;
-      case kSocket: options.socketPath = optarg; options.socketGiven = true; break;
+      case kRoot:
+        options.deviceRoot = optarg;
+        rootGiven = true;
+        break;
+      case kSocket:
+        options.socketPath = optarg;
+        options.socketGiven = true;
+        break;
       case kJson: options.json = true; break;
       case kTimeout: {
         uint64_t seconds = parseUnsigned(optarg, "--timeout");
@@ -223,7 +234,8 @@ Global parseOptions(int argc, char** argv, bool* help, bool* version) {
   if (rootGiven && options.deviceRoot.empty()) throw UsageError{"--root needs a directory"};
   // QuarterKit knows where the sockets are: under a device root, or the host's.
   if (!options.socketGiven)
-    options.socketPath = options.deviceRoot.empty() ? qk::requestSocketPath() : qk::requestSocketPath(options.deviceRoot);
+    options.socketPath =
+        options.deviceRoot.empty() ? qk::requestSocketPath() : qk::requestSocketPath(options.deviceRoot);
   options.args.assign(argv + optind, argv + argc);
   return options;
 }
@@ -286,8 +298,6 @@ int main(int argc, char** argv) {
   } catch (const ctl::UsageError& e) {
     // Messages quote what was given, which may come from anywhere.
     std::cerr << "quarterctl: " << ctl::printable(e.message) << "\n(quarterctl --help for usage)\n";
-  } catch (const std::exception& e) {
-    std::cerr << "quarterctl: " << ctl::printable(e.what()) << '\n';
-  }
+  } catch (const std::exception& e) { std::cerr << "quarterctl: " << ctl::printable(e.what()) << '\n'; }
   return ctl::kExitUsage;
 }

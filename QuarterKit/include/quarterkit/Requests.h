@@ -155,8 +155,7 @@ Result processCodeSigningInfo(Connection& c, const std::optional<std::string>& i
 Result codeSigningInfoForIdentifier(Connection& c, const std::optional<std::string>& identifier);
 Result invalidateCodeSigningInfoForAppsWithoutBundleContainer(Connection& c);
 Result setDataProtection(Connection& c, uint64_t userId, const std::optional<std::string>& identifier,
-                         uint64_t containerClass, int64_t dataProtectionClass, bool isThirdParty,
-                         bool retryIfLocked);
+                         uint64_t containerClass, int64_t dataProtectionClass, bool isThirdParty, bool retryIfLocked);
 Result recreateContainerStructure(Connection& c, const ContainerRef& container);
 Result diskUsage(Connection& c, const ContainerRef& container);
 inline Result createOrLookupContainer(Connection& c, uint64_t userId, std::optional<std::string> identifier,
