@@ -2,6 +2,9 @@
 
 #include <sqlite3.h>
 
+#include <unordered_map>
+#include <utility>
+
 #include "base/PlistCodec.h"
 #include "platform/Log.h"
 
@@ -51,20 +54,72 @@ constexpr const char* kSelectChildren =
     "SELECT child_bundles.child_code_signing_id_text FROM child_bundles, code_signing_info WHERE "
     "code_signing_info.code_signing_id_text = ? AND child_bundles.parent_id=code_signing_info.id;";
 
-// A prepared statement, finalized on every way out.
+}  // namespace
+
+// The connection's statements, each prepared once (persistent) and reset
+// after every use. A statement already in use (a nested call) gets a copy of
+// its own for that call.
+class QRTSQLiteDBStatementCache {
+ public:
+  QRTSQLiteDBStatementCache(sqlite3* db, const QRTURL& url) : db(db), url(url) {}
+  ~QRTSQLiteDBStatementCache() { close(); }
+  // Before the connection closes; later uses find no connection.
+  void close() {
+    for (auto& [sql, slot] : slots) finalize(slot.statement);
+    slots.clear();
+    db = nullptr;
+  }
+  void finalize(sqlite3_stmt* statement) const {
+    if (statement && sqlite3_finalize(statement) != SQLITE_OK) {
+      QRTLog(kLogError, "sqlite3_finalize for %@ failed: %s", url, sqlite3_errmsg(db));
+    }
+  }
+
+  sqlite3* db;
+  const QRTURL& url;
+  struct Slot {
+    sqlite3_stmt* statement = nullptr;
+    bool inUse = false;
+  };
+  // Keyed by the text's address: every statement is one of the constants above.
+  std::unordered_map<const char*, Slot> slots;
+};
+
+namespace {
+
+// A statement of the connection for one use: bindings and state are reset on
+// every way out.
 class Statement {
  public:
-  Statement(sqlite3* db, const char* sql, const QRTURL& url) : db_(db), url_(url) {
-    rc_ = sqlite3_prepare_v2(db, sql, -1, &stmt_, nullptr);
+  Statement(QRTSQLiteDBStatementCache& cache, const char* sql) : cache_(cache) {
+    QRTSQLiteDBStatementCache::Slot& slot = cache.slots[sql];
+    if (slot.statement && !slot.inUse) {
+      slot_ = &slot;
+    } else if (sqlite3_prepare_v3(cache.db, sql, -1, slot.inUse ? 0 : SQLITE_PREPARE_PERSISTENT, &stmt_, nullptr) !=
+               SQLITE_OK) {
+      cache.finalize(std::exchange(stmt_, nullptr));
+      return;
+    } else if (!slot.inUse) {
+      slot.statement = stmt_;
+      slot_ = &slot;
+    }
+    if (slot_) {
+      slot_->inUse = true;
+      stmt_ = slot_->statement;
+    }
   }
   ~Statement() {
-    if (stmt_ && sqlite3_finalize(stmt_) != SQLITE_OK) {
-      QRTLog(kLogError, "sqlite3_finalize for %@ failed: %s", url_, sqlite3_errmsg(db_));
+    if (!slot_) {
+      cache_.finalize(stmt_);
+      return;
     }
+    sqlite3_reset(stmt_);
+    sqlite3_clear_bindings(stmt_);
+    slot_->inUse = false;
   }
   Statement(const Statement&) = delete;
   Statement& operator=(const Statement&) = delete;
-  bool prepared() const { return rc_ == SQLITE_OK && stmt_; }
+  bool prepared() const { return stmt_ != nullptr; }
   sqlite3_stmt* get() const { return stmt_; }
   bool bindText(int index, const std::string& text) {
     return sqlite3_bind_text(stmt_, index, text.c_str(), -1, SQLITE_TRANSIENT) == SQLITE_OK;
@@ -72,10 +127,9 @@ class Statement {
   bool bindInt(int index, int value) { return sqlite3_bind_int(stmt_, index, value) == SQLITE_OK; }
 
  private:
-  sqlite3* db_;
-  const QRTURL& url_;
+  QRTSQLiteDBStatementCache& cache_;
+  QRTSQLiteDBStatementCache::Slot* slot_ = nullptr;
   sqlite3_stmt* stmt_ = nullptr;
-  int rc_ = SQLITE_ERROR;
 };
 
 #define DB_ERROR(underlying, ...) \
@@ -89,9 +143,11 @@ bool isError(const QRTErrorRef& error, QRTErrorCode code) {
 
 // The private building blocks share the connection and the URL.
 struct QRTSQLiteDBStatements {
-  static QRTErrorRef performTwoParameterQuery(sqlite3* db, const QRTURL& url, const char* sql, const std::string& one,
+  static QRTErrorRef performTwoParameterQuery(QRTSQLiteDBStatementCache& cache, const char* sql, const std::string& one,
                                               const std::optional<std::string>& two, int expectedChanges) {
-    Statement statement(db, sql, url);
+    sqlite3* const db = cache.db;
+    const QRTURL& url = cache.url;
+    Statement statement(cache, sql);
     if (!statement.prepared())
       return DB_ERROR(nullptr, "sqlite3_prepare(insert) for %@ failed: %s", url, sqlite3_errmsg(db));
     if (!statement.bindText(1, one)) {
@@ -111,10 +167,12 @@ struct QRTSQLiteDBStatements {
     return nullptr;
   }
 
-  static QRTErrorRef performInsertOrUpdateQuery(sqlite3* db, const QRTURL& url, const char* sql,
+  static QRTErrorRef performInsertOrUpdateQuery(QRTSQLiteDBStatementCache& cache, const char* sql,
                                                 const QRTCodeSigningEntry& entry, const std::string& identifier,
                                                 bool isUpdate) {
-    Statement statement(db, sql, url);
+    sqlite3* const db = cache.db;
+    const QRTURL& url = cache.url;
+    Statement statement(cache, sql);
     if (!statement.prepared())
       return DB_ERROR(nullptr, "sqlite3_prepare(insert) for %@ failed: %s", url, sqlite3_errmsg(db));
     if (!statement.bindInt(1, entry.invalid)) {
@@ -149,21 +207,23 @@ struct QRTSQLiteDBStatements {
     return nullptr;
   }
 
-  static QRTErrorRef insertCodeSigningInfo(sqlite3* db, const QRTURL& url, const QRTCodeSigningEntry& entry,
+  static QRTErrorRef insertCodeSigningInfo(QRTSQLiteDBStatementCache& cache, const QRTCodeSigningEntry& entry,
                                            const std::string& identifier) {
-    QRTErrorRef error = performInsertOrUpdateQuery(db, url, kUpdateInfo, entry, identifier, true);
+    QRTErrorRef error = performInsertOrUpdateQuery(cache, kUpdateInfo, entry, identifier, true);
     if (!error) return nullptr;
     if (!isError(error, QRTErrorUnexpectedChangeCount)) {
       return DB_ERROR(error, "Error performing UPDATE operation for %@", identifier);
     }
-    error = performInsertOrUpdateQuery(db, url, kInsertInfo, entry, identifier, false);
+    error = performInsertOrUpdateQuery(cache, kInsertInfo, entry, identifier, false);
     if (error) return DB_ERROR(error, "Error performing INSERT operation for %@", identifier);
     return nullptr;
   }
 
-  static QRTErrorRef insertCodeSigningData(sqlite3* db, const QRTURL& url, const QRTCodeSigningEntry& entry,
+  static QRTErrorRef insertCodeSigningData(QRTSQLiteDBStatementCache& cache, const QRTCodeSigningEntry& entry,
                                            const std::string& identifier) {
-    Statement statement(db, kInsertData, url);
+    sqlite3* const db = cache.db;
+    const QRTURL& url = cache.url;
+    Statement statement(cache, kInsertData);
     if (!statement.prepared())
       return DB_ERROR(nullptr, "sqlite3_prepare(insert) for %@ failed: %s", url, sqlite3_errmsg(db));
     const plist::Value info = entry.codeSigningInfo ? plist::Value(*entry.codeSigningInfo) : plist::Value();
@@ -270,10 +330,14 @@ std::unique_ptr<QRTSQLiteDB> QRTSQLiteDB::initWithParentDirectoryURL(const QRTUR
   return std::unique_ptr<QRTSQLiteDB>(new QRTSQLiteDB(db, std::move(url)));
 }
 
+QRTSQLiteDB::QRTSQLiteDB(sqlite3* db, QRTURL url)
+    : db_(db), url_(std::move(url)), statements_(std::make_unique<QRTSQLiteDBStatementCache>(db_, url_)) {}
+
 QRTSQLiteDB::~QRTSQLiteDB() { closeDB(); }
 
 void QRTSQLiteDB::closeDB() {
   if (!db_) return;
+  statements_->close();
   QRTLog(kLogDebug, "closing %@", url_);
   const int rc = sqlite3_close(db_);
   if (rc != SQLITE_OK) QRTLog(kLogError, "sqlite3_close for %@ failed: %d", url_, rc);
@@ -289,11 +353,11 @@ bool QRTSQLiteDB::addCodeSigningEntry(const QRTCodeSigningEntry* entry,
     return false;
   }
   QRTErrorRef result = S::transaction(db_, [&]() -> QRTErrorRef {
-    if (QRTErrorRef failed = S::insertCodeSigningInfo(db_, url_, *entry, *withIdentifier)) return failed;
-    if (QRTErrorRef failed = S::insertCodeSigningData(db_, url_, *entry, *withIdentifier)) return failed;
+    if (QRTErrorRef failed = S::insertCodeSigningInfo(*statements_, *entry, *withIdentifier)) return failed;
+    if (QRTErrorRef failed = S::insertCodeSigningData(*statements_, *entry, *withIdentifier)) return failed;
     // A child that can't be written doesn't fail the parent.
     for (const std::string& child : entry->childBundleIdentifiers.value_or(std::vector<std::string>{})) {
-      S::performTwoParameterQuery(db_, url_, kInsertChild, child, *withIdentifier, -1);
+      S::performTwoParameterQuery(*statements_, kInsertChild, child, *withIdentifier, -1);
     }
     return nullptr;
   });
@@ -307,7 +371,7 @@ bool QRTSQLiteDB::deleteCodeSigningEntryWithIdentifier(const std::optional<std::
     QRTSetError(error, QRT_ERROR(QRTErrorInvalidArgument, nullptr, true, "\bidentifier %@ cannot be nil", nullptr));
     return false;
   }
-  if (QRTErrorRef failed = S::performTwoParameterQuery(db_, url_, kDelete, *identifier, std::nullopt, 1)) {
+  if (QRTErrorRef failed = S::performTwoParameterQuery(*statements_, kDelete, *identifier, std::nullopt, 1)) {
     QRTSetError(error, DB_ERROR(failed, "failed to delete from code_signing_info"));
     return false;
   }
@@ -319,7 +383,7 @@ std::optional<QRTCodeSigningEntry> QRTSQLiteDB::codeSigningEntryWithIdentifier(c
   QRTErrorRef failure;
   std::optional<QRTCodeSigningEntry> entry;
   {
-    Statement statement(db_, kSelectEntry, url_);
+    Statement statement(*statements_, kSelectEntry);
     if (!statement.prepared()) {
       failure = DB_ERROR(nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_, sqlite3_errmsg(db_));
     } else if (!statement.bindText(1, identifier)) {
@@ -356,7 +420,7 @@ std::optional<QRTCodeSigningEntry> QRTSQLiteDB::codeSigningEntryWithIdentifier(c
 }
 
 bool QRTSQLiteDB::invalidateCodeSigningWithIdentifier(const std::string& identifier, QRTErrorRef* error) {
-  if (QRTErrorRef failed = S::performTwoParameterQuery(db_, url_, kInvalidate, identifier, std::nullopt, -1)) {
+  if (QRTErrorRef failed = S::performTwoParameterQuery(*statements_, kInvalidate, identifier, std::nullopt, -1)) {
     QRTSetError(error, DB_ERROR(failed, "failed to invalidate identifier %@", identifier));
     return false;
   }
@@ -390,7 +454,7 @@ bool QRTSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::st
 
 QRTErrorRef QRTSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(
     const std::function<void(const std::string& identifier, const QRTCodeSigningEntry& entry)>& block) {
-  Statement statement(db_, kSelectAll, url_);
+  Statement statement(*statements_, kSelectAll);
   if (!statement.prepared())
     return DB_ERROR(nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_, sqlite3_errmsg(db_));
   QRTErrorRef result;
@@ -423,7 +487,7 @@ QRTErrorRef QRTSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(
 
 std::optional<std::vector<std::string>> QRTSQLiteDB::childIdentifiersForParentIdentifier(const std::string& identifier,
                                                                                          QRTErrorRef* error) {
-  Statement statement(db_, kSelectChildren, url_);
+  Statement statement(*statements_, kSelectChildren);
   if (!statement.prepared()) {
     QRTSetError(error, DB_ERROR(nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_, sqlite3_errmsg(db_)));
     return std::nullopt;

@@ -16,6 +16,7 @@
 #include "Daemon/codesign/QRTCodeSigningEntry.h"
 
 struct sqlite3;
+class QRTSQLiteDBStatementCache;
 
 class QRTSQLiteDB {
  public:
@@ -45,8 +46,10 @@ class QRTSQLiteDB {
                                                                               QRTErrorRef* error);
 
  private:
-  QRTSQLiteDB(sqlite3* db, QRTURL url) : db_(db), url_(std::move(url)) {}
+  QRTSQLiteDB(sqlite3* db, QRTURL url);
 
   sqlite3* db_ = nullptr;
   QRTURL url_;
+  // Statements prepared once for the connection's life.
+  std::unique_ptr<QRTSQLiteDBStatementCache> statements_;
 };
