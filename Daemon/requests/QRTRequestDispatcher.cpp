@@ -22,7 +22,7 @@ bool requestIdentifiersValid(const plist::Dictionary& request, uint32_t callerUi
 }  // namespace
 
 void QRTReply::send(uint64_t code) {
-  dictionary["ReplyError"] = code;
+  dictionary[QRTReplyKeyError] = code;
   const platform::SendResult sent = connection_->send(messageId_, dictionary);
   done();
   if (sent != platform::SendResult::TooLarge) return;
@@ -30,43 +30,63 @@ void QRTReply::send(uint64_t code) {
   QRTLog(kLogError, "Reply to message %llu with code %llu does not fit in one frame; answering %llu",
          static_cast<unsigned long long>(messageId_), static_cast<unsigned long long>(code),
          static_cast<unsigned long long>(QRTErrorException));
-  connection_->send(messageId_, plist::Dictionary{{"ReplyError", static_cast<uint64_t>(QRTErrorException)}});
+  connection_->send(messageId_, plist::Dictionary{{QRTReplyKeyError, static_cast<uint64_t>(QRTErrorException)}});
 }
 
 #define SERVED(n, name, handler, entitlement, flag) \
   { n, name, handler, entitlement, flag }
 const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
-    SERVED(0, "createOrLookupContainer", QRTHandleCreateOrLookupContainer, QRTEntitlementNone, 1),
-    SERVED(1, "containersForUser", QRTHandleContainersForUser, QRTEntitlementAllowed, 1),
-    SERVED(2, "replaceContainer", QRTHandleReplaceContainer, QRTEntitlementAllowed, 1),
-    SERVED(3, "stageContainerForDelete", QRTHandleStageContainerForDelete, QRTEntitlementAllowed, 1),
-    SERVED(4, "deleteContainersOnDeathRow", QRTHandleDeleteContainersOnDeathRow, QRTEntitlementAllowed, 0),
-    SERVED(5, "setInfoValue", QRTHandleSetInfoValue, QRTEntitlementAllowed, 1),
-    SERVED(6, "infoValueForKey", QRTHandleInfoValueForKey, QRTEntitlementAllowed, 1),
-    SERVED(7, "metadataForContainer", QRTHandleMetadataForContainer, QRTEntitlementAllowed, 1),
-    SERVED(8, "recreateDefaultStructure", QRTHandleRecreateDefaultStructure, QRTEntitlementAllowed, 1),
-    SERVED(9, "regenerateDirectoryUUID", QRTHandleRegenerateDirectoryUUID, QRTEntitlementAllowed, 1),
-    SERVED(10, "deleteContainer", QRTHandleDeleteContainer, QRTEntitlementAllowed, 1),
-    SERVED(11, "wipeAddonDataContainer", QRTHandleWipeAddonDataContainer, QRTEntitlementWipeContainer, 1),
-    SERVED(12, "deleteDataContainerContent", QRTHandleDeleteDataContainerContent, QRTEntitlementAllowed, 1),
-    SERVED(13, "groupContainerPaths", QRTHandleGroupContainerPaths, QRTEntitlementNone, 1),
-    SERVED(14, "groupContainerIdentifiers", QRTHandleGroupContainerIdentifiers, QRTEntitlementAllowed, 1),
-    SERVED(15, "systemContainerPath", QRTHandleSystemContainerPath, QRTEntitlementNone, 1),
-    SERVED(16, "systemGroupContainerPaths", QRTHandleSystemGroupContainerPaths, QRTEntitlementNone, 1),
-    SERVED(17, "systemGroupContainerPath", QRTHandleSystemGroupContainerPath, QRTEntitlementNone, 1),
-    SERVED(18, "processCodeSigningInfo", QRTHandleProcessCodeSigningInfo, QRTEntitlementAllowed, 1),
-    SERVED(19, "codeSigningInfoForIdentifier", QRTHandleCodeSigningInfoForIdentifier, QRTEntitlementAllowed, 1),
-    SERVED(20, "invalidateCodeSigningInfoForAppsWithoutBundleContainer",
+    SERVED(QRTCommandCreateOrLookupContainer, "createOrLookupContainer", QRTHandleCreateOrLookupContainer,
+           QRTEntitlementNone, 1),
+    SERVED(QRTCommandContainersForUser, "containersForUser", QRTHandleContainersForUser, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandReplaceContainer, "replaceContainer", QRTHandleReplaceContainer, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandStageContainerForDelete, "stageContainerForDelete", QRTHandleStageContainerForDelete,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandDeleteContainersOnDeathRow, "deleteContainersOnDeathRow", QRTHandleDeleteContainersOnDeathRow,
+           QRTEntitlementAllowed, 0),
+    SERVED(QRTCommandSetInfoValue, "setInfoValue", QRTHandleSetInfoValue, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandInfoValueForKey, "infoValueForKey", QRTHandleInfoValueForKey, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandMetadataForContainer, "metadataForContainer", QRTHandleMetadataForContainer, QRTEntitlementAllowed,
+           1),
+    SERVED(QRTCommandRecreateDefaultStructure, "recreateDefaultStructure", QRTHandleRecreateDefaultStructure,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandRegenerateDirectoryUUID, "regenerateDirectoryUUID", QRTHandleRegenerateDirectoryUUID,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandDeleteContainer, "deleteContainer", QRTHandleDeleteContainer, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandWipeAddonDataContainer, "wipeAddonDataContainer", QRTHandleWipeAddonDataContainer,
+           QRTEntitlementWipeContainer, 1),
+    SERVED(QRTCommandDeleteDataContainerContent, "deleteDataContainerContent", QRTHandleDeleteDataContainerContent,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandGroupContainerPaths, "groupContainerPaths", QRTHandleGroupContainerPaths, QRTEntitlementNone, 1),
+    SERVED(QRTCommandGroupContainerIdentifiers, "groupContainerIdentifiers", QRTHandleGroupContainerIdentifiers,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandSystemContainerPath, "systemContainerPath", QRTHandleSystemContainerPath, QRTEntitlementNone, 1),
+    SERVED(QRTCommandSystemGroupContainerPaths, "systemGroupContainerPaths", QRTHandleSystemGroupContainerPaths,
+           QRTEntitlementNone, 1),
+    SERVED(QRTCommandSystemGroupContainerPath, "systemGroupContainerPath", QRTHandleSystemGroupContainerPath,
+           QRTEntitlementNone, 1),
+    SERVED(QRTCommandProcessCodeSigningInfo, "processCodeSigningInfo", QRTHandleProcessCodeSigningInfo,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandCodeSigningInfoForIdentifier, "codeSigningInfoForIdentifier",
+           QRTHandleCodeSigningInfoForIdentifier, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandInvalidateCodeSigningInfoForAppsWithoutBundleContainer,
+           "invalidateCodeSigningInfoForAppsWithoutBundleContainer",
            QRTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, QRTEntitlementAllowed, 1),
-    SERVED(21, "setDataProtection", QRTHandleSetDataProtection, QRTEntitlementAllowed, 0),
-    SERVED(22, "recreateContainerStructure", QRTHandleRecreateDefaultStructure, QRTEntitlementAllowed, 1),
-    SERVED(23, "diskUsage", QRTHandleDiskUsage, QRTEntitlementAllowed, 1),
-    SERVED(24, "performDataMigration", QRTHandlePerformDataMigration, QRTEntitlementDataMigration, 1),
-    SERVED(25, "retryTest", QRTHandleRetryTest, QRTEntitlementAllowed, 1),
-    SERVED(26, "stageSharedContent", QRTHandleStageSharedContent, QRTEntitlementStageSharedContent, 1),
-    SERVED(27, "setNetworkExtension", QRTHandleSetNetworkExtension, QRTEntitlementNetworkExtension, 1),
-    SERVED(28, "userManagedAssetsPath", QRTHandleUserManagedAssetsPath, QRTEntitlementUserManagedAssets, 1),
-    SERVED(29, "deleteUserManagedAsset", QRTHandleDeleteUserManagedAsset, QRTEntitlementUserManagedAssets, 1),
+    SERVED(QRTCommandSetDataProtection, "setDataProtection", QRTHandleSetDataProtection, QRTEntitlementAllowed, 0),
+    SERVED(QRTCommandRecreateContainerStructure, "recreateContainerStructure", QRTHandleRecreateDefaultStructure,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandDiskUsage, "diskUsage", QRTHandleDiskUsage, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandPerformDataMigration, "performDataMigration", QRTHandlePerformDataMigration,
+           QRTEntitlementDataMigration, 1),
+    SERVED(QRTCommandRetryTest, "retryTest", QRTHandleRetryTest, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandStageSharedContent, "stageSharedContent", QRTHandleStageSharedContent,
+           QRTEntitlementStageSharedContent, 1),
+    SERVED(QRTCommandSetNetworkExtension, "setNetworkExtension", QRTHandleSetNetworkExtension,
+           QRTEntitlementNetworkExtension, 1),
+    SERVED(QRTCommandUserManagedAssetsPath, "userManagedAssetsPath", QRTHandleUserManagedAssetsPath,
+           QRTEntitlementUserManagedAssets, 1),
+    SERVED(QRTCommandDeleteUserManagedAsset, "deleteUserManagedAsset", QRTHandleDeleteUserManagedAsset,
+           QRTEntitlementUserManagedAssets, 1),
 };
 #undef SERVED
 
@@ -80,7 +100,7 @@ void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::R
   const plist::Dictionary& request = *event.message;
   const auto& peer = connection->peer();
   platform::RefusalScope refusals(peer ? peer->uid : UINT32_MAX);
-  uint64_t command = QRTMessageU64(request, "Command");
+  uint64_t command = QRTMessageU64(request, QRTKeyCommand);
   auto reply = std::make_shared<QRTReply>(connection, event.messageId);
   uint64_t result = QRTErrorNone;
   bool handled = false;
@@ -301,12 +321,12 @@ bool requestIdentifiersValid(const plist::Dictionary& request, uint32_t callerUi
                   static_cast<unsigned long long>(command), callerUid);
     return false;
   };
-  for (const char* key : {"Identifier", "GroupIdentifier", "OldIdentifier", "NewIdentifier"}) {
+  for (const char* key : {QRTKeyIdentifier, QRTKeyGroupIdentifier, QRTKeyOldIdentifier, QRTKeyNewIdentifier}) {
     if (const plist::Value* value = plist::find(request, key); value && !check(key, *value)) return false;
   }
-  if (const plist::Value* list = plist::find(request, "IdentifiersArray"); list && list->arrayIf()) {
+  if (const plist::Value* list = plist::find(request, QRTKeyIdentifiersArray); list && list->arrayIf()) {
     for (const plist::Value& item : list->array())
-      if (!check("IdentifiersArray", item)) return false;
+      if (!check(QRTKeyIdentifiersArray, item)) return false;
   }
   return true;
 }
@@ -350,6 +370,6 @@ const plist::Value* QRTMessageObject(const plist::Dictionary& message, std::stri
 std::optional<std::string> QRTMessageIdentifier(const plist::Dictionary& message,
                                                 const std::optional<std::string>& clientIdentifier) {
   // A mistyped identifier reads as missing, as every reader treats a wrong type.
-  if (std::optional<std::string> identifier = QRTMessageString(message, "Identifier")) return identifier;
+  if (std::optional<std::string> identifier = QRTMessageString(message, QRTKeyIdentifier)) return identifier;
   return clientIdentifier;
 }

@@ -11,18 +11,10 @@
 #include <string>
 
 #include "base/PlistValue.h"
+#include "base/QRTProtocol.h"
 #include "base/QRTUUID.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "platform/RequestSocket.h"
-
-inline constexpr const char* QRTEntitlementNone = "com.norvane.private.QuarterKit.none";
-inline constexpr const char* QRTEntitlementAllowed = "com.norvane.private.QuarterKit.allowed";
-inline constexpr const char* QRTEntitlementOtherIdLookup = "com.norvane.private.QuarterKit.otherIdLookup";
-inline constexpr const char* QRTEntitlementWipeContainer = "com.norvane.private.QuarterKit.wipeContainer";
-inline constexpr const char* QRTEntitlementDataMigration = "com.norvane.private.QuarterKit.dataMigration";
-inline constexpr const char* QRTEntitlementStageSharedContent = "com.norvane.private.QuarterKit.stageSharedContent";
-inline constexpr const char* QRTEntitlementNetworkExtension = "com.norvane.private.QuarterKit.networkExtension";
-inline constexpr const char* QRTEntitlementUserManagedAssets = "com.norvane.private.QuarterKit.userManagedAssets";
 
 // The reply of one request. Handlers fill dictionary; the commands that finish
 // later keep the reply and call send() themselves.
@@ -53,14 +45,13 @@ using QRTRequestHandler = void (*)(const plist::Dictionary& request, const QRTRe
                                    QRTClientConnection& client, uint64_t* result);
 
 struct QRTCommandRow {
-  uint64_t command;
+  QRTCommand command;
   const char* name;
   QRTRequestHandler handler;
   const char* entitlement;
   uint32_t replyOnReturn;
 };
 
-inline constexpr uint64_t QRTCommandCount = 30;
 extern const QRTCommandRow QRTCommandTable[QRTCommandCount];
 
 // The handler of every event on a client connection.
