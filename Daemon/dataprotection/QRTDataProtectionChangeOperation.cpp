@@ -14,6 +14,7 @@
 #include "Daemon/QRTDaemon.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTClientConnection.h"
+#include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTLocks.h"
 #include "platform/FileIO.h"
@@ -309,7 +310,8 @@ std::optional<plist::Dictionary> QRTDataProtectionChangeOperation::_readAndValid
     return invalid(QRT_ERROR(QRTErrorInvalidMetadata, nullptr, false, "Invalid update info Identifier: %@ at %@",
                              foundValue(*d, kIdentifierKey), *url));
   const plist::Integer* containerClass = integerAt(*d, kContainerClassKey);
-  if (!containerClass || containerClass->asUnsigned() < 1 || containerClass->asUnsigned() > 13)
+  if (!containerClass || containerClass->asUnsigned() < QRTClassAppBundle ||
+      containerClass->asUnsigned() > QRTClassSystemGroup)
     return invalid(QRT_ERROR(QRTErrorInvalidMetadata, nullptr, false, "Invalid update info container class: %ld at %@",
                              static_cast<long>(containerClass ? containerClass->asSigned() : 0), *url));
   if (!integerAt(*d, kUserIdKey))

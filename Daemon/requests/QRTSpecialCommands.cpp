@@ -1,6 +1,7 @@
 #include "Daemon/requests/QRTSpecialCommands.h"
 
 #include "Daemon/migration/QRTContainerMigrator.h"
+#include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Log.h"
@@ -30,7 +31,9 @@ void QRTHandleRetryTest(const plist::Dictionary& request, const QRTReplyRef&, QR
     return;
   }
   uint32_t userId = 0;
-  if (!validateUserId(static_cast<uint32_t>(QRTMessageU64(request, QRTKeyUserID)), 2, client, &userId, result)) return;
+  if (!validateUserId(static_cast<uint32_t>(QRTMessageU64(request, QRTKeyUserID)), QRTClassAppData, client, &userId,
+                      result))
+    return;
   client.retryTestForUser(userId, QRTMessageU64(request, QRTKeyNumRetryCrashes), result);
 }
 

@@ -26,7 +26,6 @@ namespace {
 
 constexpr uint32_t kComplexBit = 0x80000000u;
 constexpr uint32_t kOutOfLineDescriptor = 1;
-constexpr uint32_t kSystemContainerUser = 499;
 
 struct KernRequest {
   std::optional<std::string> codeSignatureId, containerId, applicationId, systemContainerId;
@@ -108,12 +107,12 @@ uint64_t dataContainerClass(const std::string& identifier, uint32_t containerTyp
   QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
   uint64_t cls = mapping ? mapping->dataContainerTypeForIdentifier(identifier) : 0;
   if (QRTIsPerUserClass(cls)) {
-    if (containerType == 1 && cls != 4) {
+    if (containerType == 1 && cls != QRTClassAddonData) {
       QRTLog(kLogNotice, "SB Type: %u, EM Type: %llu.  Declaring this a plugin", containerType,
              static_cast<unsigned long long>(cls));
-      return 4;
+      return QRTClassAddonData;
     }
-    if (containerType == 0 && cls != 2) {
+    if (containerType == 0 && cls != QRTClassAppData) {
       QRTLog(kLogNotice, "SB type is app, but EM type is %llu", static_cast<unsigned long long>(cls));
     }
     return cls;
@@ -148,8 +147,8 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
     }
   }
   if (request.systemContainerId) {
-    QRTMetadataRef m = internal.createOrLookupContainerForUser(kSystemContainerUser, request.systemContainerId, true,
-                                                               12, false, true, &error);
+    QRTMetadataRef m = internal.createOrLookupContainerForUser(QRTSystemContainerUserId, request.systemContainerId,
+                                                               true, QRTClassSystemData, false, true, &error);
     if (m) {
       out->systemContainer = m->url();
     } else {
@@ -159,7 +158,8 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
     }
   }
   for (const std::string& group : request.appGroupIds) {
-    QRTMetadataRef m = internal.createOrLookupContainerForUser(request.personaId, group, true, 7, false, true, &error);
+    QRTMetadataRef m =
+        internal.createOrLookupContainerForUser(request.personaId, group, true, QRTClassAppGroup, false, true, &error);
     if (m) {
       out->groups.emplace_back(group, m->url().path());
     } else {
@@ -169,8 +169,8 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
     }
   }
   for (const std::string& group : request.systemGroupIds) {
-    QRTMetadataRef m =
-        internal.createOrLookupContainerForUser(kSystemContainerUser, group, true, 13, false, true, &error);
+    QRTMetadataRef m = internal.createOrLookupContainerForUser(QRTSystemContainerUserId, group, true,
+                                                               QRTClassSystemGroup, false, true, &error);
     if (m) {
       out->systemGroups.emplace_back(group, m->url().path());
     } else {
