@@ -350,8 +350,8 @@ QRTDataProtectionChangeOperation::Ref QRTDataProtectionChangeOperation::dataProt
   const uint64_t containerClass = integerAt(*d, kContainerClassKey)->asUnsigned();
   const auto userId = static_cast<uint32_t>(integerAt(*d, kUserIdKey)->asUnsigned());
   uint64_t code = QRTErrorNone;
-  QRTMetadataRef metadata =
-      internalClient().createOrLookupContainerForUser(userId, identifier, false, containerClass, false, true, &code);
+  QRTMetadataRef metadata = internalClient().createOrLookupContainerForUser(
+      {userId, containerClass, identifier}, QRTCreateMode::LookupOnly, QRTLocking::TakeLocks, &code);
   if (!metadata) {
     QRTSetError(error, QRT_ERROR(QRTErrorNotFound, nullptr, false,
                                  "Failed to lookup container metadata from file userId: %u, identifier: %@, Class: "
@@ -485,8 +485,9 @@ bool QRTDataProtectionChangeOperation::_runChange(bool* needToRetry, QRTErrorRef
   const auto containerClass = static_cast<unsigned long long>(m->containerClass());
   QRTIdentifierLock lock(m->uuid().UUIDString(), false);
   uint64_t code = QRTErrorNone;
-  QRTMetadataRef found = internalClient().createOrLookupContainerForUser(m->userId(), m->identifier(), false,
-                                                                         m->containerClass(), false, false, &code);
+  QRTMetadataRef found =
+      internalClient().createOrLookupContainerForUser({m->userId(), m->containerClass(), m->identifier()},
+                                                      QRTCreateMode::LookupOnly, QRTLocking::CallerHoldsLocks, &code);
   if (!found) {
     QRTSetError(error, QRT_ERROR(QRTErrorNotFound, nullptr, false,
                                  "Failed to lookup container to set data protection for userId: %u, identifier: %@, "

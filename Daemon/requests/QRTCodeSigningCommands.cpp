@@ -95,8 +95,9 @@ void QRTHandleSystemGroupContainerPath(const plist::Dictionary& request, const Q
   } else if ((group && QRTWhitelist::sharedWhitelist().systemGroupContainerIdIsWellknown(*group)) ||
              client.allowGroupIdLookup()) {
     client.setAllowGroupIdLookup(true);
-    auto metadata = client.createOrLookupContainerForUser(QRTSystemContainerUserId, group, true, QRTClassSystemGroup,
-                                                          false, true, result);
+    auto metadata =
+        client.createOrLookupContainerForUser({QRTSystemContainerUserId, QRTClassSystemGroup, group},
+                                              QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, result);
     if (metadata) path = metadata->url().path();
   } else {
     if (group != kQuietSystemGroup) {

@@ -55,10 +55,11 @@ void QRTHandleCreateOrLookupContainer(const plist::Dictionary& request, const QR
     return;
   std::optional<uint32_t> userId = checkedUser(request, containerClass, client, result);
   if (!userId) return;
-  auto metadata =
-      client.createOrLookupContainerForUser(*userId, QRTMessageIdentifier(request, client.clientBundleIdentifier()),
-                                            QRTMessageBool(request, QRTKeyCreateIfNecessary), containerClass,
-                                            QRTMessageBool(request, QRTKeyTransient), true, result);
+  auto metadata = client.createOrLookupContainerForUser(
+      {*userId, containerClass, QRTMessageIdentifier(request, client.clientBundleIdentifier()),
+       QRTMessageBool(request, QRTKeyTransient)},
+      QRTMessageBool(request, QRTKeyCreateIfNecessary) ? QRTCreateMode::CreateIfMissing : QRTCreateMode::LookupOnly,
+      QRTLocking::TakeLocks, result);
   if (!metadata) return;
   reply->dictionary[QRTReplyKeyUUID] = uuidData(metadata->uuid());
   reply->dictionary[QRTReplyKeyExisted] = metadata->existed();
@@ -74,8 +75,8 @@ void QRTHandleSystemContainerPath(const plist::Dictionary& request, const QRTRep
       QRTWhitelist::sharedWhitelist().systemContainerIdIsWellknown(*identifier)) {
     client.setAllowOtherIdLookup(true);
   }
-  auto metadata = client.createOrLookupContainerForUser(QRTSystemContainerUserId, identifier, true, QRTClassSystemData,
-                                                        false, true, result);
+  auto metadata = client.createOrLookupContainerForUser({QRTSystemContainerUserId, QRTClassSystemData, identifier},
+                                                        QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, result);
   if (metadata) reply->dictionary[QRTReplyKeyPath] = metadata->url().path();
 }
 

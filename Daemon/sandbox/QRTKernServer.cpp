@@ -136,8 +136,8 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
   uint64_t error = 1;
   if (identifier) {
     uint64_t cls = dataContainerClass(*identifier, request.containerType);
-    QRTMetadataRef m =
-        internal.createOrLookupContainerForUser(request.personaId, identifier, true, cls, false, true, &error);
+    QRTMetadataRef m = internal.createOrLookupContainerForUser(
+        {request.personaId, cls, identifier}, QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &error);
     if (m) {
       out->dataContainer = m->url();
     } else {
@@ -147,8 +147,9 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
     }
   }
   if (request.systemContainerId) {
-    QRTMetadataRef m = internal.createOrLookupContainerForUser(QRTSystemContainerUserId, request.systemContainerId,
-                                                               true, QRTClassSystemData, false, true, &error);
+    QRTMetadataRef m = internal.createOrLookupContainerForUser(
+        {QRTSystemContainerUserId, QRTClassSystemData, request.systemContainerId}, QRTCreateMode::CreateIfMissing,
+        QRTLocking::TakeLocks, &error);
     if (m) {
       out->systemContainer = m->url();
     } else {
@@ -158,8 +159,8 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
     }
   }
   for (const std::string& group : request.appGroupIds) {
-    QRTMetadataRef m =
-        internal.createOrLookupContainerForUser(request.personaId, group, true, QRTClassAppGroup, false, true, &error);
+    QRTMetadataRef m = internal.createOrLookupContainerForUser(
+        {request.personaId, QRTClassAppGroup, group}, QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &error);
     if (m) {
       out->groups.emplace_back(group, m->url().path());
     } else {
@@ -169,8 +170,9 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
     }
   }
   for (const std::string& group : request.systemGroupIds) {
-    QRTMetadataRef m = internal.createOrLookupContainerForUser(QRTSystemContainerUserId, group, true,
-                                                               QRTClassSystemGroup, false, true, &error);
+    QRTMetadataRef m =
+        internal.createOrLookupContainerForUser({QRTSystemContainerUserId, QRTClassSystemGroup, group},
+                                                QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &error);
     if (m) {
       out->systemGroups.emplace_back(group, m->url().path());
     } else {

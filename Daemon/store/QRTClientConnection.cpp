@@ -173,11 +173,14 @@ QRTMetadataRef QRTClientConnection::_createNewContainer(uint32_t userId, const s
   return nullptr;
 }
 
-QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(uint32_t userId,
-                                                                   const std::optional<std::string>& identifier,
-                                                                   bool createIfNecessary, uint64_t containerClass,
-                                                                   bool transient, bool useLocking,
-                                                                   uint64_t* withError) {
+QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(const QRTContainerKey& key, QRTCreateMode mode,
+                                                                   QRTLocking locking, uint64_t* withError) {
+  const uint32_t userId = key.userId;
+  const uint64_t containerClass = key.containerClass;
+  const std::optional<std::string>& identifier = key.identifier;
+  const bool createIfNecessary = mode == QRTCreateMode::CreateIfMissing;
+  const bool transient = key.transient;
+  const bool useLocking = locking == QRTLocking::TakeLocks;
   if (!identifier || containerClass < QRTClassAppBundle || containerClass > QRTClassSystemGroup) {
     reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
                          "Can't act on an invalid object: userId: %u, ID: %@, class: %ld", userId, identifier,
@@ -200,7 +203,8 @@ QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(uint32_t user
            "to do this. File a Bugline in \"QuarterKit | all\"",
            clientBundleIdentifier_, static_cast<long>(containerClass), identifier);
   }
-  if (containerClass == 12 && !allowOtherIdLookup_ && (!codeSigningGrantsSystemContainer(*identifier) || foreign)) {
+  if (containerClass == QRTClassSystemData && !allowOtherIdLookup_ &&
+      (!codeSigningGrantsSystemContainer(*identifier) || foreign)) {
     reportCode(QRT_ERROR(QRTErrorNotEntitled, nullptr, true, "%@ not entitled for system container with identifier %@",
                          clientBundleIdentifier_, identifier),
                withError);

@@ -275,7 +275,8 @@ void QRTClientConnection::setNetworkExtensionForUser(uint32_t userId, const std:
                         withError);
     }
     uint64_t code = QRTErrorNone;
-    QRTMetadataRef m = createOrLookupContainerForUser(userId, identifier, true, containerClass, false, true, &code);
+    QRTMetadataRef m = createOrLookupContainerForUser({userId, containerClass, identifier},
+                                                      QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code);
     if (!m) {
       QRTLog(kLogError, "Failed to create VPN Plugin container for tunnelbroker: %llu, ID: %@, class: %llu",
              static_cast<unsigned long long>(code), identifier, static_cast<unsigned long long>(containerClass));
@@ -294,8 +295,8 @@ void QRTClientConnection::setNetworkExtensionForUser(uint32_t userId, const std:
 void QRTClientConnection::retryTestForUser(uint32_t userId, uint64_t withNumCrashes, uint64_t* withError) {
   try {
     uint64_t code = QRTErrorNone;
-    QRTMetadataRef m = createOrLookupContainerForUser(userId, std::string(kRetryTestIdentifier), true, QRTClassAppData,
-                                                      false, true, &code);
+    QRTMetadataRef m = createOrLookupContainerForUser({userId, QRTClassAppData, std::string(kRetryTestIdentifier)},
+                                                      QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code);
     if (!m) {
       QRTLog(kLogError, "Failed to create or lookup lookup existing container for retry test: %@",
              std::to_string(code));
