@@ -2,9 +2,49 @@
 
 #include <cstdint>
 
+#include "base/QRTProtocol.h"
+
 namespace quarterkit {
 
-Request::Request(Command command) { u64("Command", static_cast<uint64_t>(command)); }
+// The public enum keeps its own spelling for callers outside the tree; every
+// value is the daemon's.
+#define SAME_COMMAND(kit, daemon) \
+  static_assert(static_cast<uint64_t>(Command::kit) == QRTCommand##daemon, #kit " is not the daemon's number")
+SAME_COMMAND(createOrLookupContainer, CreateOrLookupContainer);
+SAME_COMMAND(containersForUser, ContainersForUser);
+SAME_COMMAND(replaceContainer, ReplaceContainer);
+SAME_COMMAND(stageContainerForDelete, StageContainerForDelete);
+SAME_COMMAND(deleteContainersOnDeathRow, DeleteContainersOnDeathRow);
+SAME_COMMAND(setInfoValue, SetInfoValue);
+SAME_COMMAND(infoValueForKey, InfoValueForKey);
+SAME_COMMAND(metadataForContainer, MetadataForContainer);
+SAME_COMMAND(recreateDefaultStructure, RecreateDefaultStructure);
+SAME_COMMAND(regenerateDirectoryUUID, RegenerateDirectoryUUID);
+SAME_COMMAND(deleteContainer, DeleteContainer);
+SAME_COMMAND(wipeAddonDataContainer, WipeAddonDataContainer);
+SAME_COMMAND(deleteDataContainerContent, DeleteDataContainerContent);
+SAME_COMMAND(groupContainerPaths, GroupContainerPaths);
+SAME_COMMAND(groupContainerIdentifiers, GroupContainerIdentifiers);
+SAME_COMMAND(systemContainerPath, SystemContainerPath);
+SAME_COMMAND(systemGroupContainerPaths, SystemGroupContainerPaths);
+SAME_COMMAND(systemGroupContainerPath, SystemGroupContainerPath);
+SAME_COMMAND(processCodeSigningInfo, ProcessCodeSigningInfo);
+SAME_COMMAND(codeSigningInfoForIdentifier, CodeSigningInfoForIdentifier);
+SAME_COMMAND(invalidateCodeSigningInfoForAppsWithoutBundleContainer,
+             InvalidateCodeSigningInfoForAppsWithoutBundleContainer);
+SAME_COMMAND(setDataProtection, SetDataProtection);
+SAME_COMMAND(recreateContainerStructure, RecreateContainerStructure);
+SAME_COMMAND(diskUsage, DiskUsage);
+SAME_COMMAND(performDataMigration, PerformDataMigration);
+SAME_COMMAND(retryTest, RetryTest);
+SAME_COMMAND(stageSharedContent, StageSharedContent);
+SAME_COMMAND(setNetworkExtension, SetNetworkExtension);
+SAME_COMMAND(userManagedAssetsPath, UserManagedAssetsPath);
+SAME_COMMAND(deleteUserManagedAsset, DeleteUserManagedAsset);
+#undef SAME_COMMAND
+static_assert(static_cast<uint64_t>(Command::deleteUserManagedAsset) + 1 == QRTCommandCount, "a command is missing");
+
+Request::Request(Command command) { u64(QRTKeyCommand, static_cast<uint64_t>(command)); }
 
 Request& Request::u64(std::string_view key, uint64_t v) {
   // Unsigned on the wire only where a signed reader would get it wrong.
@@ -88,10 +128,10 @@ namespace {
 
 // The keys that name one container in most container commands.
 Request& addContainer(Request& r, const ContainerRef& c) {
-  return r.u64("UserID", c.userId)
-      .u64("ContainerClass", c.containerClass)
-      .string("Identifier", c.identifier)
-      .uuid("UUID", c.uuid);
+  return r.u64(QRTKeyUserID, c.userId)
+      .u64(QRTKeyContainerClass, c.containerClass)
+      .string(QRTKeyIdentifier, c.identifier)
+      .uuid(QRTKeyUUID, c.uuid);
 }
 
 Result onContainer(Connection& c, Command command, const ContainerRef& container) {
@@ -104,32 +144,32 @@ Result onContainer(Connection& c, Command command, const ContainerRef& container
 Result createOrLookupContainer(Connection& c, uint64_t userId, std::optional<std::string> identifier,
                                uint64_t containerClass, bool createIfNecessary, bool transient) {
   return perform(c, Request(Command::createOrLookupContainer)
-                        .u64("UserID", userId)
-                        .string("Identifier", identifier)
-                        .u64("ContainerClass", containerClass)
-                        .boolean("CreateIfNecessary", createIfNecessary)
-                        .boolean("Transient", transient));
+                        .u64(QRTKeyUserID, userId)
+                        .string(QRTKeyIdentifier, identifier)
+                        .u64(QRTKeyContainerClass, containerClass)
+                        .boolean(QRTKeyCreateIfNecessary, createIfNecessary)
+                        .boolean(QRTKeyTransient, transient));
 }
 
 Result containersForUser(Connection& c, uint64_t userId, uint64_t containerClass, bool transient) {
   return perform(c, Request(Command::containersForUser)
-                        .u64("UserID", userId)
-                        .u64("ContainerClass", containerClass)
-                        .boolean("Transient", transient));
+                        .u64(QRTKeyUserID, userId)
+                        .u64(QRTKeyContainerClass, containerClass)
+                        .boolean(QRTKeyTransient, transient));
 }
 
 Result replaceContainer(Connection& c, const std::optional<ContainerRef>& old, const ContainerRef& replacement) {
   Request r(Command::replaceContainer);
   if (old) {
-    r.uuid("OldContainerUUID", old->uuid)
-        .u64("OldContainerUserID", old->userId)
-        .u64("OldContainerClass", old->containerClass)
-        .string("OldIdentifier", old->identifier);
+    r.uuid(QRTKeyOldContainerUUID, old->uuid)
+        .u64(QRTKeyOldContainerUserID, old->userId)
+        .u64(QRTKeyOldContainerClass, old->containerClass)
+        .string(QRTKeyOldIdentifier, old->identifier);
   }
-  r.uuid("NewContainerUUID", replacement.uuid)
-      .u64("NewContainerUserID", replacement.userId)
-      .u64("NewContainerClass", replacement.containerClass)
-      .string("NewIdentifier", replacement.identifier);
+  r.uuid(QRTKeyNewContainerUUID, replacement.uuid)
+      .u64(QRTKeyNewContainerUserID, replacement.userId)
+      .u64(QRTKeyNewContainerClass, replacement.containerClass)
+      .string(QRTKeyNewIdentifier, replacement.identifier);
   return perform(c, r);
 }
 
@@ -141,10 +181,10 @@ Result stageContainerForDelete(Connection& c, const std::vector<uint64_t>& userI
   for (const std::string& s : identifiers) ids.emplace_back(s);
   for (uint64_t k : classes) classArray.emplace_back(k);
   return perform(c, Request(Command::stageContainerForDelete)
-                        .array("UserIDsArray", std::move(users))
-                        .array("UUIDsArray", std::move(uuidArray))
-                        .array("IdentifiersArray", std::move(ids))
-                        .array("ContainerClassesArray", std::move(classArray)));
+                        .array(QRTKeyUserIDsArray, std::move(users))
+                        .array(QRTKeyUUIDsArray, std::move(uuidArray))
+                        .array(QRTKeyIdentifiersArray, std::move(ids))
+                        .array(QRTKeyContainerClassesArray, std::move(classArray)));
 }
 
 Result deleteContainersOnDeathRow(Connection& c) { return perform(c, Request(Command::deleteContainersOnDeathRow)); }
@@ -152,19 +192,19 @@ Result deleteContainersOnDeathRow(Connection& c) { return perform(c, Request(Com
 Result setInfoValue(Connection& c, const ContainerRef& container, const std::string& key,
                     const std::optional<plist::Value>& value) {
   Request r(Command::setInfoValue);
-  addContainer(r, container).string("Key", key);
-  if (value) r.value("Value", *value);
+  addContainer(r, container).string(QRTKeyKey, key);
+  if (value) r.value(QRTKeyValue, *value);
   return perform(c, r);
 }
 
 Result infoValueForKey(Connection& c, const ContainerRef& container, const std::string& key) {
   Request r(Command::infoValueForKey);
-  return perform(c, addContainer(r, container).string("Key", key));
+  return perform(c, addContainer(r, container).string(QRTKeyKey, key));
 }
 
 Result metadataForContainer(Connection& c, const ContainerRef& container, bool infoDictRequested) {
   Request r(Command::metadataForContainer);
-  return perform(c, addContainer(r, container).boolean("InfoDictRequested", infoDictRequested));
+  return perform(c, addContainer(r, container).boolean(QRTKeyInfoDictRequested, infoDictRequested));
 }
 
 Result recreateDefaultStructure(Connection& c, const ContainerRef& container) {
@@ -178,64 +218,66 @@ Result regenerateDirectoryUUID(Connection& c, const ContainerRef& container) {
 Result deleteContainer(Connection& c, uint64_t userId, const std::optional<std::string>& identifier,
                        uint64_t containerClass, bool transient) {
   return perform(c, Request(Command::deleteContainer)
-                        .u64("UserID", userId)
-                        .string("Identifier", identifier)
-                        .u64("ContainerClass", containerClass)
-                        .boolean("Transient", transient));
+                        .u64(QRTKeyUserID, userId)
+                        .string(QRTKeyIdentifier, identifier)
+                        .u64(QRTKeyContainerClass, containerClass)
+                        .boolean(QRTKeyTransient, transient));
 }
 
 Result wipeAddonDataContainer(Connection& c, uint64_t userId, const std::optional<std::string>& identifier) {
   // The daemon works on class 4 whatever is sent; sending it keeps the
   // message self-describing.
   return perform(c, Request(Command::wipeAddonDataContainer)
-                        .u64("UserID", userId)
-                        .string("Identifier", identifier)
-                        .u64("ContainerClass", 4));
+                        .u64(QRTKeyUserID, userId)
+                        .string(QRTKeyIdentifier, identifier)
+                        .u64(QRTKeyContainerClass, 4));
 }
 
 Result deleteDataContainerContent(Connection& c, uint64_t userId, const std::optional<std::string>& identifier,
                                   uint64_t containerClass) {
   return perform(c, Request(Command::deleteDataContainerContent)
-                        .u64("UserID", userId)
-                        .string("Identifier", identifier)
-                        .u64("ContainerClass", containerClass));
+                        .u64(QRTKeyUserID, userId)
+                        .string(QRTKeyIdentifier, identifier)
+                        .u64(QRTKeyContainerClass, containerClass));
 }
 
 Result groupContainerPaths(Connection& c, uint64_t userId, const std::optional<std::string>& identifier) {
-  return perform(c, Request(Command::groupContainerPaths).u64("UserID", userId).string("Identifier", identifier));
+  return perform(c,
+                 Request(Command::groupContainerPaths).u64(QRTKeyUserID, userId).string(QRTKeyIdentifier, identifier));
 }
 
 Result groupContainerIdentifiers(Connection& c, uint64_t userId, const std::optional<std::string>& identifier) {
-  return perform(c, Request(Command::groupContainerIdentifiers).u64("UserID", userId).string("Identifier", identifier));
+  return perform(
+      c, Request(Command::groupContainerIdentifiers).u64(QRTKeyUserID, userId).string(QRTKeyIdentifier, identifier));
 }
 
 Result systemContainerPath(Connection& c, const std::optional<std::string>& identifier) {
-  return perform(c, Request(Command::systemContainerPath).string("Identifier", identifier));
+  return perform(c, Request(Command::systemContainerPath).string(QRTKeyIdentifier, identifier));
 }
 
 Result systemGroupContainerPaths(Connection& c, const std::optional<std::string>& identifier) {
-  return perform(c, Request(Command::systemGroupContainerPaths).string("Identifier", identifier));
+  return perform(c, Request(Command::systemGroupContainerPaths).string(QRTKeyIdentifier, identifier));
 }
 
 Result systemGroupContainerPath(Connection& c, const std::string& groupIdentifier,
                                 const std::optional<std::string>& identifier) {
   return perform(c, Request(Command::systemGroupContainerPath)
-                        .string("GroupIdentifier", groupIdentifier)
-                        .string("Identifier", identifier));
+                        .string(QRTKeyGroupIdentifier, groupIdentifier)
+                        .string(QRTKeyIdentifier, identifier));
 }
 
 Result processCodeSigningInfo(Connection& c, const std::optional<std::string>& identifier,
                               const std::optional<plist::Value>& codeSigningInfo,
                               const std::optional<plist::Value>& options) {
   Request r(Command::processCodeSigningInfo);
-  r.string("Identifier", identifier);
+  r.string(QRTKeyIdentifier, identifier);
   if (codeSigningInfo) r.value("CodeSigningInfo", *codeSigningInfo);
   if (options) r.value("OptionsDictionary", *options);
   return perform(c, r);
 }
 
 Result codeSigningInfoForIdentifier(Connection& c, const std::optional<std::string>& identifier) {
-  return perform(c, Request(Command::codeSigningInfoForIdentifier).string("Identifier", identifier));
+  return perform(c, Request(Command::codeSigningInfoForIdentifier).string(QRTKeyIdentifier, identifier));
 }
 
 Result invalidateCodeSigningInfoForAppsWithoutBundleContainer(Connection& c) {
@@ -245,12 +287,12 @@ Result invalidateCodeSigningInfoForAppsWithoutBundleContainer(Connection& c) {
 Result setDataProtection(Connection& c, uint64_t userId, const std::optional<std::string>& identifier,
                          uint64_t containerClass, int64_t dataProtectionClass, bool isThirdParty, bool retryIfLocked) {
   return perform(c, Request(Command::setDataProtection)
-                        .u64("UserID", userId)
-                        .string("Identifier", identifier)
-                        .u64("ContainerClass", containerClass)
-                        .i64("DataProtectionClass", dataProtectionClass)
-                        .boolean("IsThirdParty", isThirdParty)
-                        .boolean("RetryIfLocked", retryIfLocked));
+                        .u64(QRTKeyUserID, userId)
+                        .string(QRTKeyIdentifier, identifier)
+                        .u64(QRTKeyContainerClass, containerClass)
+                        .i64(QRTKeyDataProtectionClass, dataProtectionClass)
+                        .boolean(QRTKeyIsThirdParty, isThirdParty)
+                        .boolean(QRTKeyRetryIfLocked, retryIfLocked));
 }
 
 Result recreateContainerStructure(Connection& c, const ContainerRef& container) {
@@ -262,31 +304,34 @@ Result diskUsage(Connection& c, const ContainerRef& container) { return onContai
 Result performDataMigration(Connection& c) { return perform(c, Request(Command::performDataMigration)); }
 
 Result retryTest(Connection& c, uint64_t userId, uint64_t numRetryCrashes) {
-  return perform(c, Request(Command::retryTest).u64("UserID", userId).u64("NumRetryCrashes", numRetryCrashes));
+  return perform(c, Request(Command::retryTest).u64(QRTKeyUserID, userId).u64(QRTKeyNumRetryCrashes, numRetryCrashes));
 }
 
 Result stageSharedContent(Connection& c, const std::optional<std::string>& identifier,
                           const std::optional<std::string>& sourcePath, const std::optional<std::string>& destPath) {
   return perform(c, Request(Command::stageSharedContent)
-                        .string("Identifier", identifier)
-                        .string("SourcePath", sourcePath)
-                        .string("DestPath", destPath));
+                        .string(QRTKeyIdentifier, identifier)
+                        .string(QRTKeySourcePath, sourcePath)
+                        .string(QRTKeyDestPath, destPath));
 }
 
 Result setNetworkExtension(Connection& c, const std::optional<std::string>& identifier, uint64_t containerClass) {
-  return perform(
-      c, Request(Command::setNetworkExtension).string("Identifier", identifier).u64("ContainerClass", containerClass));
+  return perform(c, Request(Command::setNetworkExtension)
+                        .string(QRTKeyIdentifier, identifier)
+                        .u64(QRTKeyContainerClass, containerClass));
 }
 
 Result userManagedAssetsPath(Connection& c, const std::optional<std::string>& identifier, bool isRelative) {
-  return perform(
-      c, Request(Command::userManagedAssetsPath).string("Identifier", identifier).boolean("IsRelative", isRelative));
+  return perform(c, Request(Command::userManagedAssetsPath)
+                        .string(QRTKeyIdentifier, identifier)
+                        .boolean(QRTKeyIsRelative, isRelative));
 }
 
 Result deleteUserManagedAsset(Connection& c, const std::optional<std::string>& identifier,
                               const std::optional<std::string>& relativePath) {
-  return perform(
-      c, Request(Command::deleteUserManagedAsset).string("Identifier", identifier).string("SourcePath", relativePath));
+  return perform(c, Request(Command::deleteUserManagedAsset)
+                        .string(QRTKeyIdentifier, identifier)
+                        .string(QRTKeySourcePath, relativePath));
 }
 
 }  // namespace quarterkit

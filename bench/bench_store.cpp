@@ -116,9 +116,10 @@ int main(int argc, char** argv) {
   for (int i = 0; i < creations; ++i) {
     auto start = Clock::now();
     uint64_t code = 1;
-    check(client.createOrLookupContainerForUser(501, "com.example.app" + std::to_string(i), true, 2, false, true,
-                                                &code) != nullptr,
-          "create");
+    check(
+        client.createOrLookupContainerForUser({501, 2, "com.example.app" + std::to_string(i)},
+                                              QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code) != nullptr,
+        "create");
     daemonSeconds += since(start);
     start = Clock::now();
     floorCreate(staging, floorDir, metadata);

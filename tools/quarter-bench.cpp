@@ -32,6 +32,7 @@
 #include "QuarterKit/QuarterKit.h"
 #include "QuarterKit/Requests.h"
 #include "base/PlistCodec.h"
+#include "base/QRTProtocol.h"
 #include "base/QRTUUID.h"
 
 namespace {
@@ -83,7 +84,7 @@ class BenchDaemon {
     writeFile(root_ / "etc/group", "wheel:x:0:\n_installer:x:33:\nsystemusers:x:499:\nmobile:x:501:\n");
     plist::Dictionary identity{{"Executable", self},
                                {"SigningIdentifier", std::string("com.norvane.quarter-bench")},
-                               {"Entitlements", plist::Dictionary{{"com.norvane.private.QuarterKit.allowed", true}}}};
+                               {"Entitlements", plist::Dictionary{{QRTEntitlementAllowed, true}}}};
     plist::Data bytes = plist::writeBinary(identity);
     writeFile(root_ / "etc/quarterd/identities/quarter-bench.plist", std::string(bytes.begin(), bytes.end()));
   }
@@ -173,14 +174,14 @@ bool prepareInfoContainer(Client& c) {
   auto reply = qk::createOrLookupContainer(*c.connection, kUser, identifier, kClass, true, false);
   if (!succeeded(reply)) return false;
   c.container.identifier = identifier;
-  c.container.uuid = reply->uuid("ReplyUUID");
+  c.container.uuid = reply->uuid(QRTReplyKeyUUID);
   return c.container.uuid && succeeded(qk::setInfoValue(*c.connection, c.container, "bench", plist::Value(0)));
 }
 
 // A program's code-signing registration, changed by every call of cs-set.
 plist::Dictionary codeSigningInfo(uint64_t sequence) {
   plist::Dictionary entitlements{{"com.norvane.bench.sequence", plist::Value(plist::Integer{sequence, false})},
-                                 {"com.norvane.private.QuarterKit.none", true}};
+                                 {QRTEntitlementNone, true}};
   return {{"com.norvane.QuarterKit.Entitlements", entitlements}};
 }
 

@@ -14,6 +14,7 @@
 #include "Daemon/QRTDaemon.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTClientConnection.h"
+#include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTLocks.h"
 #include "platform/FileIO.h"
@@ -309,7 +310,8 @@ std::optional<plist::Dictionary> QRTDataProtectionChangeOperation::_readAndValid
     return invalid(QRT_ERROR(QRTErrorInvalidMetadata, nullptr, false, "Invalid update info Identifier: %@ at %@",
                              foundValue(*d, kIdentifierKey), *url));
   const plist::Integer* containerClass = integerAt(*d, kContainerClassKey);
-  if (!containerClass || containerClass->asUnsigned() < 1 || containerClass->asUnsigned() > 13)
+  if (!containerClass || containerClass->asUnsigned() < QRTClassAppBundle ||
+      containerClass->asUnsigned() > QRTClassSystemGroup)
     return invalid(QRT_ERROR(QRTErrorInvalidMetadata, nullptr, false, "Invalid update info container class: %ld at %@",
                              static_cast<long>(containerClass ? containerClass->asSigned() : 0), *url));
   if (!integerAt(*d, kUserIdKey))
@@ -348,8 +350,8 @@ QRTDataProtectionChangeOperation::Ref QRTDataProtectionChangeOperation::dataProt
   const uint64_t containerClass = integerAt(*d, kContainerClassKey)->asUnsigned();
   const auto userId = static_cast<uint32_t>(integerAt(*d, kUserIdKey)->asUnsigned());
   uint64_t code = QRTErrorNone;
-  QRTMetadataRef metadata =
-      internalClient().createOrLookupContainerForUser(userId, identifier, false, containerClass, false, true, &code);
+  QRTMetadataRef metadata = internalClient().createOrLookupContainerForUser(
+      {userId, containerClass, identifier}, QRTCreateMode::LookupOnly, QRTLocking::TakeLocks, &code);
   if (!metadata) {
     QRTSetError(error, QRT_ERROR(QRTErrorNotFound, nullptr, false,
                                  "Failed to lookup container metadata from file userId: %u, identifier: %@, Class: "
@@ -483,8 +485,9 @@ bool QRTDataProtectionChangeOperation::_runChange(bool* needToRetry, QRTErrorRef
   const auto containerClass = static_cast<unsigned long long>(m->containerClass());
   QRTIdentifierLock lock(m->uuid().UUIDString(), false);
   uint64_t code = QRTErrorNone;
-  QRTMetadataRef found = internalClient().createOrLookupContainerForUser(m->userId(), m->identifier(), false,
-                                                                         m->containerClass(), false, false, &code);
+  QRTMetadataRef found =
+      internalClient().createOrLookupContainerForUser({m->userId(), m->containerClass(), m->identifier()},
+                                                      QRTCreateMode::LookupOnly, QRTLocking::CallerHoldsLocks, &code);
   if (!found) {
     QRTSetError(error, QRT_ERROR(QRTErrorNotFound, nullptr, false,
                                  "Failed to lookup container to set data protection for userId: %u, identifier: %@, "

@@ -164,8 +164,8 @@ std::optional<std::map<std::string, std::string>> QRTGroupManager::groupContaine
     std::map<std::string, std::string> found;
     for (const std::string& group : groups ? *groups : std::vector<std::string>{}) {
       uint64_t code = QRTErrorNone;
-      QRTMetadataRef container =
-          clientConnection.createOrLookupContainerForUser(userId, group, true, groupClass, false, false, &code);
+      QRTMetadataRef container = clientConnection.createOrLookupContainerForUser(
+          {userId, groupClass, group}, QRTCreateMode::CreateIfMissing, QRTLocking::CallerHoldsLocks, &code);
       if (!container) {
         QRTLog(kLogError, "Failed to create or lookup group container-userId: %u, ID: %@ : %llu", userId, group,
                static_cast<unsigned long long>(code));

@@ -27,7 +27,6 @@ namespace {
 
 constexpr const char* kOldBundleContainerPath = "/private/var/mobile/Containers/Bundle";
 constexpr uint64_t kMultiUserModeFlag = 0x80000000u;
-constexpr uint32_t kBundleOwnerId = 33;
 
 // The installer's account as files carry it: 33 on a device, the account
 // standing for it on a host. Nothing, with a log line, when that is missing.
@@ -36,11 +35,11 @@ struct HostOwner {
   gid_t gid;
 };
 std::optional<HostOwner> bundleOwner() {
-  std::optional<uid_t> uid = platform::hostUserId(kBundleOwnerId);
-  std::optional<gid_t> gid = platform::hostGroupId(kBundleOwnerId);
+  std::optional<uid_t> uid = platform::hostUserId(QRTInstallerUserId);
+  std::optional<gid_t> gid = platform::hostGroupId(QRTInstallerUserId);
   if (!uid || !gid) {
     QRTLog(kLogError, "No account stands for the installer (%u): bundle containers left as they are",
-           static_cast<unsigned>(kBundleOwnerId));
+           static_cast<unsigned>(QRTInstallerUserId));
     return std::nullopt;
   }
   return HostOwner{*uid, *gid};
@@ -258,7 +257,7 @@ bool QRTContainerMigrator::_performBundleContainerOwnershipMigrationWithError(QR
   const std::optional<HostOwner> owner = bundleOwner();
   QRTErrorRef ownerError;
   if (!owner) {
-    ownerError = QRT_POSIX_ERROR(EPERM, "No account stands for user %u", static_cast<unsigned>(kBundleOwnerId));
+    ownerError = QRT_POSIX_ERROR(EPERM, "No account stands for user %u", static_cast<unsigned>(QRTInstallerUserId));
   }
   if (!owner ||
       !QRTFileManager::defaultManager().standardizeOwnershipAtURL(bundles, owner->uid, owner->gid, &ownerError)) {

@@ -193,8 +193,8 @@ void QRTClientConnection::deleteContainerForUser(uint32_t userId, const std::opt
                                                  uint64_t containerClass, bool transient, uint64_t* withError) {
   try {
     uint64_t code = QRTErrorNone;
-    auto metadata =
-        createOrLookupContainerForUser(userId, withIdentifier, false, containerClass, transient, true, &code);
+    auto metadata = createOrLookupContainerForUser({userId, containerClass, withIdentifier, transient},
+                                                   QRTCreateMode::LookupOnly, QRTLocking::TakeLocks, &code);
     if (!metadata) {
       QRTLog(platform::kLogError,
              "Failed to lookup existing container to delete-identifier: %@, class: %ld, transient: %d", withIdentifier,
@@ -236,12 +236,14 @@ void QRTClientConnection::deleteDataContainerContentForUser(uint32_t userId,
   }
   try {
     uint64_t code = QRTErrorNone;
-    auto existing = createOrLookupContainerForUser(userId, identifier, false, containerClass, false, true, &code);
+    auto existing = createOrLookupContainerForUser({userId, containerClass, identifier}, QRTCreateMode::LookupOnly,
+                                                   QRTLocking::TakeLocks, &code);
     if (!existing) {
       QRTLog(platform::kLogError, "Failed to lookup existing container to wipe-identifier: %@", identifier);
       return fail(code);
     }
-    auto fresh = createOrLookupContainerForUser(userId, identifier, true, containerClass, true, true, &code);
+    auto fresh = createOrLookupContainerForUser({userId, containerClass, identifier, true},
+                                                QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code);
     if (!fresh) {
       QRTLog(platform::kLogError, "Failed to create transient container for wipe-identifier: %@", identifier);
       return fail(code);

@@ -53,8 +53,9 @@ void _moveSystemContainerIntoPlace(const QRTURL& restored, uint64_t containerCla
   const QRTURL failedDirectory =
       withExtension(restored.URLByDeletingLastPathComponent(), "failed").URLByAppendingPathComponent(identifier, true);
   uint64_t code = QRTErrorNone;
-  QRTMetadataRef container = client.createOrLookupContainerForUser(QRTSystemContainerUserId, identifier, true,
-                                                                   containerClass, false, true, &code);
+  QRTMetadataRef container =
+      client.createOrLookupContainerForUser({QRTSystemContainerUserId, containerClass, identifier},
+                                            QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code);
   if (code != QRTErrorNone || !container) {
     QRTLog(kLogError, "Failed to create system container %@: %llu", identifier, static_cast<unsigned long long>(code));
     return;

@@ -32,7 +32,7 @@ void replyGroupPaths(uint32_t userId, const plist::Dictionary& request, const QR
                      QRTClientConnection& client, uint64_t* result) {
   auto paths = QRTGroupManager::defaultManager().groupContainerPathsForUser(
       userId, client, QRTMessageIdentifier(request, client.clientBundleIdentifier()), result);
-  if (paths) reply->dictionary["ReplyGroupContainerDict"] = pathDictionary(*paths);
+  if (paths) reply->dictionary[QRTReplyKeyGroupContainerDict] = pathDictionary(*paths);
 }
 
 // A key that is present must hold a dictionary: a mistyped info read as
@@ -41,7 +41,7 @@ bool dictionaryOrAbsent(const plist::Dictionary& request, const char* key, const
   const plist::Value* value = QRTMessageObject(request, key);
   *out = value ? value->dictionaryIf() : nullptr;
   if (!value || *out) return true;
-  QRTLog(kLogError, "%s of %@ is not a dictionary; nothing changed", key, QRTMessageString(request, "Identifier"));
+  QRTLog(kLogError, "%s of %@ is not a dictionary; nothing changed", key, QRTMessageString(request, QRTKeyIdentifier));
   return false;
 }
 
@@ -50,7 +50,7 @@ bool dictionaryOrAbsent(const plist::Dictionary& request, const char* key, const
 void QRTHandleGroupContainerPaths(const plist::Dictionary& request, const QRTReplyRef& reply,
                                   QRTClientConnection& client, uint64_t* result) {
   uint32_t userId = 0;
-  auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));
+  auto requested = static_cast<uint32_t>(QRTMessageU64(request, QRTKeyUserID));
   if (!validateUserId(requested, QRTClassAppGroup, client, &userId, result)) return;
   if (!mappingOr66(result)) return;
   replyGroupPaths(userId, request, reply, client, result);
@@ -59,13 +59,13 @@ void QRTHandleGroupContainerPaths(const plist::Dictionary& request, const QRTRep
 void QRTHandleGroupContainerIdentifiers(const plist::Dictionary& request, const QRTReplyRef& reply,
                                         QRTClientConnection& client, uint64_t* result) {
   uint32_t userId = 0;
-  auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));
+  auto requested = static_cast<uint32_t>(QRTMessageU64(request, QRTKeyUserID));
   if (!validateUserId(requested, QRTClassAppGroup, client, &userId, result)) return;
   if (!mappingOr66(result)) return;
   auto identifiers = QRTGroupManager::defaultManager().groupContainerIdentifiersForUser(
       userId, QRTMessageIdentifier(request, client.clientBundleIdentifier()), result);
   if (identifiers)
-    reply->dictionary["ReplyGroupIdentifiersArray"] = plist::Array(identifiers->begin(), identifiers->end());
+    reply->dictionary[QRTReplyKeyGroupIdentifiersArray] = plist::Array(identifiers->begin(), identifiers->end());
 }
 
 void QRTHandleSystemGroupContainerPaths(const plist::Dictionary& request, const QRTReplyRef& reply,
@@ -80,7 +80,7 @@ void QRTHandleSystemGroupContainerPath(const plist::Dictionary& request, const Q
   if (!mapping) return;
   const std::optional<std::string>& caller = client.clientBundleIdentifier();
   const std::optional<std::string> identifier = QRTMessageIdentifier(request, caller);
-  const std::optional<std::string> group = QRTMessageString(request, "GroupIdentifier");
+  const std::optional<std::string> group = QRTMessageString(request, QRTKeyGroupIdentifier);
   // Entitlement is judged by the caller's own identifier, whatever it names,
   // and counts only for a caller whose uid may hold system-level entitlements.
   const QRTGroupList entitled =
@@ -95,8 +95,9 @@ void QRTHandleSystemGroupContainerPath(const plist::Dictionary& request, const Q
   } else if ((group && QRTWhitelist::sharedWhitelist().systemGroupContainerIdIsWellknown(*group)) ||
              client.allowGroupIdLookup()) {
     client.setAllowGroupIdLookup(true);
-    auto metadata = client.createOrLookupContainerForUser(QRTSystemContainerUserId, group, true, QRTClassSystemGroup,
-                                                          false, true, result);
+    auto metadata =
+        client.createOrLookupContainerForUser({QRTSystemContainerUserId, QRTClassSystemGroup, group},
+                                              QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, result);
     if (metadata) path = metadata->url().path();
   } else {
     if (group != kQuietSystemGroup) {
@@ -113,7 +114,7 @@ void QRTHandleSystemGroupContainerPath(const plist::Dictionary& request, const Q
     *result = QRTErrorNotFound;
     return;
   }
-  reply->dictionary["ReplyPath"] = *path;
+  reply->dictionary[QRTReplyKeyPath] = *path;
 }
 
 void QRTHandleProcessCodeSigningInfo(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection&,
@@ -127,7 +128,7 @@ void QRTHandleProcessCodeSigningInfo(const plist::Dictionary& request, const QRT
     *result = QRTErrorInvalidArgument;
     return;
   }
-  uint64_t code = mapping->processCodeSigningInfo(info, QRTMessageString(request, "Identifier"), options);
+  uint64_t code = mapping->processCodeSigningInfo(info, QRTMessageString(request, QRTKeyIdentifier), options);
   if (code != QRTErrorNone) *result = code;
 }
 
@@ -136,12 +137,12 @@ void QRTHandleCodeSigningInfoForIdentifier(const plist::Dictionary& request, con
   QRTCodeSigningMapping* mapping = mappingOr66(result);
   if (!mapping) return;
   std::optional<plist::Dictionary> info =
-      mapping->getCodeSigningInfoForIdentifier(QRTMessageString(request, "Identifier"));
+      mapping->getCodeSigningInfoForIdentifier(QRTMessageString(request, QRTKeyIdentifier));
   if (!info) {
     *result = QRTErrorNotFound;
     return;
   }
-  reply->dictionary["ReplyInfoDictionary"] = std::move(*info);
+  reply->dictionary[QRTReplyKeyInfoDictionary] = std::move(*info);
 }
 
 void QRTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer(const plist::Dictionary&, const QRTReplyRef&,

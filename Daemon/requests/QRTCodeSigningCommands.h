@@ -4,7 +4,7 @@
 // information.
 #pragma once
 
-#include "Daemon/requests/QRTRequestDispatcher.h"
+#include "Daemon/requests/QRTMessage.h"
 
 void QRTHandleGroupContainerPaths(const plist::Dictionary& request, const QRTReplyRef& reply,
                                   QRTClientConnection& client, uint64_t* result);

@@ -16,7 +16,7 @@ plist::Data uuidData(const QRTUUID& uuid) { return plist::Data(uuid.bytes().begi
 std::optional<uint32_t> checkedUser(const plist::Dictionary& request, uint64_t containerClass,
                                     const QRTClientConnection& client, uint64_t* result) {
   uint32_t effective = 0;
-  auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));
+  auto requested = static_cast<uint32_t>(QRTMessageU64(request, QRTKeyUserID));
   if (!validateUserId(requested, containerClass, client, &effective, result)) return std::nullopt;
   return effective;
 }
@@ -49,20 +49,22 @@ bool globalClassEntitled(uint64_t containerClass, const std::optional<std::strin
 
 void QRTHandleCreateOrLookupContainer(const plist::Dictionary& request, const QRTReplyRef& reply,
                                       QRTClientConnection& client, uint64_t* result) {
-  uint64_t containerClass = QRTMessageU64(request, "ContainerClass");
+  uint64_t containerClass = QRTMessageU64(request, QRTKeyContainerClass);
   if (!globalClassEntitled(containerClass, QRTMessageIdentifier(request, client.clientBundleIdentifier()), client,
                            result))
     return;
   std::optional<uint32_t> userId = checkedUser(request, containerClass, client, result);
   if (!userId) return;
   auto metadata = client.createOrLookupContainerForUser(
-      *userId, QRTMessageIdentifier(request, client.clientBundleIdentifier()),
-      QRTMessageBool(request, "CreateIfNecessary"), containerClass, QRTMessageBool(request, "Transient"), true, result);
+      {*userId, containerClass, QRTMessageIdentifier(request, client.clientBundleIdentifier()),
+       QRTMessageBool(request, QRTKeyTransient)},
+      QRTMessageBool(request, QRTKeyCreateIfNecessary) ? QRTCreateMode::CreateIfMissing : QRTCreateMode::LookupOnly,
+      QRTLocking::TakeLocks, result);
   if (!metadata) return;
-  reply->dictionary["ReplyUUID"] = uuidData(metadata->uuid());
-  reply->dictionary["ReplyExisted"] = metadata->existed();
-  reply->dictionary["ReplyPath"] = metadata->url().path();
-  reply->dictionary["ReplyIdentifier"] = metadata->identifier();
+  reply->dictionary[QRTReplyKeyUUID] = uuidData(metadata->uuid());
+  reply->dictionary[QRTReplyKeyExisted] = metadata->existed();
+  reply->dictionary[QRTReplyKeyPath] = metadata->url().path();
+  reply->dictionary[QRTReplyKeyIdentifier] = metadata->identifier();
 }
 
 void QRTHandleSystemContainerPath(const plist::Dictionary& request, const QRTReplyRef& reply,
@@ -73,16 +75,16 @@ void QRTHandleSystemContainerPath(const plist::Dictionary& request, const QRTRep
       QRTWhitelist::sharedWhitelist().systemContainerIdIsWellknown(*identifier)) {
     client.setAllowOtherIdLookup(true);
   }
-  auto metadata = client.createOrLookupContainerForUser(QRTSystemContainerUserId, identifier, true, QRTClassSystemData,
-                                                        false, true, result);
-  if (metadata) reply->dictionary["ReplyPath"] = metadata->url().path();
+  auto metadata = client.createOrLookupContainerForUser({QRTSystemContainerUserId, QRTClassSystemData, identifier},
+                                                        QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, result);
+  if (metadata) reply->dictionary[QRTReplyKeyPath] = metadata->url().path();
 }
 
 namespace {
 
 std::optional<uint64_t> classAndUser(const plist::Dictionary& request, const QRTClientConnection& client,
                                      uint64_t* result, uint32_t* userId) {
-  uint64_t containerClass = QRTMessageU64(request, "ContainerClass");
+  uint64_t containerClass = QRTMessageU64(request, QRTKeyContainerClass);
   auto user = checkedUser(request, containerClass, client, result);
   if (!user) return std::nullopt;
   *userId = *user;
@@ -96,7 +98,7 @@ void QRTHandleContainersForUser(const plist::Dictionary& request, const QRTReply
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
-  auto list = client.containersForUser(userId, *containerClass, QRTMessageBool(request, "Transient"), result);
+  auto list = client.containersForUser(userId, *containerClass, QRTMessageBool(request, QRTKeyTransient), result);
   if (!list) return;
   plist::Array identifiers, uuids;
   identifiers.reserve(list->size());
@@ -105,41 +107,41 @@ void QRTHandleContainersForUser(const plist::Dictionary& request, const QRTReply
     identifiers.emplace_back(metadata->identifier());
     uuids.emplace_back(uuidData(metadata->uuid()));
   }
-  reply->dictionary["ReplyIdsArray"] = std::move(identifiers);
-  reply->dictionary["ReplyUUIDsArray"] = std::move(uuids);
+  reply->dictionary[QRTReplyKeyIdsArray] = std::move(identifiers);
+  reply->dictionary[QRTReplyKeyUUIDsArray] = std::move(uuids);
 }
 
 void QRTHandleReplaceContainer(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
                                uint64_t* result) {
-  std::optional<QRTUUID> oldUUID = QRTMessageUUID(request, "OldContainerUUID");
+  std::optional<QRTUUID> oldUUID = QRTMessageUUID(request, QRTKeyOldContainerUUID);
   uint64_t oldClass = 0;
   uint32_t oldUser = 0;
   std::optional<std::string> oldIdentifier;
   if (oldUUID) {
-    oldClass = QRTMessageU64(request, "OldContainerClass");
-    oldIdentifier = QRTMessageString(request, "OldIdentifier");
-    auto requested = static_cast<uint32_t>(QRTMessageU64(request, "OldContainerUserID"));
+    oldClass = QRTMessageU64(request, QRTKeyOldContainerClass);
+    oldIdentifier = QRTMessageString(request, QRTKeyOldIdentifier);
+    auto requested = static_cast<uint32_t>(QRTMessageU64(request, QRTKeyOldContainerUserID));
     if (!validateUserId(requested, oldClass, client, &oldUser, result)) return;
   }
-  uint64_t newClass = QRTMessageU64(request, "NewContainerClass");
+  uint64_t newClass = QRTMessageU64(request, QRTKeyNewContainerClass);
   uint32_t newUser = 0;
-  auto requested = static_cast<uint32_t>(QRTMessageU64(request, "NewContainerUserID"));
+  auto requested = static_cast<uint32_t>(QRTMessageU64(request, QRTKeyNewContainerUserID));
   if (!validateUserId(requested, newClass, client, &newUser, result)) return;
-  client.replaceContainer(oldUUID, QRTMessageUUID(request, "NewContainerUUID"), oldUser, newUser, oldIdentifier,
-                          QRTMessageString(request, "NewIdentifier"), oldClass, newClass, false, false, result);
+  client.replaceContainer(oldUUID, QRTMessageUUID(request, QRTKeyNewContainerUUID), oldUser, newUser, oldIdentifier,
+                          QRTMessageString(request, QRTKeyNewIdentifier), oldClass, newClass, false, false, result);
 }
 
 void QRTHandleStageContainerForDelete(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
                                       uint64_t* result) {
   std::vector<std::optional<uint64_t>> classes;
   std::vector<std::optional<QRTUUID>> uuids;
-  if (const plist::Value* v = QRTMessageObject(request, "ContainerClassesArray"); v && v->arrayIf()) {
+  if (const plist::Value* v = QRTMessageObject(request, QRTKeyContainerClassesArray); v && v->arrayIf()) {
     for (const plist::Value& item : v->array()) {
       const plist::Integer* i = item.integerIf();
       classes.push_back(i ? std::optional<uint64_t>(i->asUnsigned()) : std::nullopt);
     }
   }
-  if (const plist::Value* v = QRTMessageObject(request, "UUIDsArray"); v && v->arrayIf()) {
+  if (const plist::Value* v = QRTMessageObject(request, QRTKeyUUIDsArray); v && v->arrayIf()) {
     for (const plist::Value& item : v->array()) {
       const plist::Data* d = item.dataIf();
       uuids.push_back(d ? QRTUUID::fromBytes(d->data(), d->size()) : std::nullopt);
@@ -148,7 +150,7 @@ void QRTHandleStageContainerForDelete(const plist::Dictionary& request, const QR
   // Each user id is checked against the class at its position; positions
   // past the class list have no class to check against and are not read.
   std::vector<uint32_t> users;
-  if (const plist::Value* v = QRTMessageObject(request, "UserIDsArray"); v && v->arrayIf()) {
+  if (const plist::Value* v = QRTMessageObject(request, QRTKeyUserIDsArray); v && v->arrayIf()) {
     const plist::Array& requested = v->array();
     for (size_t i = 0; i < requested.size() && i < classes.size(); ++i) {
       const plist::Integer* n = requested[i].integerIf();
@@ -161,7 +163,7 @@ void QRTHandleStageContainerForDelete(const plist::Dictionary& request, const QR
     }
   }
   std::vector<std::optional<std::string>> identifiers;
-  const plist::Value* ids = QRTMessageObject(request, "IdentifiersArray");
+  const plist::Value* ids = QRTMessageObject(request, QRTKeyIdentifiersArray);
   if (ids && ids->arrayIf()) {
     for (const plist::Value& item : ids->array()) {
       identifiers.push_back(item.stringIf() ? std::optional<std::string>(item.string()) : std::nullopt);
@@ -182,10 +184,10 @@ void QRTHandleSetInfoValue(const plist::Dictionary& request, const QRTReplyRef&,
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
-  const plist::Value* value = QRTMessageObject(request, "Value");
-  client.setInfoValue(value ? std::optional<plist::Value>(*value) : std::nullopt, QRTMessageString(request, "Key"),
-                      userId, QRTMessageUUID(request, "UUID"), QRTMessageString(request, "Identifier"), *containerClass,
-                      true, result);
+  const plist::Value* value = QRTMessageObject(request, QRTKeyValue);
+  client.setInfoValue(value ? std::optional<plist::Value>(*value) : std::nullopt, QRTMessageString(request, QRTKeyKey),
+                      userId, QRTMessageUUID(request, QRTKeyUUID), QRTMessageString(request, QRTKeyIdentifier),
+                      *containerClass, true, result);
 }
 
 void QRTHandleInfoValueForKey(const plist::Dictionary& request, const QRTReplyRef& reply, QRTClientConnection& client,
@@ -193,9 +195,9 @@ void QRTHandleInfoValueForKey(const plist::Dictionary& request, const QRTReplyRe
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
-  auto value = client.infoValueForKey(QRTMessageString(request, "Key"), userId, QRTMessageUUID(request, "UUID"),
-                                      QRTMessageString(request, "Identifier"), *containerClass, true, result);
-  if (value) reply->dictionary["ReplyInfoValue"] = std::move(*value);
+  auto value = client.infoValueForKey(QRTMessageString(request, QRTKeyKey), userId, QRTMessageUUID(request, QRTKeyUUID),
+                                      QRTMessageString(request, QRTKeyIdentifier), *containerClass, true, result);
+  if (value) reply->dictionary[QRTReplyKeyInfoValue] = std::move(*value);
 }
 
 void QRTHandleMetadataForContainer(const plist::Dictionary& request, const QRTReplyRef& reply,
@@ -203,13 +205,13 @@ void QRTHandleMetadataForContainer(const plist::Dictionary& request, const QRTRe
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
-  auto metadata = client.metadataForUser(userId, QRTMessageUUID(request, "UUID"),
-                                         QRTMessageString(request, "Identifier"), *containerClass, result);
+  auto metadata = client.metadataForUser(userId, QRTMessageUUID(request, QRTKeyUUID),
+                                         QRTMessageString(request, QRTKeyIdentifier), *containerClass, result);
   if (!metadata) return;
-  reply->dictionary["ReplyPath"] = metadata->url().path();
-  reply->dictionary["ReplyTransient"] = metadata->transient();
-  if (QRTMessageBool(request, "InfoDictRequested") && metadata->info()) {
-    reply->dictionary["ReplyInfoDictionary"] = *metadata->info();
+  reply->dictionary[QRTReplyKeyPath] = metadata->url().path();
+  reply->dictionary[QRTReplyKeyTransient] = metadata->transient();
+  if (QRTMessageBool(request, QRTKeyInfoDictRequested) && metadata->info()) {
+    reply->dictionary[QRTReplyKeyInfoDictionary] = *metadata->info();
   }
 }
 
@@ -218,8 +220,8 @@ void QRTHandleRecreateDefaultStructure(const plist::Dictionary& request, const Q
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
-  client.recreateDefaultStructureForUser(userId, QRTMessageUUID(request, "UUID"),
-                                         QRTMessageString(request, "Identifier"), *containerClass, result);
+  client.recreateDefaultStructureForUser(userId, QRTMessageUUID(request, QRTKeyUUID),
+                                         QRTMessageString(request, QRTKeyIdentifier), *containerClass, result);
 }
 
 void QRTHandleRegenerateDirectoryUUID(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
@@ -227,8 +229,8 @@ void QRTHandleRegenerateDirectoryUUID(const plist::Dictionary& request, const QR
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
-  client.regenerateDirectoryUUIDForUser(userId, QRTMessageUUID(request, "UUID"),
-                                        QRTMessageString(request, "Identifier"), *containerClass, result);
+  client.regenerateDirectoryUUIDForUser(userId, QRTMessageUUID(request, QRTKeyUUID),
+                                        QRTMessageString(request, QRTKeyIdentifier), *containerClass, result);
 }
 
 void QRTHandleDeleteContainer(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
@@ -236,8 +238,8 @@ void QRTHandleDeleteContainer(const plist::Dictionary& request, const QRTReplyRe
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
-  client.deleteContainerForUser(userId, QRTMessageString(request, "Identifier"), *containerClass,
-                                QRTMessageBool(request, "Transient"), result);
+  client.deleteContainerForUser(userId, QRTMessageString(request, QRTKeyIdentifier), *containerClass,
+                                QRTMessageBool(request, QRTKeyTransient), result);
 }
 
 void QRTHandleWipeAddonDataContainer(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
@@ -245,9 +247,10 @@ void QRTHandleWipeAddonDataContainer(const plist::Dictionary& request, const QRT
   // Only the wipe list decides, whatever else the caller may look up.
   client.setAllowOtherIdLookup(false);
   uint32_t userId = 0;
-  auto requested = static_cast<uint32_t>(QRTMessageU64(request, "UserID"));
+  auto requested = static_cast<uint32_t>(QRTMessageU64(request, QRTKeyUserID));
   if (!validateUserId(requested, QRTClassAddonData, client, &userId, result)) return;
-  client.deleteDataContainerContentForUser(userId, QRTMessageString(request, "Identifier"), QRTClassAddonData, result);
+  client.deleteDataContainerContentForUser(userId, QRTMessageString(request, QRTKeyIdentifier), QRTClassAddonData,
+                                           result);
 }
 
 void QRTHandleDeleteDataContainerContent(const plist::Dictionary& request, const QRTReplyRef&,
@@ -255,7 +258,8 @@ void QRTHandleDeleteDataContainerContent(const plist::Dictionary& request, const
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
-  client.deleteDataContainerContentForUser(userId, QRTMessageString(request, "Identifier"), *containerClass, result);
+  client.deleteDataContainerContentForUser(userId, QRTMessageString(request, QRTKeyIdentifier), *containerClass,
+                                           result);
 }
 
 void QRTHandleDiskUsage(const plist::Dictionary& request, const QRTReplyRef& reply, QRTClientConnection& client,
@@ -263,6 +267,7 @@ void QRTHandleDiskUsage(const plist::Dictionary& request, const QRTReplyRef& rep
   uint32_t userId;
   auto containerClass = classAndUser(request, client, result, &userId);
   if (!containerClass) return;
-  reply->dictionary["ReplyDiskUsage"] = client.diskUsageForUserId(
-      userId, QRTMessageUUID(request, "UUID"), QRTMessageString(request, "Identifier"), *containerClass, result);
+  reply->dictionary[QRTReplyKeyDiskUsage] =
+      client.diskUsageForUserId(userId, QRTMessageUUID(request, QRTKeyUUID),
+                                QRTMessageString(request, QRTKeyIdentifier), *containerClass, result);
 }

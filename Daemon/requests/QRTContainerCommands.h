@@ -2,7 +2,7 @@
 // checks the user, calls one container operation and writes the reply keys.
 #pragma once
 
-#include "Daemon/requests/QRTRequestDispatcher.h"
+#include "Daemon/requests/QRTMessage.h"
 
 void QRTHandleCreateOrLookupContainer(const plist::Dictionary& request, const QRTReplyRef& reply,
                                       QRTClientConnection& client, uint64_t* result);

@@ -2,7 +2,7 @@
 // sent by the change's completion, possibly after the next unlock.
 #pragma once
 
-#include "Daemon/requests/QRTRequestDispatcher.h"
+#include "Daemon/requests/QRTMessage.h"
 
 void QRTHandleSetDataProtection(const plist::Dictionary& request, const QRTReplyRef& reply, QRTClientConnection& client,
                                 uint64_t* result);

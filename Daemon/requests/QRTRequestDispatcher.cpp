@@ -21,52 +21,60 @@ namespace {
 bool requestIdentifiersValid(const plist::Dictionary& request, uint32_t callerUid, uint64_t command);
 }  // namespace
 
-void QRTReply::send(uint64_t code) {
-  dictionary["ReplyError"] = code;
-  const platform::SendResult sent = connection_->send(messageId_, dictionary);
-  done();
-  if (sent != platform::SendResult::TooLarge) return;
-  // The stream stays whole: the client gets an error in place of the reply.
-  QRTLog(kLogError, "Reply to message %llu with code %llu does not fit in one frame; answering %llu",
-         static_cast<unsigned long long>(messageId_), static_cast<unsigned long long>(code),
-         static_cast<unsigned long long>(QRTErrorException));
-  connection_->send(messageId_, plist::Dictionary{{"ReplyError", static_cast<uint64_t>(QRTErrorException)}});
-}
-
 #define SERVED(n, name, handler, entitlement, flag) \
   { n, name, handler, entitlement, flag }
 const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
-    SERVED(0, "createOrLookupContainer", QRTHandleCreateOrLookupContainer, QRTEntitlementNone, 1),
-    SERVED(1, "containersForUser", QRTHandleContainersForUser, QRTEntitlementAllowed, 1),
-    SERVED(2, "replaceContainer", QRTHandleReplaceContainer, QRTEntitlementAllowed, 1),
-    SERVED(3, "stageContainerForDelete", QRTHandleStageContainerForDelete, QRTEntitlementAllowed, 1),
-    SERVED(4, "deleteContainersOnDeathRow", QRTHandleDeleteContainersOnDeathRow, QRTEntitlementAllowed, 0),
-    SERVED(5, "setInfoValue", QRTHandleSetInfoValue, QRTEntitlementAllowed, 1),
-    SERVED(6, "infoValueForKey", QRTHandleInfoValueForKey, QRTEntitlementAllowed, 1),
-    SERVED(7, "metadataForContainer", QRTHandleMetadataForContainer, QRTEntitlementAllowed, 1),
-    SERVED(8, "recreateDefaultStructure", QRTHandleRecreateDefaultStructure, QRTEntitlementAllowed, 1),
-    SERVED(9, "regenerateDirectoryUUID", QRTHandleRegenerateDirectoryUUID, QRTEntitlementAllowed, 1),
-    SERVED(10, "deleteContainer", QRTHandleDeleteContainer, QRTEntitlementAllowed, 1),
-    SERVED(11, "wipeAddonDataContainer", QRTHandleWipeAddonDataContainer, QRTEntitlementWipeContainer, 1),
-    SERVED(12, "deleteDataContainerContent", QRTHandleDeleteDataContainerContent, QRTEntitlementAllowed, 1),
-    SERVED(13, "groupContainerPaths", QRTHandleGroupContainerPaths, QRTEntitlementNone, 1),
-    SERVED(14, "groupContainerIdentifiers", QRTHandleGroupContainerIdentifiers, QRTEntitlementAllowed, 1),
-    SERVED(15, "systemContainerPath", QRTHandleSystemContainerPath, QRTEntitlementNone, 1),
-    SERVED(16, "systemGroupContainerPaths", QRTHandleSystemGroupContainerPaths, QRTEntitlementNone, 1),
-    SERVED(17, "systemGroupContainerPath", QRTHandleSystemGroupContainerPath, QRTEntitlementNone, 1),
-    SERVED(18, "processCodeSigningInfo", QRTHandleProcessCodeSigningInfo, QRTEntitlementAllowed, 1),
-    SERVED(19, "codeSigningInfoForIdentifier", QRTHandleCodeSigningInfoForIdentifier, QRTEntitlementAllowed, 1),
-    SERVED(20, "invalidateCodeSigningInfoForAppsWithoutBundleContainer",
+    SERVED(QRTCommandCreateOrLookupContainer, "createOrLookupContainer", QRTHandleCreateOrLookupContainer,
+           QRTEntitlementNone, 1),
+    SERVED(QRTCommandContainersForUser, "containersForUser", QRTHandleContainersForUser, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandReplaceContainer, "replaceContainer", QRTHandleReplaceContainer, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandStageContainerForDelete, "stageContainerForDelete", QRTHandleStageContainerForDelete,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandDeleteContainersOnDeathRow, "deleteContainersOnDeathRow", QRTHandleDeleteContainersOnDeathRow,
+           QRTEntitlementAllowed, 0),
+    SERVED(QRTCommandSetInfoValue, "setInfoValue", QRTHandleSetInfoValue, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandInfoValueForKey, "infoValueForKey", QRTHandleInfoValueForKey, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandMetadataForContainer, "metadataForContainer", QRTHandleMetadataForContainer, QRTEntitlementAllowed,
+           1),
+    SERVED(QRTCommandRecreateDefaultStructure, "recreateDefaultStructure", QRTHandleRecreateDefaultStructure,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandRegenerateDirectoryUUID, "regenerateDirectoryUUID", QRTHandleRegenerateDirectoryUUID,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandDeleteContainer, "deleteContainer", QRTHandleDeleteContainer, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandWipeAddonDataContainer, "wipeAddonDataContainer", QRTHandleWipeAddonDataContainer,
+           QRTEntitlementWipeContainer, 1),
+    SERVED(QRTCommandDeleteDataContainerContent, "deleteDataContainerContent", QRTHandleDeleteDataContainerContent,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandGroupContainerPaths, "groupContainerPaths", QRTHandleGroupContainerPaths, QRTEntitlementNone, 1),
+    SERVED(QRTCommandGroupContainerIdentifiers, "groupContainerIdentifiers", QRTHandleGroupContainerIdentifiers,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandSystemContainerPath, "systemContainerPath", QRTHandleSystemContainerPath, QRTEntitlementNone, 1),
+    SERVED(QRTCommandSystemGroupContainerPaths, "systemGroupContainerPaths", QRTHandleSystemGroupContainerPaths,
+           QRTEntitlementNone, 1),
+    SERVED(QRTCommandSystemGroupContainerPath, "systemGroupContainerPath", QRTHandleSystemGroupContainerPath,
+           QRTEntitlementNone, 1),
+    SERVED(QRTCommandProcessCodeSigningInfo, "processCodeSigningInfo", QRTHandleProcessCodeSigningInfo,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandCodeSigningInfoForIdentifier, "codeSigningInfoForIdentifier",
+           QRTHandleCodeSigningInfoForIdentifier, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandInvalidateCodeSigningInfoForAppsWithoutBundleContainer,
+           "invalidateCodeSigningInfoForAppsWithoutBundleContainer",
            QRTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, QRTEntitlementAllowed, 1),
-    SERVED(21, "setDataProtection", QRTHandleSetDataProtection, QRTEntitlementAllowed, 0),
-    SERVED(22, "recreateContainerStructure", QRTHandleRecreateDefaultStructure, QRTEntitlementAllowed, 1),
-    SERVED(23, "diskUsage", QRTHandleDiskUsage, QRTEntitlementAllowed, 1),
-    SERVED(24, "performDataMigration", QRTHandlePerformDataMigration, QRTEntitlementDataMigration, 1),
-    SERVED(25, "retryTest", QRTHandleRetryTest, QRTEntitlementAllowed, 1),
-    SERVED(26, "stageSharedContent", QRTHandleStageSharedContent, QRTEntitlementStageSharedContent, 1),
-    SERVED(27, "setNetworkExtension", QRTHandleSetNetworkExtension, QRTEntitlementNetworkExtension, 1),
-    SERVED(28, "userManagedAssetsPath", QRTHandleUserManagedAssetsPath, QRTEntitlementUserManagedAssets, 1),
-    SERVED(29, "deleteUserManagedAsset", QRTHandleDeleteUserManagedAsset, QRTEntitlementUserManagedAssets, 1),
+    SERVED(QRTCommandSetDataProtection, "setDataProtection", QRTHandleSetDataProtection, QRTEntitlementAllowed, 0),
+    SERVED(QRTCommandRecreateContainerStructure, "recreateContainerStructure", QRTHandleRecreateDefaultStructure,
+           QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandDiskUsage, "diskUsage", QRTHandleDiskUsage, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandPerformDataMigration, "performDataMigration", QRTHandlePerformDataMigration,
+           QRTEntitlementDataMigration, 1),
+    SERVED(QRTCommandRetryTest, "retryTest", QRTHandleRetryTest, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandStageSharedContent, "stageSharedContent", QRTHandleStageSharedContent,
+           QRTEntitlementStageSharedContent, 1),
+    SERVED(QRTCommandSetNetworkExtension, "setNetworkExtension", QRTHandleSetNetworkExtension,
+           QRTEntitlementNetworkExtension, 1),
+    SERVED(QRTCommandUserManagedAssetsPath, "userManagedAssetsPath", QRTHandleUserManagedAssetsPath,
+           QRTEntitlementUserManagedAssets, 1),
+    SERVED(QRTCommandDeleteUserManagedAsset, "deleteUserManagedAsset", QRTHandleDeleteUserManagedAsset,
+           QRTEntitlementUserManagedAssets, 1),
 };
 #undef SERVED
 
@@ -80,7 +88,7 @@ void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::R
   const plist::Dictionary& request = *event.message;
   const auto& peer = connection->peer();
   platform::RefusalScope refusals(peer ? peer->uid : UINT32_MAX);
-  uint64_t command = QRTMessageU64(request, "Command");
+  uint64_t command = QRTMessageU64(request, QRTKeyCommand);
   auto reply = std::make_shared<QRTReply>(connection, event.messageId);
   uint64_t result = QRTErrorNone;
   bool handled = false;
@@ -215,79 +223,6 @@ std::optional<QRTClientConnection> checkEntitlementsAndInitClientObject(const pl
   return client;
 }
 
-void QRTLogEntitlementRefusal(uint32_t callerUid, int pid, const std::optional<std::string>& signingIdentifier,
-                              const char* entitlement) {
-  platform::logRefusal(
-      callerUid, "checkEntitlementsAndInitClientObject",
-      QRTFormat("connection attempt from pid %d (%@) missing required entitlement: %s", pid,
-                signingIdentifier ? std::optional(platform::logIdentifier(*signingIdentifier)) : std::nullopt,
-                entitlement));
-}
-
-bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, uint32_t callerUserId, bool systemProcess,
-                    uint32_t* effectiveUserId, uint64_t* result) {
-  bool valid;
-  uint32_t effective = requestedUserId;
-  if (QRTIsBundleClass(containerClass)) {
-    valid = requestedUserId == QRTInstallerUserId;
-    effective = QRTInstallerUserId;
-  } else if (QRTIsSystemClass(containerClass)) {
-    valid = requestedUserId == QRTSystemContainerUserId;
-  } else if (!systemProcess || callerUserId >= platform::ordinaryUserMinimum()) {
-    // Anyone may connect, whatever their uid: only root and the holders of
-    // system-level entitlements act for other users.
-    valid = requestedUserId == callerUserId || requestedUserId == 1;
-    effective = callerUserId;
-  } else if (requestedUserId == 1) {
-    effective = QRTGlobalConfiguration::sharedInstance().currentMobileUserId();
-    valid = effective != QRTGlobalConfiguration::kNoDefaultUser;
-  } else {
-    valid = user_id_valid_for_class(containerClass, requestedUserId);
-  }
-  if (!valid) {
-    if (result) {
-      QRTLogRefusal(callerUserId, "Invalid userId %u for class %llu from client %u", requestedUserId,
-                    static_cast<unsigned long long>(containerClass), callerUserId);
-      *result = QRTErrorInvalidArgument;
-    }
-    return false;
-  }
-  if (effectiveUserId) *effectiveUserId = effective;
-  return true;
-}
-
-bool validateUserId(uint32_t requestedUserId, uint64_t containerClass, const QRTClientConnection& client,
-                    uint32_t* effectiveUserId, uint64_t* result) {
-  return validateUserId(requestedUserId, containerClass, client.clientUserId(), client.rights().systemProcess,
-                        effectiveUserId, result);
-}
-
-bool QRTIdentifierIsValid(std::string_view identifier) {
-  if (identifier.empty() || identifier.size() > kQRTIdentifierMaxBytes) return false;
-  for (size_t i = 0; i < identifier.size();) {
-    const auto c = static_cast<unsigned char>(identifier[i]);
-    if (c < 0x20 || c == 0x7f) return false;
-    if (c < 0x80) {
-      ++i;
-      continue;
-    }
-    // Shortest-form UTF-8 of a scalar value; C1 controls are controls too.
-    size_t length = c >= 0xc2 && c <= 0xdf ? 2 : c >= 0xe0 && c <= 0xef ? 3 : c >= 0xf0 && c <= 0xf4 ? 4 : 0;
-    if (length == 0 || i + length > identifier.size()) return false;
-    uint32_t value = c & (0x7f >> length);
-    for (size_t k = 1; k < length; ++k) {
-      const auto next = static_cast<unsigned char>(identifier[i + k]);
-      if ((next & 0xc0) != 0x80) return false;
-      value = value << 6 | (next & 0x3f);
-    }
-    if ((length == 3 && (value < 0x800 || (value >= 0xd800 && value <= 0xdfff))) ||
-        (length == 4 && (value < 0x10000 || value > 0x10ffff)) || (value >= 0x80 && value <= 0x9f))
-      return false;
-    i += length;
-  }
-  return true;
-}
-
 namespace {
 
 // Every identifier a request names: the program, group and system group
@@ -301,55 +236,14 @@ bool requestIdentifiersValid(const plist::Dictionary& request, uint32_t callerUi
                   static_cast<unsigned long long>(command), callerUid);
     return false;
   };
-  for (const char* key : {"Identifier", "GroupIdentifier", "OldIdentifier", "NewIdentifier"}) {
+  for (const char* key : {QRTKeyIdentifier, QRTKeyGroupIdentifier, QRTKeyOldIdentifier, QRTKeyNewIdentifier}) {
     if (const plist::Value* value = plist::find(request, key); value && !check(key, *value)) return false;
   }
-  if (const plist::Value* list = plist::find(request, "IdentifiersArray"); list && list->arrayIf()) {
+  if (const plist::Value* list = plist::find(request, QRTKeyIdentifiersArray); list && list->arrayIf()) {
     for (const plist::Value& item : list->array())
-      if (!check("IdentifiersArray", item)) return false;
+      if (!check(QRTKeyIdentifiersArray, item)) return false;
   }
   return true;
 }
 
 }  // namespace
-
-uint64_t QRTMessageU64(const plist::Dictionary& message, std::string_view key) {
-  const plist::Value* v = plist::find(message, key);
-  const plist::Integer* i = v ? v->integerIf() : nullptr;
-  return i ? i->asUnsigned() : 0;
-}
-
-int64_t QRTMessageI64(const plist::Dictionary& message, std::string_view key) {
-  const plist::Value* v = plist::find(message, key);
-  const plist::Integer* i = v ? v->integerIf() : nullptr;
-  return i ? i->asSigned() : 0;
-}
-
-bool QRTMessageBool(const plist::Dictionary& message, std::string_view key) {
-  const plist::Value* v = plist::find(message, key);
-  const bool* b = v ? v->booleanIf() : nullptr;
-  return b && *b;
-}
-
-std::optional<std::string> QRTMessageString(const plist::Dictionary& message, std::string_view key) {
-  const plist::Value* v = plist::find(message, key);
-  const std::string* s = v ? v->stringIf() : nullptr;
-  return s ? std::optional<std::string>(*s) : std::nullopt;
-}
-
-std::optional<QRTUUID> QRTMessageUUID(const plist::Dictionary& message, std::string_view key) {
-  const plist::Value* v = plist::find(message, key);
-  const plist::Data* d = v ? v->dataIf() : nullptr;
-  return d ? QRTUUID::fromBytes(d->data(), d->size()) : std::nullopt;
-}
-
-const plist::Value* QRTMessageObject(const plist::Dictionary& message, std::string_view key) {
-  return plist::find(message, key);
-}
-
-std::optional<std::string> QRTMessageIdentifier(const plist::Dictionary& message,
-                                                const std::optional<std::string>& clientIdentifier) {
-  // A mistyped identifier reads as missing, as every reader treats a wrong type.
-  if (std::optional<std::string> identifier = QRTMessageString(message, "Identifier")) return identifier;
-  return clientIdentifier;
-}

@@ -1,6 +1,7 @@
 #include "Daemon/requests/QRTSpecialCommands.h"
 
 #include "Daemon/migration/QRTContainerMigrator.h"
+#include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Log.h"
@@ -30,33 +31,35 @@ void QRTHandleRetryTest(const plist::Dictionary& request, const QRTReplyRef&, QR
     return;
   }
   uint32_t userId = 0;
-  if (!validateUserId(static_cast<uint32_t>(QRTMessageU64(request, "UserID")), 2, client, &userId, result)) return;
-  client.retryTestForUser(userId, QRTMessageU64(request, "NumRetryCrashes"), result);
+  if (!validateUserId(static_cast<uint32_t>(QRTMessageU64(request, QRTKeyUserID)), QRTClassAppData, client, &userId,
+                      result))
+    return;
+  client.retryTestForUser(userId, QRTMessageU64(request, QRTKeyNumRetryCrashes), result);
 }
 
 void QRTHandleStageSharedContent(const plist::Dictionary& request, const QRTReplyRef& reply,
                                  QRTClientConnection& client, uint64_t* result) {
-  auto url = client.stageSharedContentForIdentifier(QRTMessageString(request, "Identifier"),
-                                                    QRTMessageString(request, "SourcePath"),
-                                                    QRTMessageString(request, "DestPath"), result);
-  if (url) reply->dictionary["ReplyPath"] = url->path();
+  auto url = client.stageSharedContentForIdentifier(QRTMessageString(request, QRTKeyIdentifier),
+                                                    QRTMessageString(request, QRTKeySourcePath),
+                                                    QRTMessageString(request, QRTKeyDestPath), result);
+  if (url) reply->dictionary[QRTReplyKeyPath] = url->path();
 }
 
 void QRTHandleSetNetworkExtension(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
                                   uint64_t* result) {
-  client.setNetworkExtensionForUser(mobileUser(), QRTMessageString(request, "Identifier"),
-                                    QRTMessageU64(request, "ContainerClass"), result);
+  client.setNetworkExtensionForUser(mobileUser(), QRTMessageString(request, QRTKeyIdentifier),
+                                    QRTMessageU64(request, QRTKeyContainerClass), result);
 }
 
 void QRTHandleUserManagedAssetsPath(const plist::Dictionary& request, const QRTReplyRef& reply,
                                     QRTClientConnection& client, uint64_t* result) {
-  auto url = client.userManagedAssetsPathForUser(mobileUser(), QRTMessageString(request, "Identifier"),
-                                                 QRTMessageBool(request, "IsRelative"), result);
-  if (url) reply->dictionary["ReplyPath"] = url->path();
+  auto url = client.userManagedAssetsPathForUser(mobileUser(), QRTMessageString(request, QRTKeyIdentifier),
+                                                 QRTMessageBool(request, QRTKeyIsRelative), result);
+  if (url) reply->dictionary[QRTReplyKeyPath] = url->path();
 }
 
 void QRTHandleDeleteUserManagedAsset(const plist::Dictionary& request, const QRTReplyRef&, QRTClientConnection& client,
                                      uint64_t* result) {
-  client.deleteUserManagedAssetForUser(mobileUser(), QRTMessageString(request, "Identifier"),
-                                       QRTMessageString(request, "SourcePath"), result);
+  client.deleteUserManagedAssetForUser(mobileUser(), QRTMessageString(request, QRTKeyIdentifier),
+                                       QRTMessageString(request, QRTKeySourcePath), result);
 }

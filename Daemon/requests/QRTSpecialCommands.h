@@ -2,7 +2,7 @@
 // the network extension and user-managed assets.
 #pragma once
 
-#include "Daemon/requests/QRTRequestDispatcher.h"
+#include "Daemon/requests/QRTMessage.h"
 
 void QRTHandlePerformDataMigration(const plist::Dictionary& request, const QRTReplyRef& reply,
                                    QRTClientConnection& client, uint64_t* result);

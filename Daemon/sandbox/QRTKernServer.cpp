@@ -26,7 +26,6 @@ namespace {
 
 constexpr uint32_t kComplexBit = 0x80000000u;
 constexpr uint32_t kOutOfLineDescriptor = 1;
-constexpr uint32_t kSystemContainerUser = 499;
 
 struct KernRequest {
   std::optional<std::string> codeSignatureId, containerId, applicationId, systemContainerId;
@@ -108,12 +107,12 @@ uint64_t dataContainerClass(const std::string& identifier, uint32_t containerTyp
   QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
   uint64_t cls = mapping ? mapping->dataContainerTypeForIdentifier(identifier) : 0;
   if (QRTIsPerUserClass(cls)) {
-    if (containerType == 1 && cls != 4) {
+    if (containerType == 1 && cls != QRTClassAddonData) {
       QRTLog(kLogNotice, "SB Type: %u, EM Type: %llu.  Declaring this a plugin", containerType,
              static_cast<unsigned long long>(cls));
-      return 4;
+      return QRTClassAddonData;
     }
-    if (containerType == 0 && cls != 2) {
+    if (containerType == 0 && cls != QRTClassAppData) {
       QRTLog(kLogNotice, "SB type is app, but EM type is %llu", static_cast<unsigned long long>(cls));
     }
     return cls;
@@ -137,8 +136,8 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
   uint64_t error = 1;
   if (identifier) {
     uint64_t cls = dataContainerClass(*identifier, request.containerType);
-    QRTMetadataRef m =
-        internal.createOrLookupContainerForUser(request.personaId, identifier, true, cls, false, true, &error);
+    QRTMetadataRef m = internal.createOrLookupContainerForUser(
+        {request.personaId, cls, identifier}, QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &error);
     if (m) {
       out->dataContainer = m->url();
     } else {
@@ -148,8 +147,9 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
     }
   }
   if (request.systemContainerId) {
-    QRTMetadataRef m = internal.createOrLookupContainerForUser(kSystemContainerUser, request.systemContainerId, true,
-                                                               12, false, true, &error);
+    QRTMetadataRef m = internal.createOrLookupContainerForUser(
+        {QRTSystemContainerUserId, QRTClassSystemData, request.systemContainerId}, QRTCreateMode::CreateIfMissing,
+        QRTLocking::TakeLocks, &error);
     if (m) {
       out->systemContainer = m->url();
     } else {
@@ -159,7 +159,8 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
     }
   }
   for (const std::string& group : request.appGroupIds) {
-    QRTMetadataRef m = internal.createOrLookupContainerForUser(request.personaId, group, true, 7, false, true, &error);
+    QRTMetadataRef m = internal.createOrLookupContainerForUser(
+        {request.personaId, QRTClassAppGroup, group}, QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &error);
     if (m) {
       out->groups.emplace_back(group, m->url().path());
     } else {
@@ -170,7 +171,8 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
   }
   for (const std::string& group : request.systemGroupIds) {
     QRTMetadataRef m =
-        internal.createOrLookupContainerForUser(kSystemContainerUser, group, true, 13, false, true, &error);
+        internal.createOrLookupContainerForUser({QRTSystemContainerUserId, QRTClassSystemGroup, group},
+                                                QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &error);
     if (m) {
       out->systemGroups.emplace_back(group, m->url().path());
     } else {

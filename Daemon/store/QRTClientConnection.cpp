@@ -72,10 +72,10 @@ bool QRTClientConnection::_createSubDirectories(const QRTURL& url, uint32_t user
                                                 QRTErrorRef* error) {
   const char* const* begin = nullptr;
   size_t count = 0;
-  if (containerClass == 7 || containerClass == 13) {
+  if (containerClass == QRTClassAppGroup || containerClass == QRTClassSystemGroup) {
     begin = kGroupSubDirectories;
     count = std::size(kGroupSubDirectories);
-  } else if (QRTIsPerUserClass(containerClass) || containerClass == 12) {
+  } else if (QRTIsPerUserClass(containerClass) || containerClass == QRTClassSystemData) {
     begin = kDataSubDirectories;
     count = std::size(kDataSubDirectories);
   }
@@ -83,7 +83,7 @@ bool QRTClientConnection::_createSubDirectories(const QRTURL& url, uint32_t user
   // A system container's group bits are its ACL mask (owner, group and other
   // entries stay empty): 0000 would cut the systemusers entry down to nothing.
   const mode_t mode = system ? 0070 : 0755;
-  const uint32_t owner = system ? kNobodyId : userId;
+  const uint32_t owner = system ? QRTNobodyUserId : userId;
   for (size_t i = 0; i < count; ++i) {
     QRTErrorRef underlying;
     if (!_createDefaultDirectory(url.URLByAppendingPathComponent(begin[i], true), mode, owner, &underlying)) {
@@ -173,12 +173,15 @@ QRTMetadataRef QRTClientConnection::_createNewContainer(uint32_t userId, const s
   return nullptr;
 }
 
-QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(uint32_t userId,
-                                                                   const std::optional<std::string>& identifier,
-                                                                   bool createIfNecessary, uint64_t containerClass,
-                                                                   bool transient, bool useLocking,
-                                                                   uint64_t* withError) {
-  if (!identifier || containerClass < 1 || containerClass > 13) {
+QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(const QRTContainerKey& key, QRTCreateMode mode,
+                                                                   QRTLocking locking, uint64_t* withError) {
+  const uint32_t userId = key.userId;
+  const uint64_t containerClass = key.containerClass;
+  const std::optional<std::string>& identifier = key.identifier;
+  const bool createIfNecessary = mode == QRTCreateMode::CreateIfMissing;
+  const bool transient = key.transient;
+  const bool useLocking = locking == QRTLocking::TakeLocks;
+  if (!identifier || containerClass < QRTClassAppBundle || containerClass > QRTClassSystemGroup) {
     reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
                          "Can't act on an invalid object: userId: %u, ID: %@, class: %ld", userId, identifier,
                          static_cast<long>(containerClass)),
@@ -192,14 +195,16 @@ QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(uint32_t user
     return nullptr;
   }
   const bool foreign = identifier != clientBundleIdentifier_;
-  if (foreign && !allowOtherIdLookup_ && !((containerClass == 7 || containerClass == 13) && allowGroupIdLookup_) &&
+  if (foreign && !allowOtherIdLookup_ &&
+      !((containerClass == QRTClassAppGroup || containerClass == QRTClassSystemGroup) && allowGroupIdLookup_) &&
       platform::deviceIsInternalBuild()) {
     QRTLog(platform::kLogDebug,
            "%@ trying to retrieve container class %ld for identifier: %@. WARNING: Soon you will need an entitlement "
            "to do this. File a Bugline in \"QuarterKit | all\"",
            clientBundleIdentifier_, static_cast<long>(containerClass), identifier);
   }
-  if (containerClass == 12 && !allowOtherIdLookup_ && (!codeSigningGrantsSystemContainer(*identifier) || foreign)) {
+  if (containerClass == QRTClassSystemData && !allowOtherIdLookup_ &&
+      (!codeSigningGrantsSystemContainer(*identifier) || foreign)) {
     reportCode(QRT_ERROR(QRTErrorNotEntitled, nullptr, true, "%@ not entitled for system container with identifier %@",
                          clientBundleIdentifier_, identifier),
                withError);

@@ -17,6 +17,20 @@
 #include "Daemon/QRTError.h"
 
 class QRTMetadata;
+
+// Names one container: its user, class, identifier and whether it is the
+// transient one.
+struct QRTContainerKey {
+  uint32_t userId = 0;
+  uint64_t containerClass = 0;
+  std::optional<std::string> identifier;
+  bool transient = false;
+};
+// Whether a look-up makes the container when it is missing.
+enum class QRTCreateMode : bool { LookupOnly, CreateIfMissing };
+// Whether the call takes the identifier locks itself, or runs where the
+// caller already holds them.
+enum class QRTLocking : bool { CallerHoldsLocks, TakeLocks };
 using QRTMetadataRef = std::shared_ptr<const QRTMetadata>;
 
 class QRTClientConnection {
@@ -51,9 +65,8 @@ class QRTClientConnection {
   // Finds the container of (user, class, identifier, transient), or makes it
   // through the staging directory when asked to. Nothing on failure, with
   // the code in *withError.
-  QRTMetadataRef createOrLookupContainerForUser(uint32_t userId, const std::optional<std::string>& identifier,
-                                                bool createIfNecessary, uint64_t containerClass, bool transient,
-                                                bool useLocking, uint64_t* withError);
+  QRTMetadataRef createOrLookupContainerForUser(const QRTContainerKey& key, QRTCreateMode mode, QRTLocking locking,
+                                                uint64_t* withError);
 
   // Queues a death-row pass; the completion gets its result code.
   void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);

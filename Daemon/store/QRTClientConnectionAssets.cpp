@@ -17,6 +17,7 @@
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTClientConnectionInternal.h"
 #include "Daemon/store/QRTContainerCache.h"
+#include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTLocks.h"
 #include "Daemon/store/QRTMetadata.h"
 #include "platform/DeviceProperties.h"
@@ -33,7 +34,8 @@ constexpr const char* kCrashCounterKey = "CrashCounter";
 
 QRTMetadataRef appDataContainer(uint32_t userId, const std::string& identifier, QRTErrorRef* error) {
   QRTErrorRef lookup;
-  QRTMetadataRef m = QRTContainerCache::sharedInstance().containerForUser(userId, 2, identifier, false, &lookup);
+  QRTMetadataRef m =
+      QRTContainerCache::sharedInstance().containerForUser(userId, QRTClassAppData, identifier, false, &lookup);
   if (!m) {
     *error =
         QRT_ERROR(QRTErrorInvalidParameter, lookup, true,
@@ -125,7 +127,7 @@ std::optional<QRTURL> QRTClientConnection::userManagedAssetsPathForUser(uint32_t
     // Read again under the lock: another request may have made it meanwhile.
     QRTErrorRef ignored;
     if (QRTMetadataRef current =
-            QRTContainerCache::sharedInstance().containerForUser(userId, 2, identifier, false, &ignored))
+            QRTContainerCache::sharedInstance().containerForUser(userId, QRTClassAppData, identifier, false, &ignored))
       m = current;
     if (!m->userManagedAssetsDirName()) {
       m = makeAssetsDirectory(m, userId, &error);
@@ -168,7 +170,7 @@ void QRTClientConnection::deleteUserManagedAssetForUser(uint32_t userId, const s
     QRTIdentifierLock lock(m->uuid().UUIDString(), true);
     QRTErrorRef ignored;
     if (QRTMetadataRef current =
-            QRTContainerCache::sharedInstance().containerForUser(userId, 2, identifier, false, &ignored))
+            QRTContainerCache::sharedInstance().containerForUser(userId, QRTClassAppData, identifier, false, &ignored))
       m = current;
     if (m->url().empty() || !m->userManagedAssetsDirName()) {
       return reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
@@ -220,7 +222,8 @@ std::optional<QRTURL> QRTClientConnection::stageSharedContentForIdentifier(
                             clientBundleIdentifier_, identifier));
     }
     QRTErrorRef lookup;
-    QRTMetadataRef m = QRTContainerCache::sharedInstance().containerForUser(499, 13, identifier, false, &lookup);
+    QRTMetadataRef m = QRTContainerCache::sharedInstance().containerForUser(
+        QRTSystemContainerUserId, QRTClassSystemGroup, identifier, false, &lookup);
     if (!m) {
       return fail(QRT_ERROR(QRTErrorNotFound, lookup, true, "System group container with identifier %@ not found: %@",
                             identifier, lookup));
@@ -259,7 +262,7 @@ void QRTClientConnection::setNetworkExtensionForUser(uint32_t userId, const std:
           QRT_ERROR(QRTErrorInvalidParameter, nullptr, true, "Can't act on invalid input: ID: %@", identifier),
           withError);
     }
-    if (containerClass != 2 && containerClass != 6) {
+    if (containerClass != QRTClassAppData && containerClass != QRTClassVPNData) {
       return reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
                                   "Can't set network extension on container of type: %llu, identifier: %@",
                                   static_cast<unsigned long long>(containerClass), identifier),
@@ -272,7 +275,8 @@ void QRTClientConnection::setNetworkExtensionForUser(uint32_t userId, const std:
                         withError);
     }
     uint64_t code = QRTErrorNone;
-    QRTMetadataRef m = createOrLookupContainerForUser(userId, identifier, true, containerClass, false, true, &code);
+    QRTMetadataRef m = createOrLookupContainerForUser({userId, containerClass, identifier},
+                                                      QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code);
     if (!m) {
       QRTLog(kLogError, "Failed to create VPN Plugin container for tunnelbroker: %llu, ID: %@, class: %llu",
              static_cast<unsigned long long>(code), identifier, static_cast<unsigned long long>(containerClass));
@@ -291,8 +295,8 @@ void QRTClientConnection::setNetworkExtensionForUser(uint32_t userId, const std:
 void QRTClientConnection::retryTestForUser(uint32_t userId, uint64_t withNumCrashes, uint64_t* withError) {
   try {
     uint64_t code = QRTErrorNone;
-    QRTMetadataRef m =
-        createOrLookupContainerForUser(userId, std::string(kRetryTestIdentifier), true, 2, false, true, &code);
+    QRTMetadataRef m = createOrLookupContainerForUser({userId, QRTClassAppData, std::string(kRetryTestIdentifier)},
+                                                      QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code);
     if (!m) {
       QRTLog(kLogError, "Failed to create or lookup lookup existing container for retry test: %@",
              std::to_string(code));

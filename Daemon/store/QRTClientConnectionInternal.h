@@ -14,6 +14,3 @@ inline void reportCode(const QRTErrorRef& error, uint64_t* withError) {
 inline bool hasCode(const QRTErrorRef& error, const char* domain, int32_t code) {
   return error && error->domain() == domain && error->code() == code;
 }
-
-// Owner of the sub-directories of system containers: the unprivileged nobody id.
-inline constexpr uint32_t kNobodyId = 4294967294u;

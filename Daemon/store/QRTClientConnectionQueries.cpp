@@ -27,7 +27,7 @@ namespace {
 
 bool validSelector(const char* function, uint32_t userId, const std::optional<QRTUUID>& uuid, uint64_t containerClass,
                    QRTErrorRef* error) {
-  if (uuid && containerClass >= 1 && containerClass <= 13) return true;
+  if (uuid && containerClass >= QRTClassAppBundle && containerClass <= QRTClassSystemGroup) return true;
   QRTSetError(error, QRTCreateError(function, __LINE__, QRTErrorDomain, QRTErrorInvalidParameter, nullptr, nullptr,
                                     true, "Can't act on an invalid object: userId: %u, UUID: %@, Class: %ld", userId,
                                     uuid, static_cast<long>(containerClass)));
@@ -50,7 +50,7 @@ QRTMetadataRef lookupByUUID(const char* function, uint32_t userId, const QRTUUID
 
 std::optional<std::vector<QRTMetadataRef>> QRTClientConnection::containersForUser(uint32_t userId, uint64_t withClass,
                                                                                   bool transient, uint64_t* withError) {
-  if (withClass < 1 || withClass > 13) {
+  if (withClass < QRTClassAppBundle || withClass > QRTClassSystemGroup) {
     reportCode(
         QRT_ERROR(QRTErrorInvalidParameter, nullptr, true, "Can't act on an invalid container-userId: %u, class: %ld",
                   userId, static_cast<long>(withClass)),

@@ -59,8 +59,9 @@ std::optional<QRTContainerCache::ClassMap> QRTContainerCache::buildClassMap(uint
   if (!items) return std::nullopt;
 
   ClassMap map;
-  const bool pushMappings =
-      populateSandboxCache && !transient && (contentClass == 10 || contentClass == 12 || contentClass == 13);
+  const bool pushMappings = populateSandboxCache && !transient &&
+                            (contentClass == QRTClassInternalDaemonData || contentClass == QRTClassSystemData ||
+                             contentClass == QRTClassSystemGroup);
   // Planted directories beyond a user's bound are not read: they could not
   // have been made through requests.
   const size_t limit = userId == 0 ? SIZE_MAX : QRTGlobalConfiguration::sharedInstance().maxContainersPerClass();

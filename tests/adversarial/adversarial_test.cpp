@@ -221,8 +221,7 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
     ASSERT_EQ(chown(otherHome().c_str(), kOtherUser, kOtherUser), 0);
 
     setOwnIdentity("com.example.installer",
-                   {{"com.norvane.private.QuarterKit.allowed", true},
-                    {"com.norvane.private.QuarterKit.wipeContainer", plist::Array{"com.example.addon"}}});
+                   {{QRTEntitlementAllowed, true}, {QRTEntitlementWipeContainer, plist::Array{"com.example.addon"}}});
     app = make(kUser, "com.example.app", 2);
     addon = make(kUser, "com.example.addon", 4);
     other = make(kOtherUser, "com.example.other", 2);
@@ -304,19 +303,19 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
   void plant(const std::function<bool()>& step) { ASSERT_EQ(asUser(kUser, step), 0) << "the user could not plant"; }
 
   static plist::Dictionary stage(const Container& c) {
-    return {{"ContainerClassesArray", plist::Array{c.cls}},
-            {"UserIDsArray", plist::Array{c.user}},
-            {"UUIDsArray", plist::Array{uuidData(c.uuid)}},
-            {"IdentifiersArray", plist::Array{c.identifier}}};
+    return {{QRTKeyContainerClassesArray, plist::Array{c.cls}},
+            {QRTKeyUserIDsArray, plist::Array{c.user}},
+            {QRTKeyUUIDsArray, plist::Array{uuidData(c.uuid)}},
+            {QRTKeyIdentifiersArray, plist::Array{c.identifier}}};
   }
   static plist::Dictionary replace(const Container& old, const Container& fresh) {
-    return {{"OldContainerUUID", uuidData(old.uuid)},   {"OldContainerClass", old.cls},
-            {"OldContainerUserID", old.user},           {"OldIdentifier", old.identifier},
-            {"NewContainerUUID", uuidData(fresh.uuid)}, {"NewContainerClass", fresh.cls},
-            {"NewContainerUserID", fresh.user},         {"NewIdentifier", fresh.identifier}};
+    return {{QRTKeyOldContainerUUID, uuidData(old.uuid)},   {QRTKeyOldContainerClass, old.cls},
+            {QRTKeyOldContainerUserID, old.user},           {QRTKeyOldIdentifier, old.identifier},
+            {QRTKeyNewContainerUUID, uuidData(fresh.uuid)}, {QRTKeyNewContainerClass, fresh.cls},
+            {QRTKeyNewContainerUserID, fresh.user},         {QRTKeyNewIdentifier, fresh.identifier}};
   }
   static plist::Dictionary creation(const std::string& identifier, bool transient = false) {
-    return with(byName(kUser, 2, identifier), {{"CreateIfNecessary", true}, {"Transient", transient}});
+    return with(byName(kUser, 2, identifier), {{QRTKeyCreateIfNecessary, true}, {QRTKeyTransient, transient}});
   }
 
   std::string home() const { return root + "/private/var/mobile"; }
@@ -365,9 +364,10 @@ TEST_P(AdversarialTest, NothingOutsideTheUsersReachChanges) {
     EXPECT_EQ(firstOwnedBy(tree, kUser), "") << "the user's item in " << tree << "; replies:" << trace_;
   }
   auto connection = qk::Connection::connect(qk::requestSocketPath(root));
-  auto reply = connection ? connection->call(request(0, byName(other)), kRequestTimeout) : std::nullopt;
+  auto reply = connection ? connection->call(request(QRTCommandCreateOrLookupContainer, byName(other)), kRequestTimeout)
+                          : std::nullopt;
   EXPECT_EQ(codeOf(reply), 1u) << "the daemon no longer serves; replies (command:code):" << trace_;
-  EXPECT_EQ(at(reply, "ReplyPath"), plist::Value(other.path)) << "the other user's container moved";
+  EXPECT_EQ(at(reply, QRTReplyKeyPath), plist::Value(other.path)) << "the other user's container moved";
   if (!reply) stuck_ = true;
 }
 
@@ -394,9 +394,9 @@ Requests onApp(std::vector<uint64_t> commands) {
 }
 // The command on a container by name, then a death-row pass.
 Requests byNameThenPass(uint64_t command, Container T::*c = &T::app) {
-  return [=](T& t) { t.sends({{command, byName(t.*c)}, {4, {}}}); };
+  return [=](T& t) { t.sends({{command, byName(t.*c)}, {QRTCommandDeleteContainersOnDeathRow, {}}}); };
 }
-const plist::Dictionary kSet{{"Key", "k"}, {"Value", "v"}};
+const plist::Dictionary kSet{{QRTKeyKey, "k"}, {QRTKeyValue, "v"}};
 // As the user: a directory that passes for the container (it has a copy of
 // its metadata file), with links to targets where its default directories belong.
 bool plantDecoy(const T& t, const Container& c, const std::string& dir) {
@@ -423,7 +423,7 @@ void registerEntitledCopy(T& t) {
   t.fresh = t.make(499, "com.example.sysd", 12);
   const std::string copy = t.root + "/usr/bin/entitledctl";
   ASSERT_EQ(system(("mkdir -p " + parentOf(copy) + " && cp " QRT_QUARTERCTL_PATH " " + copy).c_str()), 0);
-  t.setIdentity("entitledctl", copy, "com.example.entitledctl", {{"com.norvane.private.QuarterKit.allowed", true}});
+  t.setIdentity("entitledctl", copy, "com.example.entitledctl", {{QRTEntitlementAllowed, true}});
 }
 
 // As the user: a container directory (made with its parents) whose metadata
@@ -456,13 +456,13 @@ const Case kCases[] = {
     // The metadata file.
     swapped(
         "MetadataLinkToDevicePasswd_SetInfo", appItem(kMetadataFile), [](const T& t) { return t.root + "/etc/passwd"; },
-        [](T& t) { t.send(5, with(selector(t.app), kSet)); }),
+        [](T& t) { t.send(QRTCommandSetInfoValue, with(selector(t.app), kSet)); }),
     {"MetadataHardLinkToOutsideFile_SetInfo",
      [](T& t) {
        ASSERT_EQ(unlink(t.in(t.app, kMetadataFile).c_str()), 0);
        ASSERT_EQ(link((t.outside + "/public").c_str(), t.in(t.app, kMetadataFile).c_str()), 0);
      },
-     [](T& t) { t.send(5, with(selector(t.app), kSet)); }},
+     [](T& t) { t.send(QRTCommandSetInfoValue, with(selector(t.app), kSet)); }},
     {"MetadataLinkToOtherUsersMetadata_Restart_ReadAndSet",
      [](T& t) {
        t.plant([&] { return swapForLink(t.in(t.app, kMetadataFile), t.in(t.other, kMetadataFile)); });
@@ -470,8 +470,9 @@ const Case kCases[] = {
      },
      [](T& t) {
        for (const Container* c : {&t.app, &t.other})
-         t.sends({{7, with(selector(*c), {{"InfoDictRequested", true}})}, {6, with(selector(*c), {{"Key", "k"}})}});
-       t.send(5, with(selector(t.app), kSet));
+         t.sends({{QRTCommandMetadataForContainer, with(selector(*c), {{QRTKeyInfoDictRequested, true}})},
+                  {QRTCommandInfoValueForKey, with(selector(*c), {{QRTKeyKey, "k"}})}});
+       t.send(QRTCommandSetInfoValue, with(selector(t.app), kSet));
      }},
     {"MetadataFifo_Restart_LookupAndRead",
      [](T& t) {
@@ -482,19 +483,22 @@ const Case kCases[] = {
        t.restartDaemon();
      },
      [](T& t) {
-       t.sends({{0, byName(t.app)},
+       t.sends({{QRTCommandCreateOrLookupContainer, byName(t.app)},
                 {7, selector(t.app)},
-                {6, with(selector(t.app), {{"Key", "k"}})},
+                {6, with(selector(t.app), {{QRTKeyKey, "k"}})},
                 {23, selector(t.app)}});
      }},
     // Default sub-directories: recreated and given to the user.
-    swapped("DocumentsLinkToOutside_Recreate", appItem("Documents"), outsideDir, onApp({8})),
-    swapped("LibraryLinkToOutside_RecreateMissing", appItem("Library"), outsideDir, onApp({22})),
+    swapped("DocumentsLinkToOutside_Recreate", appItem("Documents"), outsideDir,
+            onApp({QRTCommandRecreateDefaultStructure})),
+    swapped("LibraryLinkToOutside_RecreateMissing", appItem("Library"), outsideDir,
+            onApp({QRTCommandRecreateContainerStructure})),
     swapped(
-        "TmpLinkToDeviceEtc_Recreate", appItem("tmp"), [](const T& t) { return t.root + "/etc"; }, onApp({8})),
+        "TmpLinkToDeviceEtc_Recreate", appItem("tmp"), [](const T& t) { return t.root + "/etc"; },
+        onApp({QRTCommandRecreateDefaultStructure})),
     swapped(
         "DocumentsLinkToOtherUsersDocuments_RecreateMissing", appItem("Documents"),
-        [](const T& t) { return t.in(t.other, "Documents"); }, onApp({22})),
+        [](const T& t) { return t.in(t.other, "Documents"); }, onApp({QRTCommandRecreateContainerStructure})),
     {"TmpAndCachesHardLinkedToOutsideFiles_Recreate",
      [](T& t) {
        t.plant(
@@ -502,7 +506,7 @@ const Case kCases[] = {
        ASSERT_EQ(link((t.outside + "/secret").c_str(), t.in(t.app, "tmp").c_str()), 0);
        ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/Caches").c_str()), 0);
      },
-     onApp({8, 22})},
+     onApp({QRTCommandRecreateDefaultStructure, QRTCommandRecreateContainerStructure})},
     // Where new containers are made.
     {"ClassDirectoryLinkToOutside_Create",
      [](T& t) {
@@ -512,39 +516,43 @@ const Case kCases[] = {
                 symlink(t.outside.c_str(), (data + "/Application").c_str()) == 0;
        });
      },
-     [](T& t) { t.send(0, T::creation("com.example.new")); }},
+     [](T& t) { t.send(QRTCommandCreateOrLookupContainer, T::creation("com.example.new")); }},
     swapped(
         "ContainersLinkToOutside_Create", [](const T& t) { return t.containers(); }, outsideDir,
         [](T& t) {
-          t.sends({{0, T::creation("com.example.new")},
-                   {0, with(T::creation("com.example.new"), {{"ContainerClass", 6}})}});
+          t.sends({{QRTCommandCreateOrLookupContainer, T::creation("com.example.new")},
+                   {0, with(T::creation("com.example.new"), {{QRTKeyContainerClass, 6}})}});
         }),
     swapped(
         "HomeLibraryLinkToOutside_CreateTransient", [](const T& t) { return t.home() + "/Library"; }, outsideDir,
-        [](T& t) { t.send(0, T::creation("com.example.new", true)); }),
+        [](T& t) { t.send(QRTCommandCreateOrLookupContainer, T::creation("com.example.new", true)); }),
     swapped(
         "HomeLibraryLinkToDaemonLibrary_CreateTransient", [](const T& t) { return t.home() + "/Library"; },
         [](const T& t) { return t.root + "/private/var/root/Library"; },
-        [](T& t) { t.send(0, T::creation("com.example.new", true)); }),
+        [](T& t) { t.send(QRTCommandCreateOrLookupContainer, T::creation("com.example.new", true)); }),
     // The container directory itself.
-    swapped("ContainerLinkToOutside_StageAndPass", appPath, outsideDir,
-            [](T& t) {
-              t.sends({{3, T::stage(t.app)}, {4, {}}});
-            }),
-    swapped("ContainerLinkToOtherUsersContainer_DeleteAndPass", appPath, otherContainer, byNameThenPass(10)),
-    swapped("ContainerLinkToOtherUsersContainer_RegenerateUUID", appPath, otherContainer, onApp({9, 8})),
-    swapped("ContainerLinkToOtherUsersContainer_DiskUsage", appPath, otherContainer, onApp({23})),
-    swapped("ContainerLinkToOtherUsersContainer_Wipe", appPath, otherContainer, byNameThenPass(12)),
+    swapped(
+        "ContainerLinkToOutside_StageAndPass", appPath, outsideDir,
+        [](T& t) {
+          t.sends({{QRTCommandStageContainerForDelete, T::stage(t.app)}, {QRTCommandDeleteContainersOnDeathRow, {}}});
+        }),
+    swapped("ContainerLinkToOtherUsersContainer_DeleteAndPass", appPath, otherContainer,
+            byNameThenPass(QRTCommandDeleteContainer)),
+    swapped("ContainerLinkToOtherUsersContainer_RegenerateUUID", appPath, otherContainer,
+            onApp({QRTCommandRegenerateDirectoryUUID, QRTCommandRecreateDefaultStructure})),
+    swapped("ContainerLinkToOtherUsersContainer_DiskUsage", appPath, otherContainer, onApp({QRTCommandDiskUsage})),
+    swapped("ContainerLinkToOtherUsersContainer_Wipe", appPath, otherContainer,
+            byNameThenPass(QRTCommandDeleteDataContainerContent)),
     swapped(
         "AddonContainerLinkToOtherUsersContainer_WipeAddon", [](const T& t) { return t.addon.path; }, otherContainer,
-        byNameThenPass(11, &T::addon)),
+        byNameThenPass(QRTCommandWipeAddonDataContainer, &T::addon)),
     {"OldContainerLinkToOtherUsersContainer_Replace",
      [](T& t) {
        freshApp(t);
        t.plant([&] { return swapForLink(t.app.path, t.other.path); });
      },
      [](T& t) {
-       t.sends({{2, T::replace(t.app, t.fresh)}, {4, {}}});
+       t.sends({{QRTCommandReplaceContainer, T::replace(t.app, t.fresh)}, {QRTCommandDeleteContainersOnDeathRow, {}}});
      }},
     {"NewContainerLinkToOtherUsersContainer_Replace",
      [](T& t) {
@@ -552,16 +560,21 @@ const Case kCases[] = {
        t.plant([&] { return swapForLink(t.fresh.path, t.other.path); });
      },
      [](T& t) {
-       t.sends({{2, T::replace(t.app, t.fresh)}, {8, selector(t.app)}, {4, {}}});
+       t.sends({{QRTCommandReplaceContainer, T::replace(t.app, t.fresh)},
+                {QRTCommandRecreateDefaultStructure, selector(t.app)},
+                {QRTCommandDeleteContainersOnDeathRow, {}}});
      }},
     // Hard links to files outside, inside a container that is then worked on.
-    {"HardLinksInContainer_DeleteAndPass", hardLinks, byNameThenPass(10)},
-    {"HardLinksInContainer_WipeAndPass", hardLinks, byNameThenPass(12)},
-    {"HardLinksInContainer_UsageRegenerateRecreate", hardLinks, onApp({23, 9, 22})},
+    {"HardLinksInContainer_DeleteAndPass", hardLinks, byNameThenPass(QRTCommandDeleteContainer)},
+    {"HardLinksInContainer_WipeAndPass", hardLinks, byNameThenPass(QRTCommandDeleteDataContainerContent)},
+    {"HardLinksInContainer_UsageRegenerateRecreate", hardLinks,
+     onApp({QRTCommandDiskUsage, QRTCommandRegenerateDirectoryUUID, QRTCommandRecreateContainerStructure})},
     {"FifoInContainer_UsageAndDelete",
      [](T& t) { t.plant([&] { return mkfifo(t.in(t.app, "Documents/pipe").c_str(), 0644) == 0; }); },
      [](T& t) {
-       t.sends({{23, selector(t.app)}, {10, byName(t.app)}, {4, {}}});
+       t.sends({{QRTCommandDiskUsage, selector(t.app)},
+                {QRTCommandDeleteContainer, byName(t.app)},
+                {QRTCommandDeleteContainersOnDeathRow, {}}});
      }},
     // Swaps while requests run.
     // A link to a decoy that passes for the container (it has the metadata
@@ -570,8 +583,8 @@ const Case kCases[] = {
      [](T& t) { t.plant([&] { return plantDecoy(t, t.app, t.home() + "/decoy"); }); },
      [](T& t) {
        for (int i = 0; i < 20; ++i) {
-         onApp({8, 22, 23})(t);
-         t.send(5, with(selector(t.app), {{"Key", "k"}, {"Value", i}}));
+         onApp({QRTCommandRecreateDefaultStructure, QRTCommandRecreateContainerStructure, QRTCommandDiskUsage})(t);
+         t.send(QRTCommandSetInfoValue, with(selector(t.app), {{QRTKeyKey, "k"}, {QRTKeyValue, i}}));
        }
      },
      [](const T& t) { flip(t.app.path, t.home() + "/decoy"); }},
@@ -593,7 +606,7 @@ const Case kCases[] = {
        ASSERT_EQ(system(("chown -R 501:501 " + t.in(t.app, "Documents")).c_str()), 0);
      },
      [](T& t) {
-       t.sends({{3, T::stage(t.app)}, {4, {}}});
+       t.sends({{QRTCommandStageContainerForDelete, T::stage(t.app)}, {QRTCommandDeleteContainersOnDeathRow, {}}});
      },
      // The staged container stays the user's, and reachable, inside the death-row directory.
      [](const T& t) {
@@ -608,7 +621,8 @@ const Case kCases[] = {
        });
      },
      [](T& t) {
-       for (int i = 0; i < 20; ++i) t.send(0, T::creation("com.example.race" + std::to_string(i)));
+       for (int i = 0; i < 20; ++i)
+         t.send(QRTCommandCreateOrLookupContainer, T::creation("com.example.race" + std::to_string(i)));
      },
      [](const T& t) { flip(t.containers() + "/Data", t.home() + "/fake"); }},
     {"RaceContainersAndLinkToDecoys_WipeReplaceStageRegenerateDelete",
@@ -619,11 +633,13 @@ const Case kCases[] = {
        });
      },
      [](T& t) {
-       t.send(12, byName(t.app));
-       t.sends({{2, T::replace(t.app, t.make(kUser, "com.example.app", 2, true))}, {3, T::stage(t.addon)}});
+       t.send(QRTCommandDeleteDataContainerContent, byName(t.app));
+       t.sends({{QRTCommandReplaceContainer, T::replace(t.app, t.make(kUser, "com.example.app", 2, true))},
+                {QRTCommandStageContainerForDelete, T::stage(t.addon)}});
        // Last: a new directory name lives in one of the two trees only.
-       onApp({9, 9, 9})(t);
-       byNameThenPass(10)(t);
+       onApp({QRTCommandRegenerateDirectoryUUID, QRTCommandRegenerateDirectoryUUID, QRTCommandRegenerateDirectoryUUID})(
+           t);
+       byNameThenPass(QRTCommandDeleteContainer)(t);
      },
      [](const T& t) { flip(t.containers(), t.home() + "/decoys"); }},
     // Borrowed identities, requests no entitlement covers, refusals to flush the log.
@@ -642,15 +658,17 @@ const Case kCases[] = {
      }},
     {"LongIdentifiers_300Creations", [](T&) {},
      [](T& t) {
-       EXPECT_EQ(t.sendsAs(kUser, 11, {{0, T::creation(std::string(1 << 20, 'a'))}}, 300), 0) << "not refused with 11";
+       EXPECT_EQ(
+           t.sendsAs(kUser, 11, {{QRTCommandCreateOrLookupContainer, T::creation(std::string(1 << 20, 'a'))}}, 300), 0)
+           << "not refused with 11";
        EXPECT_EQ(listDirectory(parentOf(t.app.path)).size(), 1u) << "containers left in the class directory";
      }},
     {"ServiceAccountActsForOthers_TransientAndRootsHome",
      [](T& t) { std::ofstream(t.root + "/etc/passwd", std::ios::app) << "svc:x:120:120::/:/bin/false\n", freshApp(t); },
      [](T& t) {
        EXPECT_EQ(t.sendsAs(120, 38,
-                           {{0, T::creation("com.example.app", true)},
-                            {0, with(T::creation("com.example.app"), {{"UserID", 0}})}}),
+                           {{QRTCommandCreateOrLookupContainer, T::creation("com.example.app", true)},
+                            {0, with(T::creation("com.example.app"), {{QRTKeyUserID, 0}})}}),
                  0);
        EXPECT_TRUE(exists(t.fresh.path)) << "the user's transient container was sent to death row";
      }},
@@ -660,10 +678,10 @@ const Case kCases[] = {
        writeFile(t.fresh.path + "/payload", "the installer's");
      },
      [](T& t) {
-       const plist::Dictionary create{{"CreateIfNecessary", true}},
-           transient{{"CreateIfNecessary", true}, {"Transient", true}};
+       const plist::Dictionary create{{QRTKeyCreateIfNecessary, true}},
+           transient{{QRTKeyCreateIfNecessary, true}, {QRTKeyTransient, true}};
        EXPECT_EQ(t.sendsAs(kUser, 55,
-                           {{0, with(byName(33, 1, "com.example.bundle"), transient)},
+                           {{QRTCommandCreateOrLookupContainer, with(byName(33, 1, "com.example.bundle"), transient)},
                             {0, with(byName(33, 3, "com.victim.app"), create)},
                             {0, with(byName(499, 13, "systemgroup.com.victim"), create)}}),
                  0);
@@ -674,14 +692,14 @@ const Case kCases[] = {
      }},
     {"RefusalsFlushingTheLog_800In200ms", [](T&) {},
      [](T& t) {
-       t.sendsAs(kUser, 55, {{10, byName(t.other)}});
+       t.sendsAs(kUser, 55, {{QRTCommandDeleteContainer, byName(t.other)}});
        const std::string evidence = "from pid " + std::to_string(t.lastPid) + " ";
        // Entitlement refusals and a handler's own refusal (a system container not entitled).
-       EXPECT_EQ(
-           t.sendsAs(kUser, 55,
-                     {{17, {{"GroupIdentifier", "systemgroup.com.victim"}}}, {0, byName(499, 12, "com.example.sysd")}},
-                     400),
-           0);
+       EXPECT_EQ(t.sendsAs(kUser, 55,
+                           {{17, {{QRTKeyGroupIdentifier, "systemgroup.com.victim"}}},
+                            {QRTCommandCreateOrLookupContainer, byName(499, 12, "com.example.sysd")}},
+                           400),
+                 0);
        std::this_thread::sleep_for(std::chrono::milliseconds(1500));
        const std::string log = t.root + "/private/var/root/Library/Logs/QuarterKit/quarterd.log";
        const std::string text = readFile(log + ".0") + readFile(log);
@@ -705,7 +723,7 @@ const Case kCases[] = {
        });
        reboot(t);
      },
-     [](T& t) { t.send(4); }},
+     [](T& t) { t.send(QRTCommandDeleteContainersOnDeathRow); }},
     {"PlantedBundleAndLogs_BuildUpgrade",
      [](T& t) {
        ASSERT_EQ(t.stopDaemon(), 0);
@@ -722,7 +740,8 @@ const Case kCases[] = {
        writeFile(t.root + "/etc/system-version.plist", std::string(version.begin(), version.end()));
        reboot(t);
      },
-     [](T& t) { t.send(0, byName(33, 1, "com.victim.app")); }, nullptr, [](T& t) { expectReply(t, "0:21"); }},
+     [](T& t) { t.send(QRTCommandCreateOrLookupContainer, byName(33, 1, "com.victim.app")); }, nullptr,
+     [](T& t) { expectReply(t, "0:21"); }},
     {"PlantedMetadataWithGroupIds_DataMigration",
      [](T& t) {
        t.plant([&] {
@@ -731,7 +750,7 @@ const Case kCases[] = {
        });
        t.restartDaemon();
      },
-     [](T& t) { t.send(24); }, nullptr,
+     [](T& t) { t.send(QRTCommandPerformDataMigration); }, nullptr,
      [](T& t) {
        EXPECT_EQ(t.logText().find("Migrating app group entitlements for com.victim.sysd"), std::string::npos);
      }},
@@ -746,11 +765,13 @@ const Case kCases[] = {
        });
        t.restartDaemon();
      },
-     [](T& t) { t.send(0, byName(kUser, 2, "com.example.big")); }, nullptr, [](T& t) { expectReply(t, "0:21"); }},
+     [](T& t) { t.send(QRTCommandCreateOrLookupContainer, byName(kUser, 2, "com.example.big")); }, nullptr,
+     [](T& t) { expectReply(t, "0:21"); }},
     // Bounds on what one user holds.
     {"MassCreation_BoundPerClass", [](T& t) { writeFile(t.root + "/run/quarterd.maxcontainers", "3"); },
      [](T& t) {
-       for (int i = 0; i < 4; ++i) t.send(0, T::creation("com.example.mass" + std::to_string(i)));
+       for (int i = 0; i < 4; ++i)
+         t.send(QRTCommandCreateOrLookupContainer, T::creation("com.example.mass" + std::to_string(i)));
      },
      nullptr,
      [](T& t) {
@@ -769,7 +790,7 @@ const Case kCases[] = {
                 truncate(t.in(t.app, "Documents/sparse").c_str(), 64 << 20) == 0;
        });
      },
-     [](T& t) { t.send(10, byName(t.app)); }, nullptr,
+     [](T& t) { t.send(QRTCommandDeleteContainer, byName(t.app)); }, nullptr,
      [](T& t) {
        EXPECT_FALSE(exists(t.app.path)) << t.trace_;
        EXPECT_EQ(firstOwnedBy(t.deadDirectory(), kUser), "") << "copied to the daemon's death row";

@@ -17,12 +17,12 @@
 #include "base/PlistCodec.h"
 
 plist::Dictionary request(uint64_t command, plist::Dictionary keys) {
-  keys["Command"] = command;
+  keys[QRTKeyCommand] = command;
   return keys;
 }
 
 uint64_t codeOf(const std::optional<plist::Dictionary>& reply) {
-  const plist::Value* code = reply ? plist::find(*reply, "ReplyError") : nullptr;
+  const plist::Value* code = reply ? plist::find(*reply, QRTReplyKeyError) : nullptr;
   return code && code->isInteger() ? code->integer().asUnsigned() : 0;
 }
 
@@ -39,10 +39,10 @@ std::optional<uint64_t> u64At(const std::optional<plist::Dictionary>& reply, con
 }
 
 plist::Dictionary byName(uint64_t user, uint64_t cls, const std::string& identifier) {
-  return {{"UserID", user}, {"ContainerClass", cls}, {"Identifier", identifier}};
+  return {{QRTKeyUserID, user}, {QRTKeyContainerClass, cls}, {QRTKeyIdentifier, identifier}};
 }
 plist::Dictionary byName(const Container& c) { return byName(c.user, c.cls, c.identifier); }
-plist::Dictionary selector(const Container& c) { return with(byName(c), {{"UUID", uuidData(c.uuid)}}); }
+plist::Dictionary selector(const Container& c) { return with(byName(c), {{QRTKeyUUID, uuidData(c.uuid)}}); }
 plist::Dictionary with(plist::Dictionary keys, plist::Dictionary more) { return more.merge(keys), more; }
 plist::Dictionary without(plist::Dictionary keys, const std::string& key) { return keys.erase(key), keys; }
 
@@ -199,20 +199,20 @@ std::optional<plist::Dictionary> DaemonFixture::call(uint64_t command, plist::Di
 
 Container DaemonFixture::createOrLookup(uint64_t user, const std::string& identifier, uint64_t cls, bool create,
                                         bool transient, uint64_t command) {
-  auto reply = call(command, {{"UserID", user},
-                              {"ContainerClass", cls},
-                              {"Identifier", identifier},
-                              {"CreateIfNecessary", create},
-                              {"Transient", transient}});
+  auto reply = call(command, {{QRTKeyUserID, user},
+                              {QRTKeyContainerClass, cls},
+                              {QRTKeyIdentifier, identifier},
+                              {QRTKeyCreateIfNecessary, create},
+                              {QRTKeyTransient, transient}});
   Container c;
   c.user = user;
   c.cls = cls;
   c.error = codeOf(reply);
   if (!reply) return c;
-  if (auto* v = plist::find(*reply, "ReplyIdentifier"); v && v->isString()) c.identifier = v->string();
-  if (auto* v = plist::find(*reply, "ReplyPath"); v && v->isString()) c.path = v->string();
-  if (auto* v = plist::find(*reply, "ReplyExisted"); v && v->isBoolean()) c.existed = v->boolean();
-  if (auto* v = plist::find(*reply, "ReplyUUID"); v && v->isData()) {
+  if (auto* v = plist::find(*reply, QRTReplyKeyIdentifier); v && v->isString()) c.identifier = v->string();
+  if (auto* v = plist::find(*reply, QRTReplyKeyPath); v && v->isString()) c.path = v->string();
+  if (auto* v = plist::find(*reply, QRTReplyKeyExisted); v && v->isBoolean()) c.existed = v->boolean();
+  if (auto* v = plist::find(*reply, QRTReplyKeyUUID); v && v->isData()) {
     c.uuid = QRTUUID::fromBytes(v->data().data(), v->data().size()).value_or(QRTUUID());
   }
   return c;

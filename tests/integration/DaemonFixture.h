@@ -14,6 +14,7 @@
 
 #include "QuarterKit/QuarterKit.h"
 #include "base/PlistValue.h"
+#include "base/QRTProtocol.h"
 #include "base/QRTUUID.h"
 
 // A container as command 0 (or 15) answered for it; user and cls echo the

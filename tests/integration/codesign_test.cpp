@@ -12,7 +12,7 @@
 
 namespace {
 
-constexpr const char* kAllowed = "com.norvane.private.QuarterKit.allowed";
+constexpr const char* kAllowed = QRTEntitlementAllowed;
 constexpr const char* kAppGroups = "com.norvane.security.application-groups";
 constexpr const char* kSystemGroups = "com.norvane.security.system-groups";
 constexpr const char* kSystemContainer = "com.norvane.security.system-container";
@@ -31,19 +31,23 @@ class CodesignTest : public DaemonFixture {
   void beInstaller() { setOwnIdentity("com.example.installer", {{kAllowed, true}}); }
 
   uint64_t registerProgram(const std::string& id, plist::Dictionary entitlements, plist::Dictionary options = {}) {
-    return codeOf(call(18, {{"Identifier", id},
-                            {"CodeSigningInfo", info(std::move(entitlements))},
-                            {"OptionsDictionary", std::move(options)}}));
+    return codeOf(call(QRTCommandProcessCodeSigningInfo, {{QRTKeyIdentifier, id},
+                                                          {"CodeSigningInfo", info(std::move(entitlements))},
+                                                          {"OptionsDictionary", std::move(options)}}));
   }
-  uint64_t unregister(const std::string& id) { return codeOf(call(18, {{"Identifier", id}})); }
-  bool registered(const std::string& id) { return codeOf(call(19, {{"Identifier", id}})) == 1; }
+  uint64_t unregister(const std::string& id) {
+    return codeOf(call(QRTCommandProcessCodeSigningInfo, {{QRTKeyIdentifier, id}}));
+  }
+  bool registered(const std::string& id) {
+    return codeOf(call(QRTCommandCodeSigningInfoForIdentifier, {{QRTKeyIdentifier, id}})) == 1;
+  }
 
   // Command 13 or 16: group identifier to path.
   std::map<std::string, std::string> groupPaths(uint64_t command, const std::string& id) {
-    auto reply = call(command, {{"Identifier", id}, {"UserID", 1}});
+    auto reply = call(command, {{QRTKeyIdentifier, id}, {QRTKeyUserID, 1}});
     EXPECT_EQ(codeOf(reply), 1u) << command << " " << id;
     std::map<std::string, std::string> paths;
-    auto dict = at(reply, "ReplyGroupContainerDict");
+    auto dict = at(reply, QRTReplyKeyGroupContainerDict);
     if (dict && dict->isDictionary()) {
       for (const auto& [group, path] : dict->dictionary()) paths[group] = plist::describe(path);
     }
@@ -63,24 +67,24 @@ TEST_F(CodesignTest, GroupsAreMadeOnDemandSharedAndDroppedWithTheirLastProgram) 
   EXPECT_EQ(lookup(501, "group.g1", 7), 21u);
   EXPECT_EQ(lookup(499, "systemgroup.com.example.s1", 13), 21u);
 
-  auto app = groupPaths(13, "com.example.a");
+  auto app = groupPaths(QRTCommandGroupContainerPaths, "com.example.a");
   ASSERT_EQ(app.size(), 2u);
   for (const char* g : {"group.g1", "group.g2"}) {
     EXPECT_TRUE(exists(app[g])) << g;
     EXPECT_EQ(lookup(501, g, 7), 1u) << g;
   }
-  auto system = groupPaths(16, "com.example.a");
+  auto system = groupPaths(QRTCommandSystemGroupContainerPaths, "com.example.a");
   ASSERT_EQ(system.size(), 1u);
   EXPECT_EQ(lookup(499, "systemgroup.com.example.s1", 13), 1u);
   // Command 17 judges the caller by its registered entitlements, not by the identity file's.
   setOwnIdentity("com.example.a", {{"com.example.unrelated", true}});
-  auto reply = call(17, {{"GroupIdentifier", "systemgroup.com.example.s1"}});
+  auto reply = call(QRTCommandSystemGroupContainerPath, {{QRTKeyGroupIdentifier, "systemgroup.com.example.s1"}});
   EXPECT_EQ(codeOf(reply), 1u);
-  EXPECT_EQ(at(reply, "ReplyPath"), plist::Value(system["systemgroup.com.example.s1"]));
+  EXPECT_EQ(at(reply, QRTReplyKeyPath), plist::Value(system["systemgroup.com.example.s1"]));
   beInstaller();
 
   ASSERT_EQ(registerProgram("com.example.b", {{kAppGroups, "group.g1"}}), 1u);
-  EXPECT_EQ(groupPaths(13, "com.example.b")["group.g1"], app["group.g1"]);
+  EXPECT_EQ(groupPaths(QRTCommandGroupContainerPaths, "com.example.b")["group.g1"], app["group.g1"]);
 
   ASSERT_EQ(registerProgram("com.example.a", {}), 1u);
   EXPECT_EQ(lookup(501, "group.g1", 7), 1u);
@@ -97,11 +101,15 @@ TEST_F(CodesignTest, GroupsAreMadeOnDemandSharedAndDroppedWithTheirLastProgram) 
 TEST_F(CodesignTest, SystemGroupRefusalsAndOwnEntitlements) {
   // Step 8: the caller's own entitlements count without any installer registration.
   setOwnIdentity("com.example.self", {{kAppGroups, strings({"group.self"})}});
-  auto own = groupPaths(13, "com.example.self");
+  auto own = groupPaths(QRTCommandGroupContainerPaths, "com.example.self");
   ASSERT_EQ(own.count("group.self"), 1u);
   EXPECT_TRUE(exists(own["group.self"]));
-  EXPECT_EQ(codeOf(call(17, {{"GroupIdentifier", "systemgroup.com.norvane.sharedpclogging"}})), 55u);
-  EXPECT_EQ(codeOf(call(17, {{"GroupIdentifier", "systemgroup.com.example.notmine"}})), 55u);
+  EXPECT_EQ(codeOf(call(QRTCommandSystemGroupContainerPath,
+                        {{QRTKeyGroupIdentifier, "systemgroup.com.norvane.sharedpclogging"}})),
+            55u);
+  EXPECT_EQ(
+      codeOf(call(QRTCommandSystemGroupContainerPath, {{QRTKeyGroupIdentifier, "systemgroup.com.example.notmine"}})),
+      55u);
   EXPECT_TRUE(
       logContains("com.example.self is not entitled for system group identifier: "
                   "systemgroup.com.example.notmine."));
@@ -111,9 +119,9 @@ TEST_F(CodesignTest, SystemGroupRefusalsAndOwnEntitlements) {
 TEST_F(CodesignTest, WithdrawnSystemContainerEntitlementTakesTheContainer) {
   ASSERT_EQ(registerProgram("com.example.sys", {{kSystemContainer, true}}), 1u);
   setOwnIdentity("com.example.sys", {{kSystemContainer, true}});
-  auto reply = call(15, {});
+  auto reply = call(QRTCommandSystemContainerPath, {});
   ASSERT_EQ(codeOf(reply), 1u);
-  const std::string path = plist::describe(*at(reply, "ReplyPath"));
+  const std::string path = plist::describe(*at(reply, QRTReplyKeyPath));
   EXPECT_TRUE(exists(path));
   beInstaller();
   ASSERT_EQ(registerProgram("com.example.sys", {{kSystemContainer, false}}), 1u);
@@ -122,7 +130,7 @@ TEST_F(CodesignTest, WithdrawnSystemContainerEntitlementTakesTheContainer) {
   EXPECT_TRUE(
       logContains("Deleting system container for ID: com.example.sys because it is no longer in the entitlements"));
   setOwnIdentity("com.example.sys", {{kSystemContainer, true}});
-  EXPECT_EQ(codeOf(call(15, {})), 55u);
+  EXPECT_EQ(codeOf(call(QRTCommandSystemContainerPath, {})), 55u);
 }
 
 TEST_F(CodesignTest, InvalidationSparesBundledAndSelfRegisteredPrograms) {
@@ -130,10 +138,10 @@ TEST_F(CodesignTest, InvalidationSparesBundledAndSelfRegisteredPrograms) {
   ASSERT_EQ(registerProgram("com.example.bundled", {}), 1u);
   ASSERT_EQ(registerProgram("com.example.orphan", {}), 1u);
   ASSERT_EQ(registerProgram("com.example.self", {}, {{"RegByCaller", true}}), 1u);
-  EXPECT_EQ(codeOf(call(20)), 1u);
+  EXPECT_EQ(codeOf(call(QRTCommandInvalidateCodeSigningInfoForAppsWithoutBundleContainer)), 1u);
   EXPECT_TRUE(registered("com.example.bundled"));
   EXPECT_TRUE(registered("com.example.self"));
-  EXPECT_EQ(codeOf(call(19, {{"Identifier", "com.example.orphan"}})), 21u);
+  EXPECT_EQ(codeOf(call(QRTCommandCodeSigningInfoForIdentifier, {{QRTKeyIdentifier, "com.example.orphan"}})), 21u);
   // Registering again makes it valid.
   ASSERT_EQ(registerProgram("com.example.orphan", {}), 1u);
   EXPECT_TRUE(registered("com.example.orphan"));
@@ -148,7 +156,8 @@ TEST_F(CodesignTest, AcknowledgedRegistrationsSurviveAKill) {
     writers.emplace_back([&, t] {
       for (int i = 0; !stop; ++i) {
         std::string id = "com.example.burst" + std::to_string(t) + "." + std::to_string(i);
-        auto reply = call(18, {{"Identifier", id}, {"CodeSigningInfo", info({{kAppGroups, "group.burst"}})}});
+        auto reply = call(QRTCommandProcessCodeSigningInfo,
+                          {{QRTKeyIdentifier, id}, {"CodeSigningInfo", info({{kAppGroups, "group.burst"}})}});
         if (!reply) return;
         if (codeOf(reply) != 1) continue;
         std::lock_guard<std::mutex> hold(lock);
@@ -192,14 +201,14 @@ TEST_F(CodesignTest, HostileRegistrationsAreRefusedOrIgnored) {
     const char* log;
   };
   const std::vector<Case> cases = {
-      {"info a string", {{"Identifier", "com.example.kept"}, {"CodeSigningInfo", "x"}}, 38, nullptr},
+      {"info a string", {{QRTKeyIdentifier, "com.example.kept"}, {"CodeSigningInfo", "x"}}, 38, nullptr},
       {"options an array",
-       {{"Identifier", "com.example.kept"}, {"CodeSigningInfo", info({})}, {"OptionsDictionary", strings({"a"})}},
+       {{QRTKeyIdentifier, "com.example.kept"}, {"CodeSigningInfo", info({})}, {"OptionsDictionary", strings({"a"})}},
        38,
        nullptr},
       {"no identifier", {{"CodeSigningInfo", info({})}}, 18, nullptr},
       {"options of the wrong types",
-       {{"Identifier", "com.example.typed"},
+       {{QRTKeyIdentifier, "com.example.typed"},
         {"CodeSigningInfo", info({})},
         {"OptionsDictionary", plist::Dictionary{{"com.norvane.QuarterKit.DataContainerClass", "2"},
                                                 {"RegByCaller", "yes"},
@@ -207,22 +216,25 @@ TEST_F(CodesignTest, HostileRegistrationsAreRefusedOrIgnored) {
        1,
        nullptr},
       {"non-string groups",
-       {{"Identifier", "com.example.nonstring"},
+       {{QRTKeyIdentifier, "com.example.nonstring"},
         {"CodeSigningInfo", info({{kAppGroups, plist::Array{plist::Value("group.a"), plist::Value(3)}}})}},
        1,
        "Entitlement com.norvane.security.application-groups for com.example.nonstring contains non-string values; "
        "ignoring."},
-      {"control characters", {{"Identifier", "com.example.\x01\n\x7f"}, {"CodeSigningInfo", info({})}}, 11, nullptr},
+      {"control characters",
+       {{QRTKeyIdentifier, "com.example.\x01\n\x7f"}, {"CodeSigningInfo", info({})}},
+       11,
+       nullptr},
   };
   for (const Case& c : cases) {
-    EXPECT_EQ(codeOf(call(18, c.keys)), c.code) << c.what;
+    EXPECT_EQ(codeOf(call(QRTCommandProcessCodeSigningInfo, c.keys)), c.code) << c.what;
     if (c.log) { EXPECT_TRUE(logContains(c.log)) << c.what; }
   }
   // Nothing refused touched the stored entry or its group.
   EXPECT_TRUE(registered("com.example.kept"));
-  EXPECT_EQ(groupPaths(13, "com.example.kept").count("group.kept"), 1u);
+  EXPECT_EQ(groupPaths(QRTCommandGroupContainerPaths, "com.example.kept").count("group.kept"), 1u);
   // "RegByCaller" as a string is no caller registration: invalidation applies.
-  EXPECT_EQ(codeOf(call(20)), 1u);
+  EXPECT_EQ(codeOf(call(QRTCommandInvalidateCodeSigningInfoForAppsWithoutBundleContainer)), 1u);
   EXPECT_FALSE(registered("com.example.typed"));
 }
 
@@ -237,10 +249,11 @@ TEST_F(CodesignTest, TenThousandChildBundlesHitTheLimitAndGoWithTheirParent) {
     std::vector<std::future<std::optional<plist::Dictionary>>> replies;
     for (int i = base; i < base + 50; ++i) {
       replies.push_back(connection->send(
-          request(18, {{"Identifier", "com.example.child." + std::to_string(i)},
-                       {"CodeSigningInfo", info({})},
-                       {"OptionsDictionary",
-                        plist::Dictionary{{"com.norvane.QuarterKit.ParentBundleID", "com.example.parent"}}}})));
+          request(QRTCommandProcessCodeSigningInfo,
+                  {{QRTKeyIdentifier, "com.example.child." + std::to_string(i)},
+                   {"CodeSigningInfo", info({})},
+                   {"OptionsDictionary",
+                    plist::Dictionary{{"com.norvane.QuarterKit.ParentBundleID", "com.example.parent"}}}})));
     }
     for (size_t i = 0; i < replies.size(); ++i) {
       uint64_t code = codeOf(replies[i].get());
@@ -252,7 +265,9 @@ TEST_F(CodesignTest, TenThousandChildBundlesHitTheLimitAndGoWithTheirParent) {
   EXPECT_EQ(codes[38], 10000 - 1024);
   EXPECT_TRUE(logContains("Parent com.example.parent already has 1024 child bundles; not adding"));
   // Deleting the parent's bundle takes the parent's and its children's information.
-  EXPECT_EQ(codeOf(call(10, {{"UserID", 33}, {"ContainerClass", 1}, {"Identifier", "com.example.parent"}})), 1u);
+  EXPECT_EQ(codeOf(call(QRTCommandDeleteContainer,
+                        {{QRTKeyUserID, 33}, {QRTKeyContainerClass, 1}, {QRTKeyIdentifier, "com.example.parent"}})),
+            1u);
   EXPECT_FALSE(registered("com.example.parent"));
   ASSERT_FALSE(accepted.empty());
   EXPECT_FALSE(registered(accepted));

@@ -27,15 +27,16 @@ class ConcurrencyTest : public DaemonFixture {
  protected:
   void SetUp() override {
     DaemonFixture::SetUp();
-    if (!HasFatalFailure()) setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true}});
+    if (!HasFatalFailure()) setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
   }
 
   // Command 1's UUIDs for user 501, class 2.
   std::set<std::string> listedUUIDs(bool transient) {
-    auto reply = call(1, {{"UserID", 501u}, {"ContainerClass", 2u}, {"Transient", transient}});
+    auto reply = call(QRTCommandContainersForUser,
+                      {{QRTKeyUserID, 501u}, {QRTKeyContainerClass, 2u}, {QRTKeyTransient, transient}});
     EXPECT_EQ(codeOf(reply), 1u);
     std::set<std::string> uuids;
-    auto array = at(reply, "ReplyUUIDsArray");
+    auto array = at(reply, QRTReplyKeyUUIDsArray);
     for (const plist::Value& v : array && array->isArray() ? array->array() : plist::Array{}) {
       const plist::Data* data = v.dataIf();
       auto uuid = data ? QRTUUID::fromBytes(data->data(), data->size()) : std::nullopt;
@@ -66,7 +67,8 @@ TEST_F(ConcurrencyTest, ReadsSeeWholeMetadataWhileItChangesAndOneCreatorMakesEac
   // metadata reply must be whole: the container's own path, a dictionary.
   auto setter = [&] {
     for (int i = 1; i <= kSets; ++i) {
-      badSets += codeOf(call(5, with(selector(app), {{"Key", "counter"}, {"Value", i}}))) != 1;
+      badSets +=
+          codeOf(call(QRTCommandSetInfoValue, with(selector(app), {{QRTKeyKey, "counter"}, {QRTKeyValue, i}}))) != 1;
     }
     setterDone = true;
   };
@@ -80,12 +82,12 @@ TEST_F(ConcurrencyTest, ReadsSeeWholeMetadataWhileItChangesAndOneCreatorMakesEac
         seen = value->integer().asSigned();
     };
     while (!setterDone) {
-      auto got = call(6, with(selector(app), {{"Key", "counter"}}));
+      auto got = call(QRTCommandInfoValueForKey, with(selector(app), {{QRTKeyKey, "counter"}}));
       if (codeOf(got) != 1 && codeOf(got) != 24) ++badReads;
-      check(at(got, "ReplyInfoValue"));
-      auto metadata = call(7, with(selector(app), {{"InfoDictRequested", true}}));
-      auto info = at(metadata, "ReplyInfoDictionary");
-      if (codeOf(metadata) != 1 || at(metadata, "ReplyPath") != plist::Value(app.path) ||
+      check(at(got, QRTReplyKeyInfoValue));
+      auto metadata = call(QRTCommandMetadataForContainer, with(selector(app), {{QRTKeyInfoDictRequested, true}}));
+      auto info = at(metadata, QRTReplyKeyInfoDictionary);
+      if (codeOf(metadata) != 1 || at(metadata, QRTReplyKeyPath) != plist::Value(app.path) ||
           (info && !info->isDictionary())) {
         ++badReads;
       } else if (info) {
@@ -118,8 +120,8 @@ TEST_F(ConcurrencyTest, ReadsSeeWholeMetadataWhileItChangesAndOneCreatorMakesEac
   together(bodies);
   EXPECT_EQ(badSets, 0);
   EXPECT_EQ(badReads, 0);
-  auto last = call(6, with(selector(app), {{"Key", "counter"}}));
-  EXPECT_EQ(at(last, "ReplyInfoValue"), plist::Value(kSets));
+  auto last = call(QRTCommandInfoValueForKey, with(selector(app), {{QRTKeyKey, "counter"}}));
+  EXPECT_EQ(at(last, QRTReplyKeyInfoValue), plist::Value(kSets));
 }
 
 TEST_F(ConcurrencyTest, TransientRecreationDeletionAndPassesLoseNoContainer) {
@@ -134,22 +136,23 @@ TEST_F(ConcurrencyTest, TransientRecreationDeletionAndPassesLoseNoContainer) {
   auto remove = [&] {
     for (int i = 0; i < kIterations; ++i) {
       if (i % 2) {
-        call(10, with(byName(501, 2, id(i)), {{"Transient", i % 4 == 1}}));
+        call(QRTCommandDeleteContainer, with(byName(501, 2, id(i)), {{QRTKeyTransient, i % 4 == 1}}));
         continue;
       }
       // Stage whatever the listing shows, by its UUIDs.
-      auto reply = call(1, {{"UserID", 501u}, {"ContainerClass", 2u}, {"Transient", true}});
-      auto ids = at(reply, "ReplyIdsArray"), uuids = at(reply, "ReplyUUIDsArray");
+      auto reply = call(QRTCommandContainersForUser,
+                        {{QRTKeyUserID, 501u}, {QRTKeyContainerClass, 2u}, {QRTKeyTransient, true}});
+      auto ids = at(reply, QRTReplyKeyIdsArray), uuids = at(reply, QRTReplyKeyUUIDsArray);
       if (!ids || !uuids || !ids->isArray() || !uuids->isArray()) continue;
       plist::Array classes(ids->array().size(), plist::Value(2u)), users(ids->array().size(), plist::Value(501u));
-      call(3, {{"ContainerClassesArray", classes},
-               {"UserIDsArray", users},
-               {"UUIDsArray", uuids->array()},
-               {"IdentifiersArray", ids->array()}});
+      call(QRTCommandStageContainerForDelete, {{QRTKeyContainerClassesArray, classes},
+                                               {QRTKeyUserIDsArray, users},
+                                               {QRTKeyUUIDsArray, uuids->array()},
+                                               {QRTKeyIdentifiersArray, ids->array()}});
     }
   };
   auto passes = [&] {
-    for (int i = 0; i < kIterations; ++i) EXPECT_EQ(codeOf(call(4)), 1u);
+    for (int i = 0; i < kIterations; ++i) EXPECT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)), 1u);
   };
   together({[&] { recreate(0); }, [&] { recreate(1); }, remove, passes});
 
@@ -159,7 +162,7 @@ TEST_F(ConcurrencyTest, TransientRecreationDeletionAndPassesLoseNoContainer) {
   // A pass answers once it has run, after every pass queued before it.
   std::vector<std::string> dead;
   for (int i = 0; i < 50; ++i) {
-    EXPECT_EQ(codeOf(call(4)), 1u);
+    EXPECT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)), 1u);
     if ((dead = listDirectory(deadDirectory())).empty()) break;
   }
   EXPECT_TRUE(dead.empty()) << dead.size() << " items left on death row, the first " << dead[0];
@@ -173,19 +176,19 @@ TEST_F(ConcurrencyTest, PassDuringAHandOverLeavesNothingBehind) {
   GTEST_SKIP() << "pause points need a build with test hooks";
 #endif
   const Container first = make(501, "com.example.handover", 2, true);
-  ASSERT_EQ(codeOf(call(4)), 1u);
+  ASSERT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)), 1u);
   writeFile(root + "/run/quarterd.pausepoint", "deathrow-hand-over\n");
   Container second;
   std::thread recreate([&] { second = createOrLookup(501, "com.example.handover", 2, true, true); });
   for (int i = 0; i < 500 && listDirectory(deadDirectory()).empty(); ++i)
     std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  EXPECT_EQ(codeOf(call(4)), 1u);
+  EXPECT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)), 1u);
   recreate.join();
   unlink((root + "/run/quarterd.pausepoint").c_str());
   EXPECT_TRUE(logContains("Pause point deathrow-hand-over reached"));
   EXPECT_EQ(second.error, 1u);
   EXPECT_FALSE(exists(first.path));
-  EXPECT_EQ(codeOf(call(4)), 1u);
+  EXPECT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)), 1u);
   EXPECT_TRUE(listDirectory(deadDirectory()).empty());
 }
 

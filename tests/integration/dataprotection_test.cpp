@@ -89,7 +89,8 @@ uint64_t codeOfOnlyReply(const std::string& socketPath, const plist::Dictionary&
   uint64_t id = 0;
   auto reply = receive(&id);
   EXPECT_EQ(id, 1u);
-  send(2, request(7, {{"UserID", 501}, {"ContainerClass", 2}, {"Identifier", "com.example.nothing"}}));
+  send(2, request(QRTCommandMetadataForContainer,
+                  {{QRTKeyUserID, 501}, {QRTKeyContainerClass, 2}, {QRTKeyIdentifier, "com.example.nothing"}}));
   uint64_t nextId = 0;
   EXPECT_TRUE(receive(&nextId));
   EXPECT_EQ(nextId, 2u) << "a second reply to the first request";
@@ -101,7 +102,7 @@ class DataProtectionTest : public DaemonFixture {
  protected:
   void SetUp() override {
     DaemonFixture::SetUp();
-    if (!HasFatalFailure()) setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true}});
+    if (!HasFatalFailure()) setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
   }
 
   void TearDown() override {
@@ -133,12 +134,12 @@ class DataProtectionTest : public DaemonFixture {
   }
 
   static plist::Dictionary protect(const std::string& id, int64_t cls, bool retry, bool thirdParty = false) {
-    return {{"UserID", 501},
-            {"ContainerClass", 2},
-            {"Identifier", id},
-            {"DataProtectionClass", cls},
-            {"IsThirdParty", thirdParty},
-            {"RetryIfLocked", retry}};
+    return {{QRTKeyUserID, 501},
+            {QRTKeyContainerClass, 2},
+            {QRTKeyIdentifier, id},
+            {QRTKeyDataProtectionClass, cls},
+            {QRTKeyIsThirdParty, thirdParty},
+            {QRTKeyRetryIfLocked, retry}};
   }
 
   // The user data items of c by class.
@@ -150,8 +151,9 @@ class DataProtectionTest : public DaemonFixture {
   }
 
   std::optional<uint64_t> recordedClass(const Container& c) {
-    return u64At(call(6, with(selector(c), {{"Key", "com.norvane.Emplacer.ContentProtectionClass"}})),
-                 "ReplyInfoValue");
+    return u64At(call(QRTCommandInfoValueForKey,
+                      with(selector(c), {{QRTKeyKey, "com.norvane.Emplacer.ContentProtectionClass"}})),
+                 QRTReplyKeyInfoValue);
   }
 
   // Sends command 21 on a connection of its own and returns the reply to come.
@@ -215,9 +217,9 @@ TEST_F(DataProtectionTest, EveryRequestGetsOneReply) {
     plist::Dictionary keys;
     uint64_t code;
   } cases[] = {
-      {"user check fails", with(protect(c.identifier, 1, false), {{"ContainerClass", 1}}), 38},
-      {"bundle class", with(protect(c.identifier, 1, false), {{"ContainerClass", 1}, {"UserID", 33}}), 11},
-      {"no identifier", without(protect(c.identifier, 1, false), "Identifier"), 11},
+      {"user check fails", with(protect(c.identifier, 1, false), {{QRTKeyContainerClass, 1}}), 38},
+      {"bundle class", with(protect(c.identifier, 1, false), {{QRTKeyContainerClass, 1}, {QRTKeyUserID, 33}}), 11},
+      {"no identifier", without(protect(c.identifier, 1, false), QRTKeyIdentifier), 11},
       {"no such container", protect("com.example.absent", 1, false), 21},
       {"class 2", protect(c.identifier, 2, false), 38},
       {"class 4 for a third party", protect(c.identifier, 4, false, true), 38},
@@ -248,8 +250,9 @@ TEST_F(DataProtectionTest, LockedDeviceHoldsOrRefusesTheChange) {
     SCOPED_TRACE(test.what);
     const std::string id = std::string("com.example.locked") + std::to_string(&test - cases);
     Container c = makeApp(id, 20, test.from);
-    ASSERT_EQ(codeOf(call(5, with(selector(c),
-                                  {{"Key", "com.norvane.Emplacer.ContentProtectionClass"}, {"Value", test.from}}))),
+    ASSERT_EQ(codeOf(call(QRTCommandSetInfoValue,
+                          with(selector(c), {{QRTKeyKey, "com.norvane.Emplacer.ContentProtectionClass"},
+                                             {QRTKeyValue, test.from}}))),
               1u);
     setLocked(true);
     auto reply = protectLater(protect(id, test.to, test.retry));
@@ -335,7 +338,7 @@ TEST_F(DataProtectionTest, QuarterctlProtect) {
   fs::copy_file(QRT_QUARTERCTL_PATH, ctl);
   char resolved[PATH_MAX];
   ASSERT_NE(realpath(ctl.c_str(), resolved), nullptr);
-  setIdentity("quarterctl", resolved, "com.norvane.quarterctl", {{"com.norvane.private.QuarterKit.allowed", true}});
+  setIdentity("quarterctl", resolved, "com.norvane.quarterctl", {{QRTEntitlementAllowed, true}});
   const std::string command = ctl + " --root " + root + " protect --identifier com.example.ctl ";
   EXPECT_EQ(WEXITSTATUS(system((command + "--protection-class 1 >/dev/null").c_str())), 0);
   EXPECT_EQ(classOf(c.path + "/Documents/d0/f0"), 1);

@@ -16,14 +16,18 @@ namespace {
 
 constexpr uint64_t kNotServed = 49;
 constexpr uint64_t kNotEntitled = 55;
-const char* kAllowed = "com.norvane.private.QuarterKit.allowed";
+const char* kAllowed = QRTEntitlementAllowed;
 
-bool isNoneCommand(uint64_t c) { return c == 0 || c == 13 || c == 15 || c == 16 || c == 17; }
+bool isNoneCommand(uint64_t c) {
+  return c == QRTCommandCreateOrLookupContainer || c == QRTCommandGroupContainerPaths ||
+         c == QRTCommandSystemContainerPath || c == QRTCommandSystemGroupContainerPaths ||
+         c == QRTCommandSystemGroupContainerPath;
+}
 
 using DispatcherTest = DaemonFixture;
 
 TEST_F(DispatcherTest, CommandsOutsideTheTableAnswer49) {
-  for (uint64_t command : {uint64_t{30}, uint64_t{1} << 32, UINT64_MAX})
+  for (uint64_t command : {QRTCommandCount, uint64_t{1} << 32, UINT64_MAX})
     EXPECT_EQ(replyError(request(command)), kNotServed) << command;
 }
 
@@ -31,10 +35,11 @@ TEST_F(DispatcherTest, CommandsOutsideTheTableAnswer49) {
 TEST_F(DispatcherTest, EntitlementsOpenTheCommandTable) {
   for (bool allowed : {false, true}) {
     if (allowed) setOwnIdentity("com.example.installer", {{kAllowed, true}});
-    for (uint64_t command = 0; command < 30; ++command) {
+    for (uint64_t command = 0; command < QRTCommandCount; ++command) {
       // Command 17 itself refuses (55) a group the caller may not reach; a well-known one it may.
       plist::Dictionary keys;
-      if (command == 17) keys = {{"GroupIdentifier", "systemgroup.com.norvane.policysets"}};
+      if (command == QRTCommandSystemGroupContainerPath)
+        keys = {{QRTKeyGroupIdentifier, "systemgroup.com.norvane.policysets"}};
       uint64_t code = replyError(request(command, keys));
       EXPECT_NE(code, 0u) << command;
       EXPECT_EQ(code == kNotEntitled, !allowed && !isNoneCommand(command)) << command << ": " << code;
@@ -44,20 +49,21 @@ TEST_F(DispatcherTest, EntitlementsOpenTheCommandTable) {
 
 TEST_F(DispatcherTest, MessageWithoutCommandIsCommandZero) {
   // Command 0 checks the user against the class first: class 0 fits nobody.
-  EXPECT_EQ(replyError(plist::Dictionary{{"Identifier", "com.example.app"}}), 38u);
+  EXPECT_EQ(replyError(plist::Dictionary{{QRTKeyIdentifier, "com.example.app"}}), 38u);
 }
 
 TEST_F(DispatcherTest, NamedEntitlementsOpenTheirOwnRowsOnly) {
-  setOwnIdentity("com.example.migrator",
-                 {{"com.norvane.private.QuarterKit.dataMigration", true},
-                  {"com.norvane.private.QuarterKit.userManagedAssets", false},
-                  {"com.norvane.private.QuarterKit.wipeContainer", plist::Array{"com.example.addon"}}});
-  for (uint64_t command : {24, 11}) EXPECT_NE(replyError(request(command)), kNotEntitled) << command;
-  for (uint64_t command : {28, 1}) EXPECT_EQ(replyError(request(command)), kNotEntitled) << command;
+  setOwnIdentity("com.example.migrator", {{QRTEntitlementDataMigration, true},
+                                          {QRTEntitlementUserManagedAssets, false},
+                                          {QRTEntitlementWipeContainer, plist::Array{"com.example.addon"}}});
+  for (uint64_t command : {QRTCommandPerformDataMigration, QRTCommandWipeAddonDataContainer})
+    EXPECT_NE(replyError(request(command)), kNotEntitled) << command;
+  for (uint64_t command : {QRTCommandUserManagedAssetsPath, QRTCommandContainersForUser})
+    EXPECT_EQ(replyError(request(command)), kNotEntitled) << command;
 
   // A wipe entitlement that is not an array refuses without the master one.
-  setOwnIdentity("com.example.wiper", {{"com.norvane.private.QuarterKit.wipeContainer", true}});
-  EXPECT_EQ(replyError(request(11)), kNotEntitled);
+  setOwnIdentity("com.example.wiper", {{QRTEntitlementWipeContainer, true}});
+  EXPECT_EQ(replyError(request(QRTCommandWipeAddonDataContainer)), kNotEntitled);
 }
 
 TEST_F(DispatcherTest, UnreadableFrameClosesOnlyItsConnection) {
@@ -67,7 +73,7 @@ TEST_F(DispatcherTest, UnreadableFrameClosesOnlyItsConnection) {
   // A well-framed payload that is not a property list.
   std::vector<uint8_t> garbage = {12, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0, 'n', 'o', 'p', 'e'};
   ASSERT_TRUE(qk::testing::ConnectionAccess::sendRaw(*bad, garbage.data(), garbage.size()));
-  auto lost = bad->send(request(30));
+  auto lost = bad->send(request(QRTCommandCount));
   EXPECT_EQ(lost.get(), std::nullopt);
   EXPECT_TRUE(bad->closed());
 
@@ -77,10 +83,10 @@ TEST_F(DispatcherTest, UnreadableFrameClosesOnlyItsConnection) {
     if (frameBytes.size() > 12) frameBytes[12 + 8] = 0xA0;  // the dictionary marker becomes an array
     auto conn = connect();
     ASSERT_TRUE(qk::testing::ConnectionAccess::sendRaw(*conn, frameBytes.data(), frameBytes.size()));
-    EXPECT_EQ(conn->send(request(30)).get(), std::nullopt);
+    EXPECT_EQ(conn->send(request(QRTCommandCount)).get(), std::nullopt);
   }
 
-  EXPECT_EQ(codeOf(healthy->call(request(30))), kNotServed);
+  EXPECT_EQ(codeOf(healthy->call(request(QRTCommandCount))), kNotServed);
 }
 
 TEST_F(DispatcherTest, SixtyFourClientsAtOnceAllGetTheirReplies) {
@@ -121,7 +127,7 @@ TEST_F(DispatcherTest, StartsInOrderAndMarksTheFirstBoot) {
   stopDaemon();
   std::string before = logText();
   startDaemon();
-  ASSERT_EQ(replyError(request(30)), kNotServed);
+  ASSERT_EQ(replyError(request(QRTCommandCount)), kNotServed);
   std::string after = logText().substr(before.size());
   EXPECT_EQ(after.find("first boot"), std::string::npos);
   EXPECT_NE(after.find("started"), std::string::npos);

@@ -45,7 +45,7 @@ class ExecTest : public DaemonFixture {
     // An entitled program where the system keeps its programs.
     entitled = "/usr/local/bin/qrt-exec-test-entitled-" + std::to_string(getpid());
     std::filesystem::copy_file(QRT_QUARTERCTL_PATH, entitled, std::filesystem::copy_options::overwrite_existing);
-    setIdentity("entitled", entitled, "com.example.entitled", {{"com.norvane.private.QuarterKit.allowed", true}});
+    setIdentity("entitled", entitled, "com.example.entitled", {{QRTEntitlementAllowed, true}});
   }
   void TearDown() override {
     unlink(entitled.c_str());

@@ -123,7 +123,7 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
             "# test\n[Daemon]\nDefaultUser=alice\nMaxContainersPerClass=lots\nColour=blue\n");
   plist::Dictionary identity{{"Executable", readLink("/proc/self/exe")},
                              {"SigningIdentifier", "com.example.installer"},
-                             {"Entitlements", plist::Dictionary{{"com.norvane.private.QuarterKit.allowed", true}}}};
+                             {"Entitlements", plist::Dictionary{{QRTEntitlementAllowed, true}}}};
   plist::Data bytes = plist::writeBinary(identity);
   writeFile(dir + "/etc/quarterd/identities/installer.plist", std::string(bytes.begin(), bytes.end()));
 
@@ -152,14 +152,15 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.what);
-    auto reply = host.call(row.caller, request(0, {{"UserID", row.user},
-                                                   {"ContainerClass", row.cls},
-                                                   {"Identifier", std::string("com.example.") + row.what},
-                                                   {"CreateIfNecessary", true}}));
+    auto reply = host.call(row.caller, request(QRTCommandCreateOrLookupContainer,
+                                               {{QRTKeyUserID, row.user},
+                                                {QRTKeyContainerClass, row.cls},
+                                                {QRTKeyIdentifier, std::string("com.example.") + row.what},
+                                                {QRTKeyCreateIfNecessary, true}}));
     ASSERT_TRUE(reply);
     EXPECT_EQ(codeOf(reply) == 1, row.made) << codeOf(reply);
     if (!row.made) continue;
-    std::string path = stringAt(reply, "ReplyPath").value_or("");
+    std::string path = stringAt(reply, QRTReplyKeyPath).value_or("");
     ASSERT_EQ(path.rfind(row.pathPrefix, 0), 0u) << path;
     const std::string seen = path.starts_with("/var/") ? host.inside(path) : path;
     if (row.owner != UINT32_MAX) { EXPECT_EQ(ownerAndMode(seen).first, row.owner); }
@@ -167,7 +168,7 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
     EXPECT_EQ(u64At(metadata, "QRTMetadataPersona"), row.persona);
   }
   // The data migration hands the bundle class to the installer's account, not to uid 33.
-  EXPECT_EQ(codeOf(host.call(0, request(24, {}))), 1u);
+  EXPECT_EQ(codeOf(host.call(0, request(QRTCommandPerformDataMigration, {}))), 1u);
   EXPECT_EQ(ownerAndMode(host.inside(store + "Bundle/Application")).first, kInstaller);
   // The home's own .local stays its user's.
   EXPECT_EQ(ownerAndMode(dir + "/home/bob/.local").first, kBob);

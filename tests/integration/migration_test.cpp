@@ -51,7 +51,7 @@ class MigrationTest : public DaemonFixture {
  protected:
   void SetUp() override {
     DaemonFixture::SetUp();
-    if (!HasFatalFailure()) setOwnIdentity("com.example.migrator", {{"com.norvane.private.QuarterKit.allowed", true}});
+    if (!HasFatalFailure()) setOwnIdentity("com.example.migrator", {{QRTEntitlementAllowed, true}});
   }
 
   std::string containers() const { return root + "/private/var/containers"; }
@@ -209,12 +209,12 @@ class DataMigrationTest : public MigrationTest, public ::testing::WithParamInter
 TEST_P(DataMigrationTest, ImportsEveryOlderStoreOnce) {
   ASSERT_NO_FATAL_FAILURE(prepareLegacyStore());
   const std::string point = GetParam();
-  if (!point.empty()) { ASSERT_NO_FATAL_FAILURE(runUntilKilled(point, 24)); }
+  if (!point.empty()) { ASSERT_NO_FATAL_FAILURE(runUntilKilled(point, QRTCommandPerformDataMigration)); }
   startDaemon();
-  ASSERT_EQ(codeOf(call(24)), 1u);
+  ASSERT_EQ(codeOf(call(QRTCommandPerformDataMigration)), 1u);
 
   // A second run finds both container migrations recorded and visits nothing.
-  ASSERT_EQ(codeOf(call(24)), 1u);
+  ASSERT_EQ(codeOf(call(QRTCommandPerformDataMigration)), 1u);
   ASSERT_TRUE(logContains("Legacy entitlement migration completed"));
   const std::string log = logText();
   const size_t last = log.rfind("Performing Data Migration on");
@@ -267,7 +267,7 @@ TEST_F(MigrationTest, MappingFileWhoseEveryEntryFailsStays) {
   const std::string file = library() + "/qrt_code_signing_info.plist";
   writePlist(file, {{"org.legacy.broken", plist::Dictionary{{"Invalid", true}}}});
   startDaemon();
-  EXPECT_EQ(codeOf(call(24)), 1u);
+  EXPECT_EQ(codeOf(call(QRTCommandPerformDataMigration)), 1u);
   EXPECT_TRUE(logContains("Successfully migrated 0 entries, failed to migrate 1"));
   EXPECT_TRUE(exists(file));
 }
@@ -330,7 +330,7 @@ INSTANTIATE_TEST_SUITE_P(CrashPoints, BuildUpgradeTest,
 TEST_F(MigrationTest, RebootClearsLeftoversAndInstallsBackup) {
   make(501, "org.legacy.keep", 2);
   make(501, "org.legacy.temp", 2, true);
-  Container wellKnown = createOrLookup(0, "com.norvane.mapsd", 12, true, false, 15);
+  Container wellKnown = createOrLookup(0, "com.norvane.mapsd", 12, true, false, QRTCommandSystemContainerPath);
   ASSERT_EQ(wellKnown.error, 1u);
   ASSERT_EQ(stopDaemon(), 0);
   const auto before = snapshot();
@@ -352,7 +352,8 @@ TEST_F(MigrationTest, RebootClearsLeftoversAndInstallsBackup) {
   writeFile(backup + "/Shared/systemgroup.org.legacy.restored/shared.txt", "shared");
   reboot();
   startDaemon();
-  ASSERT_EQ(codeOf(call(4)), 1u);  // waits for the death-row pass that start-up queued
+  ASSERT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)),
+            1u);  // waits for the death-row pass that start-up queued
 
   EXPECT_TRUE(listDirectory(caches + "/Staging").empty());
   EXPECT_TRUE(listDirectory(caches + "/Temp").empty());
@@ -393,7 +394,7 @@ TEST_F(MigrationTest, StoreSurvivesStartUpUnchanged) {
   for (bool rebooted : {true, false}) {
     if (rebooted) reboot();
     startDaemon();
-    ASSERT_EQ(codeOf(call(4)), 1u);
+    ASSERT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)), 1u);
     ASSERT_EQ(stopDaemon(), 0);
     EXPECT_EQ(snapshot(), before) << (rebooted ? "after a reboot" : "after a restart");
   }

@@ -59,7 +59,7 @@ class QuarterctlTest : public DaemonFixture {
     std::filesystem::copy_file(QRT_QUARTERCTL_PATH, ctl);
     char resolved[PATH_MAX];
     ASSERT_NE(realpath(ctl.c_str(), resolved), nullptr);
-    setIdentity("quarterctl", resolved, "com.norvane.quarterctl", {{"com.norvane.private.QuarterKit.allowed", true}});
+    setIdentity("quarterctl", resolved, "com.norvane.quarterctl", {{QRTEntitlementAllowed, true}});
   }
 
   // Runs the binary with --root and the arguments, as a shell splits them.

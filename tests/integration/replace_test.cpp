@@ -23,15 +23,15 @@ const char* kMarkerFile = "replace-marker";
 std::string markerAt(const std::string& containerPath) { return readFile(containerPath + "/" + kMarkerFile); }
 
 plist::Dictionary replaceKeys(const Container* old, const Container& fresh) {
-  plist::Dictionary keys{{"NewContainerUUID", uuidData(fresh.uuid)},
-                         {"NewContainerClass", 2},
-                         {"NewContainerUserID", 501},
-                         {"NewIdentifier", fresh.identifier}};
+  plist::Dictionary keys{{QRTKeyNewContainerUUID, uuidData(fresh.uuid)},
+                         {QRTKeyNewContainerClass, 2},
+                         {QRTKeyNewContainerUserID, 501},
+                         {QRTKeyNewIdentifier, fresh.identifier}};
   if (old) {
-    keys["OldContainerUUID"] = uuidData(old->uuid);
-    keys["OldContainerClass"] = 2;
-    keys["OldContainerUserID"] = 501;
-    keys["OldIdentifier"] = old->identifier;
+    keys[QRTKeyOldContainerUUID] = uuidData(old->uuid);
+    keys[QRTKeyOldContainerClass] = 2;
+    keys[QRTKeyOldContainerUserID] = 501;
+    keys[QRTKeyOldIdentifier] = old->identifier;
   }
   return keys;
 }
@@ -47,7 +47,7 @@ class ReplaceTest : public DaemonFixture {
  protected:
   void SetUp() override {
     DaemonFixture::SetUp();
-    setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true}});
+    setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
   }
 
   std::string replaceDir() const { return root + "/private/var/root/Library/QuarterKit/Replace"; }
@@ -131,7 +131,7 @@ class ReplaceTest : public DaemonFixture {
 TEST_F(ReplaceTest, ReplaceAndWipeTakeOverAndSurviveRestart) {
   Container old = make("com.example.app", false, "app-old");
   Container fresh = make("com.example.app", true, "app-new");
-  ASSERT_EQ(codeOf(call(2, replaceKeys(&old, fresh))), 1u);
+  ASSERT_EQ(codeOf(call(QRTCommandReplaceContainer, replaceKeys(&old, fresh))), 1u);
   EXPECT_FALSE(exists(old.path));
   EXPECT_FALSE(exists(fresh.path));
   EXPECT_EQ(liveCopies("app-old"), 0);
@@ -139,7 +139,7 @@ TEST_F(ReplaceTest, ReplaceAndWipeTakeOverAndSurviveRestart) {
   expectLiveAcrossRestart("com.example.app", movedIn(fresh), fresh.uuid, "app-new");
 
   Container wiped = make("com.example.wiped", false, "wiped-old");
-  ASSERT_EQ(codeOf(call(12, byName(501, 2, "com.example.wiped"))), 1u);
+  ASSERT_EQ(codeOf(call(QRTCommandDeleteDataContainerContent, byName(501, 2, "com.example.wiped"))), 1u);
   EXPECT_EQ(liveCopies("wiped-old"), 0);
   expectLiveAcrossRestart("com.example.wiped", wiped.path, wiped.uuid, "");
 }
@@ -155,17 +155,18 @@ TEST_F(ReplaceTest, RefusalsChangeNothing) {
     uint64_t code;
   };
   const Refusal refusals[] = {
-      {"same container", "NewContainerUUID", uuidData(old.uuid), 22},
-      {"class mismatch", "NewContainerClass", 4, 23},
-      {"user mismatch", "NewContainerUserID", 502, 56},
-      {"no new UUID", "NewContainerUUID", std::nullopt, 11},
-      {"unknown old UUID", "OldContainerUUID", uuidData(QRTUUID::random()), 21},
-      {"unknown new UUID", "NewContainerUUID", uuidData(QRTUUID::random()), 21},
-      {"old identifier differs", "OldIdentifier", "com.example.other", 21},
+      {"same container", QRTKeyNewContainerUUID, uuidData(old.uuid), 22},
+      {"class mismatch", QRTKeyNewContainerClass, 4, 23},
+      {"user mismatch", QRTKeyNewContainerUserID, 502, 56},
+      {"no new UUID", QRTKeyNewContainerUUID, std::nullopt, 11},
+      {"unknown old UUID", QRTKeyOldContainerUUID, uuidData(QRTUUID::random()), 21},
+      {"unknown new UUID", QRTKeyNewContainerUUID, uuidData(QRTUUID::random()), 21},
+      {"old identifier differs", QRTKeyOldIdentifier, "com.example.other", 21},
   };
   for (const Refusal& refusal : refusals) {
     SCOPED_TRACE(refusal.name);
-    EXPECT_EQ(codeOf(call(2, changed(replaceKeys(&old, fresh), refusal.key, refusal.value))), refusal.code);
+    EXPECT_EQ(codeOf(call(QRTCommandReplaceContainer, changed(replaceKeys(&old, fresh), refusal.key, refusal.value))),
+              refusal.code);
     EXPECT_EQ(markerAt(old.path), "keep-old");
     EXPECT_EQ(markerAt(fresh.path), "keep-new");
     expectLive("com.example.keep", old);
@@ -177,13 +178,13 @@ TEST_F(ReplaceTest, FailedMoveOfNewContainerPutsOldOneBack) {
   Container old = make("com.example.back", false, "back-old");
   Container fresh = make("com.example.back", true, "back-new");
   ASSERT_EQ(mkdir(movedIn(fresh).c_str(), 0755), 0);
-  EXPECT_EQ(codeOf(call(2, replaceKeys(&old, fresh))), 27u);
+  EXPECT_EQ(codeOf(call(QRTCommandReplaceContainer, replaceKeys(&old, fresh))), 27u);
   ASSERT_EQ(rmdir(movedIn(fresh).c_str()), 0);
 
   // An immutable directory cannot be renamed: the old container has already
   // been moved aside and dropped from the cache when the new one fails to move.
   ASSERT_EQ(system(("chattr +i " + fresh.path).c_str()), 0);
-  const uint64_t code = codeOf(call(2, replaceKeys(&old, fresh)));
+  const uint64_t code = codeOf(call(QRTCommandReplaceContainer, replaceKeys(&old, fresh)));
   ASSERT_EQ(system(("chattr -i " + fresh.path).c_str()), 0);
   EXPECT_EQ(code, 15u);
   expectLive("com.example.back", old);
@@ -191,20 +192,20 @@ TEST_F(ReplaceTest, FailedMoveOfNewContainerPutsOldOneBack) {
   EXPECT_EQ(markerAt(fresh.path), "back-new");
   expectNothingInFlight();
 
-  EXPECT_EQ(codeOf(call(2, replaceKeys(&old, fresh))), 1u);
+  EXPECT_EQ(codeOf(call(QRTCommandReplaceContainer, replaceKeys(&old, fresh))), 1u);
   EXPECT_EQ(markerAt(lookup("com.example.back").path), "back-new");
 }
 
 TEST_F(ReplaceTest, PromotionMakesTransientContainerPermanent) {
   Container transient = make("com.example.promoted", true, "promoted");
-  ASSERT_EQ(codeOf(call(2, replaceKeys(nullptr, transient))), 1u);
+  ASSERT_EQ(codeOf(call(QRTCommandReplaceContainer, replaceKeys(nullptr, transient))), 1u);
   EXPECT_FALSE(exists(transient.path));
   expectLiveAcrossRestart("com.example.promoted", movedIn(transient), transient.uuid, "promoted");
 
   // A permanent container of the same identifier blocks a promotion.
   Container permanent = make("com.example.taken", false, "taken");
   Container candidate = make("com.example.taken", true, "candidate");
-  EXPECT_EQ(codeOf(call(2, replaceKeys(nullptr, candidate))), 27u);
+  EXPECT_EQ(codeOf(call(QRTCommandReplaceContainer, replaceKeys(nullptr, candidate))), 27u);
   EXPECT_EQ(markerAt(candidate.path), "candidate");
   EXPECT_EQ(lookup("com.example.taken").path, permanent.path);
   EXPECT_EQ(markerAt(permanent.path), "taken");
@@ -228,7 +229,8 @@ TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
             0);
   killDaemon();
   startDaemon();
-  ASSERT_TRUE(call(1, {{"ContainerClass", 2}, {"UserID", 501}}));  // served once start-up is over
+  ASSERT_TRUE(call(QRTCommandContainersForUser,
+                   {{QRTKeyContainerClass, 2}, {QRTKeyUserID, 501}}));  // served once start-up is over
   EXPECT_TRUE(listDirectory(other + "/.staging").empty());
   for (int i = 0; i < 100 && !listDirectory(other + "/.deathrow").empty(); ++i) usleep(20000);
   EXPECT_TRUE(listDirectory(other + "/.deathrow").empty());
@@ -238,7 +240,7 @@ TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
     SCOPED_TRACE(point);
     const std::string id = std::string("com.example.") + point;
     if (command == 10) make(id, false, id);
-    crashAndRestart(command, with(byName(501, 2, id), {{"CreateIfNecessary", true}}), point);
+    crashAndRestart(command, with(byName(501, 2, id), {{QRTKeyCreateIfNecessary, true}}), point);
     Container live = lookup(id);
     EXPECT_EQ(live.error, code);
     if (live.error == 1) { EXPECT_TRUE(exists(live.path + "/Library/Caches")) << live.path; }

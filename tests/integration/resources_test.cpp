@@ -95,7 +95,9 @@ int waitFor(pid_t pid, std::chrono::milliseconds timeout) {
 }
 
 // The largest request a frame holds: the dictionary's own bytes plus padding.
-plist::Dictionary largestRequest() { return request(30, {{"Pad", plist::Data(frame::kMaxLength - 8 - 256, 0x5a)}}); }
+plist::Dictionary largestRequest() {
+  return request(QRTCommandCount, {{"Pad", plist::Data(frame::kMaxLength - 8 - 256, 0x5a)}});
+}
 
 using ResourcesTest = DaemonFixture;
 
@@ -131,7 +133,7 @@ TEST_F(ResourcesTest, ConnectionsPerUserAreCappedAndOtherUsersAreStillServed) {
   ASSERT_EQ(read(report[0], &open, sizeof open), static_cast<ssize_t>(sizeof open));
   EXPECT_EQ(open, kPerUserLimit);
   // Root is not limited, and is served while user 501 holds its connections.
-  EXPECT_EQ(replyError(request(30)), kNotServed);
+  EXPECT_EQ(replyError(request(QRTCommandCount)), kNotServed);
   (void)!write(release[1], "x", 1);
   EXPECT_EQ(waitFor(child, 30s), 0);
   for (int fd : {report[0], release[1]}) close(fd);
@@ -185,7 +187,7 @@ TEST_F(ResourcesTest, FloodOfLargestFramesStaysWithinTheBudget) {
   const long peak = statusKiB(daemon, "VmHWM");
   RecordProperty("PeakKiB", std::to_string(peak));
   if (!kSanitized) { EXPECT_LT(peak, before + kBudgetKiB + kAllowanceKiB) << "baseline " << before; }
-  EXPECT_EQ(replyError(request(30)), kNotServed);
+  EXPECT_EQ(replyError(request(QRTCommandCount)), kNotServed);
 }
 
 // User 501 starts five largest frames and sends no more of them: it holds
@@ -251,7 +253,7 @@ TEST_F(ResourcesTest, RunningOutOfDescriptorsDoesNotSpin) {
 
   for (int fd : fds) close(fd);
   ASSERT_EQ(prlimit(daemon, RLIMIT_NOFILE, &restored, nullptr), 0);
-  EXPECT_EQ(replyError(request(30)), kNotServed);
+  EXPECT_EQ(replyError(request(QRTCommandCount)), kNotServed);
 }
 
 TEST_F(ResourcesTest, SecondDaemonOnTheSameRootExitsAndLeavesTheFirstServing) {
@@ -267,7 +269,7 @@ TEST_F(ResourcesTest, SecondDaemonOnTheSameRootExitsAndLeavesTheFirstServing) {
   EXPECT_NE(WEXITSTATUS(status), 0);
   EXPECT_NE(WEXITSTATUS(status), 127);
   EXPECT_TRUE(exists(qk::requestSocketPath(root)));
-  EXPECT_EQ(replyError(request(30)), kNotServed);
+  EXPECT_EQ(replyError(request(QRTCommandCount)), kNotServed);
 }
 
 TEST_F(ResourcesTest, SigtermEndsInTimeWithAClientThatNeverReads) {
@@ -278,7 +280,7 @@ TEST_F(ResourcesTest, SigtermEndsInTimeWithAClientThatNeverReads) {
   // Pipelined requests whose replies fill the socket, then block the daemon's writers.
   std::vector<uint8_t> bytes;
   for (uint64_t id = 1; id <= 20000; ++id) {
-    std::vector<uint8_t> one = frame::encode(id, request(30, {{"Pad", std::string(200, 'p')}}));
+    std::vector<uint8_t> one = frame::encode(id, request(QRTCommandCount, {{"Pad", std::string(200, 'p')}}));
     bytes.insert(bytes.end(), one.begin(), one.end());
   }
   fcntl(fd, F_SETFL, O_NONBLOCK);
@@ -303,20 +305,20 @@ TEST_F(ResourcesTest, SigtermEndsInTimeWithAClientThatNeverReads) {
 // caller's own, a non-integer class is 0, a non-boolean flag is false.
 TEST_F(ResourcesTest, MistypedKeysReadAsMissing) {
   setOwnIdentity("com.example.self", {});
-  const plist::Dictionary base{{"UserID", 0}, {"ContainerClass", 2}, {"CreateIfNecessary", true}};
+  const plist::Dictionary base{{QRTKeyUserID, 0}, {QRTKeyContainerClass, 2}, {QRTKeyCreateIfNecessary, true}};
   const std::tuple<plist::Dictionary, uint64_t, const char*> cases[] = {
       // keys, code, identifier answered
-      {with(base, {{"Identifier", 17}}), 1, "com.example.self"},
-      {with(base, {{"Identifier", plist::Data{'a', 'b'}}}), 1, "com.example.self"},
-      {with(base, {{"Identifier", plist::Array{"com.example.other"}}}), 1, "com.example.self"},
-      {with(base, {{"Identifier", "com.example.named"}}), 1, "com.example.named"},
-      {with(base, {{"Identifier", "com.example.flag"}, {"CreateIfNecessary", 1}}), 21, nullptr},
-      {with(base, {{"Identifier", "com.example.cls"}, {"ContainerClass", "2"}}), 38, nullptr},
+      {with(base, {{QRTKeyIdentifier, 17}}), 1, "com.example.self"},
+      {with(base, {{QRTKeyIdentifier, plist::Data{'a', 'b'}}}), 1, "com.example.self"},
+      {with(base, {{QRTKeyIdentifier, plist::Array{"com.example.other"}}}), 1, "com.example.self"},
+      {with(base, {{QRTKeyIdentifier, "com.example.named"}}), 1, "com.example.named"},
+      {with(base, {{QRTKeyIdentifier, "com.example.flag"}, {QRTKeyCreateIfNecessary, 1}}), 21, nullptr},
+      {with(base, {{QRTKeyIdentifier, "com.example.cls"}, {QRTKeyContainerClass, "2"}}), 38, nullptr},
   };
   for (const auto& [keys, code, identifier] : cases) {
-    auto reply = call(0, keys);
+    auto reply = call(QRTCommandCreateOrLookupContainer, keys);
     EXPECT_EQ(codeOf(reply), code) << plist::describe(keys);
-    if (identifier) { EXPECT_EQ(at(reply, "ReplyIdentifier"), plist::Value(identifier)) << plist::describe(keys); }
+    if (identifier) { EXPECT_EQ(at(reply, QRTReplyKeyIdentifier), plist::Value(identifier)) << plist::describe(keys); }
   }
 }
 

@@ -63,7 +63,7 @@ TEST_F(ServiceTest, ReadyOnlyOnceRequestsAreServedAndStoppingOnSigterm) {
   ASSERT_FALSE(start.empty()) << "no READY=1";
   // The moment READY=1 is out, a request must be answered (this program
   // has no entitlement: a refusal is an answer too).
-  EXPECT_NE(codeOf(call(1, {{"UserID", 501}, {"ContainerClass", 2}})), 0u);
+  EXPECT_NE(codeOf(call(QRTCommandContainersForUser, {{QRTKeyUserID, 501}, {QRTKeyContainerClass, 2}})), 0u);
   EXPECT_TRUE(contains(start.front(), "STATUS=Starting")) << start.front();
   EXPECT_TRUE(contains(start.back(), "STATUS=")) << start.back();
 
@@ -96,9 +96,9 @@ TEST_F(ServiceTest, ServesUnderTheUnitsSystemCallFilterAndRemovesItsSocketsOnExi
   }
   const std::string request = qk::requestSocketPath(root), upcall = qk::upcallSocketPath(root);
   for (int i = 0; i < 400 && !exists(upcall); ++i) usleep(25000);
-  setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true}});
+  setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
   make(501, "com.example.app", 2);
-  EXPECT_EQ(codeOf(call(15, {{"Identifier", "com.norvane.mapsd"}})), 1u);
+  EXPECT_EQ(codeOf(call(QRTCommandSystemContainerPath, {{QRTKeyIdentifier, "com.norvane.mapsd"}})), 1u);
   make(499, "com.norvane.mapsd", 12);
   qk::UpcallRequest question;
   question.codeSignatureId = "com.example.app";

@@ -8,12 +8,12 @@
 
 namespace {
 
-constexpr const char* kAssets = "com.norvane.private.QuarterKit.userManagedAssets";
+constexpr const char* kAssets = QRTEntitlementUserManagedAssets;
 
 class SpecialCommandsTest : public DaemonFixture {};
 
 std::string replyPath(const std::optional<plist::Dictionary>& reply) {
-  auto v = at(reply, "ReplyPath");
+  auto v = at(reply, QRTReplyKeyPath);
   return v && v->stringIf() ? *v->stringIf() : "";
 }
 
@@ -21,13 +21,15 @@ TEST_F(SpecialCommandsTest, UserManagedAssetsStayInsideTheirDirectory) {
   setOwnIdentity("com.example.caller", plist::Dictionary{{kAssets, true}});
   Container app = make(501, "com.example.app", 2);
   // "UserID" is ignored: the mobile user's container is meant.
-  auto first = call(28, {{"Identifier", "com.example.app"}, {"UserID", uint64_t{777}}});
+  auto first =
+      call(QRTCommandUserManagedAssetsPath, {{QRTKeyIdentifier, "com.example.app"}, {QRTKeyUserID, uint64_t{777}}});
   ASSERT_EQ(codeOf(first), 1u);
   const std::string assets = replyPath(first);
   EXPECT_EQ(parentOf(assets), app.path + "/Library");
   EXPECT_TRUE(baseName(assets).starts_with("com.norvane.UserManagedAssets."));
   EXPECT_EQ(ownerAndMode(assets), std::make_pair(501u, 0755u));
-  auto relative = call(28, {{"Identifier", "com.example.app"}, {"IsRelative", true}});
+  auto relative =
+      call(QRTCommandUserManagedAssetsPath, {{QRTKeyIdentifier, "com.example.app"}, {QRTKeyIsRelative, true}});
   EXPECT_EQ(replyPath(relative), "Library/" + baseName(assets));
 
   // What the owner plants, as the owner.
@@ -55,49 +57,54 @@ TEST_F(SpecialCommandsTest, UserManagedAssetsStayInsideTheirDirectory) {
   };
   for (Case c : {Case{"../../Library", 10}, Case{"sub/../sub/file", 10}, Case{"out_dir/file", 10}, Case{"out_dir", 10},
                  Case{"out_file", 10}, Case{"mid/file", 10}, Case{"up", 10}, Case{"/etc/passwd", 10}, Case{"", 10}}) {
-    EXPECT_EQ(codeOf(call(29, {{"Identifier", "com.example.app"}, {"SourcePath", c.path}})), c.code) << c.path;
+    EXPECT_EQ(codeOf(call(QRTCommandDeleteUserManagedAsset,
+                          {{QRTKeyIdentifier, "com.example.app"}, {QRTKeySourcePath, c.path}})),
+              c.code)
+        << c.path;
   }
   EXPECT_EQ(readFile(outside + "/file"), "not yours");
   EXPECT_TRUE(exists(root + "/etc/passwd"));
   EXPECT_EQ(listDirectory(outside).size(), 1u);
-  EXPECT_EQ(codeOf(call(29, {{"Identifier", "com.example.app"}, {"SourcePath", "sub/file"}})), 1u);
+  EXPECT_EQ(codeOf(call(QRTCommandDeleteUserManagedAsset,
+                        {{QRTKeyIdentifier, "com.example.app"}, {QRTKeySourcePath, "sub/file"}})),
+            1u);
   EXPECT_FALSE(exists(assets + "/sub/file"));
 
   // The directory removed by hand is not made again.
   ASSERT_EQ(system(("rm -rf " + assets).c_str()), 0);
-  EXPECT_EQ(codeOf(call(28, {{"Identifier", "com.example.app"}})), 11u);
+  EXPECT_EQ(codeOf(call(QRTCommandUserManagedAssetsPath, {{QRTKeyIdentifier, "com.example.app"}})), 11u);
   EXPECT_FALSE(exists(assets));
 }
 
 TEST_F(SpecialCommandsTest, NetworkExtensionOnlyForTheBroker) {
-  setOwnIdentity("com.example.other", plist::Dictionary{{"com.norvane.private.QuarterKit.networkExtension", true}});
-  plist::Dictionary keys{{"Identifier", "com.example.vpn"}, {"ContainerClass", uint64_t{6}}};
-  EXPECT_EQ(codeOf(call(27, keys)), 49u);
+  setOwnIdentity("com.example.other", plist::Dictionary{{QRTEntitlementNetworkExtension, true}});
+  plist::Dictionary keys{{QRTKeyIdentifier, "com.example.vpn"}, {QRTKeyContainerClass, uint64_t{6}}};
+  EXPECT_EQ(codeOf(call(QRTCommandSetNetworkExtension, keys)), 49u);
   EXPECT_TRUE(listDirectory(root + "/private/var/mobile/Containers/Data/VPNPlugin").empty());
-  setOwnIdentity("com.norvane.tunnelbroker",
-                 plist::Dictionary{{"com.norvane.private.QuarterKit.networkExtension", true}});
-  EXPECT_EQ(codeOf(call(27, with(keys, {{"ContainerClass", uint64_t{4}}}))), 11u);
-  ASSERT_EQ(codeOf(call(27, with(keys, {{"UserID", uint64_t{0}}}))), 1u);
+  setOwnIdentity("com.norvane.tunnelbroker", plist::Dictionary{{QRTEntitlementNetworkExtension, true}});
+  EXPECT_EQ(codeOf(call(QRTCommandSetNetworkExtension, with(keys, {{QRTKeyContainerClass, uint64_t{4}}}))), 11u);
+  ASSERT_EQ(codeOf(call(QRTCommandSetNetworkExtension, with(keys, {{QRTKeyUserID, uint64_t{0}}}))), 1u);
   Container vpn = createOrLookup(501, "com.example.vpn", 6, false);
   EXPECT_EQ(vpn.error, 1u);
   EXPECT_EQ(readLink(root + "/run/sandbox/mappings/501/1/com.norvane.tunnelworker"), vpn.path);
 }
 
 TEST_F(SpecialCommandsTest, SharedContentRefusesDotsAndTheUnentitled) {
-  setOwnIdentity("com.example.caller", plist::Dictionary{{"com.norvane.private.QuarterKit.stageSharedContent", true}});
-  plist::Dictionary keys{{"Identifier", "systemgroup.com.example"}, {"SourcePath", "a"}, {"DestPath", "b"}};
-  EXPECT_EQ(codeOf(call(26, with(keys, {{"SourcePath", "x/../a"}}))), 38u);
-  EXPECT_EQ(codeOf(call(26, with(keys, {{"DestPath", ".."}}))), 38u);
-  EXPECT_EQ(codeOf(call(26, without(keys, "Identifier"))), 11u);
-  EXPECT_EQ(codeOf(call(26, keys)), 55u);
+  setOwnIdentity("com.example.caller", plist::Dictionary{{QRTEntitlementStageSharedContent, true}});
+  plist::Dictionary keys{{QRTKeyIdentifier, "systemgroup.com.example"}, {QRTKeySourcePath, "a"}, {QRTKeyDestPath, "b"}};
+  EXPECT_EQ(codeOf(call(QRTCommandStageSharedContent, with(keys, {{QRTKeySourcePath, "x/../a"}}))), 38u);
+  EXPECT_EQ(codeOf(call(QRTCommandStageSharedContent, with(keys, {{QRTKeyDestPath, ".."}}))), 38u);
+  EXPECT_EQ(codeOf(call(QRTCommandStageSharedContent, without(keys, QRTKeyIdentifier))), 11u);
+  EXPECT_EQ(codeOf(call(QRTCommandStageSharedContent, keys)), 55u);
 
   // Entitled through its own entitlements: the content moves inside the
   // container, and never through a link the owner planted.
   setOwnIdentity("com.example.caller",
-                 plist::Dictionary{{"com.norvane.private.QuarterKit.stageSharedContent", true},
+                 plist::Dictionary{{QRTEntitlementStageSharedContent, true},
                                    {"com.norvane.security.system-groups", plist::Array{"systemgroup.com.example"}}});
-  EXPECT_EQ(codeOf(call(26, keys)), 21u) << "the system group container is made on demand, not here";
-  auto group = at(call(16), "ReplyGroupContainerDict");
+  EXPECT_EQ(codeOf(call(QRTCommandStageSharedContent, keys)), 21u)
+      << "the system group container is made on demand, not here";
+  auto group = at(call(QRTCommandSystemGroupContainerPaths), QRTReplyKeyGroupContainerDict);
   ASSERT_TRUE(group && group->dictionaryIf() && plist::find(*group->dictionaryIf(), "systemgroup.com.example"));
   const std::string container = plist::find(*group->dictionaryIf(), "systemgroup.com.example")->string();
   const std::string outside = root + "/outside";
@@ -107,20 +114,23 @@ TEST_F(SpecialCommandsTest, SharedContentRefusesDotsAndTheUnentitled) {
   ASSERT_EQ(symlink(root.c_str(), (container + "/dir").c_str()), 0);
   for (const auto& [source, dest] : std::vector<std::pair<std::string, std::string>>{
            {"link", "b"}, {"a", "dir/b"}, {"/etc/passwd", "b"}, {"dir/outside", "b"}}) {
-    EXPECT_EQ(codeOf(call(26, with(keys, {{"SourcePath", source}, {"DestPath", dest}}))), 10u) << source << " " << dest;
+    EXPECT_EQ(
+        codeOf(call(QRTCommandStageSharedContent, with(keys, {{QRTKeySourcePath, source}, {QRTKeyDestPath, dest}}))),
+        10u)
+        << source << " " << dest;
   }
   EXPECT_EQ(readFile(outside), "keep");
   EXPECT_FALSE(exists(root + "/b"));
-  auto moved = call(26, keys);
+  auto moved = call(QRTCommandStageSharedContent, keys);
   EXPECT_EQ(codeOf(moved), 1u);
   EXPECT_EQ(replyPath(moved), container + "/b");
   EXPECT_EQ(readFile(container + "/b"), "shared");
 }
 
 TEST_F(SpecialCommandsTest, RetryTestOnlyOnInternalBuilds) {
-  setOwnIdentity("com.example.caller", plist::Dictionary{{"com.norvane.private.QuarterKit.allowed", true}});
-  plist::Dictionary keys{{"NumRetryCrashes", uint64_t{1}}, {"UserID", uint64_t{501}}};
-  EXPECT_EQ(codeOf(call(25, keys)), 1u);
+  setOwnIdentity("com.example.caller", plist::Dictionary{{QRTEntitlementAllowed, true}});
+  plist::Dictionary keys{{QRTKeyNumRetryCrashes, uint64_t{1}}, {QRTKeyUserID, uint64_t{501}}};
+  EXPECT_EQ(codeOf(call(QRTCommandRetryTest, keys)), 1u);
   EXPECT_TRUE(logContains("People really shouldn't be calling this on non-internal installs!"));
   EXPECT_TRUE(listDirectory(appClassDir()).empty());
 
@@ -128,13 +138,13 @@ TEST_F(SpecialCommandsTest, RetryTestOnlyOnInternalBuilds) {
             "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
             "<key>InternalBuild</key><true/></dict></plist>\n");
   // One crash: the daemon ends without a reply, then the next call cleans up.
-  EXPECT_FALSE(call(25, keys));
+  EXPECT_FALSE(call(QRTCommandRetryTest, keys));
   int status = -1;
   ASSERT_EQ(waitpid(daemon, &status, 0), daemon);
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
   daemon = -1;
   startDaemon();
-  EXPECT_EQ(codeOf(call(25, keys)), 1u);
+  EXPECT_EQ(codeOf(call(QRTCommandRetryTest, keys)), 1u);
   EXPECT_EQ(createOrLookup(501, "com.norvane.retryTest", 2, false).error, 21u);
 }
 

@@ -69,14 +69,14 @@ TEST_F(StoreTest, RefusalsLeaveNothingOnDisk) {
 
   EXPECT_EQ(createOrLookup(501, "com.example.app", 1).error, 55u);  // a bundle class needs the entitlement first
   // A system container of another program needs look-up rights.
-  setOwnIdentity("com.example.me", {{"com.norvane.private.QuarterKit.otherIdLookup", false}});
+  setOwnIdentity("com.example.me", {{QRTEntitlementOtherIdLookup, false}});
   EXPECT_EQ(createOrLookup(499, "com.example.other", 12).error, 55u);
-  EXPECT_EQ(createOrLookup(499, "com.example.other", 12, true, false, 15).error, 55u);
+  EXPECT_EQ(createOrLookup(499, "com.example.other", 12, true, false, QRTCommandSystemContainerPath).error, 55u);
   EXPECT_TRUE(listDirectory(root + "/private/var/containers/Data/System").empty());
 }
 
 TEST_F(StoreTest, BundleAndWellKnownSystemContainers) {
-  setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true}});
+  setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
   Container bundle = createOrLookup(33, "com.example.app", 1);
   ASSERT_EQ(bundle.error, 1u);
   EXPECT_EQ(bundle.path.rfind(root + "/private/var/containers/Bundle/Application/", 0), 0u);
@@ -85,7 +85,7 @@ TEST_F(StoreTest, BundleAndWellKnownSystemContainers) {
 
   // Any caller reaches a well-known system container, under its own name.
   clearOwnIdentity();
-  Container system = createOrLookup(0, "com.norvane.mapsd", 12, true, false, 15);
+  Container system = createOrLookup(0, "com.norvane.mapsd", 12, true, false, QRTCommandSystemContainerPath);
   ASSERT_EQ(system.error, 1u);
   EXPECT_EQ(system.path, root + "/private/var/containers/Data/System/com.norvane.mapsd");
   EXPECT_GT(getxattr(system.path.c_str(), "system.posix_acl_access", nullptr, 0), 0);

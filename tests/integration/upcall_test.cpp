@@ -42,10 +42,10 @@ TEST_F(UpcallTest, StartingProcessGetsItsContainers) {
   qk::UpcallRequest personaOnly;
   personaOnly.personaId = 0;
   // The installer's registration says the program's data container is a plug-in's.
-  setOwnIdentity("com.example.installer", {{"com.norvane.private.QuarterKit.allowed", true}});
+  setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
   EXPECT_EQ(
-      codeOf(call(18,
-                  {{"Identifier", "com.example.mapped"},
+      codeOf(call(QRTCommandProcessCodeSigningInfo,
+                  {{QRTKeyIdentifier, "com.example.mapped"},
                    {"CodeSigningInfo", plist::Dictionary{{"com.norvane.QuarterKit.Entitlements", plist::Dictionary{}}}},
                    {"OptionsDictionary", plist::Dictionary{{"com.norvane.QuarterKit.DataContainerClass", 4}}}})),
       1u);

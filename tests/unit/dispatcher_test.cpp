@@ -81,7 +81,7 @@ TEST(MessageReaders, MissingOrMistypedValuesReadAsNothing) {
     EXPECT_EQ(QRTMessageString(message, k).has_value(), k == "string") << k;
     EXPECT_EQ(QRTMessageUUID(message, k).has_value(), k == "uuid") << k;
     // A present identifier of another type reads as missing: the caller's own.
-    plist::Dictionary withIdentifier{{"Identifier", value}};
+    plist::Dictionary withIdentifier{{QRTKeyIdentifier, value}};
     EXPECT_EQ(QRTMessageIdentifier(withIdentifier, std::string("own")), k == "string" ? "com.example" : "own") << k;
     EXPECT_EQ(QRTMessageIdentifier(withIdentifier, std::nullopt).has_value(), k == "string") << k;
   }
@@ -113,7 +113,7 @@ TEST(ReplySending, OversizedReplyBecomesErrorFortyOnAnIntactStream) {
     while (auto f = decoder.next()) {
       auto message = frame::decodeMessage(f->payload);
       ASSERT_TRUE(message);
-      replies.emplace_back(f->messageId, QRTMessageU64(*message, "ReplyError"));
+      replies.emplace_back(f->messageId, QRTMessageU64(*message, QRTReplyKeyError));
     }
   }
   sender.join();

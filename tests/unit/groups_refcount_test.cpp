@@ -114,7 +114,7 @@ TEST_F(GroupRefcountTest, ReorderingOrRepeatingChangesNothing) {
 TEST_F(GroupRefcountTest, ReconcileRemovesOnlyUnnamedGroups) {
   uint64_t code = 1;
   ASSERT_TRUE(QRTClientConnection::sharedClientConnection().createOrLookupContainerForUser(
-      501, std::string("group.nobody"), true, 7, false, true, &code));
+      {501, 7, std::string("group.nobody")}, QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code));
   ASSERT_EQ(registerGroups("com.example.keeper", {"group.kept"}), 1u);
   ASSERT_EQ(paths("com.example.keeper").size(), 1u);
   mapping().performAllCodeSigningMigrationAndReconciliation();

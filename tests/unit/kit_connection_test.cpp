@@ -11,6 +11,7 @@
 #include "QuarterKit/Requests.h"
 #include "QuarterKit/Testing.h"
 #include "base/Frame.h"
+#include "base/QRTProtocol.h"
 #include "base/QRTUUID.h"
 
 namespace {
@@ -195,21 +196,21 @@ TEST(KitRequest, ValuesAreEncodedAndReadTheWayTheDaemonDoes) {
                                   .u64("Small", 7)
                                   .i64("Negative", -2)
                                   .message();
-  EXPECT_EQ(m, (plist::Dictionary{{"Command", 2},
+  EXPECT_EQ(m, (plist::Dictionary{{QRTKeyCommand, 2},
                                   {"U", plist::Data(uuid->bytes().begin(), uuid->bytes().end())},
                                   {"Big", plist::Integer{UINT64_MAX, true}},
                                   {"Small", plist::Integer{7, false}},
                                   {"Negative", -2}}));
 
-  qk::Reply reply({{"ReplyError", 1},
-                   {"ReplyPath", 5},
-                   {"ReplyUUID", plist::Data(15, 0)},
-                   {"ReplyIdsArray", plist::Array{"a", 3, "b"}},
-                   {"ReplyExisted", "yes"}});
+  qk::Reply reply({{QRTReplyKeyError, 1},
+                   {QRTReplyKeyPath, 5},
+                   {QRTReplyKeyUUID, plist::Data(15, 0)},
+                   {QRTReplyKeyIdsArray, plist::Array{"a", 3, "b"}},
+                   {QRTReplyKeyExisted, "yes"}});
   EXPECT_TRUE(reply.ok());
-  EXPECT_FALSE(reply.string("ReplyPath") || reply.uuid("ReplyUUID") || reply.boolean("ReplyExisted"));
+  EXPECT_FALSE(reply.string(QRTReplyKeyPath) || reply.uuid(QRTReplyKeyUUID) || reply.boolean(QRTReplyKeyExisted));
   EXPECT_EQ(0u, reply.u64("Missing"));
-  EXPECT_EQ((std::vector<std::string>{"a", "b"}), reply.strings("ReplyIdsArray"));
+  EXPECT_EQ((std::vector<std::string>{"a", "b"}), reply.strings(QRTReplyKeyIdsArray));
   EXPECT_EQ(0u, qk::Reply({}).error());
 }
 

@@ -12,6 +12,7 @@
 
 #include "TempDir.h"
 #include "base/PlistCodec.h"
+#include "base/QRTProtocol.h"
 #include "platform/DeviceProperties.h"
 #include "platform/DeviceRoot.h"
 #include "platform/FirstBoot.h"
@@ -173,7 +174,7 @@ TEST_F(DeviceRootTest, UserDatabaseReadsTheRootsFilesOnEveryLookup) {
 
 plist::Dictionary identityEntry(const std::string& executable, const std::string& signing, bool entitled) {
   plist::Dictionary entry{{"Executable", executable}, {"SigningIdentifier", signing}};
-  if (entitled) entry["Entitlements"] = plist::Dictionary{{"com.norvane.private.QuarterKit.allowed", true}};
+  if (entitled) entry["Entitlements"] = plist::Dictionary{{QRTEntitlementAllowed, true}};
   return entry;
 }
 
@@ -188,7 +189,7 @@ TEST_F(DeviceRootTest, IdentityRegistryLastSortedFileWinsAndChangesAreSeen) {
   CodeIdentity tool = *identityForExecutable("/usr/bin/tool");
   EXPECT_EQ(tool.signingIdentifier, "com.example.b");
   ASSERT_TRUE(tool.entitlements);
-  EXPECT_TRUE(plist::find(*tool.entitlements, "com.norvane.private.QuarterKit.allowed"));
+  EXPECT_TRUE(plist::find(*tool.entitlements, QRTEntitlementAllowed));
   CodeIdentity plain = *identityForExecutable("/usr/bin/plain");
   EXPECT_EQ(plain.signingIdentifier, "com.example.plain");
   EXPECT_FALSE(plain.entitlements);
@@ -222,7 +223,7 @@ TEST_F(DeviceRootTest, PeerIdentityIsTheFileAndTheUid) {
   struct stat real {};
   ASSERT_EQ(stat("/usr/bin/true", &real), 0);
   const plist::Dictionary groups{{"com.norvane.security.application-groups", plist::Array{"group.a"}}};
-  const plist::Dictionary all{*groups.begin(), {"com.norvane.private.QuarterKit.allowed", true}};
+  const plist::Dictionary all{*groups.begin(), {QRTEntitlementAllowed, true}};
   const plist::Array none;
   const std::tuple<plist::Array, plist::Dictionary, uid_t, int, int, ino_t, int> rows[] = {
       {none, all, 0, 0644, 0755, 0, 1},

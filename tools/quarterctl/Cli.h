@@ -16,6 +16,7 @@
 #include "QuarterKit/QuarterKit.h"
 #include "QuarterKit/Requests.h"
 #include "base/PlistValue.h"
+#include "base/QRTProtocol.h"
 #include "base/QRTUUID.h"
 
 namespace ctl {

@@ -40,22 +40,23 @@ qk::Result onOne(qk::Connection& c, qk::ContainerRef& r, const std::function<qk:
 int createOrLookup(G g, A a, bool create) {
   qk::ContainerRef r = containerArgs(a);
   const bool transient = a.has("--transient");
-  return deliver(g,
-                 [&](qk::Connection& c) {
-                   return qk::createOrLookupContainer(c, r.userId, r.identifier, r.containerClass, create, transient);
-                 },
-                 {[](const qk::Reply& reply) {
-                    Table table({"IDENTIFIER", "UUID", "EXISTED", "PATH"});
-                    table.add({reply.string("ReplyIdentifier").value_or(""), uuidText(reply.uuid("ReplyUUID")),
-                               reply.boolean("ReplyExisted") ? "yes" : "no", reply.string("ReplyPath").value_or("")});
-                    table.print();
-                  },
-                  [](const qk::Reply& reply) -> nlohmann::json {
-                    return {{"identifier", orNull(reply.string("ReplyIdentifier"))},
-                            {"uuid", uuidText(reply.uuid("ReplyUUID"))},
-                            {"path", orNull(reply.string("ReplyPath"))},
-                            {"existed", reply.boolean("ReplyExisted")}};
-                  }});
+  return deliver(
+      g,
+      [&](qk::Connection& c) {
+        return qk::createOrLookupContainer(c, r.userId, r.identifier, r.containerClass, create, transient);
+      },
+      {[](const qk::Reply& reply) {
+         Table table({"IDENTIFIER", "UUID", "EXISTED", "PATH"});
+         table.add({reply.string(QRTReplyKeyIdentifier).value_or(""), uuidText(reply.uuid(QRTReplyKeyUUID)),
+                    reply.boolean(QRTReplyKeyExisted) ? "yes" : "no", reply.string(QRTReplyKeyPath).value_or("")});
+         table.print();
+       },
+       [](const qk::Reply& reply) -> nlohmann::json {
+         return {{"identifier", orNull(reply.string(QRTReplyKeyIdentifier))},
+                 {"uuid", uuidText(reply.uuid(QRTReplyKeyUUID))},
+                 {"path", orNull(reply.string(QRTReplyKeyPath))},
+                 {"existed", reply.boolean(QRTReplyKeyExisted)}};
+       }});
 }
 
 // The path of each listed container, asked for with a window of requests in
@@ -69,14 +70,14 @@ std::vector<std::optional<std::string>> pathsOf(qk::Connection& c, const qk::Con
     std::optional<plist::Dictionary> reply;
     if (pending.front().wait_for(c.replyTimeout()) == std::future_status::ready) reply = pending.front().get();
     pending.pop_front();
-    paths.push_back(reply ? qk::Reply(std::move(*reply)).string("ReplyPath") : std::nullopt);
+    paths.push_back(reply ? qk::Reply(std::move(*reply)).string(QRTReplyKeyPath) : std::nullopt);
   };
   for (size_t i = 0; i < std::min(ids.size(), uuids.size()); ++i) {
     pending.push_back(c.send(qk::Request(qk::Command::metadataForContainer)
-                                 .u64("UserID", base.userId)
-                                 .u64("ContainerClass", base.containerClass)
-                                 .string("Identifier", ids[i])
-                                 .uuid("UUID", uuids[i])
+                                 .u64(QRTKeyUserID, base.userId)
+                                 .u64(QRTKeyContainerClass, base.containerClass)
+                                 .string(QRTKeyIdentifier, ids[i])
+                                 .uuid(QRTKeyUUID, uuids[i])
                                  .message()));
     if (pending.size() >= kPathWindow) collect();
   }
@@ -95,8 +96,8 @@ int list(G g, A a) {
       [&](qk::Connection& c) {
         qk::Result reply = qk::containersForUser(c, r.userId, r.containerClass, transient);
         if (reply && reply->ok()) {
-          ids = reply->strings("ReplyIdsArray");
-          uuids = reply->uuids("ReplyUUIDsArray");
+          ids = reply->strings(QRTReplyKeyIdsArray);
+          uuids = reply->uuids(QRTReplyKeyUUIDsArray);
           paths = pathsOf(c, r, ids, uuids);
         }
         return reply;
@@ -119,11 +120,11 @@ int infoGet(G g, A a) {
   const std::string key = *a.value("--key");
   return deliver(g, [&](qk::Connection& c) { return onOne(c, r, [&] { return qk::infoValueForKey(c, r, key); }); },
                  {[](const qk::Reply& reply) {
-                    const plist::Value* v = reply.value("ReplyInfoValue");
+                    const plist::Value* v = reply.value(QRTReplyKeyInfoValue);
                     std::cout << printable(v ? plainText(*v) : "") << '\n';
                   },
                   [&](const qk::Reply& reply) -> nlohmann::json {
-                    const plist::Value* v = reply.value("ReplyInfoValue");
+                    const plist::Value* v = reply.value(QRTReplyKeyInfoValue);
                     return {{"key", key}, {"value", v ? toJson(*v) : nlohmann::json(nullptr)}};
                   }});
 }
@@ -148,31 +149,31 @@ int infoSet(G g, A a) {
 int metadata(G g, A a) {
   qk::ContainerRef r = containerArgs(a);
   const bool info = a.has("--info");
-  return deliver(g,
-                 [&](qk::Connection& c) { return onOne(c, r, [&] { return qk::metadataForContainer(c, r, info); }); },
-                 {[&](const qk::Reply& reply) {
-                    Table table({"IDENTIFIER", "UUID", "TRANSIENT", "PATH"});
-                    table.add({r.identifier.value_or(""), uuidText(r.uuid),
-                               reply.boolean("ReplyTransient") ? "yes" : "no", reply.string("ReplyPath").value_or("")});
-                    table.print();
-                    if (!info) return;
-                    std::cout << '\n';
-                    Table values({"KEY", "VALUE"});
-                    if (const plist::Dictionary* d = reply.dictionary("ReplyInfoDictionary"))
-                      for (const auto& [k, v] : *d) values.add({k, plainText(v)});
-                    values.print();
-                  },
-                  [&](const qk::Reply& reply) {
-                    nlohmann::json out = {{"identifier", orNull(r.identifier)},
-                                          {"uuid", uuidText(r.uuid)},
-                                          {"path", orNull(reply.string("ReplyPath"))},
-                                          {"transient", reply.boolean("ReplyTransient")}};
-                    if (info) {
-                      const plist::Dictionary* d = reply.dictionary("ReplyInfoDictionary");
-                      out["info"] = d ? toJson(plist::Value(*d)) : nlohmann::json::object();
-                    }
-                    return out;
-                  }});
+  return deliver(
+      g, [&](qk::Connection& c) { return onOne(c, r, [&] { return qk::metadataForContainer(c, r, info); }); },
+      {[&](const qk::Reply& reply) {
+         Table table({"IDENTIFIER", "UUID", "TRANSIENT", "PATH"});
+         table.add({r.identifier.value_or(""), uuidText(r.uuid), reply.boolean(QRTReplyKeyTransient) ? "yes" : "no",
+                    reply.string(QRTReplyKeyPath).value_or("")});
+         table.print();
+         if (!info) return;
+         std::cout << '\n';
+         Table values({"KEY", "VALUE"});
+         if (const plist::Dictionary* d = reply.dictionary(QRTReplyKeyInfoDictionary))
+           for (const auto& [k, v] : *d) values.add({k, plainText(v)});
+         values.print();
+       },
+       [&](const qk::Reply& reply) {
+         nlohmann::json out = {{"identifier", orNull(r.identifier)},
+                               {"uuid", uuidText(r.uuid)},
+                               {"path", orNull(reply.string(QRTReplyKeyPath))},
+                               {"transient", reply.boolean(QRTReplyKeyTransient)}};
+         if (info) {
+           const plist::Dictionary* d = reply.dictionary(QRTReplyKeyInfoDictionary);
+           out["info"] = d ? toJson(plist::Value(*d)) : nlohmann::json::object();
+         }
+         return out;
+       }});
 }
 
 int du(G g, A a) {
@@ -182,12 +183,13 @@ int du(G g, A a) {
       g, [&](qk::Connection& c) { return onOne(c, r, [&] { return qk::diskUsage(c, r); }); },
       {[&](const qk::Reply& reply) {
          Table table({"IDENTIFIER", "UUID", "SIZE"});
-         table.add({r.identifier.value_or(""), uuidText(r.uuid), sizeText(reply.u64("ReplyDiskUsage"), units)});
+         table.add({r.identifier.value_or(""), uuidText(r.uuid), sizeText(reply.u64(QRTReplyKeyDiskUsage), units)});
          table.print();
        },
        [&](const qk::Reply& reply) -> nlohmann::json {
-         return {
-             {"identifier", orNull(r.identifier)}, {"uuid", uuidText(r.uuid)}, {"bytes", reply.u64("ReplyDiskUsage")}};
+         return {{"identifier", orNull(r.identifier)},
+                 {"uuid", uuidText(r.uuid)},
+                 {"bytes", reply.u64(QRTReplyKeyDiskUsage)}};
        }});
 }
 
@@ -270,9 +272,9 @@ int systemPath(G g, A a) {
   if (auto v = a.value("--identifier")) identifier = checkIdentifier(*v, "--identifier");
   return deliver(
       g, [&](qk::Connection& c) { return qk::systemContainerPath(c, identifier); },
-      {[](const qk::Reply& reply) { std::cout << printable(reply.string("ReplyPath").value_or("")) << '\n'; },
+      {[](const qk::Reply& reply) { std::cout << printable(reply.string(QRTReplyKeyPath).value_or("")) << '\n'; },
        [](const qk::Reply& reply) -> nlohmann::json {
-         return {{"path", orNull(reply.string("ReplyPath"))}};
+         return {{"path", orNull(reply.string(QRTReplyKeyPath))}};
        }});
 }
 

@@ -52,13 +52,13 @@ int groupPaths(G g, A a) {
                  },
                  {[](const qk::Reply& reply) {
                     Table table({"GROUP", "PATH"});
-                    if (const plist::Dictionary* d = reply.dictionary("ReplyGroupContainerDict"))
+                    if (const plist::Dictionary* d = reply.dictionary(QRTReplyKeyGroupContainerDict))
                       for (const auto& [group, path] : *d) table.add({group, plainText(path)});
                     table.print();
                   },
                   [](const qk::Reply& reply) {
                     nlohmann::json out = nlohmann::json::array();
-                    if (const plist::Dictionary* d = reply.dictionary("ReplyGroupContainerDict"))
+                    if (const plist::Dictionary* d = reply.dictionary(QRTReplyKeyGroupContainerDict))
                       for (const auto& [group, path] : *d) out.push_back({{"group", group}, {"path", toJson(path)}});
                     return out;
                   }});
@@ -70,12 +70,12 @@ int groupIds(G g, A a) {
   return deliver(g, [&](qk::Connection& c) { return qk::groupContainerIdentifiers(c, user, identifier); },
                  {[](const qk::Reply& reply) {
                     Table table({"GROUP"});
-                    for (const std::string& group : reply.strings("ReplyGroupIdentifiersArray")) table.add({group});
+                    for (const std::string& group : reply.strings(QRTReplyKeyGroupIdentifiersArray)) table.add({group});
                     table.print();
                   },
                   [](const qk::Reply& reply) {
                     nlohmann::json out = nlohmann::json::array();
-                    for (const std::string& group : reply.strings("ReplyGroupIdentifiersArray"))
+                    for (const std::string& group : reply.strings(QRTReplyKeyGroupIdentifiersArray))
                       out.push_back({{"group", group}});
                     return out;
                   }});
@@ -86,9 +86,9 @@ int systemGroupPath(G g, A a) {
   const auto identifier = identifierArg(a);
   return deliver(
       g, [&](qk::Connection& c) { return qk::systemGroupContainerPath(c, group, identifier); },
-      {[](const qk::Reply& reply) { std::cout << printable(reply.string("ReplyPath").value_or("")) << '\n'; },
+      {[](const qk::Reply& reply) { std::cout << printable(reply.string(QRTReplyKeyPath).value_or("")) << '\n'; },
        [](const qk::Reply& reply) -> nlohmann::json {
-         auto path = reply.string("ReplyPath");
+         auto path = reply.string(QRTReplyKeyPath);
          return {{"path", path ? nlohmann::json(*path) : nlohmann::json(nullptr)}};
        }});
 }
@@ -107,12 +107,12 @@ int codesignGet(G g, A a) {
       g, [&](qk::Connection& c) { return qk::codeSigningInfoForIdentifier(c, identifier); },
       {[](const qk::Reply& reply) {
          Table table({"KEY", "VALUE"});
-         if (const plist::Dictionary* d = reply.dictionary("ReplyInfoDictionary"))
+         if (const plist::Dictionary* d = reply.dictionary(QRTReplyKeyInfoDictionary))
            for (const auto& [key, value] : *d) table.add({key, plainText(value)});
          table.print();
        },
        [&](const qk::Reply& reply) -> nlohmann::json {
-         const plist::Dictionary* d = reply.dictionary("ReplyInfoDictionary");
+         const plist::Dictionary* d = reply.dictionary(QRTReplyKeyInfoDictionary);
          return {{"identifier", *identifier}, {"info", d ? toJson(plist::Value(*d)) : nlohmann::json::object()}};
        }});
 }

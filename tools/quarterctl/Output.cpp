@@ -266,7 +266,7 @@ int reportError(const qk::Reply& reply, const Global& global, const Show& show) 
 // Every reply key but ReplyError.
 plist::Dictionary otherKeys(const qk::Reply& reply) {
   plist::Dictionary out = reply.dictionary();
-  out.erase("ReplyError");
+  out.erase(QRTReplyKeyError);
   return out;
 }
 
@@ -300,11 +300,11 @@ int deliver(const Global& global, const Send& send, const Show& show) {
 }
 
 qk::Result resolve(qk::Connection& c, qk::ContainerRef& r) {
-  if (r.uuid) return qk::Reply(plist::Dictionary{{"ReplyError", 1}});
+  if (r.uuid) return qk::Reply(plist::Dictionary{{QRTReplyKeyError, 1}});
   qk::Result found = qk::createOrLookupContainer(c, r.userId, r.identifier, r.containerClass, false, false);
   if (found && found->ok()) {
-    r.uuid = found->uuid("ReplyUUID");
-    if (auto identifier = found->string("ReplyIdentifier")) r.identifier = identifier;
+    r.uuid = found->uuid(QRTReplyKeyUUID);
+    if (auto identifier = found->string(QRTReplyKeyIdentifier)) r.identifier = identifier;
   }
   return found;
 }

@@ -18,9 +18,9 @@ std::optional<std::string> identifierArg(A a) {
 
 // Shows the reply's path alone, or as {"path": ...}.
 const Show kPath = {
-    [](const qk::Reply& reply) { std::cout << printable(reply.string("ReplyPath").value_or("")) << '\n'; },
+    [](const qk::Reply& reply) { std::cout << printable(reply.string(QRTReplyKeyPath).value_or("")) << '\n'; },
     [](const qk::Reply& reply) -> nlohmann::json {
-      auto path = reply.string("ReplyPath");
+      auto path = reply.string(QRTReplyKeyPath);
       return {{"path", path ? nlohmann::json(*path) : nlohmann::json(nullptr)}};
     }};
 

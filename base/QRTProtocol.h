@@ -1,0 +1,101 @@
+// The request protocol of quarterd, in one place: the command numbers, the
+// keys of a request and of its reply, and the entitlements a command asks
+// for. The daemon, QuarterKit, quarterctl and the tests all name them from
+// here; the numbers and strings are what travels on the socket and never
+// change.
+#pragma once
+
+#include <cstdint>
+
+// "Command" of a request: the row of the daemon's command table.
+enum QRTCommand : uint64_t {
+  QRTCommandCreateOrLookupContainer = 0,
+  QRTCommandContainersForUser = 1,
+  QRTCommandReplaceContainer = 2,
+  QRTCommandStageContainerForDelete = 3,
+  QRTCommandDeleteContainersOnDeathRow = 4,
+  QRTCommandSetInfoValue = 5,
+  QRTCommandInfoValueForKey = 6,
+  QRTCommandMetadataForContainer = 7,
+  QRTCommandRecreateDefaultStructure = 8,
+  QRTCommandRegenerateDirectoryUUID = 9,
+  QRTCommandDeleteContainer = 10,
+  QRTCommandWipeAddonDataContainer = 11,
+  QRTCommandDeleteDataContainerContent = 12,
+  QRTCommandGroupContainerPaths = 13,
+  QRTCommandGroupContainerIdentifiers = 14,
+  QRTCommandSystemContainerPath = 15,
+  QRTCommandSystemGroupContainerPaths = 16,
+  QRTCommandSystemGroupContainerPath = 17,
+  QRTCommandProcessCodeSigningInfo = 18,
+  QRTCommandCodeSigningInfoForIdentifier = 19,
+  QRTCommandInvalidateCodeSigningInfoForAppsWithoutBundleContainer = 20,
+  QRTCommandSetDataProtection = 21,
+  QRTCommandRecreateContainerStructure = 22,
+  QRTCommandDiskUsage = 23,
+  QRTCommandPerformDataMigration = 24,
+  QRTCommandRetryTest = 25,
+  QRTCommandStageSharedContent = 26,
+  QRTCommandSetNetworkExtension = 27,
+  QRTCommandUserManagedAssetsPath = 28,
+  QRTCommandDeleteUserManagedAsset = 29,
+};
+// One past the last command; a request naming it or more is invalid.
+inline constexpr uint64_t QRTCommandCount = 30;
+
+// Keys of a request.
+inline constexpr const char* QRTKeyCommand = "Command";
+inline constexpr const char* QRTKeyUserID = "UserID";
+inline constexpr const char* QRTKeyContainerClass = "ContainerClass";
+inline constexpr const char* QRTKeyIdentifier = "Identifier";
+inline constexpr const char* QRTKeyUUID = "UUID";
+inline constexpr const char* QRTKeyTransient = "Transient";
+inline constexpr const char* QRTKeyCreateIfNecessary = "CreateIfNecessary";
+inline constexpr const char* QRTKeyOldContainerUUID = "OldContainerUUID";
+inline constexpr const char* QRTKeyOldContainerUserID = "OldContainerUserID";
+inline constexpr const char* QRTKeyOldContainerClass = "OldContainerClass";
+inline constexpr const char* QRTKeyOldIdentifier = "OldIdentifier";
+inline constexpr const char* QRTKeyNewContainerUUID = "NewContainerUUID";
+inline constexpr const char* QRTKeyNewContainerUserID = "NewContainerUserID";
+inline constexpr const char* QRTKeyNewContainerClass = "NewContainerClass";
+inline constexpr const char* QRTKeyNewIdentifier = "NewIdentifier";
+inline constexpr const char* QRTKeyUserIDsArray = "UserIDsArray";
+inline constexpr const char* QRTKeyUUIDsArray = "UUIDsArray";
+inline constexpr const char* QRTKeyIdentifiersArray = "IdentifiersArray";
+inline constexpr const char* QRTKeyContainerClassesArray = "ContainerClassesArray";
+inline constexpr const char* QRTKeyKey = "Key";
+inline constexpr const char* QRTKeyValue = "Value";
+inline constexpr const char* QRTKeyInfoDictRequested = "InfoDictRequested";
+inline constexpr const char* QRTKeyGroupIdentifier = "GroupIdentifier";
+inline constexpr const char* QRTKeyDataProtectionClass = "DataProtectionClass";
+inline constexpr const char* QRTKeyIsThirdParty = "IsThirdParty";
+inline constexpr const char* QRTKeyRetryIfLocked = "RetryIfLocked";
+inline constexpr const char* QRTKeyNumRetryCrashes = "NumRetryCrashes";
+inline constexpr const char* QRTKeySourcePath = "SourcePath";
+inline constexpr const char* QRTKeyDestPath = "DestPath";
+inline constexpr const char* QRTKeyIsRelative = "IsRelative";
+
+// Keys of a reply. "ReplyError" is in every reply: 1 is success.
+inline constexpr const char* QRTReplyKeyError = "ReplyError";
+inline constexpr const char* QRTReplyKeyPath = "ReplyPath";
+inline constexpr const char* QRTReplyKeyIdentifier = "ReplyIdentifier";
+inline constexpr const char* QRTReplyKeyUUID = "ReplyUUID";
+inline constexpr const char* QRTReplyKeyExisted = "ReplyExisted";
+inline constexpr const char* QRTReplyKeyTransient = "ReplyTransient";
+inline constexpr const char* QRTReplyKeyUUIDsArray = "ReplyUUIDsArray";
+inline constexpr const char* QRTReplyKeyIdsArray = "ReplyIdsArray";
+inline constexpr const char* QRTReplyKeyInfoValue = "ReplyInfoValue";
+inline constexpr const char* QRTReplyKeyInfoDictionary = "ReplyInfoDictionary";
+inline constexpr const char* QRTReplyKeyGroupContainerDict = "ReplyGroupContainerDict";
+inline constexpr const char* QRTReplyKeyGroupIdentifiersArray = "ReplyGroupIdentifiersArray";
+inline constexpr const char* QRTReplyKeyDiskUsage = "ReplyDiskUsage";
+
+// Entitlements a command asks of its caller.
+inline constexpr const char* QRTEntitlementNone = "com.norvane.private.QuarterKit.none";
+inline constexpr const char* QRTEntitlementAllowed = "com.norvane.private.QuarterKit.allowed";
+inline constexpr const char* QRTEntitlementOtherIdLookup = "com.norvane.private.QuarterKit.otherIdLookup";
+inline constexpr const char* QRTEntitlementWipeContainer = "com.norvane.private.QuarterKit.wipeContainer";
+inline constexpr const char* QRTEntitlementDataMigration = "com.norvane.private.QuarterKit.dataMigration";
+inline constexpr const char* QRTEntitlementStageSharedContent = "com.norvane.private.QuarterKit.stageSharedContent";
+inline constexpr const char* QRTEntitlementNetworkExtension = "com.norvane.private.QuarterKit.networkExtension";
+inline constexpr const char* QRTEntitlementUserManagedAssets = "com.norvane.private.QuarterKit.userManagedAssets";
