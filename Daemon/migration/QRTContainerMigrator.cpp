@@ -5,7 +5,7 @@
 #include <optional>
 
 #include "Daemon/QRTCrashPoint.h"
-#include "Daemon/QRTDaemon.h"
+#include "Daemon/QRTProcessWide.h"
 #include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/migration/QRTMigrationStatus.h"

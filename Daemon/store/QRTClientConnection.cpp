@@ -11,7 +11,6 @@
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTCrashPoint.h"
-#include "Daemon/QRTDaemon.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTLocks.h"

@@ -1,4 +1,4 @@
-#include "Daemon/QRTDaemon.h"
+#include "Daemon/startup/QRTDaemon.h"
 
 #include <limits.h>
 #include <malloc.h>
@@ -18,6 +18,7 @@
 #include <string>
 #include <vector>
 
+#include "Daemon/QRTProcessWide.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/requests/QRTRequestDispatcher.h"
@@ -36,19 +37,6 @@
 using platform::kLogDebug;
 using platform::kLogError;
 using platform::kLogNotice;
-
-uint32_t gQRTLogFileCount = 1;
-
-platform::Queue& QRTDeathRowQueue() {
-  static std::shared_ptr<platform::Queue> queue =
-      platform::makeSerialQueue("com.norvane.quarterd.deathrow", platform::QueuePriority::Background);
-  return *queue;
-}
-
-platform::Queue& QRTLockStateQueue() {
-  static std::shared_ptr<platform::Queue> queue = platform::makeSerialQueue("com.norvane.quarterd.lockstate");
-  return *queue;
-}
 
 namespace {
 
@@ -241,14 +229,6 @@ void stopListener() {
 }
 
 }  // namespace
-
-void run_async_with_transaction(platform::Queue& queue, platform::Work work) {
-  platform::transactionBegin();
-  queue.async([work = std::move(work)] {
-    work();
-    platform::transactionEnd();
-  });
-}
 
 void lock_state_notification_callback() {
   int state = platform::deviceLockState();
