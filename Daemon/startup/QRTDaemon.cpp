@@ -1,11 +1,9 @@
 #include "Daemon/startup/QRTDaemon.h"
 
 #include <limits.h>
-#include <malloc.h>
 #include <signal.h>
 #include <stdlib.h>
 #include <string.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <syslog.h>
 
@@ -29,6 +27,7 @@
 #include "platform/HostProfile.h"
 #include "platform/LockState.h"
 #include "platform/Log.h"
+#include "platform/ProcessLimits.h"
 #include "platform/RequestSocket.h"
 #include "platform/SafePath.h"
 #include "platform/ServiceManager.h"
@@ -161,16 +160,13 @@ std::vector<platform::HostProfileLine> setUpHostProfile() {
 
 // Every connection costs a descriptor: take all the system lets us have.
 void raiseDescriptorLimit() {
-  rlimit limit{};
-  if (getrlimit(RLIMIT_NOFILE, &limit) != 0) {
-    QRTLog(kLogError, "getrlimit(RLIMIT_NOFILE) failed: %s", strerror(errno));
-    return;
+  const platform::DescriptorLimit limit = platform::raiseDescriptorLimit();
+  if (limit.readFailed) {
+    QRTLog(kLogError, "getrlimit(RLIMIT_NOFILE) failed: %s", strerror(limit.error));
+  } else if (limit.error) {
+    QRTLog(kLogError, "Cannot raise RLIMIT_NOFILE to %llu: %s", static_cast<unsigned long long>(limit.hardLimit),
+           strerror(limit.error));
   }
-  if (limit.rlim_cur == limit.rlim_max) return;
-  limit.rlim_cur = limit.rlim_max;
-  if (setrlimit(RLIMIT_NOFILE, &limit) != 0)
-    QRTLog(kLogError, "Cannot raise RLIMIT_NOFILE to %llu: %s", static_cast<unsigned long long>(limit.rlim_max),
-           strerror(errno));
 }
 
 // One daemon per device root: a second one would run start-up work and
@@ -310,7 +306,7 @@ int QRTDaemonMain(int argc, char** argv) {
   // served, rather than staying in a thread's arena: the request budget then
   // bounds resident memory, not just what is in use. (Sanitizer allocators
   // refuse the setting.)
-  if (mallopt(M_MMAP_THRESHOLD, 256 * 1024) != 1) QRTLog(kLogDebug, "mallopt(M_MMAP_THRESHOLD) refused");
+  if (!platform::returnLargeAllocationsToSystem(256 * 1024)) QRTLog(kLogDebug, "mallopt(M_MMAP_THRESHOLD) refused");
 
   // Queue creation cannot fail here short of running out of memory, which
   // ends the process anyway; they are made now so that start-up work finds them.
