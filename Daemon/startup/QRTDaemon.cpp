@@ -25,6 +25,7 @@
 #include "platform/DeviceRoot.h"
 #include "platform/FirstBoot.h"
 #include "platform/HostProfile.h"
+#include "platform/InstanceLock.h"
 #include "platform/LockState.h"
 #include "platform/Log.h"
 #include "platform/ProcessLimits.h"
