@@ -124,7 +124,8 @@ void QRTCodeSigningMapping::performAllCodeSigningMigrationAndReconciliation() {
         QRTLog(kLogError, "Code signing migration failed: %@", error);
       }
     }
-    QRTGroupManager::defaultManager().reconcileGroupContainersOfType(QRTGroupTypeApplication);
+    QRTGroupManager::defaultManager().reconcileGroupContainersOfType(
+        QRTGroupTypeApplication, _onQueue_groupReferenceCounts(QRTGroupTypeApplication));
   });
 }
 
@@ -232,6 +233,10 @@ std::optional<QRTGroupReferenceCounts> QRTCodeSigningMapping::_onQueue_groupRefe
   std::optional<QRTGroupReferenceCounts>& counts = groupCounts_[type];
   if (!counts) counts = _onQueue_countGroupReferences(type);
   return counts;
+}
+
+std::optional<QRTGroupReferenceCounts> QRTCodeSigningMapping::groupReferenceCounts(QRTGroupType type) {
+  return onQueue([&] { return _onQueue_groupReferenceCounts(type); });
 }
 
 bool QRTCodeSigningMapping::groupReferenceCountsMatchDatabase() {
@@ -466,15 +471,21 @@ uint64_t QRTCodeSigningMapping::_onQueue_processCodeSigningInfo(const plist::Dic
       }
       std::optional<plist::Value> oldEntitlements = _onQueue_entitlementsCodeSigningEntry(stored, identifier);
       _onQueue_deleteSystemContainerIfWithdrawn(oldEntitlements, newEntitlements, identifier);
-      QRTGroupManager& groups = QRTGroupManager::defaultManager();
+      // The counts as they stand before the new entry is written.
+      auto dropGroups = [this](const QRTGroupList& before, const QRTGroupList& after, QRTGroupType type) {
+        const std::vector<std::string> dropped = QRTGroupManager::droppedGroups(before, after);
+        if (dropped.empty()) return;
+        QRTGroupManager::defaultManager().removeReferencesForGroupIdentifiers(dropped, type,
+                                                                              _onQueue_groupReferenceCounts(type));
+      };
       QRTGroupList newApp =
           _copyApplicationGroupEntitlementForIdentifier(identifier, newEntitlements, QRTApplicationGroupsEntitlement);
       QRTGroupList oldApp =
           _copyApplicationGroupEntitlementForIdentifier(identifier, oldEntitlements, QRTApplicationGroupsEntitlement);
-      if (oldApp || newApp) groups.handleChangeFromOldGroupContainerIds(oldApp, newApp, QRTGroupTypeApplication);
+      dropGroups(oldApp, newApp, QRTGroupTypeApplication);
       QRTGroupList newSystem = _systemGroupList(identifier, newEntitlements);
       QRTGroupList oldSystem = _withSystemGroupPrefix(_systemGroupList(identifier, oldEntitlements));
-      if (oldSystem || newSystem) groups.handleChangeFromOldGroupContainerIds(oldSystem, newSystem, QRTGroupTypeSystem);
+      dropGroups(oldSystem, newSystem, QRTGroupTypeSystem);
       values.push_back(codeSigningInfo ? std::move(entry) : QRTCodeSigningEntry());
       identifiers.push_back(identifier);
     }
