@@ -20,7 +20,6 @@ using platform::kLogNotice;
 namespace {
 
 constexpr const char* kSystemGroupPrefix = "systemgroup.";
-constexpr const char* kCachedEntitlementsKey = "Entitlements";
 // Every registration of a child reads its parent's whole child list, so the
 // list is bounded; no real program comes near it.
 constexpr size_t kMaxChildBundles = 1024;
@@ -279,26 +278,7 @@ std::optional<plist::Dictionary> QRTCodeSigningMapping::_onQueue_codeSigningInfo
     if (externalRequest && (entry->isPlaceholder() || entry->isInvalid())) return std::nullopt;
     return entry->codeSigningInfo;
   }
-  // Before the database, the installer cached the information in the bundle container.
-  QRTErrorRef lookupError;
-  QRTMetadataRef bundle = QRTContainerCache::sharedInstance().containerForUser(QRTInstallerUserId, QRTClassAppBundle,
-                                                                               identifier, false, &lookupError);
-  const plist::Value* cached =
-      bundle && bundle->info() ? plist::find(*bundle->info(), QRTCachedCodeSigningInfoKey) : nullptr;
-  if (!cached || !cached->dictionaryIf()) return std::nullopt;
-  plist::Dictionary info = cached->dictionary();
-  QRTLog(kLogNotice, "Migrating code signing info from bundle container upon request for %@", identifier);
-  if (const plist::Value* entitlements = plist::find(cached->dictionary(), kCachedEntitlementsKey)) {
-    info[QRTCodeSigningEntitlementsKey] = *entitlements;
-  } else {
-    info.erase(QRTCodeSigningEntitlementsKey);
-  }
-  QRTCodeSigningEntry migrated(info, QRTClassAppData);
-  QRTErrorRef addError;
-  if (!_onQueue_writeEntry(identifier, std::nullopt, &migrated, &addError)) {
-    QRTLog(kLogError, "Failed to write code signing info to DB for %@ : %@", identifier, addError);
-  }
-  return info;
+  return _onQueue_migrateCachedCodeSigningInfoFromBundleContainer(identifier);
 }
 
 std::optional<plist::Value> QRTCodeSigningMapping::_onQueue_entitlementsForIdentifier(const std::string& identifier) {

@@ -141,6 +141,10 @@ class QRTCodeSigningMapping {
   void _onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
   void _onQueue_migrateCachedCodeSigningInfoFromBundleContainersToMapping();
   bool _addMigratedEntry(const QRTCodeSigningEntry& entry, const std::string& identifier, QRTErrorRef* error);
+  // The read path's lazy import of what the installer cached in the bundle
+  // container, for an identifier the database does not hold.
+  std::optional<plist::Dictionary> _onQueue_migrateCachedCodeSigningInfoFromBundleContainer(
+      const std::string& identifier);
 
   std::shared_ptr<platform::Queue> codeSignQueue;
   std::unique_ptr<QRTSQLiteDB> codeSigningMappingDB;
