@@ -14,7 +14,7 @@
 #include "Daemon/codesign/QRTSQLiteDB.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/groups/QRTGroupManager.h"
-#include "Daemon/migration/QRTMigrationStatus.h"
+#include "Daemon/store/QRTMigrationStatus.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
