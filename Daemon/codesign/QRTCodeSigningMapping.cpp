@@ -8,6 +8,7 @@
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
+#include "Daemon/store/QRTEntitlementChecks.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTLocks.h"
 #include "Daemon/store/QRTMetadata.h"
@@ -18,6 +19,23 @@ using platform::kLogError;
 using platform::kLogNotice;
 
 namespace {
+
+// Without its database no program is known to hold a system container.
+bool mappingGrantsSystemContainer(const std::string& identifier) {
+  QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
+  return mapping && mapping->identifierHasSystemContainer(identifier);
+}
+
+QRTGroupList mappingSystemGroups(const std::string& identifier) {
+  QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
+  return mapping ? mapping->systemGroupIdentifiersForIdentifier(identifier) : std::nullopt;
+}
+
+// The store's entitlement checks are answered by the mapping from the start.
+[[maybe_unused]] const bool kEntitlementChecksInstalled = [] {
+  QRTInstallEntitlementChecks({&mappingGrantsSystemContainer, &mappingSystemGroups});
+  return true;
+}();
 
 constexpr const char* kSystemGroupPrefix = "systemgroup.";
 // Every registration of a child reads its parent's whole child list, so the

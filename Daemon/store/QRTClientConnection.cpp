@@ -7,9 +7,9 @@
 #include <iterator>
 
 #include "base/QRTUUID.h"
-#include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
+#include "Daemon/store/QRTEntitlementChecks.h"
 #include "Daemon/QRTCrashPoint.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
@@ -43,12 +43,6 @@ QRTClientConnection& QRTClientConnection::sharedClientConnection() {
 // The first-boot work (upgrade migration, system container installation,
 // transient and orphan clean-up) joins with those subsystems.
 namespace {
-
-// Without its database no program is known to hold a system container.
-bool codeSigningGrantsSystemContainer(const std::string& identifier) {
-  QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
-  return mapping && mapping->identifierHasSystemContainer(identifier);
-}
 
 constexpr const char* kDataSubDirectories[] = {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"};
 constexpr const char* kGroupSubDirectories[] = {"Library", "Library/Caches"};
@@ -198,7 +192,7 @@ QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(uint32_t user
            "to do this. File a Bugline in \"QuarterKit | all\"",
            clientBundleIdentifier_, static_cast<long>(containerClass), identifier);
   }
-  if (containerClass == 12 && !allowOtherIdLookup_ && (!codeSigningGrantsSystemContainer(*identifier) || foreign)) {
+  if (containerClass == 12 && !allowOtherIdLookup_ && (!QRTEntitlementsGrantSystemContainer(*identifier) || foreign)) {
     reportCode(QRT_ERROR(QRTErrorNotEntitled, nullptr, true, "%@ not entitled for system container with identifier %@",
                          clientBundleIdentifier_, identifier),
                withError);
