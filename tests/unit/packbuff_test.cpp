@@ -194,8 +194,7 @@ TEST(Packbuff, ReadBackKeysAndCursor) {
 
   sb_packbuff_set_size(in, copy.size() - 12);  // cut into the value string
   char* text = sb_packbuff_describe(in);
-  ASSERT_NE(text, nullptr);
-  std::string printed = text;
+  std::string printed = text ? text : "";
   free(text);
   EXPECT_NE(printed.find("`group.one'"), std::string::npos) << printed;
   EXPECT_NE(printed.find(">> item pointer exceeds end of buffer. <<"), std::string::npos) << printed;
