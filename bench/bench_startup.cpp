@@ -21,7 +21,7 @@
 #include <vector>
 
 #include "Daemon/codesign/QRTSQLiteDB.h"
-#include "Daemon/migration/QRTMigrationStatus.h"
+#include "Daemon/store/QRTMigrationStatus.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTMetadata.h"

@@ -21,7 +21,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   uint8_t* bytes = copy.empty() ? reinterpret_cast<uint8_t*>(&copy) : copy.data();
   sb_packbuff* pb = sb_packbuff_init_with_buffer(bytes, size, true, SB_PACKBUFF_DEALLOC_NONE);
   if (!pb) return 0;
-  sb_packbuff_print(pb);
+  free(sb_packbuff_describe(pb));
   uint16_t type = 0;
   int rc = 0;
   while (rc == 0 && sb_packbuff_get_item_value_type(pb, &type)) {

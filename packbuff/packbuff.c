@@ -120,7 +120,8 @@ void sb_packbuff_free(sb_packbuff* pb) {
     free(pb->item_buffer);
   } else if (pb->dealloc_type == SB_PACKBUFF_DEALLOC_REGION && pb->item_buffer) {
     if (munmap(pb->item_buffer, pb->bytes_allocated) != 0)
-      printf("munmap() of packbuff region %p (size %zu) failed\n", (void*)pb->item_buffer, pb->bytes_allocated);
+      fprintf(stderr, "munmap() of packbuff region %p (size %zu) failed\n", (void*)pb->item_buffer,
+              pb->bytes_allocated);
   }
   free(pb);
 }
@@ -294,57 +295,70 @@ static const char* dealloc_name(size_t type) {
   }
 }
 
-void sb_packbuff_print(const sb_packbuff* pb) {
-  printf("packbuff: %p\n", (const void*)pb);
+static void describe(FILE* out, const sb_packbuff* pb) {
+  fprintf(out, "packbuff: %p\n", (const void*)pb);
   if (!pb) return;
-  printf("  block_size:      %zu\n", pb->block_size);
-  printf("  dealloc_type:    %s\n", dealloc_name(pb->dealloc_type));
-  printf("  bytes_allocated: %zu\n", pb->bytes_allocated);
-  printf("  bytes_used:      %zu\n", pb->bytes_used);
-  printf("  bytes_remaining: %zu\n", pb->bytes_remaining);
-  printf("  item_buffer %p, item: %p\n", (void*)pb->item_buffer, (void*)pb->item);
-  printf("\n");
+  fprintf(out, "  block_size:      %zu\n", pb->block_size);
+  fprintf(out, "  dealloc_type:    %s\n", dealloc_name(pb->dealloc_type));
+  fprintf(out, "  bytes_allocated: %zu\n", pb->bytes_allocated);
+  fprintf(out, "  bytes_used:      %zu\n", pb->bytes_used);
+  fprintf(out, "  bytes_remaining: %zu\n", pb->bytes_remaining);
+  fprintf(out, "  item_buffer %p, item: %p\n", (void*)pb->item_buffer, (void*)pb->item);
+  fprintf(out, "\n");
   if (!pb->item_buffer) return;
   /* Walks only what is in use and in the allocation, whatever the lengths say. */
   size_t limit = pb->bytes_used < pb->bytes_allocated ? pb->bytes_used : pb->bytes_allocated;
   size_t off = 0;
   for (int index = 0;; ++index) {
     if (off > limit || limit - off < HEADER_SIZE) {
-      printf(">> item pointer exceeds end of buffer. <<\n");
+      fprintf(out, ">> item pointer exceeds end of buffer. <<\n");
       return;
     }
     const uint8_t* at = pb->item_buffer + off;
     const char* marker = at == pb->item ? "*" : " ";
     item_header h = read_header(at);
     if (h.item_type == SB_PACKBUFF_ITEM_END) {
-      printf("%s%3d: %p -- END\n", marker, index, (const void*)at);
+      fprintf(out, "%s%3d: %p -- END\n", marker, index, (const void*)at);
       return;
     }
-    printf("%s%3d:%p -- value type %u -- ", marker, index, (const void*)at, h.value_type);
+    fprintf(out, "%s%3d:%p -- value type %u -- ", marker, index, (const void*)at, h.value_type);
     uint64_t size = HEADER_SIZE;
     unsigned pad = (unsigned)pad_for(h.value);
     switch (h.item_type) {
-      case SB_PACKBUFF_ITEM_INLINE: printf("inline value: %u\n", h.value); break;
+      case SB_PACKBUFF_ITEM_INLINE: fprintf(out, "inline value: %u\n", h.value); break;
       case SB_PACKBUFF_ITEM_BYTES:
         size += (uint64_t)h.value + pad;
-        printf("bytes (%p, %u pad bytes, size: %u)\n", (const void*)(at + HEADER_SIZE), pad, h.value);
+        fprintf(out, "bytes (%p, %u pad bytes, size: %u)\n", (const void*)(at + HEADER_SIZE), pad, h.value);
         break;
       case SB_PACKBUFF_ITEM_STRING: {
         size += (uint64_t)h.value + pad;
-        printf("string (%p, %u pad bytes, size: %u): \n", (const void*)(at + HEADER_SIZE), pad, h.value);
+        fprintf(out, "string (%p, %u pad bytes, size: %u): \n", (const void*)(at + HEADER_SIZE), pad, h.value);
         size_t room = limit - off - HEADER_SIZE;
         size_t shown = h.value < room ? h.value : room;
         const void* nul = memchr(at + HEADER_SIZE, '\0', shown);
         if (nul) shown = (size_t)((const uint8_t*)nul - (at + HEADER_SIZE));
-        printf("     `%.*s'\n", (int)shown, (const char*)(at + HEADER_SIZE));
+        fprintf(out, "     `%.*s'\n", (int)shown, (const char*)(at + HEADER_SIZE));
         break;
       }
-      default: printf("*Unknown item type* %u\n", h.item_type); break;
+      default: fprintf(out, "*Unknown item type* %u\n", h.item_type); break;
     }
     if (off + size < off) {
-      printf(">> item pointer overflow. <<\n");
+      fprintf(out, ">> item pointer overflow. <<\n");
       return;
     }
     off += (size_t)size;
   }
+}
+
+char* sb_packbuff_describe(const sb_packbuff* pb) {
+  char* text = NULL;
+  size_t length = 0;
+  FILE* out = open_memstream(&text, &length);
+  if (!out) return NULL;
+  describe(out, pb);
+  if (fclose(out) != 0) {
+    free(text);
+    return NULL;
+  }
+  return text;
 }

@@ -65,7 +65,9 @@ const void* sb_packbuff_unpack_bytes(sb_packbuff* pb, size_t* length, int* error
 int sb_packbuff_unpack_key_with_string_value(sb_packbuff* pb, const char** key, uint16_t* value_type,
                                              const char** value, size_t* value_length);
 
-void sb_packbuff_print(const sb_packbuff* pb);
+// The buffer's fields and items as text, one line each, for diagnosis; the
+// caller frees it. NULL when out of memory.
+char* sb_packbuff_describe(const sb_packbuff* pb);
 
 #ifdef __cplusplus
 }

@@ -99,9 +99,4 @@ class RequestListener {
   std::unique_ptr<Impl> impl_;
 };
 
-// Takes an exclusive lock on path (created 0600, never through a symbolic
-// link) for the life of the process. The descriptor, or -1 with errno set
-// (EWOULDBLOCK: another process holds it).
-int acquireInstanceLock(const std::string& path);
-
 }  // namespace platform

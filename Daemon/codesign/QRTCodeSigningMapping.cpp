@@ -8,6 +8,7 @@
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
+#include "Daemon/store/QRTEntitlementChecks.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTLocks.h"
 #include "Daemon/store/QRTMetadata.h"
@@ -19,8 +20,24 @@ using platform::kLogNotice;
 
 namespace {
 
+// Without its database no program is known to hold a system container.
+bool mappingGrantsSystemContainer(const std::string& identifier) {
+  QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
+  return mapping && mapping->identifierHasSystemContainer(identifier);
+}
+
+QRTGroupList mappingSystemGroups(const std::string& identifier) {
+  QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
+  return mapping ? mapping->systemGroupIdentifiersForIdentifier(identifier) : std::nullopt;
+}
+
+// The store's entitlement checks are answered by the mapping from the start.
+[[maybe_unused]] const bool kEntitlementChecksInstalled = [] {
+  QRTInstallEntitlementChecks({&mappingGrantsSystemContainer, &mappingSystemGroups});
+  return true;
+}();
+
 constexpr const char* kSystemGroupPrefix = "systemgroup.";
-constexpr const char* kCachedEntitlementsKey = "Entitlements";
 // Every registration of a child reads its parent's whole child list, so the
 // list is bounded; no real program comes near it.
 constexpr size_t kMaxChildBundles = 1024;
@@ -124,7 +141,8 @@ void QRTCodeSigningMapping::performAllCodeSigningMigrationAndReconciliation() {
         QRTLog(kLogError, "Code signing migration failed: %@", error);
       }
     }
-    QRTGroupManager::defaultManager().reconcileGroupContainersOfType(QRTGroupTypeApplication);
+    QRTGroupManager::defaultManager().reconcileGroupContainersOfType(
+        QRTGroupTypeApplication, _onQueue_groupReferenceCounts(QRTGroupTypeApplication));
   });
 }
 
@@ -234,6 +252,10 @@ std::optional<QRTGroupReferenceCounts> QRTCodeSigningMapping::_onQueue_groupRefe
   return counts;
 }
 
+std::optional<QRTGroupReferenceCounts> QRTCodeSigningMapping::groupReferenceCounts(QRTGroupType type) {
+  return onQueue([&] { return _onQueue_groupReferenceCounts(type); });
+}
+
 bool QRTCodeSigningMapping::groupReferenceCountsMatchDatabase() {
   return onQueue([&] {
     for (QRTGroupType type : {QRTGroupTypeApplication, QRTGroupTypeSystem}) {
@@ -274,26 +296,7 @@ std::optional<plist::Dictionary> QRTCodeSigningMapping::_onQueue_codeSigningInfo
     if (externalRequest && (entry->isPlaceholder() || entry->isInvalid())) return std::nullopt;
     return entry->codeSigningInfo;
   }
-  // Before the database, the installer cached the information in the bundle container.
-  QRTErrorRef lookupError;
-  QRTMetadataRef bundle = QRTContainerCache::sharedInstance().containerForUser(QRTInstallerUserId, QRTClassAppBundle,
-                                                                               identifier, false, &lookupError);
-  const plist::Value* cached =
-      bundle && bundle->info() ? plist::find(*bundle->info(), QRTCachedCodeSigningInfoKey) : nullptr;
-  if (!cached || !cached->dictionaryIf()) return std::nullopt;
-  plist::Dictionary info = cached->dictionary();
-  QRTLog(kLogNotice, "Migrating code signing info from bundle container upon request for %@", identifier);
-  if (const plist::Value* entitlements = plist::find(cached->dictionary(), kCachedEntitlementsKey)) {
-    info[QRTCodeSigningEntitlementsKey] = *entitlements;
-  } else {
-    info.erase(QRTCodeSigningEntitlementsKey);
-  }
-  QRTCodeSigningEntry migrated(info, QRTClassAppData);
-  QRTErrorRef addError;
-  if (!_onQueue_writeEntry(identifier, std::nullopt, &migrated, &addError)) {
-    QRTLog(kLogError, "Failed to write code signing info to DB for %@ : %@", identifier, addError);
-  }
-  return info;
+  return _onQueue_migrateCachedCodeSigningInfoFromBundleContainer(identifier);
 }
 
 std::optional<plist::Value> QRTCodeSigningMapping::_onQueue_entitlementsForIdentifier(const std::string& identifier) {
@@ -466,15 +469,21 @@ uint64_t QRTCodeSigningMapping::_onQueue_processCodeSigningInfo(const plist::Dic
       }
       std::optional<plist::Value> oldEntitlements = _onQueue_entitlementsCodeSigningEntry(stored, identifier);
       _onQueue_deleteSystemContainerIfWithdrawn(oldEntitlements, newEntitlements, identifier);
-      QRTGroupManager& groups = QRTGroupManager::defaultManager();
+      // The counts as they stand before the new entry is written.
+      auto dropGroups = [this](const QRTGroupList& before, const QRTGroupList& after, QRTGroupType type) {
+        const std::vector<std::string> dropped = QRTGroupManager::droppedGroups(before, after);
+        if (dropped.empty()) return;
+        QRTGroupManager::defaultManager().removeReferencesForGroupIdentifiers(dropped, type,
+                                                                              _onQueue_groupReferenceCounts(type));
+      };
       QRTGroupList newApp =
           _copyApplicationGroupEntitlementForIdentifier(identifier, newEntitlements, QRTApplicationGroupsEntitlement);
       QRTGroupList oldApp =
           _copyApplicationGroupEntitlementForIdentifier(identifier, oldEntitlements, QRTApplicationGroupsEntitlement);
-      if (oldApp || newApp) groups.handleChangeFromOldGroupContainerIds(oldApp, newApp, QRTGroupTypeApplication);
+      dropGroups(oldApp, newApp, QRTGroupTypeApplication);
       QRTGroupList newSystem = _systemGroupList(identifier, newEntitlements);
       QRTGroupList oldSystem = _withSystemGroupPrefix(_systemGroupList(identifier, oldEntitlements));
-      if (oldSystem || newSystem) groups.handleChangeFromOldGroupContainerIds(oldSystem, newSystem, QRTGroupTypeSystem);
+      dropGroups(oldSystem, newSystem, QRTGroupTypeSystem);
       values.push_back(codeSigningInfo ? std::move(entry) : QRTCodeSigningEntry());
       identifiers.push_back(identifier);
     }

@@ -64,15 +64,14 @@ class QRTCodeSigningMapping {
   QRTGroupList appGroupIdentifiersForIdentifier(const std::string& identifier);
   QRTGroupList systemGroupIdentifiersForIdentifier(const std::string& identifier);
 
-  // Must be called on the queue (the group manager's counting runs there).
+  // Must be called on the queue.
   void iterateGroupIdsWithKey(
       const std::string& key, const std::optional<std::string>& fallBackKey,
       const std::function<void(const std::string& identifier, const QRTGroupList& groups)>& block);
 
   // How many stored programs (invalid and placeholder ones included) name
-  // each group of the type. Counted from the database at the first need,
-  // then kept up to date by every write of an entry. Call on the queue.
-  std::optional<QRTGroupReferenceCounts> _onQueue_groupReferenceCounts(QRTGroupType type);
+  // each group of the type, as handed to the group manager (tests).
+  std::optional<QRTGroupReferenceCounts> groupReferenceCounts(QRTGroupType type);
   // Whether the kept counts of both types equal a fresh count (tests).
   bool groupReferenceCountsMatchDatabase();
 
@@ -112,6 +111,10 @@ class QRTCodeSigningMapping {
   // counts follow the database. No wanted entry deletes the stored one.
   bool _onQueue_writeEntry(const std::string& identifier, const std::optional<QRTCodeSigningEntry>& stored,
                            const QRTCodeSigningEntry* wanted, QRTErrorRef* error);
+  // How many stored programs (invalid and placeholder ones included) name
+  // each group of the type. Counted from the database at the first need,
+  // then kept up to date by every write of an entry.
+  std::optional<QRTGroupReferenceCounts> _onQueue_groupReferenceCounts(QRTGroupType type);
   QRTGroupList _groupsOfEntry(const QRTCodeSigningEntry& entry, const std::string& identifier, QRTGroupType type);
   std::optional<QRTGroupReferenceCounts> _onQueue_countGroupReferences(QRTGroupType type);
 
@@ -138,6 +141,10 @@ class QRTCodeSigningMapping {
   void _onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
   void _onQueue_migrateCachedCodeSigningInfoFromBundleContainersToMapping();
   bool _addMigratedEntry(const QRTCodeSigningEntry& entry, const std::string& identifier, QRTErrorRef* error);
+  // The read path's lazy import of what the installer cached in the bundle
+  // container, for an identifier the database does not hold.
+  std::optional<plist::Dictionary> _onQueue_migrateCachedCodeSigningInfoFromBundleContainer(
+      const std::string& identifier);
 
   std::shared_ptr<platform::Queue> codeSignQueue;
   std::unique_ptr<QRTSQLiteDB> codeSigningMappingDB;

@@ -14,7 +14,7 @@
 #include "Daemon/codesign/QRTSQLiteDB.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/groups/QRTGroupManager.h"
-#include "Daemon/migration/QRTMigrationStatus.h"
+#include "Daemon/store/QRTMigrationStatus.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
@@ -329,4 +329,30 @@ void QRTCodeSigningMapping::_onQueue_migrateCachedCodeSigningInfoFromBundleConta
     }
   }
   if (status) status->setMigrationCompleteForType(QRTMigrationTypeCodeSigning);
+}
+
+// Before the database, the installer cached the information in the bundle
+// container: an entry missing from the database is taken from there, once,
+// when first asked for.
+std::optional<plist::Dictionary> QRTCodeSigningMapping::_onQueue_migrateCachedCodeSigningInfoFromBundleContainer(
+    const std::string& identifier) {
+  QRTErrorRef lookupError;
+  QRTMetadataRef bundle = QRTContainerCache::sharedInstance().containerForUser(QRTInstallerUserId, QRTClassAppBundle,
+                                                                               identifier, false, &lookupError);
+  const plist::Value* cached =
+      bundle && bundle->info() ? plist::find(*bundle->info(), QRTCachedCodeSigningInfoKey) : nullptr;
+  if (!cached || !cached->dictionaryIf()) return std::nullopt;
+  plist::Dictionary info = cached->dictionary();
+  QRTLog(kLogNotice, "Migrating code signing info from bundle container upon request for %@", identifier);
+  if (const plist::Value* entitlements = plist::find(cached->dictionary(), kCachedEntitlementsKey)) {
+    info[QRTCodeSigningEntitlementsKey] = *entitlements;
+  } else {
+    info.erase(QRTCodeSigningEntitlementsKey);
+  }
+  QRTCodeSigningEntry migrated(info, QRTClassAppData);
+  QRTErrorRef addError;
+  if (!_onQueue_writeEntry(identifier, std::nullopt, &migrated, &addError)) {
+    QRTLog(kLogError, "Failed to write code signing info to DB for %@ : %@", identifier, addError);
+  }
+  return info;
 }

@@ -1,10 +1,7 @@
 #include "Daemon/dataprotection/QRTApplicationTerminationAssertion.h"
 
-#include <semaphore.h>
-
 #include <atomic>
-#include <cerrno>
-#include <cstring>
+#include <semaphore>
 
 #include "platform/Log.h"
 
@@ -25,12 +22,8 @@ uint8_t platformReason(uint8_t reason) {
 
 // The semaphore and the outcome outlive this call when the callback comes late.
 struct Acquisition {
-  sem_t semaphore;
-  bool made = false;
+  std::binary_semaphore done{0};
   std::atomic<bool> failed{false};
-  ~Acquisition() {
-    if (made) sem_destroy(&semaphore);
-  }
 };
 
 }  // namespace
@@ -38,24 +31,19 @@ struct Acquisition {
 std::shared_ptr<QRTApplicationTerminationAssertion> QRTApplicationTerminationAssertion::initWithBundleIdentifier(
     const std::string& identifier, uint8_t reason) {
   auto acquisition = std::make_shared<Acquisition>();
-  if (sem_init(&acquisition->semaphore, 0, 0) != 0) {
-    QRTLog(kLogError, "Failed to create completion semaphore: %s", strerror(errno));
-    return nullptr;
-  }
-  acquisition->made = true;
   auto assertion = platform::TerminationAssertion::make(
       identifier, platformReason(reason), [acquisition, identifier](const std::optional<std::string>& error) {
         if (error) {
           QRTLog(kLogError, "Failed to acquire termination assertion for %@ : %@", identifier, *error);
           acquisition->failed = true;
         }
-        sem_post(&acquisition->semaphore);
+        acquisition->done.release();
       });
   if (!assertion) {
     QRTLog(kLogError, "Failed to get Ravelhold");
     return nullptr;
   }
-  while (sem_wait(&acquisition->semaphore) != 0 && errno == EINTR) {}
+  acquisition->done.acquire();
   if (acquisition->failed) {
     assertion->invalidate();
     return nullptr;

@@ -11,7 +11,7 @@
 #include <vector>
 
 #include "Daemon/QRTCrashPoint.h"
-#include "Daemon/QRTDaemon.h"
+#include "Daemon/QRTProcessWide.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTContentClass.h"

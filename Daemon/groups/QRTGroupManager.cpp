@@ -3,12 +3,10 @@
 #include <algorithm>
 
 #include "Daemon/QRTError.h"
-#include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
-#include "Daemon/store/QRTLocks.h"
 #include "Daemon/store/QRTMetadata.h"
 #include "Daemon/store/QRTPerUserConfiguration.h"
 #include "platform/DeviceProperties.h"
@@ -35,16 +33,6 @@ void stageGroupContainer(const QRTMetadataRef& container, uint32_t user) {
   }
 }
 
-// Error 11, in the caller's name, when there is no identifier.
-bool identifierGiven(const char* function, uint32_t userId, const std::optional<std::string>& identifier,
-                     uint64_t* withError) {
-  if (identifier) return true;
-  QRTErrorRef error = QRTCreateError(function, __LINE__, QRTErrorDomain, QRTErrorInvalidParameter, nullptr, nullptr,
-                                     true, "Can't act on an invalid object: userId: %u, ID: %@", userId, identifier);
-  if (withError) *withError = error->resultCode();
-  return false;
-}
-
 }  // namespace
 
 QRTGroupManager& QRTGroupManager::defaultManager() {
@@ -52,28 +40,19 @@ QRTGroupManager& QRTGroupManager::defaultManager() {
   return *manager;
 }
 
-std::optional<QRTGroupManager::ReferenceCounts> QRTGroupManager::_copyReferenceCountSetOfType(QRTGroupType type) {
-  QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
-  if (!mapping) return std::nullopt;
-  return mapping->_onQueue_groupReferenceCounts(type);
-}
-
-void QRTGroupManager::handleChangeFromOldGroupContainerIds(
-    const std::optional<std::vector<std::string>>& oldIds,
-    const std::optional<std::vector<std::string>>& toNewGroupContainerIds, QRTGroupType ofType) {
-  if (oldIds == toNewGroupContainerIds || !oldIds) return;
+std::vector<std::string> QRTGroupManager::droppedGroups(const std::optional<std::vector<std::string>>& oldIds,
+                                                        const std::optional<std::vector<std::string>>& newIds) {
   std::vector<std::string> removed;
+  if (oldIds == newIds || !oldIds) return removed;
   for (const std::string& id : *oldIds) {
-    if (!toNewGroupContainerIds || std::find(toNewGroupContainerIds->begin(), toNewGroupContainerIds->end(), id) ==
-                                       toNewGroupContainerIds->end()) {
-      removed.push_back(id);
-    }
+    if (!newIds || std::find(newIds->begin(), newIds->end(), id) == newIds->end()) removed.push_back(id);
   }
-  if (!removed.empty()) _removeReferenceForGroupIdentifiers(removed, ofType);
+  return removed;
 }
 
-void QRTGroupManager::_removeReferenceForGroupIdentifiers(const std::vector<std::string>& removed, QRTGroupType type) {
-  std::optional<ReferenceCounts> counts = _copyReferenceCountSetOfType(type);
+void QRTGroupManager::removeReferencesForGroupIdentifiers(const std::vector<std::string>& removed, QRTGroupType type,
+                                                          const std::optional<ReferenceCounts>& counts) {
+  if (removed.empty()) return;
   if (!counts) {
     QRTLog(kLogError, "Failed to get reference count information for group type: %ld", static_cast<long>(type));
     return;
@@ -109,8 +88,7 @@ void QRTGroupManager::_removeGroupContainersIfNeededforUser(uint32_t user, uint6
   }
 }
 
-void QRTGroupManager::reconcileGroupContainersOfType(QRTGroupType type) {
-  std::optional<ReferenceCounts> counts = _copyReferenceCountSetOfType(type);
+void QRTGroupManager::reconcileGroupContainersOfType(QRTGroupType type, const std::optional<ReferenceCounts>& counts) {
   if (!counts) {
     QRTLog(kLogError, "Failed to get reference count information for group type: %ld", static_cast<long>(type));
     return;
@@ -137,65 +115,4 @@ void QRTGroupManager::_cleanupUnreferencedGroupContainersForUser(uint32_t user, 
     QRTLog(kLogError, "Removing group container with identifier %@ for %u", container->identifier(), user);
     stageGroupContainer(container, user);
   }
-}
-
-std::optional<std::map<std::string, std::string>> QRTGroupManager::groupContainerPathsForUser(
-    uint32_t userId, QRTClientConnection& clientConnection, const std::optional<std::string>& identifier,
-    uint64_t* withError) {
-  if (!identifierGiven(__func__, userId, identifier, withError)) return std::nullopt;
-  std::optional<std::map<std::string, std::string>> paths;
-  auto body = [&] {
-    QRTAllIdentifiersLock lock(true);
-    const bool system = userId == QRTSystemContainerUserId;
-    const uint64_t groupClass = system ? QRTClassSystemGroup : QRTClassAppGroup;
-    QRTGroupList groups;
-    if (QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance()) {
-      groups = system ? mapping->systemGroupIdentifiersForIdentifier(*identifier)
-                      : mapping->appGroupIdentifiersForIdentifier(*identifier);
-    }
-    if (identifier != clientConnection.clientBundleIdentifier() && !clientConnection.allowOtherIdLookup() &&
-        platform::deviceIsInternalBuild()) {
-      QRTLog(kLogDebug,
-             "%@ trying to retrieve group containers of class %ld for identifier: %@. WARNING: Soon you will need an "
-             "entitlement to do this. File a Bugline in \"QuarterKit | all\"",
-             clientConnection.clientBundleIdentifier(), static_cast<long>(groupClass), identifier);
-    }
-    clientConnection.setAllowGroupIdLookup(true);
-    std::map<std::string, std::string> found;
-    for (const std::string& group : groups ? *groups : std::vector<std::string>{}) {
-      uint64_t code = QRTErrorNone;
-      QRTMetadataRef container = clientConnection.createOrLookupContainerForUser(
-          {userId, groupClass, group}, QRTCreateMode::CreateIfMissing, QRTLocking::CallerHoldsLocks, &code);
-      if (!container) {
-        QRTLog(kLogError, "Failed to create or lookup group container-userId: %u, ID: %@ : %llu", userId, group,
-               static_cast<unsigned long long>(code));
-        continue;
-      }
-      found[group] = container->url().path();
-    }
-    paths = std::move(found);
-  };
-  QRTErrorRef failure = QRT_GUARD(body);
-  if (failure) {
-    if (withError) *withError = failure->resultCode();
-    return std::nullopt;
-  }
-  return paths;
-}
-
-std::optional<std::vector<std::string>> QRTGroupManager::groupContainerIdentifiersForUser(
-    uint32_t userId, const std::optional<std::string>& identifier, uint64_t* withError) {
-  if (!identifierGiven(__func__, userId, identifier, withError)) return std::nullopt;
-  std::optional<std::vector<std::string>> identifiers;
-  QRTErrorRef failure = QRT_GUARD([&] {
-    QRTAllIdentifiersLock lock(true);
-    QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
-    QRTGroupList groups = mapping ? mapping->appGroupIdentifiersForIdentifier(*identifier) : std::nullopt;
-    identifiers = groups ? std::move(*groups) : std::vector<std::string>{};
-  });
-  if (failure) {
-    if (withError) *withError = failure->resultCode();
-    return std::nullopt;
-  }
-  return identifiers;
 }

@@ -1,6 +1,7 @@
 // Group containers (class 7, per user) and system group containers (class
 // 13, user 499) live while a stored program's entitlements name their group.
-// No count is stored: each change counts the names again from the mapping.
+// The group manager keeps no count: the code-signing mapping counts the
+// names and hands the counts over with each change.
 #pragma once
 
 #include <cstdint>
@@ -17,16 +18,22 @@ class QRTGroupManager {
  public:
   static QRTGroupManager& defaultManager();
 
-  // Called on the code-signing queue, under the all-identifiers lock, before
-  // the program's new entry is stored: a group the program drops goes to
-  // death row when the program was the last to name it.
-  void handleChangeFromOldGroupContainerIds(const std::optional<std::vector<std::string>>& oldIds,
-                                            const std::optional<std::vector<std::string>>& toNewGroupContainerIds,
-                                            QRTGroupType ofType);
-  // Sends every group container that no stored program names to death row.
-  void reconcileGroupContainersOfType(QRTGroupType type);
+  using ReferenceCounts = std::map<std::string, int64_t>;
 
-  // Group identifier to container path, the containers made on demand.
+  // The groups of oldIds that newIds no longer names.
+  static std::vector<std::string> droppedGroups(const std::optional<std::vector<std::string>>& oldIds,
+                                                const std::optional<std::vector<std::string>>& newIds);
+  // Called on the code-signing queue, under the all-identifiers lock, before
+  // the program's new entry is stored, with the counts as they stand then
+  // (nothing when they could not be had): a group the program drops goes to
+  // death row when the program was the last to name it.
+  void removeReferencesForGroupIdentifiers(const std::vector<std::string>& removed, QRTGroupType type,
+                                           const std::optional<ReferenceCounts>& counts);
+  // Sends every group container that the counts do not name to death row.
+  void reconcileGroupContainersOfType(QRTGroupType type, const std::optional<ReferenceCounts>& counts);
+
+  // Group identifier to container path, the containers made on demand
+  // (QRTEntitledGroupContainers.cpp, with the mapping).
   std::optional<std::map<std::string, std::string>> groupContainerPathsForUser(
       uint32_t userId, QRTClientConnection& clientConnection, const std::optional<std::string>& identifier,
       uint64_t* withError);
@@ -35,11 +42,7 @@ class QRTGroupManager {
                                                                            uint64_t* withError);
 
  private:
-  using ReferenceCounts = std::map<std::string, int64_t>;
-
   QRTGroupManager() = default;
-  std::optional<ReferenceCounts> _copyReferenceCountSetOfType(QRTGroupType type);
-  void _removeReferenceForGroupIdentifiers(const std::vector<std::string>& removed, QRTGroupType ofType);
   // Works on its own copy of the counts.
   void _removeGroupContainersIfNeededforUser(uint32_t user, uint64_t groupContainerClass,
                                              const std::vector<std::string>& identifiers,

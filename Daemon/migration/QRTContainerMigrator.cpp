@@ -5,10 +5,10 @@
 #include <optional>
 
 #include "Daemon/QRTCrashPoint.h"
-#include "Daemon/QRTDaemon.h"
+#include "Daemon/QRTProcessWide.h"
 #include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/fileops/QRTFileManager.h"
-#include "Daemon/migration/QRTMigrationStatus.h"
+#include "Daemon/store/QRTMigrationStatus.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"

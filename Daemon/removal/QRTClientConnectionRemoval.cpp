@@ -12,7 +12,7 @@
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTCrashPoint.h"
-#include "Daemon/QRTDaemon.h"
+#include "Daemon/QRTProcessWide.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTLocks.h"

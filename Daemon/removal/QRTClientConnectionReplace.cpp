@@ -10,7 +10,6 @@
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTCrashPoint.h"
-#include "Daemon/QRTDaemon.h"
 #include "Daemon/dataprotection/QRTDataProtectionManager.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
@@ -21,46 +20,6 @@
 #include "platform/DeviceRoot.h"
 #include "platform/Log.h"
 #include "Daemon/store/QRTClientConnectionInternal.h"
-
-namespace {
-// A replace whose old container could not be moved back out of staging keeps
-// its journal; staging must then survive until a later start completes it.
-bool gReplaceRecoveryIncomplete = false;
-}  // namespace
-
-void QRTClientConnection::quarterSetup() {
-  // Before quarterCleanup empties staging: a rollback moves a container back out of it.
-  QRTErrorRef error;
-  if (!_recoverFromReplaceOperationsWithError(&error)) {
-    QRTLog(platform::kLogError, "Failed recovering from replace operations: %@", error);
-    gReplaceRecoveryIncomplete = true;
-  }
-  QRTErrorRef protectionError;
-  if (!QRTDataProtectionManager::defaultManager().restartPendingDataProtectionOperationsWithError(&protectionError)) {
-    QRTLog(platform::kLogError, "Failed restarting pending data protection operations: %@", protectionError);
-  }
-}
-
-void QRTClientConnection::quarterCleanup() {
-  QRTGlobalConfiguration& configuration = QRTGlobalConfiguration::sharedInstance();
-  configuration.loadUsersWithLeftovers();
-  if (gReplaceRecoveryIncomplete) {
-    deleteContainersOnDeathRowWithCompletion(nullptr);
-    return;
-  }
-  configuration.getPerUserConfigurationForCurrentMobileUser();  // its base's staging is looked at too
-  for (const QRTURL& staging : configuration.allStagingDirectories()) {
-    QRTErrorRef error;
-    auto items = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(staging, &error);
-    if (!items && !(error->domain() == QRTPOSIXErrorDomain && error->code() == ENOENT)) {
-      QRTLog(platform::kLogError, "Failed to get items at staging URL%@ : %@", staging, error);
-    }
-    for (const QRTURL& item : items.value_or(std::vector<QRTURL>{})) {
-      _moveItemAtURLToDeathRow(item, true, false, nullptr);
-    }
-  }
-  deleteContainersOnDeathRowWithCompletion(nullptr);
-}
 
 // ---- Replace ----
 // A journal written before the first move lets the start-up recovery put the

@@ -7,11 +7,10 @@
 #include <iterator>
 
 #include "base/QRTUUID.h"
-#include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
+#include "Daemon/store/QRTEntitlementChecks.h"
 #include "Daemon/QRTCrashPoint.h"
-#include "Daemon/QRTDaemon.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTLocks.h"
@@ -44,12 +43,6 @@ QRTClientConnection& QRTClientConnection::sharedClientConnection() {
 // The first-boot work (upgrade migration, system container installation,
 // transient and orphan clean-up) joins with those subsystems.
 namespace {
-
-// Without its database no program is known to hold a system container.
-bool codeSigningGrantsSystemContainer(const std::string& identifier) {
-  QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
-  return mapping && mapping->identifierHasSystemContainer(identifier);
-}
 
 constexpr const char* kDataSubDirectories[] = {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"};
 constexpr const char* kGroupSubDirectories[] = {"Library", "Library/Caches"};
@@ -204,7 +197,7 @@ QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(const QRTCont
            clientBundleIdentifier_, static_cast<long>(containerClass), identifier);
   }
   if (containerClass == QRTClassSystemData && !allowOtherIdLookup_ &&
-      (!codeSigningGrantsSystemContainer(*identifier) || foreign)) {
+      (!QRTEntitlementsGrantSystemContainer(*identifier) || foreign)) {
     reportCode(QRT_ERROR(QRTErrorNotEntitled, nullptr, true, "%@ not entitled for system container with identifier %@",
                          clientBundleIdentifier_, identifier),
                withError);

@@ -12,12 +12,12 @@
 #include <thread>
 
 #include "Daemon/QRTError.h"
-#include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTClientConnectionInternal.h"
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
+#include "Daemon/store/QRTEntitlementChecks.h"
 #include "Daemon/store/QRTLocks.h"
 #include "Daemon/store/QRTMetadata.h"
 #include "platform/DeviceProperties.h"
@@ -213,10 +213,8 @@ std::optional<QRTURL> QRTClientConnection::stageSharedContentForIdentifier(
       return fail(QRT_ERROR(QRTErrorInvalidArgument, nullptr, true, "Paths can't contain dots. source: %@, dest: %@",
                             sourceRelativePath, destRelativePath));
     }
-    QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
-    QRTGroupList groups;
-    if (mapping && clientBundleIdentifier_)
-      groups = mapping->systemGroupIdentifiersForIdentifier(*clientBundleIdentifier_);
+    std::optional<std::vector<std::string>> groups;
+    if (clientBundleIdentifier_) groups = QRTEntitledSystemGroups(*clientBundleIdentifier_);
     if (!groups || std::find(groups->begin(), groups->end(), *identifier) == groups->end()) {
       return fail(QRT_ERROR(QRTErrorNotEntitled, nullptr, true, "%@ not entitled for system group container %@",
                             clientBundleIdentifier_, identifier));

@@ -10,7 +10,6 @@
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTCrashPoint.h"
-#include "Daemon/QRTDaemon.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTLocks.h"
@@ -231,32 +230,6 @@ void QRTClientConnection::regenerateDirectoryUUIDForUser(uint32_t userId,
       }
     }
   } catch (...) { reportCode(QRT_EXCEPTION_ERROR(), withError); }
-}
-
-void QRTClientConnection::_regenerateAllSystemContainerPaths() {
-  QRTLog(platform::kLogNotice, "Rolling system container directory UUIDs on disk");
-  for (uint64_t containerClass : {uint64_t{QRTClassSystemData}, uint64_t{QRTClassSystemGroup}}) {
-    QRTErrorRef error;
-    auto list = QRTContainerCache::sharedInstance().allContainersForUser(QRTSystemContainerUserId, containerClass,
-                                                                         false, false, &error);
-    if (!list) {
-      QRTLog(platform::kLogError, "Failed to get list of system containers for migration: %@", error);
-      continue;
-    }
-    for (const auto& metadata : *list) {
-      const std::string& identifier = metadata->identifier();
-      if (QRTWhitelist::sharedWhitelist().containerIdIsWellknown(identifier, containerClass) ||
-          identifier == "systemgroup.com.norvane.diagvault") {
-        continue;
-      }
-      uint64_t code = QRTErrorNone;
-      regenerateDirectoryUUIDForUser(QRTSystemContainerUserId, metadata->uuid(), identifier, containerClass, &code);
-      if (code != QRTErrorNone) {
-        QRTLog(platform::kLogError, "Failed to regenerate directory UUID for identifier: %@, class: %llu", identifier,
-               static_cast<unsigned long long>(containerClass));
-      }
-    }
-  }
 }
 
 uint64_t QRTClientConnection::diskUsageForUserId(uint32_t userId, const std::optional<QRTUUID>& uuid,

@@ -104,9 +104,10 @@ TEST_F(GroupRefcountTest, ReorderingOrRepeatingChangesNothing) {
   ASSERT_EQ(registerGroups("com.example.order", {"group.order.a", "group.order.b"}), 1u);
   EXPECT_EQ(mapping().generation(), before);  // the same registration writes nothing
   ASSERT_EQ(registerGroups("com.example.order", {"group.order.b", "group.order.a", "group.order.b"}), 1u);
-  QRTGroupManager::defaultManager().handleChangeFromOldGroupContainerIds(
-      std::vector<std::string>{"group.order.a", "group.order.b"},
-      std::vector<std::string>{"group.order.b", "group.order.a"}, QRTGroupTypeApplication);
+  QRTGroupManager::defaultManager().removeReferencesForGroupIdentifiers(
+      QRTGroupManager::droppedGroups(std::vector<std::string>{"group.order.a", "group.order.b"},
+                                     std::vector<std::string>{"group.order.b", "group.order.a"}),
+      QRTGroupTypeApplication, mapping().groupReferenceCounts(QRTGroupTypeApplication));
   EXPECT_TRUE(present("group.order.a"));
   EXPECT_TRUE(present("group.order.b"));
 }

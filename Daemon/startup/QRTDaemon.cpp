@@ -1,11 +1,9 @@
-#include "Daemon/QRTDaemon.h"
+#include "Daemon/startup/QRTDaemon.h"
 
 #include <limits.h>
-#include <malloc.h>
 #include <signal.h>
 #include <stdlib.h>
 #include <string.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <syslog.h>
 
@@ -18,6 +16,7 @@
 #include <string>
 #include <vector>
 
+#include "Daemon/QRTProcessWide.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/requests/QRTRequestDispatcher.h"
@@ -26,8 +25,10 @@
 #include "platform/DeviceRoot.h"
 #include "platform/FirstBoot.h"
 #include "platform/HostProfile.h"
+#include "platform/InstanceLock.h"
 #include "platform/LockState.h"
 #include "platform/Log.h"
+#include "platform/ProcessLimits.h"
 #include "platform/RequestSocket.h"
 #include "platform/SafePath.h"
 #include "platform/ServiceManager.h"
@@ -36,19 +37,6 @@
 using platform::kLogDebug;
 using platform::kLogError;
 using platform::kLogNotice;
-
-uint32_t gQRTLogFileCount = 1;
-
-platform::Queue& QRTDeathRowQueue() {
-  static std::shared_ptr<platform::Queue> queue =
-      platform::makeSerialQueue("com.norvane.quarterd.deathrow", platform::QueuePriority::Background);
-  return *queue;
-}
-
-platform::Queue& QRTLockStateQueue() {
-  static std::shared_ptr<platform::Queue> queue = platform::makeSerialQueue("com.norvane.quarterd.lockstate");
-  return *queue;
-}
 
 namespace {
 
@@ -173,16 +161,13 @@ std::vector<platform::HostProfileLine> setUpHostProfile() {
 
 // Every connection costs a descriptor: take all the system lets us have.
 void raiseDescriptorLimit() {
-  rlimit limit{};
-  if (getrlimit(RLIMIT_NOFILE, &limit) != 0) {
-    QRTLog(kLogError, "getrlimit(RLIMIT_NOFILE) failed: %s", strerror(errno));
-    return;
+  const platform::DescriptorLimit limit = platform::raiseDescriptorLimit();
+  if (limit.readFailed) {
+    QRTLog(kLogError, "getrlimit(RLIMIT_NOFILE) failed: %s", strerror(limit.error));
+  } else if (limit.error) {
+    QRTLog(kLogError, "Cannot raise RLIMIT_NOFILE to %llu: %s", static_cast<unsigned long long>(limit.hardLimit),
+           strerror(limit.error));
   }
-  if (limit.rlim_cur == limit.rlim_max) return;
-  limit.rlim_cur = limit.rlim_max;
-  if (setrlimit(RLIMIT_NOFILE, &limit) != 0)
-    QRTLog(kLogError, "Cannot raise RLIMIT_NOFILE to %llu: %s", static_cast<unsigned long long>(limit.rlim_max),
-           strerror(errno));
 }
 
 // One daemon per device root: a second one would run start-up work and
@@ -241,14 +226,6 @@ void stopListener() {
 }
 
 }  // namespace
-
-void run_async_with_transaction(platform::Queue& queue, platform::Work work) {
-  platform::transactionBegin();
-  queue.async([work = std::move(work)] {
-    work();
-    platform::transactionEnd();
-  });
-}
 
 void lock_state_notification_callback() {
   int state = platform::deviceLockState();
@@ -330,7 +307,7 @@ int QRTDaemonMain(int argc, char** argv) {
   // served, rather than staying in a thread's arena: the request budget then
   // bounds resident memory, not just what is in use. (Sanitizer allocators
   // refuse the setting.)
-  if (mallopt(M_MMAP_THRESHOLD, 256 * 1024) != 1) QRTLog(kLogDebug, "mallopt(M_MMAP_THRESHOLD) refused");
+  if (!platform::returnLargeAllocationsToSystem(256 * 1024)) QRTLog(kLogDebug, "mallopt(M_MMAP_THRESHOLD) refused");
 
   // Queue creation cannot fail here short of running out of memory, which
   // ends the process anyway; they are made now so that start-up work finds them.

@@ -1,4 +1,4 @@
-#include "Daemon/migration/QRTMigrationStatus.h"
+#include "Daemon/store/QRTMigrationStatus.h"
 
 #include <cerrno>
 #include <ctime>

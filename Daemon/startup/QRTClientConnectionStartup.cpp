@@ -1,7 +1,8 @@
-// The work of the first start after a boot: upgrade migrations, system
-// containers restored from a backup, and clearing what no container owns.
-// Nothing here stops the daemon from starting: failures are logged and the
-// next step runs.
+// The start-up work of the store: set-up and clean-up at every start, and
+// the work of the first start after a boot (upgrade migrations, system
+// container paths made anew, system containers restored from a backup, and
+// clearing what no container owns). Nothing here stops the daemon from
+// starting: failures are logged and the next step runs.
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -10,10 +11,12 @@
 #include <cstring>
 
 #include "Daemon/QRTCrashPoint.h"
+#include "Daemon/dataprotection/QRTDataProtectionManager.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/migration/QRTContainerMigrator.h"
-#include "Daemon/migration/QRTMigrationStatus.h"
+#include "Daemon/store/QRTMigrationStatus.h"
 #include "Daemon/store/QRTClientConnection.h"
+#include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTMetadata.h"
@@ -25,6 +28,46 @@
 #include "platform/SafePath.h"
 
 using platform::kLogError;
+
+namespace {
+// A replace whose old container could not be moved back out of staging keeps
+// its journal; staging must then survive until a later start completes it.
+bool gReplaceRecoveryIncomplete = false;
+}  // namespace
+
+void QRTClientConnection::quarterSetup() {
+  // Before quarterCleanup empties staging: a rollback moves a container back out of it.
+  QRTErrorRef error;
+  if (!_recoverFromReplaceOperationsWithError(&error)) {
+    QRTLog(platform::kLogError, "Failed recovering from replace operations: %@", error);
+    gReplaceRecoveryIncomplete = true;
+  }
+  QRTErrorRef protectionError;
+  if (!QRTDataProtectionManager::defaultManager().restartPendingDataProtectionOperationsWithError(&protectionError)) {
+    QRTLog(platform::kLogError, "Failed restarting pending data protection operations: %@", protectionError);
+  }
+}
+
+void QRTClientConnection::quarterCleanup() {
+  QRTGlobalConfiguration& configuration = QRTGlobalConfiguration::sharedInstance();
+  configuration.loadUsersWithLeftovers();
+  if (gReplaceRecoveryIncomplete) {
+    deleteContainersOnDeathRowWithCompletion(nullptr);
+    return;
+  }
+  configuration.getPerUserConfigurationForCurrentMobileUser();  // its base's staging is looked at too
+  for (const QRTURL& staging : configuration.allStagingDirectories()) {
+    QRTErrorRef error;
+    auto items = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(staging, &error);
+    if (!items && !(error->domain() == QRTPOSIXErrorDomain && error->code() == ENOENT)) {
+      QRTLog(platform::kLogError, "Failed to get items at staging URL%@ : %@", staging, error);
+    }
+    for (const QRTURL& item : items.value_or(std::vector<QRTURL>{})) {
+      _moveItemAtURLToDeathRow(item, true, false, nullptr);
+    }
+  }
+  deleteContainersOnDeathRowWithCompletion(nullptr);
+}
 
 namespace {
 
@@ -161,6 +204,32 @@ void QRTMoveSystemContainersIntoPlace(QRTClientConnection& client) {
 }
 
 }  // namespace
+
+void QRTClientConnection::_regenerateAllSystemContainerPaths() {
+  QRTLog(platform::kLogNotice, "Rolling system container directory UUIDs on disk");
+  for (uint64_t containerClass : {uint64_t{QRTClassSystemData}, uint64_t{QRTClassSystemGroup}}) {
+    QRTErrorRef error;
+    auto list = QRTContainerCache::sharedInstance().allContainersForUser(QRTSystemContainerUserId, containerClass,
+                                                                         false, false, &error);
+    if (!list) {
+      QRTLog(platform::kLogError, "Failed to get list of system containers for migration: %@", error);
+      continue;
+    }
+    for (const auto& metadata : *list) {
+      const std::string& identifier = metadata->identifier();
+      if (QRTWhitelist::sharedWhitelist().containerIdIsWellknown(identifier, containerClass) ||
+          identifier == "systemgroup.com.norvane.diagvault") {
+        continue;
+      }
+      uint64_t code = QRTErrorNone;
+      regenerateDirectoryUUIDForUser(QRTSystemContainerUserId, metadata->uuid(), identifier, containerClass, &code);
+      if (code != QRTErrorNone) {
+        QRTLog(platform::kLogError, "Failed to regenerate directory UUID for identifier: %@, class: %llu", identifier,
+               static_cast<unsigned long long>(containerClass));
+      }
+    }
+  }
+}
 
 void QRTClientConnection::rebootQuarterSetup() {
   if (auto status = QRTMigrationStatus::init(); status && status->isBuildUpgrade()) {

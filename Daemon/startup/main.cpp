@@ -1,3 +1,3 @@
-#include "Daemon/QRTDaemon.h"
+#include "Daemon/startup/QRTDaemon.h"
 
 int main(int argc, char** argv) { return QRTDaemonMain(argc, argv); }

@@ -1,0 +1,24 @@
+// The process's resource limits and the allocator's settings.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+
+namespace platform {
+
+// What raising the descriptor limit did.
+struct DescriptorLimit {
+  int error = 0;            // 0, or the errno of the call that failed
+  bool readFailed = false;  // the limit could not even be read
+  uint64_t hardLimit = 0;   // the limit asked for when it was read
+};
+
+// Raises the soft limit on open descriptors to the hard limit, when lower.
+DescriptorLimit raiseDescriptorLimit();
+
+// Serves allocations of at least bytes from mappings of their own, so that
+// freeing them gives the memory back to the system at once. False when the
+// allocator refuses the setting (sanitizer allocators do).
+bool returnLargeAllocationsToSystem(size_t bytes);
+
+}  // namespace platform
