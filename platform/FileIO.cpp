@@ -3,17 +3,16 @@
 #include <fcntl.h>
 #include <linux/fs.h>
 #include <sys/ioctl.h>
-#include <sys/random.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/sysmacros.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <cerrno>
 
 #include "platform/LockState.h"
+#include "platform/Random.h"
 
 #ifndef SYS_fchmodat2
 #define SYS_fchmodat2 452  // Linux 6.6; the same number on every architecture
@@ -113,22 +112,6 @@ int readFileAt(int dirfd, const char* name, std::string* out, size_t limit) {
   if (!fd.valid()) return errno;
   return readOpened(fd.get(), out, limit);
 }
-
-namespace {
-
-std::string temporaryName(std::string_view name) {
-  static std::atomic<uint64_t> counter{0};
-  uint64_t random = 0;
-  if (getrandom(&random, sizeof random, GRND_NONBLOCK) != sizeof random) random = counter.load();
-  std::string temp = ".";
-  temp += name.substr(0, 200);
-  temp += ".";
-  temp +=
-      std::to_string(getpid()) + "-" + std::to_string(counter.fetch_add(1)) + "-" + std::to_string(random % 1000000);
-  return temp;
-}
-
-}  // namespace
 
 int replaceFileAt(int dirfd, std::string_view name, const void* data, size_t size, mode_t mode, uid_t ownerUid,
                   gid_t ownerGid) {

@@ -2,7 +2,6 @@
 
 #include <dirent.h>
 #include <fcntl.h>
-#include <sys/random.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -20,6 +19,7 @@
 #include "base/PlistCodec.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
+#include "platform/Random.h"
 #include "platform/SafePath.h"
 
 using platform::kLogError;
@@ -809,19 +809,6 @@ bool TreeWalker::leave() {
 
 // ---------------------------------------------------------------------------
 
-std::string randomSuffix(size_t length) {
-  static const char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789";
-  unsigned char bytes[16];
-  if (getrandom(bytes, sizeof bytes, GRND_NONBLOCK) != sizeof bytes) {
-    static std::atomic<uint64_t> counter{0};
-    uint64_t seed = static_cast<uint64_t>(getpid()) * 0x9E3779B97F4A7C15ull + counter.fetch_add(1) * 7919;
-    for (unsigned char& b : bytes) b = static_cast<unsigned char>(seed >>= 3);
-  }
-  std::string suffix;
-  for (size_t i = 0; i < length && i < sizeof bytes; ++i) suffix += kAlphabet[bytes[i] % (sizeof kAlphabet - 1)];
-  return suffix;
-}
-
 // Writes in place without following a link or writing through a second
 // name: only a regular file with one link, or a new one, is written.
 int writeInPlace(int dirfd, const char* name, const plist::Data& bytes, bool noProtection) {
@@ -1100,7 +1087,7 @@ std::optional<QRTURL> QRTFileManager::createTemporaryDirectoryInDirectoryURL(con
   UniqueFd directory;
   int err = platform::safeOpen(parent.path(), O_RDONLY | O_DIRECTORY, &directory);
   for (int attempt = 0; !err && attempt < 100; ++attempt) {
-    std::string name = prefix + randomSuffix(6);
+    std::string name = prefix + platform::randomAlphanumeric(6);
     if (mkdirat(directory.get(), name.c_str(), S_IRWXU) == 0) return parent.URLByAppendingPathComponent(name, true);
     if (errno != EEXIST) err = errno;
   }
