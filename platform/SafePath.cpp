@@ -14,6 +14,7 @@
 #include <mutex>
 #include <vector>
 
+#include "base/QRTFormat.h"
 #include "platform/DeviceRoot.h"
 #include "platform/HostProfile.h"
 #include "platform/Log.h"
@@ -89,8 +90,6 @@ void splitParent(const std::string& relative, std::string* parent, std::string* 
     *name = relative.substr(slash + 1);
   }
 }
-
-const char* errorText(int err) { return strerror(err); }
 
 // The host owner of a protocol user; EPERM with a log line when no account
 // stands for it (never a numeric id another account may own).

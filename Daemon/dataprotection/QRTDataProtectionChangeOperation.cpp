@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "base/QRTFormat.h"
 #include "Daemon/QRTCrashPoint.h"
 #include "Daemon/QRTDaemon.h"
 #include "Daemon/fileops/QRTFileManager.h"
@@ -38,8 +39,6 @@ constexpr const char* kInternalIDKey = "QRTDataOperationInternalID";
 constexpr int32_t kDefaultFileClass = 3;
 // Items that keep their class whatever is asked.
 constexpr int32_t kUntouchableClass = 2;
-
-const char* errorText(int err) { return strerror(err); }
 
 const plist::Integer* integerAt(const plist::Dictionary& d, const char* key) {
   const plist::Value* v = plist::find(d, key);

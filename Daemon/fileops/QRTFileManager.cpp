@@ -16,6 +16,7 @@
 #include <thread>
 #include <utility>
 
+#include "base/QRTFormat.h"
 #include "base/PlistCodec.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
@@ -39,8 +40,6 @@ constexpr unsigned kUnlinkThreads = 4;
 constexpr size_t kMaxOpenDirectories = 64;
 // Property-list files are small; anything beyond this is not one of ours.
 constexpr size_t kMaxPropertyListFileSize = 64 << 20;
-
-const char* errorText(int err) { return strerror(err); }
 
 // ---------------------------------------------------------------------------
 // Recursive removal.
@@ -1002,11 +1001,11 @@ const char* importRefusal(const struct stat& st, uid_t owner) {
 bool importableTree(int dirfd, std::string& path, uid_t owner, int depth, const char** why) {
   if (depth > kMaxImportDepth) return (*why = "nested too deep"), false;
   UniqueFd dir(platform::openDirectoryAt(dirfd, "."));
-  if (!dir.valid()) return (*why = strerror(errno)), false;
+  if (!dir.valid()) return (*why = errorText(errno)), false;
   std::vector<std::string> names;
   platform::DirectoryBatch batch;
   for (ssize_t n; (n = platform::readDirectoryBatch(dir.get(), &batch)) != 0;) {
-    if (n < 0) return (*why = strerror(static_cast<int>(-n))), false;
+    if (n < 0) return (*why = errorText(static_cast<int>(-n))), false;
     bool malformed = false;
     platform::forEachEntry(batch, static_cast<size_t>(n), [&](uint64_t, unsigned char, const char* name) {
       if (name)
@@ -1020,11 +1019,11 @@ bool importableTree(int dirfd, std::string& path, uid_t owner, int depth, const 
     const size_t length = path.size();
     path += "/" + name;
     platform::Item item;
-    if (int err = platform::openItemAt(dir.get(), name.c_str(), &item)) return (*why = strerror(err)), false;
+    if (int err = platform::openItemAt(dir.get(), name.c_str(), &item)) return (*why = errorText(err)), false;
     if ((*why = importRefusal(item.st, owner))) return false;
     if (S_ISDIR(item.st.st_mode)) {
       UniqueFd sub;
-      if (int err = platform::reopenItem(item, O_RDONLY | O_DIRECTORY, &sub)) return (*why = strerror(err)), false;
+      if (int err = platform::reopenItem(item, O_RDONLY | O_DIRECTORY, &sub)) return (*why = errorText(err)), false;
       if (!importableTree(sub.get(), path, owner, depth + 1, why)) return false;
     }
     path.resize(length);
@@ -1045,7 +1044,7 @@ bool QRTFileManager::itemIsImportableAtURL(const QRTURL& url, const QRTURL& from
   if (target != base && target.compare(0, base.size() + 1, base + "/") != 0) {
     why = "not inside the tree it is taken from";
   } else if (int err = platform::safeOpenItem(base, &item)) {
-    why = strerror(err);
+    why = errorText(err);
   } else if (!(why = importRefusal(item.st, owner))) {
     // Down to url one component at a time, each checked on the descriptor of the one before.
     for (size_t start = base.size() + 1; start < target.size() + 1 && !why;) {
@@ -1059,14 +1058,14 @@ bool QRTFileManager::itemIsImportableAtURL(const QRTURL& url, const QRTURL& from
       if (!S_ISDIR(item.st.st_mode))
         why = "below something that is not a directory";
       else if (int err = platform::openItemAt(item.fd.get(), name.c_str(), &next))
-        why = strerror(err);
+        why = errorText(err);
       else if (!(why = importRefusal(next.st, owner)))
         item = std::move(next);
     }
     if (!why && S_ISDIR(item.st.st_mode)) {
       UniqueFd dir;
       if (int err = platform::reopenItem(item, O_RDONLY | O_DIRECTORY, &dir))
-        why = strerror(err);
+        why = errorText(err);
       else
         importableTree(dir.get(), path, owner, 0, &why);
     }

@@ -15,6 +15,7 @@
 #include <type_traits>
 #include <utility>
 
+#include "base/QRTFormat.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
@@ -80,8 +81,6 @@ constexpr uint32_t kNoFlags = 0;
 
 // Owner, group and other entries.
 constexpr int kBaseEntryCount = 3;
-
-const char* errorText(int err) { return strerror(err); }
 
 // Error 63; the message ends with the text of err, taken before anything
 // else can touch errno.
