@@ -11,6 +11,7 @@
 
 #include <cerrno>
 
+#include "base/Frame.h"
 #include "platform/LockState.h"
 #include "platform/Random.h"
 
@@ -27,17 +28,7 @@ void UniqueFd::reset(int fd) {
   fd_ = fd;
 }
 
-int writeAll(int fd, const void* data, size_t size) {
-  const char* bytes = static_cast<const char*>(data);
-  for (size_t done = 0; done < size;) {
-    ssize_t n = write(fd, bytes + done, size - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) return errno;
-    if (n == 0) return EIO;
-    done += static_cast<size_t>(n);
-  }
-  return 0;
-}
+int writeAll(int fd, const void* data, size_t size) { return frame::writeAll(fd, data, size, false); }
 
 int readAll(int fd, std::string* out, size_t limit) {
   out->clear();
