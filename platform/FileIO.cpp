@@ -55,6 +55,30 @@ int openNoFollowAt(int dirfd, const char* name, int flags) {
   return openat(dirfd, name, flags);
 }
 
+int createFileAt(int dirfd, const char* name, int flags, mode_t mode) {
+  return openat(dirfd, name, flags | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode);
+}
+
+int removeEntryAt(int dirfd, const char* name, int flags) { return unlinkat(dirfd, name, flags) == 0 ? 0 : errno; }
+
+int setExtendedAttribute(int fd, const char* name, const void* value, size_t size) {
+  return fsetxattr(fd, name, value, size, 0) == 0 ? 0 : errno;
+}
+
+int readLinkAt(int dirfd, const char* name, std::string* target, size_t limit) {
+  target->resize(limit);
+  ssize_t length = readlinkat(dirfd, name, target->data(), limit);
+  if (length < 0) return errno;
+  target->resize(static_cast<size_t>(length));
+  return 0;
+}
+
+int openSystemPathAt(int dirfd, const char* name) { return openat(dirfd, name, O_PATH | O_CLOEXEC); }
+
+int chownOpened(int fd, uid_t uid, gid_t gid) { return fchown(fd, uid, gid) == 0 ? 0 : errno; }
+
+int chmodOpened(int fd, mode_t mode) { return fchmod(fd, mode) == 0 ? 0 : errno; }
+
 int openItemAt(int dirfd, const char* name, Item* item) {
   item->fd.reset(openat(dirfd, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
   if (!item->fd.valid()) return errno;

@@ -162,8 +162,8 @@ void TreePruner::unlinkVictims(Frame& frame) {
     try {
       for (size_t i = t; i < count; i += threads) {
         const char* name = names_.data() + victims_[i].nameOffset;
-        if (unlinkat(frame.fd.get(), name, 0) == 0) continue;
-        int err = errno;
+        int err = platform::removeEntryAt(frame.fd.get(), name);
+        if (err == 0) continue;
         if (err == EISDIR) {  // the file system gave no type
           directories[t].emplace_back(name);
         } else {
@@ -249,7 +249,7 @@ int TreePruner::reopen(Frame& frame, int childFd) {
 }
 
 void TreePruner::removeAt(int dirfd, const char* name, int flags, const std::string& path) {
-  if (unlinkat(dirfd, name, flags) != 0) entryFailed(dirfd, name, path, errno);
+  if (int err = platform::removeEntryAt(dirfd, name, flags)) entryFailed(dirfd, name, path, err);
 }
 
 // The per-entry error hook: an entry that is only in the way because of its
@@ -259,8 +259,9 @@ void TreePruner::entryFailed(int dirfd, const char* name, const std::string& pat
   if (err == ENOENT) return;  // gone already
   QRTLog(kLogError, "prunetree hit error for %s : %s", path.c_str(), errorText(err));
   if (err == EPERM && unsetImmutable(dirfd, name, path)) {
-    if (unlinkat(dirfd, name, 0) == 0) return;
-    QRTLog(kLogError, "unlink of %s failed: %s", path.c_str(), errorText(errno));
+    int unlinkErr = platform::removeEntryAt(dirfd, name);
+    if (unlinkErr == 0) return;
+    QRTLog(kLogError, "unlink of %s failed: %s", path.c_str(), errorText(unlinkErr));
   }
   keepFirst(err);
 }
@@ -455,11 +456,10 @@ int TreeCloner::copyFile(int sdir, const char* sname, int ddir, const char* dnam
   struct stat st;
   if (fstat(sfd.get(), &st) != 0) return errno;
   if (!S_ISREG(st.st_mode)) return ESTALE;  // replaced during the copy
-  const int flags = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
-  UniqueFd dfd(openat(ddir, dname, flags, S_IRUSR | S_IWUSR));
+  UniqueFd dfd(platform::createFileAt(ddir, dname, O_WRONLY, S_IRUSR | S_IWUSR));
   if (!dfd.valid() && errno == EEXIST) {
-    if (unlinkat(ddir, dname, 0) != 0) return errno;
-    dfd.reset(openat(ddir, dname, flags, S_IRUSR | S_IWUSR));
+    if (int err = platform::removeEntryAt(ddir, dname)) return err;
+    dfd.reset(platform::createFileAt(ddir, dname, O_WRONLY, S_IRUSR | S_IWUSR));
   }
   if (!dfd.valid()) return errno;
   if (int err = copyData(sfd.get(), dfd.get(), st.st_size)) return err;
@@ -509,7 +509,8 @@ int TreeCloner::copySymlink(int sdir, const char* sname, int ddir, const char* d
   if (static_cast<size_t>(n) >= sizeof target) return ENAMETOOLONG;
   target[n] = '\0';
   if (symlinkat(target, ddir, dname) != 0) {
-    if (errno != EEXIST || unlinkat(ddir, dname, 0) != 0 || symlinkat(target, ddir, dname) != 0) return errno;
+    if (errno != EEXIST || platform::removeEntryAt(ddir, dname) != 0 || symlinkat(target, ddir, dname) != 0)
+      return errno;
   }
   if (fchownat(ddir, dname, st.st_uid, st.st_gid, AT_SYMLINK_NOFOLLOW) != 0) return errno;
   const struct timespec times[2] = {st.st_atim, st.st_mtim};
@@ -528,7 +529,8 @@ int TreeCloner::copySpecial(int sdir, const char* sname, int ddir, const char* d
   }
   const mode_t mode = st.st_mode & (S_IFMT | S_IRWXU);
   if (mknodat(ddir, dname, mode, 0) != 0) {
-    if (errno != EEXIST || unlinkat(ddir, dname, 0) != 0 || mknodat(ddir, dname, mode, 0) != 0) return errno;
+    if (errno != EEXIST || platform::removeEntryAt(ddir, dname) != 0 || mknodat(ddir, dname, mode, 0) != 0)
+      return errno;
   }
   // What was just made, pinned: a name swapped meanwhile is not followed.
   platform::Item made;
@@ -588,11 +590,11 @@ int TreeCloner::copyXattrs(int sfd, int dfd, bool isDirectory) {
       if (errno == ENODATA) continue;  // removed meanwhile
       return errno;
     }
-    if (fsetxattr(dfd, name, value_.data(), static_cast<size_t>(size), 0) != 0) {
+    if (int err = platform::setExtendedAttribute(dfd, name, value_.data(), static_cast<size_t>(size))) {
       // Labels and user data a target cannot hold are left behind; ACLs and
       // trusted attributes (the protection class) never are.
       bool optional = startsWith(name, "user.") || startsWith(name, "security.");
-      if (errno != EOPNOTSUPP || !optional) return errno;
+      if (err != EOPNOTSUPP || !optional) return err;
     }
     hasAccessAcl |= strcmp(name, kAccessAclAttribute) == 0;
     hasDefaultAcl |= strcmp(name, kDefaultAclAttribute) == 0;
@@ -815,7 +817,7 @@ int writeInPlace(int dirfd, const char* name, const plist::Data& bytes, bool noP
   UniqueFd fd;
   int err = platform::openItemAt(dirfd, name, &item);
   if (err == ENOENT) {
-    fd.reset(openat(dirfd, name, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644));
+    fd.reset(platform::createFileAt(dirfd, name, O_WRONLY, 0644));
     if (!fd.valid()) return errno;
   } else if (err) {
     return err;
