@@ -22,6 +22,7 @@
 #include "platform/Log.h"
 #include "platform/Random.h"
 #include "platform/SafePath.h"
+#include "platform/TreeWalk.h"
 
 using platform::kLogError;
 using platform::kLogNotice;
@@ -609,206 +610,6 @@ int TreeCloner::copyXattrs(int sfd, int dfd, bool isDirectory) {
 }
 
 // ---------------------------------------------------------------------------
-// Tree walk.
-
-// A physical walk on the root's device that reaches every entry through its
-// parent's descriptor. Directories are opened without following links and
-// checked against what the listing said, so a swap during the walk ends in
-// an entry that cannot be read, never in a walk of something else.
-class TreeWalker {
- public:
-  TreeWalker(const QRTURL& root, const QRTTraversalVisitor& visitor) : root_(root), visitor_(visitor) {}
-  // False when the walk stopped; error holds why, if anyone said.
-  bool run(QRTErrorRef* error);
-
- private:
-  struct Frame {
-    UniqueFd fd;
-    struct stat st;
-    std::string name;
-    size_t parentPathLength;
-    std::vector<std::string> children;
-    size_t next = 0;
-  };
-
-  bool visit(QRTTraversalEntry::Kind kind, int parentFd, const char* name, const struct stat& st, int level,
-             int error = 0, bool* skip = nullptr);
-  bool visitChild(const std::string& name);
-  bool enter(int parentFd, const std::string& name, const struct stat& st);
-  bool leave();
-  int parentFdOfTop();
-  int readChildren(Frame& frame);
-  bool fail(int err);
-
-  const QRTURL& root_;
-  const QRTTraversalVisitor& visitor_;
-  SafeParent rootParent_;
-  std::string path_;
-  std::vector<Frame> stack_;
-  std::unique_ptr<platform::DirectoryBatch> batch_;
-  dev_t device_ = 0;
-  QRTErrorRef error_;
-};
-
-QRTTraversalEntry::Kind kindOfMode(mode_t mode) {
-  if (S_ISDIR(mode)) return QRTTraversalEntry::Kind::DirectoryPre;
-  if (S_ISREG(mode)) return QRTTraversalEntry::Kind::File;
-  if (S_ISLNK(mode)) return QRTTraversalEntry::Kind::Symlink;
-  return QRTTraversalEntry::Kind::Other;
-}
-
-bool TreeWalker::fail(int err) {
-  error_ = QRT_POSIX_ERROR(err, "Error for path %s: %s", root_.fileSystemRepresentation(), errorText(err));
-  return false;
-}
-
-bool TreeWalker::run(QRTErrorRef* error) {
-  path_ = root_.path();
-  struct stat st;
-  int err = platform::safeOpenParent(path_, &rootParent_);
-  if (!err && fstatat(rootParent_.fd.get(), rootParent_.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) err = errno;
-  bool ok = err ? fail(err) : true;
-  if (ok) {
-    device_ = st.st_dev;
-    const int parentFd = rootParent_.fd.get();
-    ok = S_ISDIR(st.st_mode) ? enter(parentFd, rootParent_.name, st)
-                             : visit(kindOfMode(st.st_mode), parentFd, rootParent_.name.c_str(), st, 0);
-  }
-  while (ok && !stack_.empty()) {
-    Frame& top = stack_.back();
-    if (top.next < top.children.size()) {
-      std::string name = std::move(top.children[top.next++]);
-      ok = visitChild(name);
-    } else {
-      ok = leave();
-    }
-  }
-  if (!ok && error_) QRTSetError(error, error_);
-  return ok;
-}
-
-bool TreeWalker::visit(QRTTraversalEntry::Kind kind, int parentFd, const char* name, const struct stat& st, int level,
-                       int error, bool* skip) {
-  QRTTraversalEntry entry;
-  entry.path = path_.c_str();
-  entry.level = level;
-  entry.kind = kind;
-  entry.st = st;
-  entry.error = error;
-  entry.parentFd = parentFd;
-  entry.name = name;
-  QRTErrorRef visitorError;
-  if (!visitor_(entry, &visitorError)) {
-    error_ = std::move(visitorError);
-    return false;
-  }
-  if (skip) *skip = entry.skipDescendants;
-  return true;
-}
-
-bool TreeWalker::visitChild(const std::string& name) {
-  const int parentFd = stack_.back().fd.get();
-  const size_t parentLength = path_.size();
-  struct stat st;
-  if (fstatat(parentFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
-    if (errno == ENOENT) return true;  // gone meanwhile
-    return fail(errno);
-  }
-  bool ok;
-  if (S_ISDIR(st.st_mode)) {
-    ok = enter(parentFd, name, st);
-  } else {
-    path_ += '/';
-    path_ += name;
-    ok = visit(kindOfMode(st.st_mode), parentFd, name.c_str(), st, static_cast<int>(stack_.size()));
-    path_.resize(parentLength);
-  }
-  return ok;
-}
-
-// Visits the directory, then pushes it unless it is to be passed over.
-bool TreeWalker::enter(int parentFd, const std::string& name, const struct stat& st) {
-  const size_t parentLength = path_.size();
-  const int level = static_cast<int>(stack_.size());
-  if (level > 0) {
-    path_ += '/';
-    path_ += name;
-  }
-  UniqueFd fd;
-  int err = 0;
-  if (st.st_dev == device_) {
-    fd.reset(openDirectoryAt(parentFd, name.c_str()));
-    struct stat opened;
-    if (!fd.valid())
-      err = errno;
-    else if (fstat(fd.get(), &opened) != 0)
-      err = errno;
-    else if (opened.st_dev != st.st_dev || opened.st_ino != st.st_ino)
-      err = ESTALE;
-  }
-  if (err) {
-    // Unreadable, or swapped since the listing: reported, not entered.
-    bool ok = visit(QRTTraversalEntry::Kind::Other, parentFd, name.c_str(), st, level, err);
-    path_.resize(parentLength);
-    return ok;
-  }
-  bool skip = false;
-  if (!visit(QRTTraversalEntry::Kind::DirectoryPre, parentFd, name.c_str(), st, level, 0, &skip)) return false;
-  Frame frame{std::move(fd), st, name, parentLength, {}, 0};
-  // Another file system's directory is seen, never entered.
-  if (!skip && frame.fd.valid()) {
-    if (int readErr = readChildren(frame)) return fail(readErr);
-  }
-  if (stack_.size() >= kMaxOpenDirectories) stack_[stack_.size() - kMaxOpenDirectories].fd.reset();
-  stack_.push_back(std::move(frame));
-  return true;
-}
-
-int TreeWalker::readChildren(Frame& frame) {
-  if (!batch_) batch_ = std::make_unique<platform::DirectoryBatch>();
-  for (;;) {
-    ssize_t n = platform::readDirectoryBatch(frame.fd.get(), batch_.get());
-    if (n < 0) return static_cast<int>(-n);
-    if (n == 0) return 0;
-    platform::forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t, unsigned char, const char* name) {
-      if (name) frame.children.emplace_back(name);
-    });
-  }
-}
-
-// The descriptor of the directory below the top, reopened through the top's
-// ".." when it was closed for depth, and only if it is still the one we came
-// from.
-int TreeWalker::parentFdOfTop() {
-  if (stack_.size() < 2) return rootParent_.fd.get();
-  Frame& parent = stack_[stack_.size() - 2];
-  if (!parent.fd.valid()) {
-    const Frame& child = stack_.back();
-    if (!child.fd.valid()) return -1;
-    UniqueFd fd(openDirectoryAt(child.fd.get(), ".."));
-    struct stat st;
-    if (!fd.valid() || fstat(fd.get(), &st) != 0) return -1;
-    if (st.st_dev != parent.st.st_dev || st.st_ino != parent.st.st_ino) {
-      errno = ESTALE;
-      return -1;
-    }
-    parent.fd = std::move(fd);
-  }
-  return parent.fd.get();
-}
-
-bool TreeWalker::leave() {
-  int parentFd = parentFdOfTop();
-  if (parentFd < 0) return fail(errno);
-  Frame& top = stack_.back();
-  const int level = static_cast<int>(stack_.size()) - 1;
-  bool ok = visit(QRTTraversalEntry::Kind::DirectoryPost, parentFd, top.name.c_str(), top.st, level);
-  path_.resize(top.parentPathLength);
-  stack_.pop_back();
-  return ok;
-}
-
-// ---------------------------------------------------------------------------
 
 // Writes in place without following a link or writing through a second
 // name: only a regular file with one link, or a new one, is written.
@@ -1103,7 +904,18 @@ std::optional<QRTURL> QRTFileManager::createTemporaryDirectoryInDirectoryURL(con
 }
 
 bool QRTFileManager::_traverseDirectory(const QRTURL& root, QRTErrorRef* error, const QRTTraversalVisitor& withBlock) {
-  return TreeWalker(root, withBlock).run(error);
+  QRTErrorRef stopError;
+  int err = platform::walkTree(root.path(), [&](QRTTraversalEntry& entry) {
+    QRTErrorRef visitorError;
+    if (withBlock(entry, &visitorError)) return true;
+    stopError = std::move(visitorError);
+    return false;
+  });
+  if (err == 0) return true;
+  if (err != platform::kTreeWalkStopped)
+    stopError = QRT_POSIX_ERROR(err, "Error for path %s: %s", root.fileSystemRepresentation(), errorText(err));
+  if (stopError) QRTSetError(error, stopError);
+  return false;
 }
 
 namespace {

@@ -21,23 +21,10 @@
 #include "base/PlistCodec.h"
 #include "base/PlistValue.h"
 #include "base/QRTURL.h"
+#include "platform/TreeWalk.h"
 
-// One entry of _traverseDirectory. Valid only during the visitor's call.
-struct QRTTraversalEntry {
-  enum class Kind { DirectoryPre, DirectoryPost, File, Symlink, Other };
-  const char* path = nullptr;
-  int level = 0;  // 0 for the root
-  Kind kind = Kind::Other;
-  struct stat st {};
-  int error = 0;  // errno of a directory that could not be read (kind Other)
-  // The directory that holds the entry and its name there: act on the entry
-  // only through these (platform::openItemAt), never through path, and check
-  // that what is opened is still st.
-  int parentFd = -1;
-  const char* name = nullptr;
-  // Set by the visitor on a DirectoryPre entry to pass over its contents.
-  bool skipDescendants = false;
-};
+// One entry of _traverseDirectory (platform/TreeWalk.h).
+using QRTTraversalEntry = platform::TreeEntry;
 
 // Returns false to stop the walk, after storing an error in the slot if it has one.
 // Paths are resolved from the device root (platform/SafePath.h): a symbolic
