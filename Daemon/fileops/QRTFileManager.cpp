@@ -18,6 +18,7 @@
 
 #include "base/QRTFormat.h"
 #include "base/PlistCodec.h"
+#include "platform/Dir.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
 #include "platform/Random.h"
@@ -611,32 +612,6 @@ int TreeCloner::copyXattrs(int sfd, int dfd, bool isDirectory) {
 
 // ---------------------------------------------------------------------------
 
-// Writes in place without following a link or writing through a second
-// name: only a regular file with one link, or a new one, is written.
-int writeInPlace(int dirfd, const char* name, const plist::Data& bytes, bool noProtection) {
-  platform::Item item;
-  UniqueFd fd;
-  int err = platform::openItemAt(dirfd, name, &item);
-  if (err == ENOENT) {
-    fd.reset(platform::createFileAt(dirfd, name, O_WRONLY, 0644));
-    if (!fd.valid()) return errno;
-  } else if (err) {
-    return err;
-  } else {
-    if (S_ISLNK(item.st.st_mode)) return ELOOP;
-    if (!S_ISREG(item.st.st_mode)) return EINVAL;
-    if (item.st.st_nlink != 1) return EMLINK;
-    if (int reopenErr = platform::reopenItem(item, O_WRONLY, &fd)) return reopenErr;
-    if (ftruncate(fd.get(), 0) != 0) return errno;
-  }
-  if (int writeErr = platform::writeAll(fd.get(), bytes.data(), bytes.size())) return writeErr;
-  if (noProtection) {
-    if (int clearErr = platform::clearProtectionClass(fd.get())) return clearErr;
-  }
-  if (close(fd.release()) != 0) return errno;
-  return 0;
-}
-
 }  // namespace
 
 // ---------------------------------------------------------------------------
@@ -667,10 +642,18 @@ bool QRTFileManager::removeItemAtURL(const QRTURL& url, QRTErrorRef* error) {
 
 bool QRTFileManager::createDirectoryAtURL(const QRTURL& url, bool withIntermediateDirectories, mode_t mode,
                                           uint32_t owner, int32_t protectionClass, QRTErrorRef* error) {
+  return createDirectory(nullptr, url.path(), url, withIntermediateDirectories, mode, owner, protectionClass, nullptr,
+                         error);
+}
+
+bool QRTFileManager::createDirectory(const platform::Dir* in, std::string_view relative, const QRTURL& url,
+                                     bool withIntermediateDirectories, mode_t mode, uint32_t owner,
+                                     int32_t protectionClass, platform::Dir* out, QRTErrorRef* error) {
   const char* path = url.fileSystemRepresentation();
-  UniqueFd fd;
+  platform::Dir made;
   const uid_t wanted = owner == 0 ? platform::kAnyOwner : owner;
-  if (int err = platform::safeMakeDirectory(url.path(), mode, withIntermediateDirectories, wanted, &fd)) {
+  if (int err = in ? in->makeDirectory(relative, mode, withIntermediateDirectories, wanted, &made, nullptr, url.path())
+                   : platform::Dir::make(relative, mode, withIntermediateDirectories, wanted, &made)) {
     if (withIntermediateDirectories)
       QRTSetError(error, QRT_POSIX_ERROR(err, "ensuredirs of %s failed: %s", path, errorText(err)));
     else
@@ -678,12 +661,13 @@ bool QRTFileManager::createDirectoryAtURL(const QRTURL& url, bool withIntermedia
     return false;
   }
   if (protectionClass != -1) {
-    if (int err = platform::setProtectionClass(fd.get(), protectionClass)) {
+    if (int err = platform::setProtectionClass(made.fd(), protectionClass)) {
       QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to setclass(%d) on directory %s: %s", protectionClass, path,
                                          errorText(err)));
       return false;
     }
   }
+  if (out) *out = std::move(made);
   return true;
 }
 
@@ -750,31 +734,28 @@ bool QRTFileManager::copyItemIfExistsAtURL(const QRTURL& src, const QRTURL& toUR
   return _copyItemAtURL(src, toURL, false, error);
 }
 
+// Reports a failed move; always false.
+static bool moveFailed(int err, const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error) {
+  QRTSetError(error, QRT_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", src, toURL, errorText(err)));
+  return false;
+}
+
 bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing, QRTErrorRef* error) {
   SafeParent from, to;
   bool missing;
   int err;
   if (!openEnds(__func__, src, toURL, failIfSrcMissing, &from, &to, &missing, &err, error)) return false;
   if (missing) return true;
-  if (!err) {
-    // EXDEV stays an error: a copy would turn hard links into separate
-    // files and write sparse files out in full, as root.
-    if (renameat(from.fd.get(), from.name.c_str(), to.fd.get(), to.name.c_str()) != 0) {
-      err = errno;
-    } else {
-      // Both directories flushed before anyone hears of the move (once when
-      // they are one).
-      struct stat fromStat, toStat;
-      err = platform::syncDirectory(to.fd.get());
-      bool same = fstat(from.fd.get(), &fromStat) == 0 && fstat(to.fd.get(), &toStat) == 0 &&
-                  fromStat.st_dev == toStat.st_dev && fromStat.st_ino == toStat.st_ino;
-      if (!err && !same) err = platform::syncDirectory(from.fd.get());
-    }
-  }
-  if (err) {
-    QRTSetError(error, QRT_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", src, toURL, errorText(err)));
-    return false;
-  }
+  if (err) return moveFailed(err, src, toURL, error);
+  const platform::Dir fromDir(std::move(from.fd), {}), toDir(std::move(to.fd), {});
+  return moveItem(fromDir, from.name, toDir, to.name, src, toURL, error);
+}
+
+bool QRTFileManager::moveItem(const platform::Dir& from, std::string_view name, const platform::Dir& to,
+                              std::string_view toName, const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error) {
+  // EXDEV stays an error: a copy would turn hard links into separate files
+  // and write sparse files out in full, as root.
+  if (int err = from.renameInto(name, to, toName)) return moveFailed(err, src, toURL, error);
   return true;
 }
 
@@ -886,14 +867,11 @@ std::optional<QRTURL> QRTFileManager::createTemporaryDirectoryInDirectoryURL(con
                                                                              QRTErrorRef* error) {
   if (error) *error = nullptr;
   const std::string prefix(withNamePrefix);
-  UniqueFd directory;
-  int err = platform::safeOpen(parent.path(), O_RDONLY | O_DIRECTORY, &directory);
-  for (int attempt = 0; !err && attempt < 100; ++attempt) {
-    std::string name = prefix + platform::randomAlphanumeric(6);
-    if (mkdirat(directory.get(), name.c_str(), S_IRWXU) == 0) return parent.URLByAppendingPathComponent(name, true);
-    if (errno != EEXIST) err = errno;
-  }
-  if (!err) err = EEXIST;
+  platform::Dir directory;
+  std::string name;
+  int err = platform::Dir::open(parent.path(), &directory);
+  if (!err) err = directory.makeTemporaryDirectory(prefix, S_IRWXU, &name);
+  if (!err) return parent.URLByAppendingPathComponent(name, true);
   std::string path = parent.URLByAppendingPathComponent(prefix + "XXXXXX", true).path();
   QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to create temp dir at path %s : %s", path, errorText(err)));
   return std::nullopt;
@@ -980,6 +958,18 @@ bool QRTFileManager::itemDoesNotExistAtURL(const QRTURL& url) {
 
 // ---------------------------------------------------------------------------
 
+namespace {
+
+int writeEncoded(const plist::Data& bytes, const platform::Dir& directory, std::string_view name,
+                 QRTWriteOptions withOptions) {
+  // A fresh temporary carries no protection class, so an atomic write needs
+  // nothing more for QRTWriteFileProtectionNone.
+  if (withOptions & QRTWriteAtomic) return directory.replaceFile(name, bytes.data(), bytes.size(), 0644);
+  return directory.writeFileInPlace(name, bytes.data(), bytes.size(), (withOptions & QRTWriteFileProtectionNone) != 0);
+}
+
+}  // namespace
+
 bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTWriteOptions withOptions,
                     QRTErrorRef* error) {
   plist::Data bytes;
@@ -987,16 +977,25 @@ bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTW
   try {
     bytes = plist::writeBinary(plist::Value(dictionary));
   } catch (const std::bad_alloc&) { err = ENOMEM; }
-  SafeParent parent;
-  if (!err) err = platform::safeOpenParent(url.path(), &parent);
-  if (!err) {
-    // A fresh temporary carries no protection class, so an atomic write
-    // needs nothing more for QRTWriteFileProtectionNone.
-    err = (withOptions & QRTWriteAtomic)
-              ? platform::replaceFileAt(parent.fd.get(), parent.name, bytes.data(), bytes.size(), 0644)
-              : writeInPlace(parent.fd.get(), parent.name.c_str(), bytes,
-                             (withOptions & QRTWriteFileProtectionNone) != 0);
+  platform::Dir parent;
+  std::string name;
+  if (!err) err = platform::Dir::openParent(url.path(), &parent, &name);
+  if (!err) err = writeEncoded(bytes, parent, name, withOptions);
+  if (err) {
+    QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to write property list to %@: %s", url, errorText(err)));
+    return false;
   }
+  return true;
+}
+
+bool QRT_writeToDirectory(const plist::Dictionary& dictionary, const platform::Dir& directory, std::string_view name,
+                          const QRTURL& url, QRTWriteOptions withOptions, QRTErrorRef* error) {
+  plist::Data bytes;
+  int err = 0;
+  try {
+    bytes = plist::writeBinary(plist::Value(dictionary));
+  } catch (const std::bad_alloc&) { err = ENOMEM; }
+  if (!err) err = writeEncoded(bytes, directory, name, withOptions);
   if (err) {
     QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to write property list to %@: %s", url, errorText(err)));
     return false;

@@ -15,6 +15,7 @@
 #include "base/QRTFormat.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "platform/Acl.h"
+#include "platform/Dir.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
 #include "platform/SafePath.h"
@@ -240,6 +241,15 @@ QRTFileManager::SystemContainerACLPtr QRTFileManager::_CopyTopLevelSystemContain
 }
 
 bool QRTFileManager::setTopLevelSystemContainerACLAtURL(const QRTURL& url, QRTErrorRef* error) {
+  return setTopLevelACL(nullptr, url, error);
+}
+
+bool QRTFileManager::setTopLevelSystemContainerACL(const platform::Dir& directory, const QRTURL& url,
+                                                   QRTErrorRef* error) {
+  return setTopLevelACL(&directory, url, error);
+}
+
+bool QRTFileManager::setTopLevelACL(const platform::Dir* directory, const QRTURL& url, QRTErrorRef* error) {
   QRTErrorRef listError;
   SystemContainerACLPtr list = _CopyTopLevelSystemContainerACLWithError(&listError);
   int err = 0;
@@ -247,7 +257,7 @@ bool QRTFileManager::setTopLevelSystemContainerACLAtURL(const QRTURL& url, QRTEr
     err = EINVAL;
   } else {
     platform::Item item;
-    err = platform::safeOpenItem(url.path(), &item);
+    err = directory ? directory->openItem(".", &item) : platform::safeOpenItem(url.path(), &item);
     if (!err && S_ISLNK(item.st.st_mode)) err = ELOOP;
     if (!err) err = applyList(item, *list, &item.st);
   }
