@@ -1,6 +1,7 @@
 #include "base/Frame.h"
 
 #include <sys/socket.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
@@ -99,16 +100,21 @@ std::optional<plist::Dictionary> decodeMessage(const std::vector<uint8_t>& paylo
   return std::move(value->dictionary());
 }
 
-bool sendAll(int fd, const void* data, size_t size) {
+int writeAll(int fd, const void* data, size_t size, bool socket, bool (*waitWritable)(int fd)) {
   const uint8_t* p = static_cast<const uint8_t*>(data);
   while (size > 0) {
-    ssize_t n = ::send(fd, p, size, MSG_NOSIGNAL);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    p += n;
-    size -= static_cast<size_t>(n);
+    ssize_t n = socket ? ::send(fd, p, size, MSG_NOSIGNAL) : ::write(fd, p, size);
+    if (n > 0) {
+      p += n;
+      size -= static_cast<size_t>(n);
+      continue;
+    }
+    if (n == 0) return EIO;
+    if (errno == EINTR) continue;
+    if ((errno == EAGAIN || errno == EWOULDBLOCK) && waitWritable && waitWritable(fd)) continue;
+    return errno;
   }
-  return true;
+  return 0;
 }
 
 bool recvAll(int fd, void* data, size_t size) {

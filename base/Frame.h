@@ -53,9 +53,14 @@ class Decoder {
 std::optional<plist::Dictionary> decodeMessage(const std::vector<uint8_t>& payload, std::string* error = nullptr,
                                                uint64_t* footprint = nullptr);
 
+// The whole buffer: write(2), or send(2) without SIGPIPE on a socket. When
+// the descriptor would block, waitWritable (if any) says whether to go on.
+// 0 or an errno value (EIO when nothing more could be written).
+int writeAll(int fd, const void* data, size_t size, bool socket, bool (*waitWritable)(int fd) = nullptr);
+
 // Whole buffers over a blocking stream socket (no SIGPIPE); false when the
 // peer went away or the socket failed.
-bool sendAll(int fd, const void* data, size_t size);
+inline bool sendAll(int fd, const void* data, size_t size) { return writeAll(fd, data, size, true) == 0; }
 bool recvAll(int fd, void* data, size_t size);
 
 }  // namespace frame

@@ -326,3 +326,5 @@ std::string QRTFormatArgs(const char* format, std::initializer_list<QRTFormatArg
   }
   return out;
 }
+
+const char* errorText(int err) { return strerror(err); }

@@ -65,3 +65,6 @@ template <typename... Args>
 std::string QRTFormat(const char* format, const Args&... args) {
   return QRTFormatArgs(format, {QRTFormatArg(args)...});
 }
+
+// An errno value as every log line and error description gives it.
+const char* errorText(int err);

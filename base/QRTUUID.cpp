@@ -1,7 +1,6 @@
 #include "base/QRTUUID.h"
 
 #include <fcntl.h>
-#include <sys/random.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -10,17 +9,6 @@
 #include <random>
 
 namespace {
-
-bool fillFromGetrandom(uint8_t* buf, size_t length) {
-  size_t done = 0;
-  while (done < length) {
-    ssize_t n = getrandom(buf + done, length - done, 0);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    done += static_cast<size_t>(n);
-  }
-  return true;
-}
 
 bool fillFromURandom(uint8_t* buf, size_t length) {
   int fd = open("/dev/urandom", O_RDONLY | O_CLOEXEC);
@@ -49,8 +37,8 @@ bool isHyphenPosition(size_t i) { return i == 8 || i == 13 || i == 18 || i == 23
 
 QRTUUID QRTUUID::random() {
   std::array<uint8_t, 16> bytes{};
-  if (!fillFromGetrandom(bytes.data(), bytes.size()) && !fillFromURandom(bytes.data(), bytes.size())) {
-    // Neither kernel source answered (a seccomp filter, no /dev): a seeded
+  if (!fillFromURandom(bytes.data(), bytes.size())) {
+    // The kernel source did not answer (a seccomp filter, no /dev): a seeded
     // generator is still better than a fixed or failed identifier.
     uint64_t seed = static_cast<uint64_t>(std::chrono::steady_clock::now().time_since_epoch().count()) ^
                     (static_cast<uint64_t>(getpid()) << 32);

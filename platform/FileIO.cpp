@@ -3,17 +3,17 @@
 #include <fcntl.h>
 #include <linux/fs.h>
 #include <sys/ioctl.h>
-#include <sys/random.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/sysmacros.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <cerrno>
 
+#include "base/Frame.h"
 #include "platform/LockState.h"
+#include "platform/Random.h"
 
 #ifndef SYS_fchmodat2
 #define SYS_fchmodat2 452  // Linux 6.6; the same number on every architecture
@@ -28,17 +28,7 @@ void UniqueFd::reset(int fd) {
   fd_ = fd;
 }
 
-int writeAll(int fd, const void* data, size_t size) {
-  const char* bytes = static_cast<const char*>(data);
-  for (size_t done = 0; done < size;) {
-    ssize_t n = write(fd, bytes + done, size - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) return errno;
-    if (n == 0) return EIO;
-    done += static_cast<size_t>(n);
-  }
-  return 0;
-}
+int writeAll(int fd, const void* data, size_t size) { return frame::writeAll(fd, data, size, false); }
 
 int readAll(int fd, std::string* out, size_t limit) {
   out->clear();
@@ -64,6 +54,30 @@ int openNoFollowAt(int dirfd, const char* name, int flags) {
   }
   return openat(dirfd, name, flags);
 }
+
+int createFileAt(int dirfd, const char* name, int flags, mode_t mode) {
+  return openat(dirfd, name, flags | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode);
+}
+
+int removeEntryAt(int dirfd, const char* name, int flags) { return unlinkat(dirfd, name, flags) == 0 ? 0 : errno; }
+
+int setExtendedAttribute(int fd, const char* name, const void* value, size_t size) {
+  return fsetxattr(fd, name, value, size, 0) == 0 ? 0 : errno;
+}
+
+int readLinkAt(int dirfd, const char* name, std::string* target, size_t limit) {
+  target->resize(limit);
+  ssize_t length = readlinkat(dirfd, name, target->data(), limit);
+  if (length < 0) return errno;
+  target->resize(static_cast<size_t>(length));
+  return 0;
+}
+
+int openSystemPathAt(int dirfd, const char* name) { return openat(dirfd, name, O_PATH | O_CLOEXEC); }
+
+int chownOpened(int fd, uid_t uid, gid_t gid) { return fchown(fd, uid, gid) == 0 ? 0 : errno; }
+
+int chmodOpened(int fd, mode_t mode) { return fchmod(fd, mode) == 0 ? 0 : errno; }
 
 int openItemAt(int dirfd, const char* name, Item* item) {
   item->fd.reset(openat(dirfd, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
@@ -113,22 +127,6 @@ int readFileAt(int dirfd, const char* name, std::string* out, size_t limit) {
   if (!fd.valid()) return errno;
   return readOpened(fd.get(), out, limit);
 }
-
-namespace {
-
-std::string temporaryName(std::string_view name) {
-  static std::atomic<uint64_t> counter{0};
-  uint64_t random = 0;
-  if (getrandom(&random, sizeof random, GRND_NONBLOCK) != sizeof random) random = counter.load();
-  std::string temp = ".";
-  temp += name.substr(0, 200);
-  temp += ".";
-  temp +=
-      std::to_string(getpid()) + "-" + std::to_string(counter.fetch_add(1)) + "-" + std::to_string(random % 1000000);
-  return temp;
-}
-
-}  // namespace
 
 int replaceFileAt(int dirfd, std::string_view name, const void* data, size_t size, mode_t mode, uid_t ownerUid,
                   gid_t ownerGid) {

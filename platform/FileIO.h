@@ -63,6 +63,22 @@ int replaceFileAt(int dirfd, std::string_view name, const void* data, size_t siz
 // caller may have it); -1 with errno on failure.
 int openNoFollowAt(int dirfd, const char* name, int flags);
 inline int openDirectoryAt(int dirfd, const char* name) { return openNoFollowAt(dirfd, name, O_RDONLY | O_DIRECTORY); }
+// A new file dirfd/name (O_CREAT | O_EXCL, no link followed, close-on-exec)
+// opened with flags; -1 with errno on failure.
+int createFileAt(int dirfd, const char* name, int flags, mode_t mode);
+// unlinkat (flags 0 or AT_REMOVEDIR); 0 or an errno value.
+int removeEntryAt(int dirfd, const char* name, int flags = 0);
+// fsetxattr of an open file; 0 or an errno value.
+int setExtendedAttribute(int fd, const char* name, const void* value, size_t size);
+// The target of the link dirfd/name, cut at limit bytes; 0 or an errno value.
+int readLinkAt(int dirfd, const char* name, std::string* target, size_t limit);
+// An O_PATH descriptor of dirfd/name with a final link followed: for root's
+// own system directories only, never for anything inside the device root.
+// -1 with errno on failure.
+int openSystemPathAt(int dirfd, const char* name);
+// fchown and fchmod of an open descriptor; 0 or an errno value.
+int chownOpened(int fd, uid_t uid, gid_t gid);
+int chmodOpened(int fd, mode_t mode);
 
 // An item pinned by an O_PATH descriptor and checked with fstat: whatever
 // happens to its name afterwards, changes reach this inode and no other.

@@ -64,21 +64,6 @@ bool waitWritable(int fd) {
   }
 }
 
-bool writeAll(int fd, const uint8_t* p, size_t n) {
-  while (n > 0) {
-    ssize_t w = ::send(fd, p, n, MSG_NOSIGNAL);
-    if (w > 0) {
-      p += w;
-      n -= static_cast<size_t>(w);
-      continue;
-    }
-    if (w < 0 && errno == EINTR) continue;
-    if (w < 0 && (errno == EAGAIN || errno == EWOULDBLOCK) && waitWritable(fd)) continue;
-    return false;
-  }
-  return true;
-}
-
 void wake(int eventFd, const char* what) {
   uint64_t one = 1;
   if (::write(eventFd, &one, sizeof one) < 0 && errno != EAGAIN)
@@ -105,7 +90,7 @@ SendResult RequestConnection::send(uint64_t messageId, const plist::Dictionary& 
   {
     std::lock_guard<std::mutex> hold(writeLock_);
     if (!cancelled_) {
-      sent = writeAll(fd_, bytes.data(), bytes.size());
+      sent = frame::writeAll(fd_, bytes.data(), bytes.size(), true, waitWritable) == 0;
       if (!sent) {
         cancelled_ = true;
         ::shutdown(fd_, SHUT_RDWR);

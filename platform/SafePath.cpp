@@ -15,8 +15,7 @@
 #include <vector>
 
 #include "platform/DeviceRoot.h"
-#include "platform/HostProfile.h"
-#include "platform/Log.h"
+#include "platform/Dir.h"
 
 namespace platform {
 
@@ -88,59 +87,6 @@ void splitParent(const std::string& relative, std::string* parent, std::string* 
     *parent = relative.substr(0, slash);
     *name = relative.substr(slash + 1);
   }
-}
-
-const char* errorText(int err) { return strerror(err); }
-
-// The host owner of a protocol user; EPERM with a log line when no account
-// stands for it (never a numeric id another account may own).
-int hostOwner(std::string_view hostPath, uid_t owner, uid_t* uid, gid_t* gid) {
-  *uid = *gid = kAnyOwner;
-  if (owner == kAnyOwner) return 0;
-  std::optional<uid_t> user = hostUserId(owner);
-  std::optional<gid_t> group = hostGroupId(owner);
-  if (!user || !group) {
-    QRTLogAs(kLogError, "safeMakeDirectory", "Refusing %s: no host account stands for user %u",
-             std::string(hostPath).c_str(), static_cast<unsigned>(owner));
-    return EPERM;
-  }
-  *uid = *user;
-  *gid = *group;
-  return 0;
-}
-
-// The checks on an item found where a directory was to be made; owner and
-// group are host ids.
-int acceptDirectory(int fd, std::string_view hostPath, uid_t owner, gid_t group) {
-  struct stat st;
-  if (fstat(fd, &st) != 0) return errno;
-  if (!S_ISDIR(st.st_mode)) {
-    QRTLogAs(kLogError, "safeMakeDirectory", "Refusing %s: not a directory", std::string(hostPath).c_str());
-    return ENOTDIR;
-  }
-  if (owner == kAnyOwner) return 0;
-  if (st.st_uid != owner && st.st_uid != 0) {
-    QRTLogAs(kLogError, "safeMakeDirectory", "Refusing %s: owned by %u, not by %u", std::string(hostPath).c_str(),
-             static_cast<unsigned>(st.st_uid), static_cast<unsigned>(owner));
-    return EPERM;
-  }
-  if ((st.st_uid != owner || st.st_gid != group) && fchown(fd, owner, group) != 0) return errno;
-  return 0;
-}
-
-// mkdirat then an O_NOFOLLOW open of what is there; *made tells whether this
-// call made it.
-int makeOne(int dirfd, const char* name, mode_t mode, std::string_view hostPath, UniqueFd* out, bool* made) {
-  *made = mkdirat(dirfd, name, mode) == 0;
-  if (!*made && errno != EEXIST) return errno;
-  out->reset(openat(dirfd, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-  if (out->valid()) return 0;
-  int err = errno;
-  if (err == ELOOP || err == ENOTDIR) {
-    QRTLogAs(kLogError, "safeMakeDirectory", "Refusing %s: %s where a directory belongs", std::string(hostPath).c_str(),
-             err == ELOOP ? "a symbolic link" : "another kind of item");
-  }
-  return err;
 }
 
 }  // namespace
@@ -235,57 +181,9 @@ int safeStat(std::string_view hostPath, struct stat* st) {
 
 int safeMakeDirectory(std::string_view hostPath, mode_t mode, bool withParents, uid_t owner, UniqueFd* out,
                       bool* created) {
-  if (created) *created = false;
-  uid_t hostUid;
-  gid_t hostGid;
-  if (int err = hostOwner(hostPath, owner, &hostUid, &hostGid)) return err;
-  std::string relative;
-  if (int err = pathBelowDeviceRoot(hostPath, &relative)) return err;
-  int root = deviceRootDescriptor();
-  if (root < 0) return errno;
-  // Most calls find the directory there already: one resolution settles it.
-  UniqueFd fd;
-  int err = openBeneath(root, relative.c_str(), O_RDONLY | O_DIRECTORY, &fd);
-  if (err == 0) {
-    if (int refused = acceptDirectory(fd.get(), hostPath, hostUid, hostGid)) return refused;
-    *out = std::move(fd);
-    return 0;
-  }
-  if (err != ENOENT) {
-    if (err == ELOOP || err == ENOTDIR)
-      QRTLogAs(kLogError, "safeMakeDirectory", "Refusing %s: %s", std::string(hostPath).c_str(), errorText(err));
-    return err;
-  }
-  bool made = false;
-  if (!withParents) {
-    SafeParent parent;
-    if (int perr = safeOpenParent(hostPath, &parent)) return perr;
-    if (int merr = makeOne(parent.fd.get(), parent.name.c_str(), mode, hostPath, &fd, &made)) return merr;
-  } else {
-    // Level by level from the root; each level is opened without following
-    // a link before the next one is made inside it.
-    UniqueFd level;
-    int base = root;
-    std::string_view rest(relative);
-    while (!rest.empty()) {
-      size_t slash = rest.find('/');
-      std::string name(rest.substr(0, slash));
-      rest.remove_prefix(slash == std::string_view::npos ? rest.size() : slash + 1);
-      UniqueFd next;
-      if (int merr = makeOne(base, name.c_str(), mode, hostPath, &next, &made)) return merr;
-      // A level made in an ordinary user's home (~/.local/share on a host)
-      // is theirs, or their own programs could not use it.
-      if (made && hostProfile() && hostUid != kAnyOwner && hostUid >= hostOrdinaryUserMinimum() &&
-          fchown(next.get(), hostUid, hostGid) != 0)
-        return errno;
-      level = std::move(next);
-      base = level.get();
-    }
-    fd = std::move(level);
-  }
-  if (created) *created = made;
-  if (int refused = acceptDirectory(fd.get(), hostPath, hostUid, hostGid)) return refused;
-  *out = std::move(fd);
+  Dir dir;
+  if (int err = Dir::make(hostPath, mode, withParents, owner, &dir, created)) return err;
+  *out = UniqueFd(dir.release());
   return 0;
 }
 

@@ -3,13 +3,13 @@
 #include <fcntl.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <cerrno>
 #include <string_view>
 #include <vector>
 
 #include "platform/DeviceRoot.h"
 #include "platform/FileIO.h"
+#include "platform/Random.h"
 #include "platform/SafePath.h"
 
 namespace platform {
@@ -27,16 +27,9 @@ std::string itemDirectory(uint32_t userId, uint64_t itemType) {
   return hostPath("/run/sandbox/mappings/" + std::to_string(userId) + "/" + std::to_string(itemType));
 }
 
-// A fresh hidden name in the link's directory; pid and counter keep
-// concurrent writers, in this process or another, apart.
-std::string temporaryName() {
-  static std::atomic<uint64_t> counter{0};
-  return ".mapping-" + std::to_string(getpid()) + "-" + std::to_string(counter.fetch_add(1));
-}
-
 // The link is made and renamed relative to its directory's descriptor.
 int setLink(int dirfd, const std::string& identifier, const char* target) {
-  const std::string temporary = temporaryName();
+  const std::string temporary = temporaryName("mapping");
   if (symlinkat(target, dirfd, temporary.c_str()) != 0) {
     // A name left behind by a crashed writer with the same pid.
     if (errno != EEXIST || unlinkat(dirfd, temporary.c_str(), 0) != 0 ||

@@ -306,14 +306,10 @@ class Ruleset {
     while (dirent* entry = readdir(listing)) {
       std::string name = entry->d_name;
       if (name == "." || name == ".." || name == kMetadataFileName) continue;
-      int fd = openat(dir.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC);
-      struct stat st;
-      if (fd < 0 || fstat(fd, &st) != 0) {
-        err = errno;
-      } else if (S_ISDIR(st.st_mode) || S_ISREG(st.st_mode)) {
-        err = allow(fd, kContainerRights, S_ISDIR(st.st_mode));
-      }
-      if (fd >= 0) close(fd);
+      platform::Item item;
+      err = platform::openItemAt(dir.get(), name.c_str(), &item);
+      const mode_t mode = item.st.st_mode;
+      if (!err && (S_ISDIR(mode) || S_ISREG(mode))) err = allow(item.fd.get(), kContainerRights, S_ISDIR(mode));
       if (err) break;
     }
     closedir(listing);
@@ -362,7 +358,7 @@ class Ruleset {
     int err = 0;
     while (dirent* entry = readdir(listing)) {
       if (entry->d_name[0] == '.' || !wanted(entry->d_name)) continue;
-      int fd = openat(dirFd, entry->d_name, O_PATH | O_CLOEXEC);
+      int fd = platform::openSystemPathAt(dirFd, entry->d_name);
       struct stat st;
       if (fd < 0) continue;  // a dangling link
       if (fstat(fd, &st) == 0) err = fn(fd, st);

@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "base/QRTFormat.h"
 #include "Daemon/QRTCrashPoint.h"
 #include "Daemon/QRTProcessWide.h"
 #include "Daemon/fileops/QRTFileManager.h"
@@ -39,8 +40,6 @@ constexpr const char* kInternalIDKey = "QRTDataOperationInternalID";
 constexpr int32_t kDefaultFileClass = 3;
 // Items that keep their class whatever is asked.
 constexpr int32_t kUntouchableClass = 2;
-
-const char* errorText(int err) { return strerror(err); }
 
 const plist::Integer* integerAt(const plist::Dictionary& d, const char* key) {
   const plist::Value* v = plist::find(d, key);
@@ -112,13 +111,6 @@ class ProtectionWalk {
 
 constexpr int kOpenFlags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
 
-// openat that does not touch access times (root may; fall back if not).
-int openAt(int dirfd, const char* name, int flags) {
-  int fd = openat(dirfd, name, flags | O_NOATIME);
-  if (fd < 0 && errno == EPERM) fd = openat(dirfd, name, flags);
-  return fd;
-}
-
 // Gone, or swapped for a link or a special file since it was listed.
 bool vanished(int err) { return err == ENOENT || err == ELOOP || err == ENXIO || err == ENOTDIR; }
 
@@ -143,7 +135,8 @@ bool ProtectionWalk::openRoot(QRTErrorRef* error) {
   if (!err && !directory && !S_ISREG(st.st_mode)) return true;
   platform::UniqueFd fd;
   if (!err) {
-    fd.reset(openAt(parent.fd.get(), parent.name.c_str(), kOpenFlags | (directory ? O_DIRECTORY : 0)));
+    fd.reset(
+        platform::openNoFollowAt(parent.fd.get(), parent.name.c_str(), kOpenFlags | (directory ? O_DIRECTORY : 0)));
     if (!fd.valid()) err = errno;
     if (vanished(err)) return true;
   }
@@ -174,7 +167,8 @@ bool ProtectionWalk::visitChild(const Child& child, QRTErrorRef* error) {
   const bool directory = type == DT_DIR;
   bool ok = true;
   if (directory || (type == DT_REG && (changeType_ & QRTDataProtectionChangeOperation::QRTChangeFiles))) {
-    platform::UniqueFd fd(openAt(parent.fd.get(), child.name.c_str(), kOpenFlags | (directory ? O_DIRECTORY : 0)));
+    platform::UniqueFd fd(
+        platform::openNoFollowAt(parent.fd.get(), child.name.c_str(), kOpenFlags | (directory ? O_DIRECTORY : 0)));
     struct stat st;
     int err = fd.valid() ? (fstat(fd.get(), &st) == 0 ? 0 : errno) : errno;
     if (err) {
@@ -219,7 +213,7 @@ bool ProtectionWalk::leave(QRTErrorRef* error) {
     return false;
   if (stack_.size() >= 2 && !stack_[stack_.size() - 2].fd.valid()) {
     Frame& parent = stack_[stack_.size() - 2];
-    platform::UniqueFd fd(openAt(top.fd.get(), "..", kOpenFlags | O_DIRECTORY));
+    platform::UniqueFd fd(platform::openNoFollowAt(top.fd.get(), "..", kOpenFlags | O_DIRECTORY));
     struct stat st;
     int err = !fd.valid() ? errno : fstat(fd.get(), &st) != 0 ? errno : 0;
     if (!err && (st.st_dev != parent.device || st.st_ino != parent.inode)) err = ESTALE;  // moved meanwhile

@@ -2,7 +2,6 @@
 
 #include <dirent.h>
 #include <fcntl.h>
-#include <sys/random.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -17,10 +16,14 @@
 #include <thread>
 #include <utility>
 
+#include "base/QRTFormat.h"
 #include "base/PlistCodec.h"
+#include "platform/Dir.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
+#include "platform/Random.h"
 #include "platform/SafePath.h"
+#include "platform/TreeWalk.h"
 
 using platform::kLogError;
 using platform::kLogNotice;
@@ -39,8 +42,6 @@ constexpr unsigned kUnlinkThreads = 4;
 constexpr size_t kMaxOpenDirectories = 64;
 // Property-list files are small; anything beyond this is not one of ours.
 constexpr size_t kMaxPropertyListFileSize = 64 << 20;
-
-const char* errorText(int err) { return strerror(err); }
 
 // ---------------------------------------------------------------------------
 // Recursive removal.
@@ -163,8 +164,8 @@ void TreePruner::unlinkVictims(Frame& frame) {
     try {
       for (size_t i = t; i < count; i += threads) {
         const char* name = names_.data() + victims_[i].nameOffset;
-        if (unlinkat(frame.fd.get(), name, 0) == 0) continue;
-        int err = errno;
+        int err = platform::removeEntryAt(frame.fd.get(), name);
+        if (err == 0) continue;
         if (err == EISDIR) {  // the file system gave no type
           directories[t].emplace_back(name);
         } else {
@@ -250,7 +251,7 @@ int TreePruner::reopen(Frame& frame, int childFd) {
 }
 
 void TreePruner::removeAt(int dirfd, const char* name, int flags, const std::string& path) {
-  if (unlinkat(dirfd, name, flags) != 0) entryFailed(dirfd, name, path, errno);
+  if (int err = platform::removeEntryAt(dirfd, name, flags)) entryFailed(dirfd, name, path, err);
 }
 
 // The per-entry error hook: an entry that is only in the way because of its
@@ -260,8 +261,9 @@ void TreePruner::entryFailed(int dirfd, const char* name, const std::string& pat
   if (err == ENOENT) return;  // gone already
   QRTLog(kLogError, "prunetree hit error for %s : %s", path.c_str(), errorText(err));
   if (err == EPERM && unsetImmutable(dirfd, name, path)) {
-    if (unlinkat(dirfd, name, 0) == 0) return;
-    QRTLog(kLogError, "unlink of %s failed: %s", path.c_str(), errorText(errno));
+    int unlinkErr = platform::removeEntryAt(dirfd, name);
+    if (unlinkErr == 0) return;
+    QRTLog(kLogError, "unlink of %s failed: %s", path.c_str(), errorText(unlinkErr));
   }
   keepFirst(err);
 }
@@ -456,11 +458,10 @@ int TreeCloner::copyFile(int sdir, const char* sname, int ddir, const char* dnam
   struct stat st;
   if (fstat(sfd.get(), &st) != 0) return errno;
   if (!S_ISREG(st.st_mode)) return ESTALE;  // replaced during the copy
-  const int flags = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
-  UniqueFd dfd(openat(ddir, dname, flags, S_IRUSR | S_IWUSR));
+  UniqueFd dfd(platform::createFileAt(ddir, dname, O_WRONLY, S_IRUSR | S_IWUSR));
   if (!dfd.valid() && errno == EEXIST) {
-    if (unlinkat(ddir, dname, 0) != 0) return errno;
-    dfd.reset(openat(ddir, dname, flags, S_IRUSR | S_IWUSR));
+    if (int err = platform::removeEntryAt(ddir, dname)) return err;
+    dfd.reset(platform::createFileAt(ddir, dname, O_WRONLY, S_IRUSR | S_IWUSR));
   }
   if (!dfd.valid()) return errno;
   if (int err = copyData(sfd.get(), dfd.get(), st.st_size)) return err;
@@ -510,7 +511,8 @@ int TreeCloner::copySymlink(int sdir, const char* sname, int ddir, const char* d
   if (static_cast<size_t>(n) >= sizeof target) return ENAMETOOLONG;
   target[n] = '\0';
   if (symlinkat(target, ddir, dname) != 0) {
-    if (errno != EEXIST || unlinkat(ddir, dname, 0) != 0 || symlinkat(target, ddir, dname) != 0) return errno;
+    if (errno != EEXIST || platform::removeEntryAt(ddir, dname) != 0 || symlinkat(target, ddir, dname) != 0)
+      return errno;
   }
   if (fchownat(ddir, dname, st.st_uid, st.st_gid, AT_SYMLINK_NOFOLLOW) != 0) return errno;
   const struct timespec times[2] = {st.st_atim, st.st_mtim};
@@ -529,7 +531,8 @@ int TreeCloner::copySpecial(int sdir, const char* sname, int ddir, const char* d
   }
   const mode_t mode = st.st_mode & (S_IFMT | S_IRWXU);
   if (mknodat(ddir, dname, mode, 0) != 0) {
-    if (errno != EEXIST || unlinkat(ddir, dname, 0) != 0 || mknodat(ddir, dname, mode, 0) != 0) return errno;
+    if (errno != EEXIST || platform::removeEntryAt(ddir, dname) != 0 || mknodat(ddir, dname, mode, 0) != 0)
+      return errno;
   }
   // What was just made, pinned: a name swapped meanwhile is not followed.
   platform::Item made;
@@ -589,11 +592,11 @@ int TreeCloner::copyXattrs(int sfd, int dfd, bool isDirectory) {
       if (errno == ENODATA) continue;  // removed meanwhile
       return errno;
     }
-    if (fsetxattr(dfd, name, value_.data(), static_cast<size_t>(size), 0) != 0) {
+    if (int err = platform::setExtendedAttribute(dfd, name, value_.data(), static_cast<size_t>(size))) {
       // Labels and user data a target cannot hold are left behind; ACLs and
       // trusted attributes (the protection class) never are.
       bool optional = startsWith(name, "user.") || startsWith(name, "security.");
-      if (errno != EOPNOTSUPP || !optional) return errno;
+      if (err != EOPNOTSUPP || !optional) return err;
     }
     hasAccessAcl |= strcmp(name, kAccessAclAttribute) == 0;
     hasDefaultAcl |= strcmp(name, kDefaultAclAttribute) == 0;
@@ -608,245 +611,6 @@ int TreeCloner::copyXattrs(int sfd, int dfd, bool isDirectory) {
 }
 
 // ---------------------------------------------------------------------------
-// Tree walk.
-
-// A physical walk on the root's device that reaches every entry through its
-// parent's descriptor. Directories are opened without following links and
-// checked against what the listing said, so a swap during the walk ends in
-// an entry that cannot be read, never in a walk of something else.
-class TreeWalker {
- public:
-  TreeWalker(const QRTURL& root, const QRTTraversalVisitor& visitor) : root_(root), visitor_(visitor) {}
-  // False when the walk stopped; error holds why, if anyone said.
-  bool run(QRTErrorRef* error);
-
- private:
-  struct Frame {
-    UniqueFd fd;
-    struct stat st;
-    std::string name;
-    size_t parentPathLength;
-    std::vector<std::string> children;
-    size_t next = 0;
-  };
-
-  bool visit(QRTTraversalEntry::Kind kind, int parentFd, const char* name, const struct stat& st, int level,
-             int error = 0, bool* skip = nullptr);
-  bool visitChild(const std::string& name);
-  bool enter(int parentFd, const std::string& name, const struct stat& st);
-  bool leave();
-  int parentFdOfTop();
-  int readChildren(Frame& frame);
-  bool fail(int err);
-
-  const QRTURL& root_;
-  const QRTTraversalVisitor& visitor_;
-  SafeParent rootParent_;
-  std::string path_;
-  std::vector<Frame> stack_;
-  std::unique_ptr<platform::DirectoryBatch> batch_;
-  dev_t device_ = 0;
-  QRTErrorRef error_;
-};
-
-QRTTraversalEntry::Kind kindOfMode(mode_t mode) {
-  if (S_ISDIR(mode)) return QRTTraversalEntry::Kind::DirectoryPre;
-  if (S_ISREG(mode)) return QRTTraversalEntry::Kind::File;
-  if (S_ISLNK(mode)) return QRTTraversalEntry::Kind::Symlink;
-  return QRTTraversalEntry::Kind::Other;
-}
-
-bool TreeWalker::fail(int err) {
-  error_ = QRT_POSIX_ERROR(err, "Error for path %s: %s", root_.fileSystemRepresentation(), errorText(err));
-  return false;
-}
-
-bool TreeWalker::run(QRTErrorRef* error) {
-  path_ = root_.path();
-  struct stat st;
-  int err = platform::safeOpenParent(path_, &rootParent_);
-  if (!err && fstatat(rootParent_.fd.get(), rootParent_.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) err = errno;
-  bool ok = err ? fail(err) : true;
-  if (ok) {
-    device_ = st.st_dev;
-    const int parentFd = rootParent_.fd.get();
-    ok = S_ISDIR(st.st_mode) ? enter(parentFd, rootParent_.name, st)
-                             : visit(kindOfMode(st.st_mode), parentFd, rootParent_.name.c_str(), st, 0);
-  }
-  while (ok && !stack_.empty()) {
-    Frame& top = stack_.back();
-    if (top.next < top.children.size()) {
-      std::string name = std::move(top.children[top.next++]);
-      ok = visitChild(name);
-    } else {
-      ok = leave();
-    }
-  }
-  if (!ok && error_) QRTSetError(error, error_);
-  return ok;
-}
-
-bool TreeWalker::visit(QRTTraversalEntry::Kind kind, int parentFd, const char* name, const struct stat& st, int level,
-                       int error, bool* skip) {
-  QRTTraversalEntry entry;
-  entry.path = path_.c_str();
-  entry.level = level;
-  entry.kind = kind;
-  entry.st = st;
-  entry.error = error;
-  entry.parentFd = parentFd;
-  entry.name = name;
-  QRTErrorRef visitorError;
-  if (!visitor_(entry, &visitorError)) {
-    error_ = std::move(visitorError);
-    return false;
-  }
-  if (skip) *skip = entry.skipDescendants;
-  return true;
-}
-
-bool TreeWalker::visitChild(const std::string& name) {
-  const int parentFd = stack_.back().fd.get();
-  const size_t parentLength = path_.size();
-  struct stat st;
-  if (fstatat(parentFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
-    if (errno == ENOENT) return true;  // gone meanwhile
-    return fail(errno);
-  }
-  bool ok;
-  if (S_ISDIR(st.st_mode)) {
-    ok = enter(parentFd, name, st);
-  } else {
-    path_ += '/';
-    path_ += name;
-    ok = visit(kindOfMode(st.st_mode), parentFd, name.c_str(), st, static_cast<int>(stack_.size()));
-    path_.resize(parentLength);
-  }
-  return ok;
-}
-
-// Visits the directory, then pushes it unless it is to be passed over.
-bool TreeWalker::enter(int parentFd, const std::string& name, const struct stat& st) {
-  const size_t parentLength = path_.size();
-  const int level = static_cast<int>(stack_.size());
-  if (level > 0) {
-    path_ += '/';
-    path_ += name;
-  }
-  UniqueFd fd;
-  int err = 0;
-  if (st.st_dev == device_) {
-    fd.reset(openDirectoryAt(parentFd, name.c_str()));
-    struct stat opened;
-    if (!fd.valid())
-      err = errno;
-    else if (fstat(fd.get(), &opened) != 0)
-      err = errno;
-    else if (opened.st_dev != st.st_dev || opened.st_ino != st.st_ino)
-      err = ESTALE;
-  }
-  if (err) {
-    // Unreadable, or swapped since the listing: reported, not entered.
-    bool ok = visit(QRTTraversalEntry::Kind::Other, parentFd, name.c_str(), st, level, err);
-    path_.resize(parentLength);
-    return ok;
-  }
-  bool skip = false;
-  if (!visit(QRTTraversalEntry::Kind::DirectoryPre, parentFd, name.c_str(), st, level, 0, &skip)) return false;
-  Frame frame{std::move(fd), st, name, parentLength, {}, 0};
-  // Another file system's directory is seen, never entered.
-  if (!skip && frame.fd.valid()) {
-    if (int readErr = readChildren(frame)) return fail(readErr);
-  }
-  if (stack_.size() >= kMaxOpenDirectories) stack_[stack_.size() - kMaxOpenDirectories].fd.reset();
-  stack_.push_back(std::move(frame));
-  return true;
-}
-
-int TreeWalker::readChildren(Frame& frame) {
-  if (!batch_) batch_ = std::make_unique<platform::DirectoryBatch>();
-  for (;;) {
-    ssize_t n = platform::readDirectoryBatch(frame.fd.get(), batch_.get());
-    if (n < 0) return static_cast<int>(-n);
-    if (n == 0) return 0;
-    platform::forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t, unsigned char, const char* name) {
-      if (name) frame.children.emplace_back(name);
-    });
-  }
-}
-
-// The descriptor of the directory below the top, reopened through the top's
-// ".." when it was closed for depth, and only if it is still the one we came
-// from.
-int TreeWalker::parentFdOfTop() {
-  if (stack_.size() < 2) return rootParent_.fd.get();
-  Frame& parent = stack_[stack_.size() - 2];
-  if (!parent.fd.valid()) {
-    const Frame& child = stack_.back();
-    if (!child.fd.valid()) return -1;
-    UniqueFd fd(openDirectoryAt(child.fd.get(), ".."));
-    struct stat st;
-    if (!fd.valid() || fstat(fd.get(), &st) != 0) return -1;
-    if (st.st_dev != parent.st.st_dev || st.st_ino != parent.st.st_ino) {
-      errno = ESTALE;
-      return -1;
-    }
-    parent.fd = std::move(fd);
-  }
-  return parent.fd.get();
-}
-
-bool TreeWalker::leave() {
-  int parentFd = parentFdOfTop();
-  if (parentFd < 0) return fail(errno);
-  Frame& top = stack_.back();
-  const int level = static_cast<int>(stack_.size()) - 1;
-  bool ok = visit(QRTTraversalEntry::Kind::DirectoryPost, parentFd, top.name.c_str(), top.st, level);
-  path_.resize(top.parentPathLength);
-  stack_.pop_back();
-  return ok;
-}
-
-// ---------------------------------------------------------------------------
-
-std::string randomSuffix(size_t length) {
-  static const char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789";
-  unsigned char bytes[16];
-  if (getrandom(bytes, sizeof bytes, GRND_NONBLOCK) != sizeof bytes) {
-    static std::atomic<uint64_t> counter{0};
-    uint64_t seed = static_cast<uint64_t>(getpid()) * 0x9E3779B97F4A7C15ull + counter.fetch_add(1) * 7919;
-    for (unsigned char& b : bytes) b = static_cast<unsigned char>(seed >>= 3);
-  }
-  std::string suffix;
-  for (size_t i = 0; i < length && i < sizeof bytes; ++i) suffix += kAlphabet[bytes[i] % (sizeof kAlphabet - 1)];
-  return suffix;
-}
-
-// Writes in place without following a link or writing through a second
-// name: only a regular file with one link, or a new one, is written.
-int writeInPlace(int dirfd, const char* name, const plist::Data& bytes, bool noProtection) {
-  platform::Item item;
-  UniqueFd fd;
-  int err = platform::openItemAt(dirfd, name, &item);
-  if (err == ENOENT) {
-    fd.reset(openat(dirfd, name, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644));
-    if (!fd.valid()) return errno;
-  } else if (err) {
-    return err;
-  } else {
-    if (S_ISLNK(item.st.st_mode)) return ELOOP;
-    if (!S_ISREG(item.st.st_mode)) return EINVAL;
-    if (item.st.st_nlink != 1) return EMLINK;
-    if (int reopenErr = platform::reopenItem(item, O_WRONLY, &fd)) return reopenErr;
-    if (ftruncate(fd.get(), 0) != 0) return errno;
-  }
-  if (int writeErr = platform::writeAll(fd.get(), bytes.data(), bytes.size())) return writeErr;
-  if (noProtection) {
-    if (int clearErr = platform::clearProtectionClass(fd.get())) return clearErr;
-  }
-  if (close(fd.release()) != 0) return errno;
-  return 0;
-}
 
 }  // namespace
 
@@ -878,10 +642,18 @@ bool QRTFileManager::removeItemAtURL(const QRTURL& url, QRTErrorRef* error) {
 
 bool QRTFileManager::createDirectoryAtURL(const QRTURL& url, bool withIntermediateDirectories, mode_t mode,
                                           uint32_t owner, int32_t protectionClass, QRTErrorRef* error) {
+  return createDirectory(nullptr, url.path(), url, withIntermediateDirectories, mode, owner, protectionClass, nullptr,
+                         error);
+}
+
+bool QRTFileManager::createDirectory(const platform::Dir* in, std::string_view relative, const QRTURL& url,
+                                     bool withIntermediateDirectories, mode_t mode, uint32_t owner,
+                                     int32_t protectionClass, platform::Dir* out, QRTErrorRef* error) {
   const char* path = url.fileSystemRepresentation();
-  UniqueFd fd;
+  platform::Dir made;
   const uid_t wanted = owner == 0 ? platform::kAnyOwner : owner;
-  if (int err = platform::safeMakeDirectory(url.path(), mode, withIntermediateDirectories, wanted, &fd)) {
+  if (int err = in ? in->makeDirectory(relative, mode, withIntermediateDirectories, wanted, &made, nullptr, url.path())
+                   : platform::Dir::make(relative, mode, withIntermediateDirectories, wanted, &made)) {
     if (withIntermediateDirectories)
       QRTSetError(error, QRT_POSIX_ERROR(err, "ensuredirs of %s failed: %s", path, errorText(err)));
     else
@@ -889,12 +661,13 @@ bool QRTFileManager::createDirectoryAtURL(const QRTURL& url, bool withIntermedia
     return false;
   }
   if (protectionClass != -1) {
-    if (int err = platform::setProtectionClass(fd.get(), protectionClass)) {
+    if (int err = platform::setProtectionClass(made.fd(), protectionClass)) {
       QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to setclass(%d) on directory %s: %s", protectionClass, path,
                                          errorText(err)));
       return false;
     }
   }
+  if (out) *out = std::move(made);
   return true;
 }
 
@@ -961,31 +734,28 @@ bool QRTFileManager::copyItemIfExistsAtURL(const QRTURL& src, const QRTURL& toUR
   return _copyItemAtURL(src, toURL, false, error);
 }
 
+// Reports a failed move; always false.
+static bool moveFailed(int err, const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error) {
+  QRTSetError(error, QRT_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", src, toURL, errorText(err)));
+  return false;
+}
+
 bool QRTFileManager::_moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing, QRTErrorRef* error) {
   SafeParent from, to;
   bool missing;
   int err;
   if (!openEnds(__func__, src, toURL, failIfSrcMissing, &from, &to, &missing, &err, error)) return false;
   if (missing) return true;
-  if (!err) {
-    // EXDEV stays an error: a copy would turn hard links into separate
-    // files and write sparse files out in full, as root.
-    if (renameat(from.fd.get(), from.name.c_str(), to.fd.get(), to.name.c_str()) != 0) {
-      err = errno;
-    } else {
-      // Both directories flushed before anyone hears of the move (once when
-      // they are one).
-      struct stat fromStat, toStat;
-      err = platform::syncDirectory(to.fd.get());
-      bool same = fstat(from.fd.get(), &fromStat) == 0 && fstat(to.fd.get(), &toStat) == 0 &&
-                  fromStat.st_dev == toStat.st_dev && fromStat.st_ino == toStat.st_ino;
-      if (!err && !same) err = platform::syncDirectory(from.fd.get());
-    }
-  }
-  if (err) {
-    QRTSetError(error, QRT_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", src, toURL, errorText(err)));
-    return false;
-  }
+  if (err) return moveFailed(err, src, toURL, error);
+  const platform::Dir fromDir(std::move(from.fd), {}), toDir(std::move(to.fd), {});
+  return moveItem(fromDir, from.name, toDir, to.name, src, toURL, error);
+}
+
+bool QRTFileManager::moveItem(const platform::Dir& from, std::string_view name, const platform::Dir& to,
+                              std::string_view toName, const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error) {
+  // EXDEV stays an error: a copy would turn hard links into separate files
+  // and write sparse files out in full, as root.
+  if (int err = from.renameInto(name, to, toName)) return moveFailed(err, src, toURL, error);
   return true;
 }
 
@@ -1015,11 +785,11 @@ const char* importRefusal(const struct stat& st, uid_t owner) {
 bool importableTree(int dirfd, std::string& path, uid_t owner, int depth, const char** why) {
   if (depth > kMaxImportDepth) return (*why = "nested too deep"), false;
   UniqueFd dir(platform::openDirectoryAt(dirfd, "."));
-  if (!dir.valid()) return (*why = strerror(errno)), false;
+  if (!dir.valid()) return (*why = errorText(errno)), false;
   std::vector<std::string> names;
   platform::DirectoryBatch batch;
   for (ssize_t n; (n = platform::readDirectoryBatch(dir.get(), &batch)) != 0;) {
-    if (n < 0) return (*why = strerror(static_cast<int>(-n))), false;
+    if (n < 0) return (*why = errorText(static_cast<int>(-n))), false;
     bool malformed = false;
     platform::forEachEntry(batch, static_cast<size_t>(n), [&](uint64_t, unsigned char, const char* name) {
       if (name)
@@ -1033,11 +803,11 @@ bool importableTree(int dirfd, std::string& path, uid_t owner, int depth, const 
     const size_t length = path.size();
     path += "/" + name;
     platform::Item item;
-    if (int err = platform::openItemAt(dir.get(), name.c_str(), &item)) return (*why = strerror(err)), false;
+    if (int err = platform::openItemAt(dir.get(), name.c_str(), &item)) return (*why = errorText(err)), false;
     if ((*why = importRefusal(item.st, owner))) return false;
     if (S_ISDIR(item.st.st_mode)) {
       UniqueFd sub;
-      if (int err = platform::reopenItem(item, O_RDONLY | O_DIRECTORY, &sub)) return (*why = strerror(err)), false;
+      if (int err = platform::reopenItem(item, O_RDONLY | O_DIRECTORY, &sub)) return (*why = errorText(err)), false;
       if (!importableTree(sub.get(), path, owner, depth + 1, why)) return false;
     }
     path.resize(length);
@@ -1058,7 +828,7 @@ bool QRTFileManager::itemIsImportableAtURL(const QRTURL& url, const QRTURL& from
   if (target != base && target.compare(0, base.size() + 1, base + "/") != 0) {
     why = "not inside the tree it is taken from";
   } else if (int err = platform::safeOpenItem(base, &item)) {
-    why = strerror(err);
+    why = errorText(err);
   } else if (!(why = importRefusal(item.st, owner))) {
     // Down to url one component at a time, each checked on the descriptor of the one before.
     for (size_t start = base.size() + 1; start < target.size() + 1 && !why;) {
@@ -1072,14 +842,14 @@ bool QRTFileManager::itemIsImportableAtURL(const QRTURL& url, const QRTURL& from
       if (!S_ISDIR(item.st.st_mode))
         why = "below something that is not a directory";
       else if (int err = platform::openItemAt(item.fd.get(), name.c_str(), &next))
-        why = strerror(err);
+        why = errorText(err);
       else if (!(why = importRefusal(next.st, owner)))
         item = std::move(next);
     }
     if (!why && S_ISDIR(item.st.st_mode)) {
       UniqueFd dir;
       if (int err = platform::reopenItem(item, O_RDONLY | O_DIRECTORY, &dir))
-        why = strerror(err);
+        why = errorText(err);
       else
         importableTree(dir.get(), path, owner, 0, &why);
     }
@@ -1097,14 +867,11 @@ std::optional<QRTURL> QRTFileManager::createTemporaryDirectoryInDirectoryURL(con
                                                                              QRTErrorRef* error) {
   if (error) *error = nullptr;
   const std::string prefix(withNamePrefix);
-  UniqueFd directory;
-  int err = platform::safeOpen(parent.path(), O_RDONLY | O_DIRECTORY, &directory);
-  for (int attempt = 0; !err && attempt < 100; ++attempt) {
-    std::string name = prefix + randomSuffix(6);
-    if (mkdirat(directory.get(), name.c_str(), S_IRWXU) == 0) return parent.URLByAppendingPathComponent(name, true);
-    if (errno != EEXIST) err = errno;
-  }
-  if (!err) err = EEXIST;
+  platform::Dir directory;
+  std::string name;
+  int err = platform::Dir::open(parent.path(), &directory);
+  if (!err) err = directory.makeTemporaryDirectory(prefix, S_IRWXU, &name);
+  if (!err) return parent.URLByAppendingPathComponent(name, true);
   std::string path = parent.URLByAppendingPathComponent(prefix + "XXXXXX", true).path();
   QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to create temp dir at path %s : %s", path, errorText(err)));
   return std::nullopt;
@@ -1115,7 +882,18 @@ std::optional<QRTURL> QRTFileManager::createTemporaryDirectoryInDirectoryURL(con
 }
 
 bool QRTFileManager::_traverseDirectory(const QRTURL& root, QRTErrorRef* error, const QRTTraversalVisitor& withBlock) {
-  return TreeWalker(root, withBlock).run(error);
+  QRTErrorRef stopError;
+  int err = platform::walkTree(root.path(), [&](QRTTraversalEntry& entry) {
+    QRTErrorRef visitorError;
+    if (withBlock(entry, &visitorError)) return true;
+    stopError = std::move(visitorError);
+    return false;
+  });
+  if (err == 0) return true;
+  if (err != platform::kTreeWalkStopped)
+    stopError = QRT_POSIX_ERROR(err, "Error for path %s: %s", root.fileSystemRepresentation(), errorText(err));
+  if (stopError) QRTSetError(error, stopError);
+  return false;
 }
 
 namespace {
@@ -1180,6 +958,18 @@ bool QRTFileManager::itemDoesNotExistAtURL(const QRTURL& url) {
 
 // ---------------------------------------------------------------------------
 
+namespace {
+
+int writeEncoded(const plist::Data& bytes, const platform::Dir& directory, std::string_view name,
+                 QRTWriteOptions withOptions) {
+  // A fresh temporary carries no protection class, so an atomic write needs
+  // nothing more for QRTWriteFileProtectionNone.
+  if (withOptions & QRTWriteAtomic) return directory.replaceFile(name, bytes.data(), bytes.size(), 0644);
+  return directory.writeFileInPlace(name, bytes.data(), bytes.size(), (withOptions & QRTWriteFileProtectionNone) != 0);
+}
+
+}  // namespace
+
 bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTWriteOptions withOptions,
                     QRTErrorRef* error) {
   plist::Data bytes;
@@ -1187,16 +977,25 @@ bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTW
   try {
     bytes = plist::writeBinary(plist::Value(dictionary));
   } catch (const std::bad_alloc&) { err = ENOMEM; }
-  SafeParent parent;
-  if (!err) err = platform::safeOpenParent(url.path(), &parent);
-  if (!err) {
-    // A fresh temporary carries no protection class, so an atomic write
-    // needs nothing more for QRTWriteFileProtectionNone.
-    err = (withOptions & QRTWriteAtomic)
-              ? platform::replaceFileAt(parent.fd.get(), parent.name, bytes.data(), bytes.size(), 0644)
-              : writeInPlace(parent.fd.get(), parent.name.c_str(), bytes,
-                             (withOptions & QRTWriteFileProtectionNone) != 0);
+  platform::Dir parent;
+  std::string name;
+  if (!err) err = platform::Dir::openParent(url.path(), &parent, &name);
+  if (!err) err = writeEncoded(bytes, parent, name, withOptions);
+  if (err) {
+    QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to write property list to %@: %s", url, errorText(err)));
+    return false;
   }
+  return true;
+}
+
+bool QRT_writeToDirectory(const plist::Dictionary& dictionary, const platform::Dir& directory, std::string_view name,
+                          const QRTURL& url, QRTWriteOptions withOptions, QRTErrorRef* error) {
+  plist::Data bytes;
+  int err = 0;
+  try {
+    bytes = plist::writeBinary(plist::Value(dictionary));
+  } catch (const std::bad_alloc&) { err = ENOMEM; }
+  if (!err) err = writeEncoded(bytes, directory, name, withOptions);
   if (err) {
     QRTSetError(error, QRT_POSIX_ERROR(err, "Failed to write property list to %@: %s", url, errorText(err)));
     return false;

@@ -21,23 +21,10 @@
 #include "base/PlistCodec.h"
 #include "base/PlistValue.h"
 #include "base/QRTURL.h"
+#include "platform/TreeWalk.h"
 
-// One entry of _traverseDirectory. Valid only during the visitor's call.
-struct QRTTraversalEntry {
-  enum class Kind { DirectoryPre, DirectoryPost, File, Symlink, Other };
-  const char* path = nullptr;
-  int level = 0;  // 0 for the root
-  Kind kind = Kind::Other;
-  struct stat st {};
-  int error = 0;  // errno of a directory that could not be read (kind Other)
-  // The directory that holds the entry and its name there: act on the entry
-  // only through these (platform::openItemAt), never through path, and check
-  // that what is opened is still st.
-  int parentFd = -1;
-  const char* name = nullptr;
-  // Set by the visitor on a DirectoryPre entry to pass over its contents.
-  bool skipDescendants = false;
-};
+// One entry of _traverseDirectory (platform/TreeWalk.h).
+using QRTTraversalEntry = platform::TreeEntry;
 
 // Returns false to stop the walk, after storing an error in the slot if it has one.
 // Paths are resolved from the device root (platform/SafePath.h): a symbolic
@@ -45,8 +32,9 @@ struct QRTTraversalEntry {
 using QRTTraversalVisitor = std::function<bool(QRTTraversalEntry& entry, QRTErrorRef* error)>;
 
 namespace platform {
+class Dir;
 struct Item;
-}
+}  // namespace platform
 
 class QRTFileManager {
  public:
@@ -73,6 +61,13 @@ class QRTFileManager {
                             QRTErrorRef* error);
   bool createDirectoryAtURL(const QRTURL& url, bool withIntermediateDirectories, mode_t mode, QRTErrorRef* error);
 
+  // The same relative to a directory already held (in null: from the device
+  // root, relative then being the host path); url names the directory in
+  // errors and log lines. *out, when given, receives the directory, open.
+  bool createDirectory(const platform::Dir* in, std::string_view relative, const QRTURL& url,
+                       bool withIntermediateDirectories, mode_t mode, uint32_t owner, int32_t protectionClass,
+                       platform::Dir* out, QRTErrorRef* error);
+
   bool _copyItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing, QRTErrorRef* error);
   bool copyItemAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
   bool copyItemIfExistsAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
@@ -84,6 +79,10 @@ class QRTFileManager {
   // container is never copied on its way.
   bool _moveItemAtURL(const QRTURL& src, const QRTURL& toURL, bool failIfSrcMissing, QRTErrorRef* error);
   bool moveItemAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
+  // The same between two directories already held; src and toURL name the
+  // two ends in errors.
+  bool moveItem(const platform::Dir& from, std::string_view name, const platform::Dir& to, std::string_view toName,
+                const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
   bool moveItemIfExistsAtURL(const QRTURL& src, const QRTURL& toURL, QRTErrorRef* error);
 
   // mkdirat of prefix plus six random letters and digits, mode 0700 (owned
@@ -134,6 +133,8 @@ class QRTFileManager {
   SystemContainerACLPtr _CopyTopLevelSystemContainerACLWithError(QRTErrorRef* error);
   // The top directory keeps its owner and mode bits; error 63.
   bool setTopLevelSystemContainerACLAtURL(const QRTURL& url, QRTErrorRef* error);
+  // The same on a directory already held (url names it in errors).
+  bool setTopLevelSystemContainerACL(const platform::Dir& directory, const QRTURL& url, QRTErrorRef* error);
   // Stamps the tree; single entries that cannot be changed are only logged.
   bool standardizeACLsAtURL(const QRTURL& url, bool isSystemContainer, QRTErrorRef* error);
   bool standardizeACLsForSystemContainerAtURL(const QRTURL& url, QRTErrorRef* error);
@@ -175,6 +176,7 @@ class QRTFileManager {
 
  private:
   QRTFileManager() = default;
+  bool setTopLevelACL(const platform::Dir* directory, const QRTURL& url, QRTErrorRef* error);
 };
 
 enum QRTWriteOptions : uint32_t {
@@ -197,6 +199,10 @@ constexpr QRTWriteOptions operator|(QRTWriteOptions a, QRTWriteOptions b) {
 // regular file with one link is written (ELOOP, EINVAL, EMLINK otherwise).
 bool QRT_writeToURL(const plist::Dictionary& dictionary, const QRTURL& url, QRTWriteOptions withOptions,
                     QRTErrorRef* error);
+// The same for the child name of a directory already held; url names the
+// file in errors.
+bool QRT_writeToDirectory(const plist::Dictionary& dictionary, const platform::Dir& directory, std::string_view name,
+                          const QRTURL& url, QRTWriteOptions withOptions, QRTErrorRef* error);
 // Reads a property list of any supported format whose top level is a
 // dictionary. Unparsable bytes fail in QRTPropertyListErrorDomain with 3840, another
 // top-level type with 2048, a read failure with a POSIX error.

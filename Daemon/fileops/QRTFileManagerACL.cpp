@@ -3,8 +3,6 @@
 // rights and a mask that leaves it whole; directories add a default list with
 // the same entries so that new items inherit them.
 
-#include <acl/libacl.h>
-#include <sys/acl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -12,10 +10,12 @@
 #include <cstring>
 #include <memory>
 #include <string>
-#include <type_traits>
 #include <utility>
 
+#include "base/QRTFormat.h"
 #include "Daemon/fileops/QRTFileManager.h"
+#include "platform/Acl.h"
+#include "platform/Dir.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
 #include "platform/SafePath.h"
@@ -24,30 +24,16 @@
 using platform::kLogError;
 using platform::kLogNotice;
 
-namespace {
-
-struct AclFree {
-  void operator()(void* acl) const { acl_free(acl); }
-};
-using UniqueAcl = std::unique_ptr<std::remove_pointer_t<acl_t>, AclFree>;
-
-// libacl may move a list when it grows (acl_create_entry, acl_calc_mask take
-// acl_t*): the owner gets whatever the calls left behind.
-struct ListSlot {
-  explicit ListSlot(UniqueAcl& list) : owner(list), raw(list.release()) {}
-  ~ListSlot() { owner.reset(raw); }
-  ListSlot(const ListSlot&) = delete;
-  ListSlot& operator=(const ListSlot&) = delete;
-  UniqueAcl& owner;
-  acl_t raw;
-};
-
-}  // namespace
+using platform::Acl;
+using platform::AclFailure;
+using platform::kAclExecute;
+using platform::kAclRead;
+using platform::kAclWrite;
 
 struct QRTFileManager::SystemContainerACL {
-  UniqueAcl access;
+  Acl access;
   // The default list; only directories have one.
-  UniqueAcl inherited;
+  Acl inherited;
 };
 
 void QRTFileManager::SystemContainerACLDeleter::operator()(SystemContainerACL* acl) const { delete acl; }
@@ -58,11 +44,11 @@ constexpr const char* kSystemUsersGroupName = "systemusers";
 constexpr const char* kMetadataFileName = ".com.norvane.quarter_kit.metadata.plist";
 constexpr uid_t kNobodyId = static_cast<uid_t>(-2);
 
-constexpr uint32_t kAllPermissions = ACL_READ | ACL_WRITE | ACL_EXECUTE;
+constexpr uint32_t kAllPermissions = kAclRead | kAclWrite | kAclExecute;
 constexpr uint32_t kFullDirectoryPermissions = kAllPermissions;
 constexpr uint32_t kFullFilePermissions = kAllPermissions;
 // Write and search: the group may add items to the top directory, nothing more.
-constexpr uint32_t kTopLevelPermissions = ACL_WRITE | ACL_EXECUTE;
+constexpr uint32_t kTopLevelPermissions = kAclWrite | kAclExecute;
 
 // File or directory inheritance puts an entry into the default list;
 // inherit-only keeps it out of the item's own list.
@@ -81,8 +67,6 @@ constexpr uint32_t kNoFlags = 0;
 // Owner, group and other entries.
 constexpr int kBaseEntryCount = 3;
 
-const char* errorText(int err) { return strerror(err); }
-
 // Error 63; the message ends with the text of err, taken before anything
 // else can touch errno.
 template <typename... Args>
@@ -92,83 +76,34 @@ QRTErrorRef aclError(const char* function, int line, int err, const char* format
 }
 #define QRT_ACL_ERROR(err, ...) aclError(__func__, __LINE__, (err), __VA_ARGS__)
 
-bool setPermissions(acl_entry_t entry, uint32_t permissions, QRTErrorRef* error) {
-  acl_permset_t permset;
-  if (acl_get_permset(entry, &permset) != 0) {
-    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_get_permset() failed: %s"));
-    return false;
-  }
-  acl_clear_perms(permset);
-  for (acl_perm_t perm : {ACL_READ, ACL_WRITE, ACL_EXECUTE}) {
-    if ((permissions & perm) && acl_add_perm(permset, perm) != 0) {
-      QRTSetError(error, QRT_ACL_ERROR(errno, "acl_add_perm() failed to set perms %x: %s", permissions));
-      return false;
-    }
-  }
-  if (acl_set_permset(entry, permset) != 0) {
-    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_set_permset() failed: %s"));
-    return false;
-  }
-  return true;
-}
+// The library calls that these errors name.
+constexpr const char* kAddPermCall = "acl_add_perm";
+constexpr const char* kCreateEntryCall = "acl_create_entry";
+constexpr const char* kAddFlagCall = "acl_add_flag_np";
 
-bool createEntry(acl_t* list, acl_tag_t tag, acl_entry_t* entry, QRTErrorRef* error) {
-  if (acl_create_entry(list, entry) != 0) {
-    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_create_entry() failed: %s"));
-    return false;
-  }
-  if (acl_set_tag_type(*entry, tag) != 0) {
-    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_set_tag_type() failed: %s"));
-    return false;
-  }
-  return true;
+// The failed step as the error the caller reports.
+QRTErrorRef aclFailureError(const AclFailure& failure, uint32_t permissions) {
+  if (strcmp(failure.call, kAddPermCall) == 0)
+    return QRT_ACL_ERROR(failure.err, "%s() failed to set perms %x: %s", failure.call, permissions);
+  return QRT_ACL_ERROR(failure.err, "%s() failed: %s", failure.call);
 }
 
 // A list with owner, group and other entries that grant nothing.
-UniqueAcl newList(int numACEs, QRTErrorRef* error) {
-  UniqueAcl list(acl_init(numACEs + kBaseEntryCount));
-  if (!list) {
-    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_init() failed: %s"));
-    return nullptr;
-  }
-  for (acl_tag_t tag : {ACL_USER_OBJ, ACL_GROUP_OBJ, ACL_OTHER}) {
-    ListSlot slot(list);
-    acl_entry_t entry;
-    if (!createEntry(&slot.raw, tag, &entry, error)) return nullptr;
+Acl newList(int numACEs, QRTErrorRef* error) {
+  Acl list;
+  if (AclFailure failure = Acl::makeWithOwnerEntries(numACEs + kBaseEntryCount, &list)) {
+    QRTSetError(error, aclFailureError(failure, 0));
+    return Acl();
   }
   return list;
 }
 
-bool addGroupEntry(UniqueAcl& list, gid_t gid, uint32_t permissions, QRTErrorRef* error) {
-  ListSlot slot(list);
-  acl_entry_t entry;
-  if (!createEntry(&slot.raw, ACL_GROUP, &entry, error)) return false;
-  if (permissions != 0 && !setPermissions(entry, permissions, error)) return false;
-  if (acl_set_qualifier(entry, &gid) != 0) {
-    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_set_qualifier() failed: %s"));
-    return false;
-  }
-  // The mask must not cut the group's entry down.
-  if (acl_calc_mask(&slot.raw) != 0) {
-    QRTSetError(error, QRT_ACL_ERROR(errno, "acl_calc_mask() failed: %s"));
+bool addGroupEntry(Acl& list, gid_t gid, uint32_t permissions, QRTErrorRef* error) {
+  if (AclFailure failure = list.addGroup(gid, permissions)) {
+    QRTSetError(error, aclFailureError(failure, permissions));
     return false;
   }
   return true;
-}
-
-// Gives the owner, group and other entries the item's own mode bits (the top
-// directory keeps its mode), and widens the mask to cover them.
-int adoptModeBits(UniqueAcl& list, mode_t mode) {
-  ListSlot slot(list);
-  acl_entry_t entry;
-  for (int which = ACL_FIRST_ENTRY; acl_get_entry(slot.raw, which, &entry) == 1; which = ACL_NEXT_ENTRY) {
-    acl_tag_t tag;
-    if (acl_get_tag_type(entry, &tag) != 0) return errno;
-    int shift = tag == ACL_USER_OBJ ? 6 : tag == ACL_GROUP_OBJ ? 3 : tag == ACL_OTHER ? 0 : -1;
-    if (shift < 0) continue;
-    if (!setPermissions(entry, (mode >> shift) & kAllPermissions, nullptr)) return errno;
-  }
-  return acl_calc_mask(&slot.raw) == 0 ? 0 : errno;
 }
 
 // The entry the walk saw, pinned; ESTALE when its name now holds another item.
@@ -192,20 +127,17 @@ bool foreignHardLink(const struct stat& st, uid_t owner, const char* path, const
 // descriptor entry, which reaches its inode without opening it.
 int applyList(const platform::Item& item, const QRTFileManager::SystemContainerACL& list,
               const struct stat* keepModeOf) {
-  std::string path = platform::itemProcPath(item);
-  acl_t access = list.access.get();
-  UniqueAcl merged;
+  const Acl* access = &list.access;
+  Acl merged;
   if (keepModeOf) {
-    merged.reset(acl_dup(access));
-    if (!merged) return errno;
-    if (int err = adoptModeBits(merged, keepModeOf->st_mode)) return err;
-    access = merged.get();
+    if (int err = list.access.duplicate(&merged)) return err;
+    if (int err = merged.adoptModeBits(keepModeOf->st_mode)) return err;
+    access = &merged;
   }
-  if (list.inherited && S_ISDIR(item.st.st_mode) &&
-      acl_set_file(path.c_str(), ACL_TYPE_DEFAULT, list.inherited.get()) != 0)
-    return errno;
-  if (acl_set_file(path.c_str(), ACL_TYPE_ACCESS, access) != 0) return errno;
-  return 0;
+  if (list.inherited && S_ISDIR(item.st.st_mode)) {
+    if (int err = list.inherited.applyTo(item, true)) return err;
+  }
+  return access->applyTo(item, false);
 }
 
 bool isMetadataPath(const char* path) { return strstr(path, kMetadataFileName) != nullptr; }
@@ -265,15 +197,15 @@ void resetOwnership(const platform::Item& item, bool changeOwner, uid_t uid, gid
 bool QRTFileManager::_CreateSystemUserACEInACL(SystemContainerACL* acl, uint32_t withPermissions, uint32_t andFlags,
                                                QRTErrorRef* withError) {
   if (!acl || !acl->access) {
-    QRTSetError(withError, QRT_ACL_ERROR(EINVAL, "acl_create_entry() failed: %s"));
+    QRTSetError(withError, QRT_ACL_ERROR(EINVAL, "%s() failed: %s", kCreateEntryCall));
     return false;
   }
   if (withPermissions & ~kAllPermissions) {
-    QRTSetError(withError, QRT_ACL_ERROR(EINVAL, "acl_add_perm() failed to set perms %x: %s", withPermissions));
+    QRTSetError(withError, QRT_ACL_ERROR(EINVAL, "%s() failed to set perms %x: %s", kAddPermCall, withPermissions));
     return false;
   }
   if (andFlags & ~kAllFlags) {
-    QRTSetError(withError, QRT_ACL_ERROR(EINVAL, "acl_add_flag_np() failed to set flags %x: %s", andFlags));
+    QRTSetError(withError, QRT_ACL_ERROR(EINVAL, "%s() failed to set flags %x: %s", kAddFlagCall, andFlags));
     return false;
   }
   std::optional<platform::GroupAccount> group = platform::groupByName(kSystemUsersGroupName);
@@ -309,6 +241,15 @@ QRTFileManager::SystemContainerACLPtr QRTFileManager::_CopyTopLevelSystemContain
 }
 
 bool QRTFileManager::setTopLevelSystemContainerACLAtURL(const QRTURL& url, QRTErrorRef* error) {
+  return setTopLevelACL(nullptr, url, error);
+}
+
+bool QRTFileManager::setTopLevelSystemContainerACL(const platform::Dir& directory, const QRTURL& url,
+                                                   QRTErrorRef* error) {
+  return setTopLevelACL(&directory, url, error);
+}
+
+bool QRTFileManager::setTopLevelACL(const platform::Dir* directory, const QRTURL& url, QRTErrorRef* error) {
   QRTErrorRef listError;
   SystemContainerACLPtr list = _CopyTopLevelSystemContainerACLWithError(&listError);
   int err = 0;
@@ -316,7 +257,7 @@ bool QRTFileManager::setTopLevelSystemContainerACLAtURL(const QRTURL& url, QRTEr
     err = EINVAL;
   } else {
     platform::Item item;
-    err = platform::safeOpenItem(url.path(), &item);
+    err = directory ? directory->openItem(".", &item) : platform::safeOpenItem(url.path(), &item);
     if (!err && S_ISLNK(item.st.st_mode)) err = ELOOP;
     if (!err) err = applyList(item, *list, &item.st);
   }

@@ -129,18 +129,13 @@ std::optional<QRTURL> containedPath(QRTFileManager& fm, const QRTURL& suspicious
 // below the base's level is followed, and where it leads is judged again.
 std::optional<QRTURL> followLink(QRTFileManager& fm, const QRTURL& suspicious, const QRTURL& base, int hops) {
   platform::SafeParent parent;
-  char target[1024];
-  ssize_t length = -1;
+  std::string linkTarget;
   int err = platform::safeOpenParent(suspicious.path(), &parent);
-  if (err == 0) {
-    length = readlinkat(parent.fd.get(), parent.name.c_str(), target, sizeof target);
-    if (length < 0) err = errno;
-  }
+  if (err == 0) err = platform::readLinkAt(parent.fd.get(), parent.name.c_str(), &linkTarget, 1024);
   if (err != 0) {
     QRTLog(kLogError, "Readlink failed: %s", strerror(err));
     return std::nullopt;
   }
-  std::string linkTarget(target, static_cast<size_t>(length));
   if (!linkTarget.empty() && linkTarget.front() == '/') {
     QRTLog(kLogError, "Rejecting %@ -> %s, as absolute symlinks are not allowed", suspicious, linkTarget.c_str());
     return std::nullopt;

@@ -22,6 +22,7 @@
 #include <utility>
 #include <vector>
 
+#include "base/QRTFormat.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
 #include "platform/SafePath.h"
@@ -34,8 +35,6 @@ namespace {
 // A second thread costs about as much as this many entries; smaller trees
 // are walked by the calling thread alone.
 constexpr uint64_t kEntriesBeforeHelper = 256;
-
-const char* errorText(int err) { return strerror(err); }
 
 using platform::UniqueFd;
 

@@ -18,6 +18,7 @@
 #include "Daemon/store/QRTWhitelist.h"
 #include "platform/DeviceProperties.h"
 #include "platform/DeviceRoot.h"
+#include "platform/Dir.h"
 #include "platform/Log.h"
 
 #include "Daemon/store/QRTClientConnectionInternal.h"
@@ -54,15 +55,18 @@ bool QRTClientConnection::_createDefaultDirectory(const QRTURL& url, mode_t mode
 }
 
 bool QRTClientConnection::_createTopLevelContainerDirectory(const QRTURL& url, uint64_t containerClass, uint32_t owner,
+                                                            const platform::Dir* staging, platform::Dir* out,
                                                             QRTErrorRef* error) {
   uint32_t directoryOwner = owner;
   if (QRTIsBundleClass(containerClass)) directoryOwner = QRTInstallerUserId;
   if (QRTIsSystemClass(containerClass)) directoryOwner = 0;
-  return QRTFileManager::defaultManager().createDirectoryAtURL(url, true, 0755, directoryOwner, 0, error);
+  const std::string name = staging ? url.lastPathComponent() : url.path();
+  return QRTFileManager::defaultManager().createDirectory(staging, name, url, true, 0755, directoryOwner, 0, out,
+                                                          error);
 }
 
 bool QRTClientConnection::_createSubDirectories(const QRTURL& url, uint32_t userId, uint64_t containerClass,
-                                                QRTErrorRef* error) {
+                                                QRTErrorRef* error, const platform::Dir* container) {
   const char* const* begin = nullptr;
   size_t count = 0;
   if (containerClass == QRTClassAppGroup || containerClass == QRTClassSystemGroup) {
@@ -79,7 +83,10 @@ bool QRTClientConnection::_createSubDirectories(const QRTURL& url, uint32_t user
   const uint32_t owner = system ? QRTNobodyUserId : userId;
   for (size_t i = 0; i < count; ++i) {
     QRTErrorRef underlying;
-    if (!_createDefaultDirectory(url.URLByAppendingPathComponent(begin[i], true), mode, owner, &underlying)) {
+    const QRTURL sub = url.URLByAppendingPathComponent(begin[i], true);
+    if (container ? !QRTFileManager::defaultManager().createDirectory(container, begin[i], sub, true, mode, owner, -1,
+                                                                      nullptr, &underlying)
+                  : !_createDefaultDirectory(sub, mode, owner, &underlying)) {
       QRTSetError(error, QRT_ERROR(QRTErrorCreateSubdirectoryFailed, underlying, true,
                                    "Failed to create sub-dir at %@%@", url, std::string("/") + begin[i]));
       return false;
@@ -88,23 +95,27 @@ bool QRTClientConnection::_createSubDirectories(const QRTURL& url, uint32_t user
   return true;
 }
 
-QRTMetadataRef QRTClientConnection::_buildInStaging(const QRTURL& staging, uint32_t userId,
-                                                    const std::string& identifier, uint64_t containerClass,
-                                                    QRTErrorRef* error) {
+QRTMetadataRef QRTClientConnection::_buildInStaging(const QRTURL& staging, const platform::Dir& stagingDirectory,
+                                                    uint32_t userId, const std::string& identifier,
+                                                    uint64_t containerClass, QRTErrorRef* error) {
   QRTErrorRef underlying;
-  if (!_createTopLevelContainerDirectory(staging, containerClass, userId, &underlying)) {
+  // Everything below is done relative to the container directory, held.
+  platform::Dir container;
+  if (!_createTopLevelContainerDirectory(staging, containerClass, userId,
+                                         stagingDirectory.valid() ? &stagingDirectory : nullptr, &container,
+                                         &underlying)) {
     QRTSetError(error, QRT_ERROR(QRTErrorCreateStagingFailed, underlying, true,
                                  "Failed to create staging dir at %@ : %@", staging, underlying));
     return nullptr;
   }
   auto metadata = std::make_shared<const QRTMetadata>(userId, QRTUUID::random(), containerClass, identifier,
                                                       std::nullopt, staging, std::nullopt);
-  if (!metadata->writeMetadataToDiskWithError(error)) return nullptr;
+  if (!metadata->writeMetadataToDiskWithError(error, &container)) return nullptr;
   if (QRTIsSystemClass(containerClass) &&
-      !QRTFileManager::defaultManager().setTopLevelSystemContainerACLAtURL(staging, error)) {
+      !QRTFileManager::defaultManager().setTopLevelSystemContainerACL(container, staging, error)) {
     return nullptr;
   }
-  if (!_createSubDirectories(staging, userId, containerClass, error)) return nullptr;
+  if (!_createSubDirectories(staging, userId, containerClass, error, &container)) return nullptr;
   return metadata;
 }
 
@@ -128,13 +139,24 @@ QRTMetadataRef QRTClientConnection::_createNewContainer(uint32_t userId, const s
     return nullptr;
   }
   const QRTURL staging = stagingDirectory->URLByAppendingPathComponent(directoryName, true);
+  // Staging is opened once and the container built and moved relative to
+  // it. When it cannot be opened, the path from the device root is made and
+  // resolved instead, which makes missing levels or reports what stops it.
+  platform::Dir held;
+  if (platform::Dir::open(stagingDirectory->path(), &held) != 0) held = platform::Dir();
 
-  QRTMetadataRef metadata = _buildInStaging(staging, userId, identifier, containerClass, error);
+  QRTMetadataRef metadata = _buildInStaging(staging, held, userId, identifier, containerClass, error);
   QRT_CRASH_POINT("create-after-build");
   if (metadata) {
     QRTURL finalURL = classDirectory ? classDirectory->URLByAppendingPathComponent(finalName, true) : QRTURL();
     QRTErrorRef moveError;
-    if (!classDirectory || !QRTFileManager::defaultManager().moveItemAtURL(staging, finalURL, &moveError)) {
+    platform::Dir classHeld;
+    const bool moved =
+        classDirectory && (held.valid() && platform::Dir::open(classDirectory->path(), &classHeld) == 0
+                               ? QRTFileManager::defaultManager().moveItem(held, directoryName, classHeld, finalName,
+                                                                           staging, finalURL, &moveError)
+                               : QRTFileManager::defaultManager().moveItemAtURL(staging, finalURL, &moveError));
+    if (!moved) {
       QRTSetError(error, QRT_ERROR(QRTErrorMoveStagingToLiveFailed, moveError, true,
                                    "Failed to move staging dir: %@ to live dir: %@", staging, finalURL));
     } else {

@@ -17,6 +17,9 @@
 #include "Daemon/QRTError.h"
 
 class QRTMetadata;
+namespace platform {
+class Dir;
+}
 
 // Names one container: its user, class, identifier and whether it is the
 // transient one.
@@ -143,12 +146,16 @@ class QRTClientConnection {
   void _cleanupOrphanedDataForUser(uint32_t userId, uint64_t containerClass);
 
  private:
+  // Made in staging when it is held (by the last component of url), else
+  // from the device root; *out receives the directory, open.
   bool _createTopLevelContainerDirectory(const QRTURL& url, uint64_t containerClass, uint32_t owner,
-                                         QRTErrorRef* error);
+                                         const platform::Dir* staging, platform::Dir* out, QRTErrorRef* error);
 
  public:
   // Also used when a container's default structure is made again.
-  bool _createSubDirectories(const QRTURL& url, uint32_t userId, uint64_t containerClass, QRTErrorRef* error);
+  // container, when given, is url's directory already held.
+  bool _createSubDirectories(const QRTURL& url, uint32_t userId, uint64_t containerClass, QRTErrorRef* error,
+                             const platform::Dir* container = nullptr);
   bool _createDefaultDirectory(const QRTURL& url, mode_t mode, uint32_t owner, QRTErrorRef* error);
   // Moves an item into a fresh holding directory on death row.
   bool _moveItemAtURLToDeathRow(const QRTURL& url, bool isDir, bool startDeletionThread, QRTErrorRef* error);
@@ -160,8 +167,9 @@ class QRTClientConnection {
                                  uint64_t containerClass, bool transient, bool useLocking, QRTErrorRef* error);
   QRTMetadataRef _createNewContainer(uint32_t userId, const std::string& identifier, uint64_t containerClass,
                                      bool transient, QRTErrorRef* error);
-  QRTMetadataRef _buildInStaging(const QRTURL& staging, uint32_t userId, const std::string& identifier,
-                                 uint64_t containerClass, QRTErrorRef* error);
+  // stagingDirectory: the staging directory held, or an invalid one.
+  QRTMetadataRef _buildInStaging(const QRTURL& staging, const platform::Dir& stagingDirectory, uint32_t userId,
+                                 const std::string& identifier, uint64_t containerClass, QRTErrorRef* error);
   uint64_t _runDeathRowPass();
   // The replace journal: the four directories of one replace, keyed by the
   // journal's key names.

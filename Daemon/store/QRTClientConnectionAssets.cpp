@@ -55,15 +55,15 @@ bool giveAssetsDirectory(const QRTURL& dir, uint32_t userId, QRTErrorRef* error)
   } else if (err == 0 && st.st_uid != 0) {
     err = EPERM;
   }
-  if (err == 0 && fchmod(fd.get(), 0755) != 0) err = errno;
+  if (err == 0) err = platform::chmodOpened(fd.get(), 0755);
   if (err != 0) {
     *error = QRT_ERROR(QRTErrorCreateSubdirectoryFailed, nullptr, true,
                        "Failed to chmod user managed assets dir at %@: %s", dir, strerror(err));
     return false;
   }
-  if (fchown(fd.get(), userId, userId) != 0) {
+  if (int chownErr = platform::chownOpened(fd.get(), userId, userId)) {
     *error = QRT_ERROR(QRTErrorCreateSubdirectoryFailed, nullptr, true,
-                       "Failed to chown user managed assets dir at %@: %s", dir, strerror(errno));
+                       "Failed to chown user managed assets dir at %@: %s", dir, strerror(chownErr));
     return false;
   }
   return true;

@@ -111,7 +111,7 @@ std::optional<plist::Dictionary> readMetadataFile(const QRTURL& file, QRTErrorRe
 
 }  // namespace
 
-bool QRTMetadata::writeMetadataToDiskWithError(QRTErrorRef* error) const {
+bool QRTMetadata::writeMetadataToDiskWithError(QRTErrorRef* error, const platform::Dir* container) const {
   plist::Dictionary dictionary = dictionaryRepresentation();
   const plist::Value whole(dictionary);
   if (!withinBudget(whole) || plist::writeBinary(whole).size() > QRTMetadataMaxEncodedBytes) {
@@ -123,8 +123,10 @@ bool QRTMetadata::writeMetadataToDiskWithError(QRTErrorRef* error) const {
     return false;
   }
   QRTErrorRef writeError;
-  if (!QRT_writeToURL(dictionary, url_.URLByAppendingPathComponent(QRTMetadataFileName),
-                      QRTWriteAtomic | QRTWriteFileProtectionNone, &writeError)) {
+  const QRTURL file = url_.URLByAppendingPathComponent(QRTMetadataFileName);
+  const QRTWriteOptions options = QRTWriteAtomic | QRTWriteFileProtectionNone;
+  if (container ? !QRT_writeToDirectory(dictionary, *container, QRTMetadataFileName, file, options, &writeError)
+                : !QRT_writeToURL(dictionary, file, options, &writeError)) {
     QRTSetError(
         error, QRT_ERROR(QRTErrorWriteFailed, writeError, true, "Failed to write metadata dictionary to URL %@", url_));
     return false;

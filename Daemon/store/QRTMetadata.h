@@ -14,6 +14,10 @@
 #include "base/QRTURL.h"
 #include "base/QRTUUID.h"
 
+namespace platform {
+class Dir;
+}
+
 inline constexpr const char* QRTMetadataFileName = ".com.norvane.quarter_kit.metadata.plist";
 
 inline constexpr const char* QRTMetadataIdentifierKey = "QRTMetadataIdentifier";
@@ -65,7 +69,8 @@ class QRTMetadata {
 
   // Writes the metadata file into the container directory, atomically.
   // Metadata over the size budget is refused with error 38 and not written.
-  bool writeMetadataToDiskWithError(QRTErrorRef* error) const;
+  // container, when given, is the container directory already held.
+  bool writeMetadataToDiskWithError(QRTErrorRef* error, const platform::Dir* container = nullptr) const;
   // Reads the metadata file of the container at url and checks it belongs to
   // forUser and, with checkClassPath, that the container lies directly in the
   // class directory of its class.

@@ -1,0 +1,56 @@
+// The tree walk: every entry reached through its parent's descriptor, no link
+// ever followed, at most a bounded number of directories held open. Each
+// directory is opened by name and checked against what its listing said, so
+// a swap during the walk ends in an entry that cannot be read, never in a walk
+// of something else. Entries that vanish meanwhile are passed over.
+#pragma once
+
+#include <sys/stat.h>
+
+#include <cstddef>
+#include <functional>
+#include <string_view>
+
+namespace platform {
+
+// One entry of a walk. Valid only during the visitor's call.
+struct TreeEntry {
+  enum class Kind { DirectoryPre, DirectoryPost, File, Symlink, Other };
+  const char* path = nullptr;
+  int level = 0;  // 0 for the root
+  Kind kind = Kind::Other;
+  struct stat st {};
+  int error = 0;  // errno of a directory that could not be read (kind Other)
+  // The directory that holds the entry and its name there: act on the entry
+  // only through these (openItemAt), never through path, and check that what
+  // is opened is still st.
+  int parentFd = -1;
+  const char* name = nullptr;
+  // Set by the visitor on a DirectoryPre entry to pass over its contents.
+  bool skipDescendants = false;
+};
+
+struct TreeWalkOptions {
+  // Deeper trees are walked with only this many directories open; the rest
+  // are reopened through ".." on the way back up, and only if still the
+  // directory the walk came from (ESTALE otherwise).
+  size_t maxOpenDirectories = 64;
+  // A directory on another file system than the root's is visited, never
+  // entered.
+  bool sameFileSystem = true;
+};
+
+// False stops the walk.
+using TreeVisitor = std::function<bool(TreeEntry& entry)>;
+
+// The visitor is called for the root (a directory or not) and for each entry
+// below it: directories before (DirectoryPre) and after (DirectoryPost) their
+// children. A directory that cannot be opened or was swapped since the
+// listing is an Other entry with its error and is not entered. Returns 0 when
+// the walk reached its end, kTreeWalkStopped when the visitor stopped it, or
+// an errno value when the walk could not go on (the root unreachable
+// (SafePath.h), a listing that failed).
+inline constexpr int kTreeWalkStopped = -1;
+int walkTree(std::string_view hostPath, const TreeVisitor& visitor, const TreeWalkOptions& options = {});
+
+}  // namespace platform
