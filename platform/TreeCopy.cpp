@@ -17,6 +17,7 @@
 #include "base/QRTFormat.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
+#include "platform/TreeWalk.h"
 
 namespace platform {
 
@@ -38,23 +39,10 @@ class TreeCloner {
   int run(int sparent, const char* sname, int dparent, const char* dname);
 
  private:
-  struct Child {
-    std::string name;
-    unsigned char type;
-  };
-  struct Frame {
-    UniqueFd src;
-    UniqueFd dst;
-    struct stat st;
-    std::vector<Child> children;
-    size_t next = 0;
-  };
-
+  bool visit(TreeEntry& entry);
   int copyEntry(int sdir, const char* sname, int ddir, const char* dname, unsigned char type);
-  int enterDirectory(int sdir, const char* sname, int ddir, const char* dname);
-  int readChildren(Frame& frame);
-  int walk();
-  int finishDirectory(Frame& frame);
+  int enterDirectory(const TreeEntry& entry);
+  int finishDirectory(const TreeEntry& entry);
   int copyFile(int sdir, const char* sname, int ddir, const char* dname);
   int copyData(int sfd, int dfd, off_t size);
   int copySymlink(int sdir, const char* sname, int ddir, const char* dname);
@@ -65,11 +53,13 @@ class TreeCloner {
   ssize_t readXattr(int sfd, const char* name);
 
   bool durable_;
-  std::vector<Frame> stack_;
+  const char* rootName_ = nullptr;  // of the destination
+  int rootParent_ = -1;
+  std::vector<UniqueFd> destinations_;  // the directories on the walk's path
+  int error_ = 0;
   std::vector<char> names_ = std::vector<char>(4096);
   std::vector<char> value_ = std::vector<char>(4096);
   std::unique_ptr<char[]> dataBuffer_;
-  std::unique_ptr<platform::DirectoryBatch> batch_;
   dev_t dstRootDevice_ = 0;
   ino_t dstRootInode_ = 0;
   // Items created under a directory with a default ACL inherit ACLs the
@@ -94,41 +84,36 @@ int TreeCloner::run(int sparent, const char* sname, int dparent, const char* dna
     int err = copyEntry(sparent, sname, dparent, dname, typeOfMode(st.st_mode));
     return err ? err : durable_ ? platform::syncDirectory(dparent) : 0;
   }
-  if (int err = enterDirectory(sparent, sname, dparent, dname)) return err;
-  struct stat dstStat;
-  if (fstat(stack_.back().dst.get(), &dstStat) != 0) return errno;
-  dstRootDevice_ = dstStat.st_dev;
-  dstRootInode_ = dstStat.st_ino;
-  dropInheritedAcls_ = fgetxattr(stack_.back().dst.get(), kDefaultAclAttribute, nullptr, 0) >= 0;
-  if (int err = walk()) return err;
+  rootName_ = dname;
+  rootParent_ = dparent;
+  // Every file system the source spans is copied; the listing's types save
+  // a stat per entry, as each is opened and checked anyway.
+  TreeWalkOptions options;
+  options.sameFileSystem = false;
+  options.typesFromListing = true;
+  int err = walkTreeAt(
+      sparent, sname, sname, [this](TreeEntry& entry) { return visit(entry); }, options);
+  if (err == kTreeWalkStopped) err = error_;
+  if (err) return err;
   return durable_ ? platform::syncDirectory(dparent) : 0;
 }
 
-int TreeCloner::walk() {
-  while (!stack_.empty()) {
-    Frame& top = stack_.back();
-    if (top.next == top.children.size()) {
-      int err = finishDirectory(top);
-      stack_.pop_back();
-      if (err) return err;
-      continue;
-    }
-    // copyEntry may push a frame: nothing of top is used after it.
-    const Child child = top.children[top.next++];
-    if (int err = copyEntry(top.src.get(), child.name.c_str(), top.dst.get(), child.name.c_str(), child.type))
-      return err;
+bool TreeCloner::visit(TreeEntry& entry) {
+  const int ddir = destinations_.empty() ? -1 : destinations_.back().get();
+  int err;
+  switch (entry.kind) {
+    case TreeEntry::Kind::DirectoryPre: err = enterDirectory(entry); break;
+    case TreeEntry::Kind::DirectoryPost: err = finishDirectory(entry); break;
+    case TreeEntry::Kind::File: err = copyFile(entry.parentFd, entry.name, ddir, entry.name); break;
+    case TreeEntry::Kind::Symlink: err = copySymlink(entry.parentFd, entry.name, ddir, entry.name); break;
+    default: err = entry.error ? entry.error : copySpecial(entry.parentFd, entry.name, ddir, entry.name); break;
   }
-  return 0;
+  error_ = err;
+  return err == 0;
 }
 
 int TreeCloner::copyEntry(int sdir, const char* sname, int ddir, const char* dname, unsigned char type) {
-  if (type == DT_UNKNOWN) {
-    struct stat st;
-    if (fstatat(sdir, sname, &st, AT_SYMLINK_NOFOLLOW) != 0) return errno;
-    type = typeOfMode(st.st_mode);
-  }
   switch (type) {
-    case DT_DIR: return enterDirectory(sdir, sname, ddir, dname);
     case DT_REG: return copyFile(sdir, sname, ddir, dname);
     case DT_LNK: return copySymlink(sdir, sname, ddir, dname);
     default: return copySpecial(sdir, sname, ddir, dname);
@@ -137,41 +122,30 @@ int TreeCloner::copyEntry(int sdir, const char* sname, int ddir, const char* dna
 
 // An existing directory at the destination is copied into; a link there is
 // refused (ELOOP).
-int TreeCloner::enterDirectory(int sdir, const char* sname, int ddir, const char* dname) {
-  UniqueFd sfd(openDirectoryAt(sdir, sname));
-  if (!sfd.valid()) return errno;
-  struct stat st;
-  if (fstat(sfd.get(), &st) != 0) return errno;
-  if (st.st_dev == dstRootDevice_ && st.st_ino == dstRootInode_) return EINVAL;  // a copy into itself
+int TreeCloner::enterDirectory(const TreeEntry& entry) {
+  const bool root = entry.level == 0;
+  if (entry.st.st_dev == dstRootDevice_ && entry.st.st_ino == dstRootInode_) return EINVAL;  // a copy into itself
+  const int ddir = root ? rootParent_ : destinations_.back().get();
+  const char* dname = root ? rootName_ : entry.name;
   if (mkdirat(ddir, dname, S_IRWXU) != 0 && errno != EEXIST) return errno;
   UniqueFd dfd(openDirectoryAt(ddir, dname));
   if (!dfd.valid()) return errno;
-  stack_.push_back(Frame{std::move(sfd), std::move(dfd), st, {}, 0});
-  return readChildren(stack_.back());
-}
-
-// The whole listing up front, so that the source descriptor serves only to
-// open children.
-int TreeCloner::readChildren(Frame& frame) {
-  if (!batch_) batch_ = std::make_unique<platform::DirectoryBatch>();
-  for (;;) {
-    ssize_t n = platform::readDirectoryBatch(frame.src.get(), batch_.get());
-    if (n < 0) return static_cast<int>(-n);
-    if (n == 0) return 0;
-    int err = 0;
-    platform::forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t, unsigned char type, const char* name) {
-      if (name)
-        frame.children.push_back(Child{name, type});
-      else
-        err = EIO;
-    });
-    if (err) return err;
+  if (root) {
+    struct stat dstStat;
+    if (fstat(dfd.get(), &dstStat) != 0) return errno;
+    dstRootDevice_ = dstStat.st_dev;
+    dstRootInode_ = dstStat.st_ino;
+    dropInheritedAcls_ = fgetxattr(dfd.get(), kDefaultAclAttribute, nullptr, 0) >= 0;
   }
+  destinations_.push_back(std::move(dfd));
+  return 0;
 }
 
-int TreeCloner::finishDirectory(Frame& frame) {
-  if (int err = finishItem(frame.src.get(), frame.dst.get(), frame.st, true)) return err;
-  return durable_ ? platform::syncDirectory(frame.dst.get()) : 0;
+int TreeCloner::finishDirectory(const TreeEntry& entry) {
+  UniqueFd dfd = std::move(destinations_.back());
+  destinations_.pop_back();
+  if (int err = finishItem(entry.fd, dfd.get(), entry.st, true)) return err;
+  return durable_ ? platform::syncDirectory(dfd.get()) : 0;
 }
 
 int TreeCloner::copyFile(int sdir, const char* sname, int ddir, const char* dname) {
