@@ -1,5 +1,6 @@
 #include "platform/TreeWalk.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 
@@ -29,6 +30,8 @@ class Walk {
  public:
   Walk(const TreeVisitor& visitor, const TreeWalkOptions& options) : visitor_(visitor), options_(options) {}
   int run(std::string_view hostPath);
+  int runAt(int parentFd, const char* name);
+  void setPath(std::string_view path) { path_ = path; }
 
  private:
   struct Frame {
@@ -36,14 +39,14 @@ class Walk {
     struct stat st;
     std::string name;
     size_t parentPathLength;
-    std::vector<std::string> children;
+    std::vector<std::pair<std::string, unsigned char>> children;
     size_t next = 0;
   };
 
   bool visit(Kind kind, int parentFd, const char* name, const struct stat& st, int level, int error = 0,
-             bool* skip = nullptr);
-  bool visitChild(const std::string& name);
-  bool enter(int parentFd, const std::string& name, const struct stat& st);
+             bool* skip = nullptr, int fd = -1);
+  bool visitChild(const std::string& name, unsigned char type);
+  bool enter(int parentFd, const std::string& name, struct stat st, bool statKnown = true);
   bool leave();
   int parentFdOfTop();
   int readChildren(Frame& frame);
@@ -55,6 +58,7 @@ class Walk {
   const TreeVisitor& visitor_;
   const TreeWalkOptions& options_;
   SafeParent rootParent_;
+  int rootParentFd_ = -1;
   std::string path_;
   std::vector<Frame> stack_;
   std::unique_ptr<DirectoryBatch> batch_;
@@ -64,21 +68,24 @@ class Walk {
 
 int Walk::run(std::string_view hostPath) {
   path_ = hostPath;
-  struct stat st;
   int err = safeOpenParent(path_, &rootParent_);
-  if (!err && fstatat(rootParent_.fd.get(), rootParent_.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) err = errno;
-  bool ok = err ? fail(err) : true;
+  if (err) return err;
+  return runAt(rootParent_.fd.get(), rootParent_.name.c_str());
+}
+
+int Walk::runAt(int parentFd, const char* name) {
+  rootParentFd_ = parentFd;
+  struct stat st;
+  bool ok = fstatat(parentFd, name, &st, AT_SYMLINK_NOFOLLOW) != 0 ? fail(errno) : true;
   if (ok) {
     device_ = st.st_dev;
-    const int parentFd = rootParent_.fd.get();
-    ok = S_ISDIR(st.st_mode) ? enter(parentFd, rootParent_.name, st)
-                             : visit(kindOfMode(st.st_mode), parentFd, rootParent_.name.c_str(), st, 0);
+    ok = S_ISDIR(st.st_mode) ? enter(parentFd, name, st) : visit(kindOfMode(st.st_mode), parentFd, name, st, 0);
   }
   while (ok && !stack_.empty()) {
     Frame& top = stack_.back();
     if (top.next < top.children.size()) {
-      std::string name = std::move(top.children[top.next++]);
-      ok = visitChild(name);
+      auto child = std::move(top.children[top.next++]);
+      ok = visitChild(child.first, child.second);
     } else {
       ok = leave();
     }
@@ -86,7 +93,21 @@ int Walk::run(std::string_view hostPath) {
   return ok ? 0 : result_;
 }
 
-bool Walk::visit(Kind kind, int parentFd, const char* name, const struct stat& st, int level, int error, bool* skip) {
+mode_t modeOfType(unsigned char type) {
+  switch (type) {
+    case DT_DIR: return S_IFDIR;
+    case DT_REG: return S_IFREG;
+    case DT_LNK: return S_IFLNK;
+    case DT_FIFO: return S_IFIFO;
+    case DT_SOCK: return S_IFSOCK;
+    case DT_CHR: return S_IFCHR;
+    case DT_BLK: return S_IFBLK;
+    default: return 0;
+  }
+}
+
+bool Walk::visit(Kind kind, int parentFd, const char* name, const struct stat& st, int level, int error, bool* skip,
+                 int fd) {
   TreeEntry entry;
   entry.path = path_.c_str();
   entry.level = level;
@@ -95,22 +116,26 @@ bool Walk::visit(Kind kind, int parentFd, const char* name, const struct stat& s
   entry.error = error;
   entry.parentFd = parentFd;
   entry.name = name;
+  entry.fd = fd;
   if (!visitor_(entry)) return fail(kTreeWalkStopped);
   if (skip) *skip = entry.skipDescendants;
   return true;
 }
 
-bool Walk::visitChild(const std::string& name) {
+bool Walk::visitChild(const std::string& name, unsigned char type) {
   const int parentFd = stack_.back().fd.get();
   const size_t parentLength = path_.size();
-  struct stat st;
-  if (fstatat(parentFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
+  struct stat st {};
+  const bool statKnown = !options_.typesFromListing || type == DT_UNKNOWN;
+  if (!statKnown) {
+    st.st_mode = modeOfType(type);
+  } else if (fstatat(parentFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
     if (errno == ENOENT) return true;  // gone meanwhile
     return fail(errno);
   }
   bool ok;
   if (S_ISDIR(st.st_mode)) {
-    ok = enter(parentFd, name, st);
+    ok = enter(parentFd, name, st, statKnown);
   } else {
     path_ += '/';
     path_ += name;
@@ -120,8 +145,9 @@ bool Walk::visitChild(const std::string& name) {
   return ok;
 }
 
-// Visits the directory, then pushes it unless it is to be passed over.
-bool Walk::enter(int parentFd, const std::string& name, const struct stat& st) {
+// Visits the directory, then pushes it unless it is to be passed over. Known
+// only by its listed type, it is taken as what the open finds.
+bool Walk::enter(int parentFd, const std::string& name, struct stat st, bool statKnown) {
   const size_t parentLength = path_.size();
   const int level = static_cast<int>(stack_.size());
   if (level > 0) {
@@ -130,15 +156,18 @@ bool Walk::enter(int parentFd, const std::string& name, const struct stat& st) {
   }
   UniqueFd fd;
   int err = 0;
-  if (!options_.sameFileSystem || st.st_dev == device_) {
+  if (!options_.sameFileSystem || !statKnown || st.st_dev == device_) {
     fd.reset(openDirectoryAt(parentFd, name.c_str()));
     struct stat opened;
     if (!fd.valid())
       err = errno;
     else if (fstat(fd.get(), &opened) != 0)
       err = errno;
+    else if (!statKnown)
+      st = opened;
     else if (opened.st_dev != st.st_dev || opened.st_ino != st.st_ino)
       err = ESTALE;
+    if (!err && options_.sameFileSystem && st.st_dev != device_) fd.reset();
   }
   if (err) {
     // Unreadable, or swapped since the listing: reported, not entered.
@@ -147,7 +176,7 @@ bool Walk::enter(int parentFd, const std::string& name, const struct stat& st) {
     return ok;
   }
   bool skip = false;
-  if (!visit(Kind::DirectoryPre, parentFd, name.c_str(), st, level, 0, &skip)) return false;
+  if (!visit(Kind::DirectoryPre, parentFd, name.c_str(), st, level, 0, &skip, fd.get())) return false;
   Frame frame{std::move(fd), st, name, parentLength, {}, 0};
   // Another file system's directory is seen, never entered.
   if (!skip && frame.fd.valid()) {
@@ -165,8 +194,8 @@ int Walk::readChildren(Frame& frame) {
     ssize_t n = readDirectoryBatch(frame.fd.get(), batch_.get());
     if (n < 0) return static_cast<int>(-n);
     if (n == 0) return 0;
-    forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t, unsigned char, const char* name) {
-      if (name) frame.children.emplace_back(name);
+    forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t, unsigned char type, const char* name) {
+      if (name) frame.children.emplace_back(name, type);
     });
   }
 }
@@ -175,7 +204,7 @@ int Walk::readChildren(Frame& frame) {
 // ".." when it was closed for depth, and only if it is still the one we came
 // from.
 int Walk::parentFdOfTop() {
-  if (stack_.size() < 2) return rootParent_.fd.get();
+  if (stack_.size() < 2) return rootParentFd_;
   Frame& parent = stack_[stack_.size() - 2];
   if (!parent.fd.valid()) {
     const Frame& child = stack_.back();
@@ -197,7 +226,7 @@ bool Walk::leave() {
   if (parentFd < 0) return fail(errno);
   Frame& top = stack_.back();
   const int level = static_cast<int>(stack_.size()) - 1;
-  bool ok = visit(Kind::DirectoryPost, parentFd, top.name.c_str(), top.st, level);
+  bool ok = visit(Kind::DirectoryPost, parentFd, top.name.c_str(), top.st, level, 0, nullptr, top.fd.get());
   path_.resize(top.parentPathLength);
   stack_.pop_back();
   return ok;
@@ -207,6 +236,13 @@ bool Walk::leave() {
 
 int walkTree(std::string_view hostPath, const TreeVisitor& visitor, const TreeWalkOptions& options) {
   return Walk(visitor, options).run(hostPath);
+}
+
+int walkTreeAt(int parentFd, const char* name, std::string_view path, const TreeVisitor& visitor,
+               const TreeWalkOptions& options) {
+  Walk walk(visitor, options);
+  walk.setPath(path);
+  return walk.runAt(parentFd, name);
 }
 
 }  // namespace platform

@@ -21,6 +21,9 @@ struct TreeEntry {
   Kind kind = Kind::Other;
   struct stat st {};
   int error = 0;  // errno of a directory that could not be read (kind Other)
+  // A directory's own descriptor on DirectoryPre and DirectoryPost, -1 when
+  // it is not entered.
+  int fd = -1;
   // The directory that holds the entry and its name there: act on the entry
   // only through these (openItemAt), never through path, and check that what
   // is opened is still st.
@@ -38,6 +41,10 @@ struct TreeWalkOptions {
   // A directory on another file system than the root's is visited, never
   // entered.
   bool sameFileSystem = true;
+  // Entries other than directories carry only their type in st.st_mode, as
+  // the listing gave it (an fstatat only where it gave none), so that a walk
+  // that opens and checks each entry anyway pays no stat for it.
+  bool typesFromListing = false;
 };
 
 // False stops the walk.
@@ -52,5 +59,9 @@ using TreeVisitor = std::function<bool(TreeEntry& entry)>;
 // (SafePath.h), a listing that failed).
 inline constexpr int kTreeWalkStopped = -1;
 int walkTree(std::string_view hostPath, const TreeVisitor& visitor, const TreeWalkOptions& options = {});
+// The same from the item name in the directory parentFd; path is the root
+// entry's path.
+int walkTreeAt(int parentFd, const char* name, std::string_view path, const TreeVisitor& visitor,
+               const TreeWalkOptions& options = {});
 
 }  // namespace platform
