@@ -12,6 +12,10 @@
 
 namespace platform {
 
+// The unprivileged nobody id: owner of the sub-directories of system
+// containers.
+inline constexpr uint32_t kNobodyUserId = 4294967294u;
+
 struct UserAccount {
   std::string name;
   uint32_t uid = 0;

@@ -42,7 +42,6 @@ namespace {
 
 constexpr const char* kSystemUsersGroupName = "systemusers";
 constexpr const char* kMetadataFileName = ".com.norvane.quarter_kit.metadata.plist";
-constexpr uid_t kNobodyId = static_cast<uid_t>(-2);
 
 constexpr uint32_t kAllPermissions = kAclRead | kAclWrite | kAclExecute;
 constexpr uint32_t kFullDirectoryPermissions = kAllPermissions;
@@ -156,7 +155,7 @@ void stampItem(const QRTTraversalEntry& entry, const StampLists& lists, bool isC
   const struct stat& st = item.st;
   // Links carry no ACL, and their targets may lie outside the tree.
   if (S_ISLNK(st.st_mode)) return;
-  if (!isContainerRoot && foreignHardLink(st, kNobodyId, entry.path, "standardizeACLsAtURL")) return;
+  if (!isContainerRoot && foreignHardLink(st, platform::kNobodyUserId, entry.path, "standardizeACLsAtURL")) return;
   bool isDirectory = S_ISDIR(st.st_mode);
   // chmod rewrites an access ACL, so the mode goes before the list is set.
   if (!isContainerRoot) {
@@ -172,7 +171,7 @@ void stampItem(const QRTTraversalEntry& entry, const StampLists& lists, bool isC
       QRTLogAs(kLogError, "standardizeACLsAtURL", "Failed to set ACL on dir %s: %s", entry.path, errorText(err));
   }
   if (!isContainerRoot) {
-    if (int err = platform::chownItem(item, kNobodyId, kNobodyId))
+    if (int err = platform::chownItem(item, platform::kNobodyUserId, platform::kNobodyUserId))
       QRTLogAs(kLogError, "standardizeACLsAtURL", "Could not chown %s: %s", entry.path, errorText(err));
   }
 }

@@ -20,6 +20,7 @@
 #include "platform/DeviceRoot.h"
 #include "platform/Dir.h"
 #include "platform/Log.h"
+#include "platform/UserDatabase.h"
 
 #include "Daemon/store/QRTClientConnectionInternal.h"
 
@@ -80,7 +81,7 @@ bool QRTClientConnection::_createSubDirectories(const QRTURL& url, uint32_t user
   // A system container's group bits are its ACL mask (owner, group and other
   // entries stay empty): 0000 would cut the systemusers entry down to nothing.
   const mode_t mode = system ? 0070 : 0755;
-  const uint32_t owner = system ? QRTNobodyUserId : userId;
+  const uint32_t owner = system ? platform::kNobodyUserId : userId;
   for (size_t i = 0; i < count; ++i) {
     QRTErrorRef underlying;
     const QRTURL sub = url.URLByAppendingPathComponent(begin[i], true);

@@ -24,8 +24,6 @@ enum QRTContentClass : uint64_t {
 inline constexpr uint32_t QRTInstallerUserId = 33;
 inline constexpr uint32_t QRTSystemContainerUserId = 499;
 inline constexpr uint32_t QRTDefaultMobileUserId = 501;
-// The unprivileged nobody id: owner of the sub-directories of system containers.
-inline constexpr uint32_t QRTNobodyUserId = 4294967294u;
 
 inline bool QRTIsBundleClass(uint64_t c) { return c == 1 || c == 3 || c == 5 || c == 8; }
 inline bool QRTIsSystemClass(uint64_t c) { return c == 12 || c == 13; }
