@@ -123,22 +123,22 @@ void DaemonFixture::TearDown() {
     int status = stopDaemon();
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "daemon exit status " << status;
   }
-  if (!mountedHome.empty()) umount2(mountedHome.c_str(), MNT_DETACH);
+  for (auto it = mounted.rbegin(); it != mounted.rend(); ++it) umount2(it->c_str(), MNT_DETACH);
   if (!root.empty() && !HasFailure()) system(("rm -rf " + root).c_str());
 }
 
-bool DaemonFixture::mountHomeOnTmpfs() {
-  const std::string home = root + "/private/var/mobile", disk = home + ".disk";
+bool DaemonFixture::mountOnTmpfs(const std::string& directory, const std::string& size) {
+  const std::string disk = directory + ".disk";
   stopDaemon();
-  const bool mounted = rename(home.c_str(), disk.c_str()) == 0 && mkdir(home.c_str(), 0755) == 0 &&
-                       mount("quarterd-test", home.c_str(), "tmpfs", 0, "size=96m") == 0;
-  if (mounted)
-    mountedHome = home;
+  const bool done = rename(directory.c_str(), disk.c_str()) == 0 && mkdir(directory.c_str(), 0755) == 0 &&
+                    mount("quarterd-test", directory.c_str(), "tmpfs", 0, ("size=" + size).c_str()) == 0;
+  if (done)
+    mounted.push_back(directory);
   else
-    rmdir(home.c_str());
-  EXPECT_EQ(system(("cp -a " + disk + "/. " + home + (mounted ? "" : " && rm -rf " + disk)).c_str()), 0);
+    rmdir(directory.c_str());
+  EXPECT_EQ(system(("cp -a " + disk + "/. " + directory + " && rm -rf " + disk).c_str()), 0);
   startDaemon();
-  return mounted;
+  return done;
 }
 
 void DaemonFixture::startDaemon() {

@@ -70,9 +70,11 @@ class DaemonFixture : public ::testing::Test {
   void setOwnIdentity(const std::string& signingIdentifier, const plist::Dictionary& entitlements);
   void clearOwnIdentity();
 
-  // Moves user 501's home onto a tmpfs of its own, the daemon stopped
-  // around it; false (the daemon running as before) when mounting is refused.
-  bool mountHomeOnTmpfs();
+  // Moves a directory of the device root onto a tmpfs of its own, the daemon
+  // stopped around it; false (the daemon running as before) when mounting is
+  // refused. mountHomeOnTmpfs does so for user 501's home.
+  bool mountOnTmpfs(const std::string& directory, const std::string& size);
+  bool mountHomeOnTmpfs() { return mountOnTmpfs(root + "/private/var/mobile", "96m"); }
 
   std::string logText() const;
   // Waits (up to 5 s) until the log holds the text.
@@ -80,7 +82,7 @@ class DaemonFixture : public ::testing::Test {
 
   std::string root;
   pid_t daemon = -1;
-  std::string mountedHome;
+  std::vector<std::string> mounted;  // innermost last
 };
 
 plist::Dictionary request(uint64_t command, plist::Dictionary keys = {});
