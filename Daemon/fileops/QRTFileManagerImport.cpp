@@ -43,12 +43,12 @@ bool importableTree(const platform::Item& top, std::string& path, uid_t owner, c
   int err = platform::walkTreeAt(
       top.fd.get(), ".", base,
       [&](platform::TreeEntry& entry) {
-        if (entry.level == 0 || entry.kind == platform::TreeEntry::Kind::DirectoryPost) return true;
+        if (entry.kind == platform::TreeEntry::Kind::DirectoryPost) return true;
         path = entry.path;
         if (entry.error)
-          *why = errorText(entry.error);
-        else if (!(*why = importRefusal(entry.st, owner)) && entry.kind == platform::TreeEntry::Kind::DirectoryPre &&
-                 entry.level > kMaxImportDepth)
+          *why = errorText(entry.error);  // the top itself too
+        else if (entry.level > 0 && !(*why = importRefusal(entry.st, owner)) &&
+                 entry.kind == platform::TreeEntry::Kind::DirectoryPre && entry.level > kMaxImportDepth)
           *why = "nested too deep";
         return !*why;
       },
