@@ -76,6 +76,8 @@ uint64_t Reply::u64(std::string_view key) const {
   const plist::Integer* i = v ? v->integerIf() : nullptr;
   return i ? i->asUnsigned() : 0;
 }
+uint64_t Reply::error() const { return u64(QRTReplyKeyError); }
+
 int64_t Reply::i64(std::string_view key) const { return static_cast<int64_t>(u64(key)); }
 bool Reply::boolean(std::string_view key) const {
   const plist::Value* v = value(key);

@@ -24,6 +24,7 @@
 #include "QuarterKit/QuarterKit.h"
 #include "QuarterKit/Requests.h"
 #include "base/Frame.h"
+#include "base/QRTProtocol.h"
 #include "bench/BenchLoad.h"
 
 namespace {
@@ -108,7 +109,7 @@ class EchoServer {
   }
 
   static void serve(int fd) {
-    const plist::Dictionary reply = {{"ReplyError", kRefused}};
+    const plist::Dictionary reply = {{QRTReplyKeyError, kRefused}};
     frame::Decoder decoder;
     std::vector<uint8_t> buffer(64 * 1024);
     for (;;) {

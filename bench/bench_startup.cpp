@@ -27,6 +27,7 @@
 #include "Daemon/store/QRTMetadata.h"
 #include "QuarterKit/QuarterKit.h"
 #include "base/PlistCodec.h"
+#include "base/QRTProtocol.h"
 #include "platform/DeviceRoot.h"
 #include "platform/Log.h"
 
@@ -134,7 +135,7 @@ uint64_t firstServed(const std::string& root, const plist::Dictionary& request) 
   while (Clock::now() < deadline) {
     if (auto connection = qk::Connection::connect(qk::requestSocketPath(root))) {
       auto reply = connection->call(request, std::chrono::seconds(600));
-      const plist::Value* code = reply ? plist::find(*reply, "ReplyError") : nullptr;
+      const plist::Value* code = reply ? plist::find(*reply, QRTReplyKeyError) : nullptr;
       return code && code->isInteger() ? code->integer().asUnsigned() : 0;
     }
     std::this_thread::sleep_for(std::chrono::microseconds(200));

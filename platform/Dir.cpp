@@ -1,5 +1,6 @@
 #include "platform/Dir.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -268,17 +269,36 @@ int Dir::renameInto(std::string_view name, const Dir& to, std::string_view toNam
   return err;
 }
 
-int Dir::list(std::vector<std::string>* names) const {
-  UniqueFd reader(openDirectoryAt(fd(), "."));
+namespace {
+
+// Calls visit(fd, type, name) for each readable record of the directory.
+template <typename Visit>
+int listDirectory(int dirfd, Visit visit) {
+  UniqueFd reader(openDirectoryAt(dirfd, "."));
   if (!reader.valid()) return errno;
   auto batch = std::make_unique<DirectoryBatch>();
   for (ssize_t n; (n = readDirectoryBatch(reader.get(), batch.get())) != 0;) {
     if (n < 0) return static_cast<int>(-n);
-    forEachEntry(*batch, static_cast<size_t>(n), [&](uint64_t, unsigned char, const char* entry) {
-      if (entry) names->emplace_back(entry);
+    forEachEntry(*batch, static_cast<size_t>(n), [&](uint64_t, unsigned char type, const char* entry) {
+      if (entry) visit(reader.get(), type, entry);
     });
   }
   return 0;
+}
+
+}  // namespace
+
+int Dir::list(std::vector<std::string>* names) const {
+  return listDirectory(fd(), [&](int, unsigned char, const char* name) { names->emplace_back(name); });
+}
+
+int Dir::list(std::vector<Entry>* entries) const {
+  return listDirectory(fd(), [&](int reader, unsigned char type, const char* name) {
+    struct stat st;
+    if (type == DT_UNKNOWN && fstatat(reader, name, &st, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(st.st_mode))
+      type = DT_DIR;
+    entries->push_back({name, type == DT_DIR});
+  });
 }
 
 }  // namespace platform

@@ -82,6 +82,14 @@ class Dir {
   // The names in directory order ("." and ".." left out; a malformed record
   // is skipped).
   int list(std::vector<std::string>* names) const;
+  struct Entry {
+    std::string name;
+    bool directory;
+  };
+  // The same with whether each entry is a directory (looked up, without
+  // following a link, where the listing gave no type; one gone meanwhile
+  // counts as no directory).
+  int list(std::vector<Entry>* entries) const;
 
   // Changes on an opened child (FileIO.h, Acl.h).
   static int setOwner(const Item& item, uid_t uid, gid_t gid) { return chownItem(item, uid, gid); }

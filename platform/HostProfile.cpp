@@ -14,8 +14,6 @@ namespace platform {
 
 namespace {
 
-constexpr uint32_t kInstallerUser = 33;
-constexpr uint32_t kSystemUser = 499;
 constexpr uint32_t kDefaultUidMin = 1000;
 
 // Written by enableHostProfile and loadHostProfile before any other thread
@@ -188,8 +186,8 @@ std::optional<uint64_t> configuredMaxContainersPerClass() { return profile().con
 
 std::optional<HostAccount> hostAccountFor(uint32_t protocolUser) {
   if (!hostProfile()) return std::nullopt;
-  if (protocolUser == kInstallerUser) return profile().installer;
-  if (protocolUser == kSystemUser) return profile().system;
+  if (protocolUser == kInstallerUserId) return profile().installer;
+  if (protocolUser == kSystemContainerUserId) return profile().system;
   return std::nullopt;
 }
 
@@ -198,14 +196,16 @@ std::optional<HostAccount> hostDefaultUser() { return profile().defaultUser; }
 std::optional<gid_t> hostSystemUsersGroup() { return profile().systemUsers; }
 
 std::optional<uid_t> hostUserId(uint32_t protocolUser) {
-  if (!hostProfile() || (protocolUser != kInstallerUser && protocolUser != kSystemUser)) return protocolUser;
+  if (!hostProfile() || (protocolUser != kInstallerUserId && protocolUser != kSystemContainerUserId))
+    return protocolUser;
   std::optional<HostAccount> account = hostAccountFor(protocolUser);
   if (!account) return std::nullopt;
   return account->uid;
 }
 
 std::optional<gid_t> hostGroupId(uint32_t protocolUser) {
-  if (!hostProfile() || (protocolUser != kInstallerUser && protocolUser != kSystemUser)) return protocolUser;
+  if (!hostProfile() || (protocolUser != kInstallerUserId && protocolUser != kSystemContainerUserId))
+    return protocolUser;
   std::optional<HostAccount> account = hostAccountFor(protocolUser);
   if (!account) return std::nullopt;
   return account->gid;
@@ -214,9 +214,9 @@ std::optional<gid_t> hostGroupId(uint32_t protocolUser) {
 uint32_t protocolUserId(uid_t hostUid) {
   if (!hostProfile()) return hostUid;
   const Profile& p = profile();
-  if (p.installer && p.installer->uid == hostUid) return kInstallerUser;
-  if (p.system && p.system->uid == hostUid) return kSystemUser;
-  if (hostUid == kInstallerUser || hostUid == kSystemUser) return kForeignUserId;
+  if (p.installer && p.installer->uid == hostUid) return kInstallerUserId;
+  if (p.system && p.system->uid == hostUid) return kSystemContainerUserId;
+  if (hostUid == kInstallerUserId || hostUid == kSystemContainerUserId) return kForeignUserId;
   return hostUid;
 }
 

@@ -2,13 +2,10 @@
 
 #include <dirent.h>
 #include <fcntl.h>
-#include <sys/stat.h>
 
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
-#include <cstring>
-#include <memory>
 #include <thread>
 #include <utility>
 #include <vector>
@@ -16,6 +13,7 @@
 #include "base/QRTFormat.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
+#include "platform/TreeWalk.h"
 
 namespace platform {
 
@@ -23,14 +21,10 @@ namespace {
 
 constexpr size_t kParallelUnlinkThreshold = 64;
 constexpr unsigned kUnlinkThreads = 4;
-// Deeper trees than this are walked with only this many directories open;
-// the rest are reopened through ".." on the way back up.
-constexpr size_t kMaxOpenDirectories = 64;
 
-// Removes a tree depth first without following links or leaving the root's
-// device. Entries that cannot be removed are reported to entryFailed and the
-// walk goes on; the first such errno is kept. The files of a large directory
-// are unlinked by a few threads at once.
+// Removes a tree on the walk: each directory's files as soon as it is listed,
+// the directory itself on the way back up. Entries that cannot be removed are
+// reported to entryFailed and the walk goes on; the first such errno is kept.
 class TreePruner {
  public:
   // The item name in the directory parentFd; path names it in messages.
@@ -41,116 +35,80 @@ class TreePruner {
   int firstError() const { return firstError_.load(); }
 
  private:
-  struct Frame {
-    UniqueFd fd;
-    dev_t dev;
-    ino_t ino;
-    size_t parentPathLength;  // to cut path_ back on the way up
-    std::string name;
-    std::vector<std::string> subdirectories;
-    size_t next = 0;
-  };
-  struct Victim {
-    ino64_t inode;
-    size_t nameOffset;  // into names_
-  };
-
-  void scan(Frame& frame);
-  void enter(const std::string& name);
-  int leave();
-  int reopen(Frame& frame, int childFd);
+  bool visit(const TreeEntry& entry);
+  bool unlinkListed(TreeListing& listing);
   void removeAt(int dirfd, const char* name, int flags, const std::string& path);
   void entryFailed(int dirfd, const char* name, const std::string& path, int err);
   bool unsetImmutable(int dirfd, const char* name, const std::string& path);
   void record(const std::string& path, int err);
-  void unlinkVictims(Frame& frame);
   void keepFirst(int err) {
     int expected = 0;
     firstError_.compare_exchange_strong(expected, err);
   }
-  std::string childPath(const char* name) const { return path_ + "/" + name; }
 
   int parentFd_;
   std::string rootName_;
-  std::string path_;  // the path of the directory on top of the stack
-  std::vector<Frame> stack_;
-  std::unique_ptr<platform::DirectoryBatch> batch_;
-  std::vector<Victim> victims_;  // scratch of scan()
-  std::string names_;
-  dev_t rootDevice_ = 0;
+  std::string path_;
   std::atomic<int> firstError_{0};  // entryFailed runs on several threads
 };
 
 int TreePruner::run() {
-  UniqueFd fd(openDirectoryAt(parentFd_, rootName_.c_str()));
-  if (!fd.valid()) {
-    int err = errno;
-    if (err != ENOTDIR && err != ELOOP) return err;
-    removeAt(parentFd_, rootName_.c_str(), 0, path_);  // a file or a link
-    return 0;
-  }
-  struct stat st;
-  if (fstat(fd.get(), &st) != 0) return errno;
-  rootDevice_ = st.st_dev;
-  batch_ = std::make_unique<platform::DirectoryBatch>();
-  stack_.push_back(Frame{std::move(fd), st.st_dev, st.st_ino, path_.size(), path_, {}});
-  scan(stack_.back());
-  while (!stack_.empty()) {
-    Frame& top = stack_.back();
-    if (top.next < top.subdirectories.size()) {
-      std::string name = std::move(top.subdirectories[top.next++]);
-      enter(name);
-    } else if (int err = leave()) {
-      return err;
-    }
-  }
-  return 0;
+  TreeWalkOptions options;
+  // Directories are opened and checked on entry anyway, and the rest never
+  // reach the visitor but through the listing.
+  options.typesFromListing = true;
+  options.onListing = [this](TreeListing& listing) { return unlinkListed(listing); };
+  return walkTreeAt(
+      parentFd_, rootName_.c_str(), path_, [this](TreeEntry& entry) { return visit(entry); }, options);
 }
 
-// Reads the whole directory, then unlinks everything but directories in
-// inode order, which on ext4 is about the order of allocation and keeps the
-// inode table and bitmap updates close together. Directories wait in the
-// frame.
-void TreePruner::scan(Frame& frame) {
-  victims_.clear();
-  names_.clear();
-  for (bool more = true; more;) {
-    ssize_t n = platform::readDirectoryBatch(frame.fd.get(), batch_.get());
-    if (n < 0) record(path_, static_cast<int>(-n));
-    more = n > 0;
-    if (!more) break;
-    platform::forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t inode, unsigned char type, const char* name) {
-      if (!name) return;
-      if (type == DT_DIR) {
-        frame.subdirectories.emplace_back(name);
-      } else {
-        victims_.push_back({inode, names_.size()});
-        names_.append(name, strlen(name) + 1);
+bool TreePruner::visit(const TreeEntry& entry) {
+  switch (entry.kind) {
+    case TreeEntry::Kind::DirectoryPre:
+      // A mount point is seen, never entered: its removal below fails (EBUSY).
+      break;
+    case TreeEntry::Kind::DirectoryPost: removeAt(entry.parentFd, entry.name, AT_REMOVEDIR, entry.path); break;
+    case TreeEntry::Kind::Other:
+      if (entry.error && entry.error != ENOTDIR && entry.error != ELOOP) {
+        entryFailed(entry.parentFd, entry.name, entry.path, entry.error);
+        break;
       }
-    });
+      [[fallthrough]];  // not a directory, or no longer one
+    default: removeAt(entry.parentFd, entry.name, 0, entry.path);
   }
-  std::sort(victims_.begin(), victims_.end(), [](const Victim& a, const Victim& b) { return a.inode < b.inode; });
-  unlinkVictims(frame);
+  return true;
 }
 
+// Unlinks everything but directories in inode order, which on ext4 is about
+// the order of allocation and keeps the inode table and bitmap updates close
+// together. Directories stay in the listing for the walk to enter.
+//
 // An unlink spends most of its time after the directory lock is dropped
 // (freeing the inode, and on a disk with online discard waiting for the
 // discard), so several threads on one directory overlap that wait. Threads
 // take interleaved shares to keep the overall order by inode.
-void TreePruner::unlinkVictims(Frame& frame) {
-  const size_t count = victims_.size();
+bool TreePruner::unlinkListed(TreeListing& listing) {
+  if (listing.error) record(listing.path, listing.error);
+  std::vector<TreeListedEntry>& entries = *listing.entries;
+  auto firstVictim =
+      std::stable_partition(entries.begin(), entries.end(), [](const TreeListedEntry& e) { return e.type == DT_DIR; });
+  std::sort(firstVictim, entries.end(),
+            [](const TreeListedEntry& a, const TreeListedEntry& b) { return a.inode < b.inode; });
+  const TreeListedEntry* victims = entries.data() + (firstVictim - entries.begin());
+  const size_t count = static_cast<size_t>(entries.end() - firstVictim);
   const unsigned threads = count >= kParallelUnlinkThreshold ? kUnlinkThreads : 1;
   std::vector<std::vector<std::string>> directories(threads);
+  const std::string directoryPath = listing.path;
   auto share = [&](unsigned t) {
     try {
       for (size_t i = t; i < count; i += threads) {
-        const char* name = names_.data() + victims_[i].nameOffset;
-        int err = platform::removeEntryAt(frame.fd.get(), name);
+        const char* name = victims[i].name.c_str();
+        int err = removeEntryAt(listing.fd, name);
         if (err == 0) continue;
         if (err == EISDIR) {  // the file system gave no type
           directories[t].emplace_back(name);
         } else {
-          entryFailed(frame.fd.get(), name, childPath(name), err);
+          entryFailed(listing.fd, name, directoryPath + "/" + name, err);
         }
       }
     } catch (const std::exception&) { keepFirst(ENOMEM); }
@@ -165,70 +123,10 @@ void TreePruner::unlinkVictims(Frame& frame) {
   share(0);
   for (unsigned t = started; t < threads; ++t) share(t);
   for (std::thread& helper : helpers) helper.join();
+  entries.erase(firstVictim, entries.end());
   for (auto& found : directories)
-    for (std::string& name : found) frame.subdirectories.push_back(std::move(name));
-}
-
-void TreePruner::enter(const std::string& name) {
-  int parentFd = stack_.back().fd.get();
-  UniqueFd fd(openDirectoryAt(parentFd, name.c_str()));
-  if (!fd.valid()) {
-    int err = errno;
-    if (err == ENOTDIR || err == ELOOP) {
-      removeAt(parentFd, name.c_str(), 0, childPath(name.c_str()));  // replaced meanwhile
-    } else {
-      entryFailed(parentFd, name.c_str(), childPath(name.c_str()), err);
-    }
-    return;
-  }
-  struct stat st;
-  if (fstat(fd.get(), &st) != 0) {
-    entryFailed(parentFd, name.c_str(), childPath(name.c_str()), errno);
-    return;
-  }
-  if (st.st_dev != rootDevice_) {
-    // A mount point: never wipe another file system; its removal fails (EBUSY).
-    fd.reset();
-    removeAt(parentFd, name.c_str(), AT_REMOVEDIR, childPath(name.c_str()));
-    return;
-  }
-  if (stack_.size() >= kMaxOpenDirectories) stack_[stack_.size() - kMaxOpenDirectories].fd.reset();
-  size_t parentLength = path_.size();
-  path_ += '/';
-  path_ += name;
-  stack_.push_back(Frame{std::move(fd), st.st_dev, st.st_ino, parentLength, name, {}});
-  scan(stack_.back());
-}
-
-// Pops the finished directory and removes it from its parent.
-int TreePruner::leave() {
-  Frame child = std::move(stack_.back());
-  stack_.pop_back();
-  if (stack_.empty()) {
-    child.fd.reset();
-    removeAt(parentFd_, rootName_.c_str(), AT_REMOVEDIR, path_);
-    return 0;
-  }
-  Frame& parent = stack_.back();
-  if (!parent.fd.valid()) {
-    if (int err = reopen(parent, child.fd.get())) return err;
-  }
-  child.fd.reset();
-  removeAt(parent.fd.get(), child.name.c_str(), AT_REMOVEDIR, path_);
-  path_.resize(child.parentPathLength);
-  return 0;
-}
-
-// Reopens a directory closed for depth through its child's "..", and refuses
-// to go on when that is no longer the directory we came from.
-int TreePruner::reopen(Frame& frame, int childFd) {
-  UniqueFd fd(openDirectoryAt(childFd, ".."));
-  if (!fd.valid()) return errno;
-  struct stat st;
-  if (fstat(fd.get(), &st) != 0) return errno;
-  if (st.st_dev != frame.dev || st.st_ino != frame.ino) return ESTALE;
-  frame.fd = std::move(fd);
-  return 0;
+    for (std::string& name : found) entries.push_back({std::move(name), DT_DIR, 0});
+  return true;
 }
 
 void TreePruner::removeAt(int dirfd, const char* name, int flags, const std::string& path) {

@@ -39,7 +39,7 @@ class Walk {
     struct stat st;
     std::string name;
     size_t parentPathLength;
-    std::vector<std::pair<std::string, unsigned char>> children;
+    std::vector<TreeListedEntry> children;
     size_t next = 0;
   };
 
@@ -49,7 +49,7 @@ class Walk {
   bool enter(int parentFd, const std::string& name, struct stat st, bool statKnown = true);
   bool leave();
   int parentFdOfTop();
-  int readChildren(Frame& frame);
+  int readChildren(Frame& frame, size_t* malformed);
   bool fail(int err) {
     result_ = err;
     return false;
@@ -84,8 +84,8 @@ int Walk::runAt(int parentFd, const char* name) {
   while (ok && !stack_.empty()) {
     Frame& top = stack_.back();
     if (top.next < top.children.size()) {
-      auto child = std::move(top.children[top.next++]);
-      ok = visitChild(child.first, child.second);
+      TreeListedEntry child = std::move(top.children[top.next++]);
+      ok = visitChild(child.name, child.type);
     } else {
       ok = leave();
     }
@@ -180,7 +180,20 @@ bool Walk::enter(int parentFd, const std::string& name, struct stat st, bool sta
   Frame frame{std::move(fd), st, name, parentLength, {}, 0};
   // Another file system's directory is seen, never entered.
   if (!skip && frame.fd.valid()) {
-    if (int readErr = readChildren(frame)) return fail(readErr);
+    size_t malformed = 0;
+    int readErr = readChildren(frame, &malformed);
+    if (options_.onListing) {
+      TreeListing listing;
+      listing.path = path_.c_str();
+      listing.level = level;
+      listing.fd = frame.fd.get();
+      listing.error = readErr;
+      listing.malformed = malformed;
+      listing.entries = &frame.children;
+      if (!options_.onListing(listing)) return fail(kTreeWalkStopped);
+    } else if (readErr) {
+      return fail(readErr);
+    }
   }
   const size_t limit = options_.maxOpenDirectories > 0 ? options_.maxOpenDirectories : 1;
   if (stack_.size() >= limit) stack_[stack_.size() - limit].fd.reset();
@@ -188,14 +201,17 @@ bool Walk::enter(int parentFd, const std::string& name, struct stat st, bool sta
   return true;
 }
 
-int Walk::readChildren(Frame& frame) {
+int Walk::readChildren(Frame& frame, size_t* malformed) {
   if (!batch_) batch_ = std::make_unique<DirectoryBatch>();
   for (;;) {
     ssize_t n = readDirectoryBatch(frame.fd.get(), batch_.get());
     if (n < 0) return static_cast<int>(-n);
     if (n == 0) return 0;
-    forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t, unsigned char type, const char* name) {
-      if (name) frame.children.emplace_back(name, type);
+    forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t inode, unsigned char type, const char* name) {
+      if (name)
+        frame.children.push_back({name, type, inode});
+      else
+        ++*malformed;
     });
   }
 }

@@ -8,8 +8,11 @@
 #include <sys/stat.h>
 
 #include <cstddef>
+#include <cstdint>
 #include <functional>
+#include <string>
 #include <string_view>
+#include <vector>
 
 namespace platform {
 
@@ -33,6 +36,31 @@ struct TreeEntry {
   bool skipDescendants = false;
 };
 
+// One name of a directory's listing, with the type and inode it gave
+// (DT_UNKNOWN where it gave none).
+struct TreeListedEntry {
+  std::string name;
+  unsigned char type;
+  uint64_t inode;
+};
+
+// A directory's listing, read whole before any of its entries is visited.
+struct TreeListing {
+  const char* path = nullptr;
+  int level = 0;  // of the directory
+  int fd = -1;    // the directory's own descriptor
+  // errno of a listing that broke off; entries then holds what was read.
+  int error = 0;
+  // Records of the listing that named nothing readable, left out of entries.
+  size_t malformed = 0;
+  // The entries still to visit: the hook may deal with some itself and take
+  // them out, or reorder the rest.
+  std::vector<TreeListedEntry>* entries = nullptr;
+};
+
+// False stops the walk.
+using TreeListingHook = std::function<bool(TreeListing& listing)>;
+
 struct TreeWalkOptions {
   // Deeper trees are walked with only this many directories open; the rest
   // are reopened through ".." on the way back up, and only if still the
@@ -45,6 +73,10 @@ struct TreeWalkOptions {
   // the listing gave it (an fstatat only where it gave none), so that a walk
   // that opens and checks each entry anyway pays no stat for it.
   bool typesFromListing = false;
+  // Called with each entered directory's listing, after its DirectoryPre
+  // visit. A listing that breaks off goes to it with its error; without it,
+  // such a listing ends the walk.
+  TreeListingHook onListing;
 };
 
 // False stops the walk.

@@ -15,6 +15,11 @@ namespace platform {
 // The unprivileged nobody id: owner of the sub-directories of system
 // containers.
 inline constexpr uint32_t kNobodyUserId = 4294967294u;
+// The two service users of the protocol: the installer, owner of the bundle
+// containers, and the owner of the system containers. The host profile maps
+// them to host accounts.
+inline constexpr uint32_t kInstallerUserId = 33;
+inline constexpr uint32_t kSystemContainerUserId = 499;
 
 struct UserAccount {
   std::string name;

@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <memory>
@@ -20,7 +21,7 @@
 #include "Daemon/store/QRTLocks.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
-#include "platform/SafePath.h"
+#include "platform/TreeWalk.h"
 
 using platform::kLogDebug;
 using platform::kLogError;
@@ -59,10 +60,10 @@ QRTClientConnection& internalClient() { return QRTClientConnection::sharedClient
 // A physical walk on the root's file system through descriptors: each item is
 // opened relative to its parent's descriptor without following a link,
 // checked with fstat, and read and changed only through that descriptor.
-// Entry types come from the directory listing, so an item costs one open,
-// one fstat, one class read and, when it changes, one class write.
-// Directories are changed after their contents. At most kOpenWindow
-// ancestors stay open; a closed one is reopened through ".." and checked.
+// Entry types come from the directory listing, so a file costs one open and
+// one class read, and only when it changes one fstat and one class write; a
+// file the change type leaves alone is not even opened. Directories are
+// changed after their contents.
 class ProtectionWalk {
  public:
   ProtectionWalk(const QRTURL& root, int32_t newClass, uint32_t changeType)
@@ -73,26 +74,15 @@ class ProtectionWalk {
   bool locked() const { return locked_; }
 
  private:
-  static constexpr size_t kOpenWindow = 64;
-  struct Child {
-    std::string name;
-    unsigned char type;
-  };
-  struct Frame {
-    platform::UniqueFd fd;
-    dev_t device;
-    ino_t inode;
-    size_t pathLength;  // of the parent's path
-    std::vector<Child> children;
-    size_t next = 0;
-  };
-
-  bool openRoot(QRTErrorRef* error);
-  bool visitChild(const Child& child, QRTErrorRef* error);
-  bool enter(platform::UniqueFd fd, const struct stat& st, size_t pathLength, QRTErrorRef* error);
-  bool leave(QRTErrorRef* error);
-  // The conditional setter on an open, checked item.
-  bool change(int fd, bool directory, QRTErrorRef* error);
+  bool visit(const platform::TreeEntry& entry);
+  bool visitRoot(const platform::TreeEntry& entry);
+  bool listed(platform::TreeListing& listing);
+  // The conditional setter on an open item. One not yet checked is checked
+  // only when the rules call for a change: a file read as not to be changed
+  // costs no fstat.
+  bool change(int fd, bool directory, bool checked);
+  bool stillRegularFileHere(int fd) const;
+  bool changes(uint32_t what) const { return (changeType_ & what) != 0; }
   void logEntryError(int err) const {
     QRTLogAs(kLogError, "_runChangeOperationNeedToRetry", "FTS returned error for %s : %s", path_.c_str(),
              errorText(err));
@@ -104,144 +94,133 @@ class ProtectionWalk {
   dev_t device_ = 0;
   bool locked_ = false;
   size_t changed_ = 0;
-  std::string path_;
-  std::vector<Frame> stack_;
-  std::unique_ptr<platform::DirectoryBatch> batch_;
+  bool started_ = false;  // the root was reached
+  std::string path_;      // of the entry being visited
+  // The levels whose directory could not be listed: neither entered nor
+  // changed.
+  std::vector<bool> unlisted_;
+  QRTErrorRef error_;
 };
 
 constexpr int kOpenFlags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
 
-// Gone, or swapped for a link or a special file since it was listed.
-bool vanished(int err) { return err == ENOENT || err == ELOOP || err == ENXIO || err == ENOTDIR; }
+// Gone, or swapped for a link, a special file or another directory since it
+// was listed.
+bool vanished(int err) { return err == ENOENT || err == ELOOP || err == ENXIO || err == ENOTDIR || err == ESTALE; }
 
 bool ProtectionWalk::run(QRTErrorRef* error) {
-  path_ = root_.path();
-  if (!openRoot(error)) return false;
-  while (!stack_.empty()) {
-    Frame& top = stack_.back();
-    bool ok = top.next < top.children.size() ? visitChild(top.children[top.next++], error) : leave(error);
-    if (!ok) return false;
+  platform::TreeWalkOptions options;
+  options.typesFromListing = true;
+  options.onListing = [this](platform::TreeListing& listing) { return listed(listing); };
+  const std::string rootPath = root_.path();
+  int err = platform::walkTree(
+      rootPath, [this](platform::TreeEntry& entry) { return visit(entry); }, options);
+  if (err == 0 || err == ENOENT || err == ELOOP) return true;  // gone meanwhile, or a link: nothing of ours to walk
+  if (err != platform::kTreeWalkStopped) {
+    // Only a directory closed for depth and moved meanwhile stops the walk.
+    error_ = started_ ? QRT_POSIX_ERROR(err, "Error for path %s: %s", path_.c_str(), errorText(err))
+                      : QRT_POSIX_ERROR(err, "fts_open failed for %@ : %s", root_, errorText(err));
   }
-  return true;
+  QRTSetError(error, std::move(error_));
+  return false;
 }
 
-bool ProtectionWalk::openRoot(QRTErrorRef* error) {
-  platform::SafeParent parent;
-  struct stat st;
-  int err = platform::safeOpenParent(root_.path(), &parent);
-  if (!err && fstatat(parent.fd.get(), parent.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) err = errno;
-  if (err == ENOENT || err == ELOOP) return true;  // gone meanwhile, or a link: nothing of ours to walk
-  const bool directory = !err && S_ISDIR(st.st_mode);
-  if (!err && !directory && !S_ISREG(st.st_mode)) return true;
+bool ProtectionWalk::visitRoot(const platform::TreeEntry& entry) {
+  using Kind = platform::TreeEntry::Kind;
+  device_ = entry.st.st_dev;
+  started_ = true;
+  int err = entry.error;
+  if (entry.kind == Kind::DirectoryPre) return true;
+  if (!err && entry.kind != Kind::File) return true;
   platform::UniqueFd fd;
-  if (!err) {
-    fd.reset(
-        platform::openNoFollowAt(parent.fd.get(), parent.name.c_str(), kOpenFlags | (directory ? O_DIRECTORY : 0)));
-    if (!fd.valid()) err = errno;
-    if (vanished(err)) return true;
-  }
   struct stat opened;
-  if (!err && fstat(fd.get(), &opened) != 0) err = errno;
+  if (!err) {
+    fd.reset(platform::openNoFollowAt(entry.parentFd, entry.name, kOpenFlags));
+    err = !fd.valid() ? errno : fstat(fd.get(), &opened) != 0 ? errno : 0;
+  }
+  if (vanished(err)) return true;
   if (err) {
-    QRTSetError(error, QRT_POSIX_ERROR(err, "fts_open failed for %@ : %s", root_, errorText(err)));
+    error_ = QRT_POSIX_ERROR(err, "fts_open failed for %@ : %s", root_, errorText(err));
     return false;
   }
-  if (opened.st_ino != st.st_ino || opened.st_dev != st.st_dev) return true;  // swapped since
-  device_ = opened.st_dev;
-  if (!directory)
-    return !(changeType_ & QRTDataProtectionChangeOperation::QRTChangeFiles) || change(fd.get(), false, error);
-  return enter(std::move(fd), opened, path_.size(), error);
+  if (opened.st_ino != entry.st.st_ino || opened.st_dev != entry.st.st_dev) return true;  // swapped since
+  return !changes(QRTDataProtectionChangeOperation::QRTChangeFiles) || change(fd.get(), false, true);
 }
 
-bool ProtectionWalk::visitChild(const Child& child, QRTErrorRef* error) {
-  Frame& parent = stack_.back();
-  const size_t parentLength = path_.size();
-  path_ += '/';
-  path_ += child.name;
-  unsigned char type = child.type;
-  if (type == DT_UNKNOWN) {
-    struct stat st;
-    if (fstatat(parent.fd.get(), child.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0)
-      type = S_ISDIR(st.st_mode) ? DT_DIR : S_ISREG(st.st_mode) ? DT_REG : DT_UNKNOWN;
-  }
-  const bool directory = type == DT_DIR;
-  bool ok = true;
-  if (directory || (type == DT_REG && (changeType_ & QRTDataProtectionChangeOperation::QRTChangeFiles))) {
-    platform::UniqueFd fd(
-        platform::openNoFollowAt(parent.fd.get(), child.name.c_str(), kOpenFlags | (directory ? O_DIRECTORY : 0)));
-    struct stat st;
-    int err = fd.valid() ? (fstat(fd.get(), &st) == 0 ? 0 : errno) : errno;
-    if (err) {
+bool ProtectionWalk::visit(const platform::TreeEntry& entry) {
+  using Kind = platform::TreeEntry::Kind;
+  path_ = entry.path;
+  if (entry.level == 0 && entry.kind != Kind::DirectoryPost) return visitRoot(entry);
+  switch (entry.kind) {
+    case Kind::Other:
       // An unreadable item is reported and passed over, as the walk goes on.
-      if (!vanished(err)) logEntryError(err);
-    } else if (st.st_dev != device_ || (directory ? !S_ISDIR(st.st_mode) : !S_ISREG(st.st_mode))) {
-      // Another file system, never entered or changed; or swapped since listed.
-    } else if (directory) {
-      return enter(std::move(fd), st, parentLength, error);
-    } else {
-      ok = change(fd.get(), false, error);
-    }
-  }
-  path_.resize(parentLength);
-  return ok;
-}
-
-bool ProtectionWalk::enter(platform::UniqueFd fd, const struct stat& st, size_t pathLength, QRTErrorRef*) {
-  Frame frame{std::move(fd), st.st_dev, st.st_ino, pathLength, {}, 0};
-  if (!batch_) batch_ = std::make_unique<platform::DirectoryBatch>();
-  for (;;) {
-    ssize_t n = platform::readDirectoryBatch(frame.fd.get(), batch_.get());
-    if (n == 0) break;
-    if (n < 0) {
-      // Unreadable: reported, neither entered nor changed.
-      logEntryError(static_cast<int>(-n));
-      path_.resize(pathLength);
+      if (entry.error && !vanished(entry.error)) logEntryError(entry.error);
       return true;
+    case Kind::DirectoryPost: {
+      const auto level = static_cast<size_t>(entry.level);
+      const bool listedWhole = level >= unlisted_.size() || !unlisted_[level];
+      if (level < unlisted_.size()) unlisted_[level] = false;
+      // Another file system's directory has no descriptor: never changed.
+      if (entry.fd < 0 || !listedWhole || !changes(QRTDataProtectionChangeOperation::QRTChangeDirectories)) return true;
+      return change(entry.fd, true, true);
     }
-    platform::forEachEntry(*batch_, static_cast<size_t>(n), [&](uint64_t, unsigned char type, const char* name) {
-      if (name && type != DT_LNK) frame.children.push_back({name, type});
-    });
+    case Kind::File: {
+      if (!changes(QRTDataProtectionChangeOperation::QRTChangeFiles)) return true;
+      platform::UniqueFd fd(platform::openNoFollowAt(entry.parentFd, entry.name, kOpenFlags));
+      if (!fd.valid()) {
+        if (!vanished(errno)) logEntryError(errno);
+        return true;
+      }
+      return change(fd.get(), false, false);
+    }
+    default: return true;  // links are never followed; directories wait for their contents
   }
-  if (stack_.size() >= kOpenWindow) stack_[stack_.size() - kOpenWindow].fd.reset();
-  stack_.push_back(std::move(frame));
+}
+
+// A directory that cannot be listed whole is reported, and neither entered
+// nor changed. The rest go in inode order, which on ext4 is about the order
+// of allocation: consecutive class writes then touch the same inode table
+// blocks.
+bool ProtectionWalk::listed(platform::TreeListing& listing) {
+  if (!listing.error) {
+    std::sort(listing.entries->begin(), listing.entries->end(),
+              [](const platform::TreeListedEntry& a, const platform::TreeListedEntry& b) { return a.inode < b.inode; });
+    return true;
+  }
+  path_ = listing.path;
+  logEntryError(listing.error);
+  listing.entries->clear();
+  const auto level = static_cast<size_t>(listing.level);
+  if (unlisted_.size() <= level) unlisted_.resize(level + 1);
+  unlisted_[level] = true;
   return true;
 }
 
-bool ProtectionWalk::leave(QRTErrorRef* error) {
-  Frame& top = stack_.back();
-  if ((changeType_ & QRTDataProtectionChangeOperation::QRTChangeDirectories) && !change(top.fd.get(), true, error))
+// Another file system, or swapped since listed: left alone.
+bool ProtectionWalk::stillRegularFileHere(int fd) const {
+  struct stat st;
+  if (fstat(fd, &st) != 0) {
+    if (!vanished(errno)) logEntryError(errno);
     return false;
-  if (stack_.size() >= 2 && !stack_[stack_.size() - 2].fd.valid()) {
-    Frame& parent = stack_[stack_.size() - 2];
-    platform::UniqueFd fd(platform::openNoFollowAt(top.fd.get(), "..", kOpenFlags | O_DIRECTORY));
-    struct stat st;
-    int err = !fd.valid() ? errno : fstat(fd.get(), &st) != 0 ? errno : 0;
-    if (!err && (st.st_dev != parent.device || st.st_ino != parent.inode)) err = ESTALE;  // moved meanwhile
-    if (err) {
-      QRTSetError(error, QRT_POSIX_ERROR(err, "Error for path %s: %s", path_.c_str(), errorText(err)));
-      return false;
-    }
-    parent.fd = std::move(fd);
   }
-  path_.resize(top.pathLength);
-  stack_.pop_back();
-  return true;
+  return st.st_dev == device_ && S_ISREG(st.st_mode);
 }
 
-bool ProtectionWalk::change(int fd, bool directory, QRTErrorRef* error) {
+bool ProtectionWalk::change(int fd, bool directory, bool checked) {
   const int32_t target = directory ? newClass_ : (newClass_ == 0 ? kDefaultFileClass : newClass_);
   int32_t current = 0;
   QRTErrorRef failure;
   int err = platform::getProtectionClass(fd, &current);
+  if (!err && current == kUntouchableClass) return true;
+  if (!err && !directory) {
+    if (current == target) return true;
+    if ((changeType_ & QRTDataProtectionChangeOperation::QRTChangeFilesOnlyToLowerClass) && target >= current)
+      return true;
+  }
+  if (!checked && !stillRegularFileHere(fd)) return true;
   if (err) {
     failure = QRT_POSIX_ERROR(err, "Failed to getclass of file %s: %s", path_.c_str(), errorText(err));
   } else {
-    if (current == kUntouchableClass) return true;
-    if (!directory) {
-      if (current == target) return true;
-      if ((changeType_ & QRTDataProtectionChangeOperation::QRTChangeFilesOnlyToLowerClass) && target >= current)
-        return true;
-    }
     QRTLog(kLogDebug, "Setting protection class of %s to %d", path_.c_str(), target);
     if (!(err = platform::setProtectionClass(fd, target, current))) {
       if (++changed_ == 10) QRT_CRASH_POINT("protection-mid-walk");
@@ -258,7 +237,7 @@ bool ProtectionWalk::change(int fd, bool directory, QRTErrorRef* error) {
     return true;
   }
   if (err == EPERM) locked_ = true;
-  QRTSetError(error, std::move(failure));
+  error_ = std::move(failure);
   return false;
 }
 

@@ -1,6 +1,5 @@
 #include "Daemon/fileops/QRTFileManager.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -24,7 +23,6 @@
 
 using platform::kLogError;
 using platform::SafeParent;
-using platform::UniqueFd;
 
 namespace {
 
@@ -215,47 +213,24 @@ bool QRTFileManager::_traverseDirectory(const QRTURL& root, QRTErrorRef* error, 
   return false;
 }
 
-namespace {
-
-// Calls visit(name, isDirectory) for every visible entry of the directory.
-template <typename Visit>
-bool iterateDirectory(const QRTURL& url, QRTErrorRef* error, Visit visit) {
-  UniqueFd fd;
-  int err = platform::safeOpen(url.path(), O_RDONLY | O_DIRECTORY, &fd);
+std::optional<std::vector<QRTURL>> QRTFileManager::urlsForItemsInDirectoryAtURL(const QRTURL& url, QRTErrorRef* error) {
+  platform::Dir directory;
+  std::vector<platform::Dir::Entry> entries;
+  int err = platform::Dir::open(url.path(), &directory);
   if (err) {
     if (err != ENOENT)
       QRTLogAs(kLogError, "_IterateDirectory", "opendir of %s failed: %s", url.fileSystemRepresentation(),
                errorText(err));
+  } else {
+    err = directory.list(&entries);
+  }
+  if (err) {
     QRTSetError(error, QRT_POSIX_ERROR(err, "_IterateDirectory for %@ returned %s", url, errorText(err)));
-    return false;
+    return std::nullopt;
   }
-  auto batch = std::make_unique<platform::DirectoryBatch>();
-  for (;;) {
-    ssize_t n = platform::readDirectoryBatch(fd.get(), batch.get());
-    if (n == 0) return true;
-    if (n < 0) {
-      err = static_cast<int>(-n);
-      QRTSetError(error, QRT_POSIX_ERROR(err, "_IterateDirectory for %@ returned %s", url, errorText(err)));
-      return false;
-    }
-    platform::forEachEntry(*batch, static_cast<size_t>(n), [&](uint64_t, unsigned char type, const char* name) {
-      if (!name || name[0] == '.') return;
-      struct stat st;
-      if (type == DT_UNKNOWN && fstatat(fd.get(), name, &st, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(st.st_mode))
-        type = DT_DIR;
-      visit(name, type == DT_DIR);
-    });
-  }
-}
-
-}  // namespace
-
-std::optional<std::vector<QRTURL>> QRTFileManager::urlsForItemsInDirectoryAtURL(const QRTURL& url, QRTErrorRef* error) {
   std::vector<QRTURL> urls;
-  bool ok = iterateDirectory(url, error, [&](const char* name, bool isDirectory) {
-    urls.push_back(url.URLByAppendingPathComponent(name, isDirectory));
-  });
-  if (!ok) return std::nullopt;
+  for (const platform::Dir::Entry& entry : entries)
+    if (entry.name[0] != '.') urls.push_back(url.URLByAppendingPathComponent(entry.name, entry.directory));
   return urls;
 }
 

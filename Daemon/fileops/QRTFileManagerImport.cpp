@@ -1,20 +1,18 @@
 // The import check: a tree is taken from where a user can write only if
 // nothing in it can change under the daemon once it is taken.
-#include <fcntl.h>
 #include <sys/stat.h>
 
 #include <string>
 #include <utility>
-#include <vector>
 
 #include "Daemon/fileops/QRTFileManager.h"
 #include "base/QRTFormat.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
 #include "platform/SafePath.h"
+#include "platform/TreeWalk.h"
 
 using platform::kLogError;
-using platform::UniqueFd;
 
 namespace {
 
@@ -30,38 +28,33 @@ const char* importRefusal(const struct stat& st, uid_t owner) {
   return nullptr;
 }
 
-// The tree below the directory; false (with the item's path and the reason) at the first refusal.
-bool importableTree(int dirfd, std::string& path, uid_t owner, int depth, const char** why) {
-  if (depth > kMaxImportDepth) return (*why = "nested too deep"), false;
-  UniqueFd dir(platform::openDirectoryAt(dirfd, "."));
-  if (!dir.valid()) return (*why = errorText(errno)), false;
-  std::vector<std::string> names;
-  platform::DirectoryBatch batch;
-  for (ssize_t n; (n = platform::readDirectoryBatch(dir.get(), &batch)) != 0;) {
-    if (n < 0) return (*why = errorText(static_cast<int>(-n))), false;
-    bool malformed = false;
-    platform::forEachEntry(batch, static_cast<size_t>(n), [&](uint64_t, unsigned char, const char* name) {
-      if (name)
-        names.emplace_back(name);
-      else
-        malformed = true;
-    });
-    if (malformed) return (*why = "an unreadable entry"), false;
-  }
-  for (const std::string& name : names) {
-    const size_t length = path.size();
-    path += "/" + name;
-    platform::Item item;
-    if (int err = platform::openItemAt(dir.get(), name.c_str(), &item)) return (*why = errorText(err)), false;
-    if ((*why = importRefusal(item.st, owner))) return false;
-    if (S_ISDIR(item.st.st_mode)) {
-      UniqueFd sub;
-      if (int err = platform::reopenItem(item, O_RDONLY | O_DIRECTORY, &sub)) return (*why = errorText(err)), false;
-      if (!importableTree(sub.get(), path, owner, depth + 1, why)) return false;
-    }
-    path.resize(length);
-  }
-  return true;
+// The tree below the directory item top (its path in path, already checked);
+// false (with the item's path and the reason) at the first refusal.
+bool importableTree(const platform::Item& top, std::string& path, uid_t owner, const char** why) {
+  platform::TreeWalkOptions options;
+  options.sameFileSystem = false;
+  options.onListing = [&](platform::TreeListing& listing) {
+    if (listing.error) *why = errorText(listing.error);
+    if (listing.malformed) *why = "an unreadable entry";
+    if (*why) path = listing.path;
+    return !*why;
+  };
+  const std::string base = path;
+  int err = platform::walkTreeAt(
+      top.fd.get(), ".", base,
+      [&](platform::TreeEntry& entry) {
+        if (entry.kind == platform::TreeEntry::Kind::DirectoryPost) return true;
+        path = entry.path;
+        if (entry.error)
+          *why = errorText(entry.error);  // the top itself too
+        else if (entry.level > 0 && !(*why = importRefusal(entry.st, owner)) &&
+                 entry.kind == platform::TreeEntry::Kind::DirectoryPre && entry.level > kMaxImportDepth)
+          *why = "nested too deep";
+        return !*why;
+      },
+      options);
+  if (err && !*why) *why = errorText(err);
+  return !*why;
 }
 
 }  // namespace
@@ -95,13 +88,7 @@ bool QRTFileManager::itemIsImportableAtURL(const QRTURL& url, const QRTURL& from
       else if (!(why = importRefusal(next.st, owner)))
         item = std::move(next);
     }
-    if (!why && S_ISDIR(item.st.st_mode)) {
-      UniqueFd dir;
-      if (int err = platform::reopenItem(item, O_RDONLY | O_DIRECTORY, &dir))
-        why = errorText(err);
-      else
-        importableTree(dir.get(), path, owner, 0, &why);
-    }
+    if (!why && S_ISDIR(item.st.st_mode)) importableTree(item, path, owner, &why);
   }
   if (why) {
     QRTLog(kLogError, "Not taking %@ from a tree a user can write: %@: %s", url, path, why);

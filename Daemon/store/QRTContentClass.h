@@ -4,6 +4,8 @@
 
 #include <cstdint>
 
+#include "platform/UserDatabase.h"
+
 enum QRTContentClass : uint64_t {
   QRTClassUndefined = 0,
   QRTClassAppBundle = 1,
@@ -21,15 +23,18 @@ enum QRTContentClass : uint64_t {
   QRTClassSystemGroup = 13,
 };
 
-inline constexpr uint32_t QRTInstallerUserId = 33;
-inline constexpr uint32_t QRTSystemContainerUserId = 499;
+inline constexpr uint32_t QRTInstallerUserId = platform::kInstallerUserId;
+inline constexpr uint32_t QRTSystemContainerUserId = platform::kSystemContainerUserId;
 inline constexpr uint32_t QRTDefaultMobileUserId = 501;
 
-inline bool QRTIsBundleClass(uint64_t c) { return c == 1 || c == 3 || c == 5 || c == 8; }
-inline bool QRTIsSystemClass(uint64_t c) { return c == 12 || c == 13; }
+inline bool QRTIsBundleClass(uint64_t c) {
+  return c == QRTClassAppBundle || c == QRTClassAddonBundle || c == QRTClassVPNBundle || c == QRTClassFrameworkBundle;
+}
+inline bool QRTIsSystemClass(uint64_t c) { return c == QRTClassSystemData || c == QRTClassSystemGroup; }
 inline bool QRTIsGlobalClass(uint64_t c) { return QRTIsBundleClass(c) || QRTIsSystemClass(c); }
 inline bool QRTIsPerUserClass(uint64_t c) {
-  return c == 2 || c == 4 || c == 6 || c == 7 || c == 9 || c == 10 || c == 11;
+  return c == QRTClassAppData || c == QRTClassAddonData || c == QRTClassVPNData || c == QRTClassAppGroup ||
+         c == QRTClassRelayServiceData || c == QRTClassInternalDaemonData || c == QRTClassTempDirData;
 }
 
 // The class's two-component path name ("Data/Application"); "Undefined" for

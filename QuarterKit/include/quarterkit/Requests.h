@@ -85,7 +85,7 @@ class Reply {
   explicit Reply(plist::Dictionary d) : reply_(std::move(d)) {}
 
   // "ReplyError"; 1 is success, 0 means the key was missing.
-  uint64_t error() const { return u64("ReplyError"); }
+  uint64_t error() const;
   bool ok() const { return error() == 1; }
   Error result() const { return static_cast<Error>(error()); }
 
