@@ -145,8 +145,7 @@ int main(int argc, char** argv) {
   floorSeconds = since(start);
   start = Clock::now();
   QRTErrorRef error;
-  auto found =
-      QRTContainerCache::sharedInstance().containerForUser(502, 2, std::string("com.example.c0"), false, &error);
+  auto found = QRTContainerCache::sharedInstance().containerForUser({502, 2, std::string("com.example.c0")}, &error);
   daemonSeconds = since(start);
   check(found && parsed == static_cast<size_t>(containers), "cache build");
   std::printf("%-28s %10.1f ms %10.1f ms %8.2f\n", ("first look-up, " + std::to_string(containers)).c_str(),

@@ -28,14 +28,14 @@ class ByteBudget {
   // poller runs once bytes come back.
   bool takeOrWait(size_t n, uint32_t user, Waiter waiter) {
     std::lock_guard<std::mutex> hold(lock_);
-    const size_t held = heldBy(user);
-    const bool userRoom = user == 0 || user == kNoUser || held == 0 || held + n <= limit_ / 2;
-    if (userRoom && (used_ == 0 || used_ + n <= limit_)) {
-      addLocked(n, user);
-      return true;
-    }
+    if (takeLocked(n, user)) return true;
     waiters_.push_back(std::move(waiter));
     return false;
+  }
+  // Takes n bytes for user when they fit; nothing is queued when not.
+  bool tryTake(size_t n, uint32_t user) {
+    std::lock_guard<std::mutex> hold(lock_);
+    return takeLocked(n, user);
   }
   // For work already admitted: a decoded message, a reply.
   void force(size_t n, uint32_t user = kNoUser) {
@@ -73,6 +73,13 @@ class ByteBudget {
   }
   // Signals the poller that serves the waiters.
   void wakeWaiters();
+  bool takeLocked(size_t n, uint32_t user) {
+    const size_t held = heldBy(user);
+    const bool userRoom = user == 0 || user == kNoUser || held == 0 || held + n <= limit_ / 2;
+    if (!userRoom || (used_ != 0 && used_ + n > limit_)) return false;
+    addLocked(n, user);
+    return true;
+  }
   void addLocked(size_t n, uint32_t user) {
     used_ += n;
     if (user != kNoUser) perUser_[user] += n;

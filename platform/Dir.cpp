@@ -11,6 +11,7 @@
 
 #include "base/QRTFormat.h"
 #include "platform/DeviceRoot.h"
+#include "platform/FlushGroup.h"
 #include "platform/HostProfile.h"
 #include "platform/Log.h"
 #include "platform/Random.h"
@@ -140,6 +141,15 @@ int Dir::openItem(std::string_view relative, Item* out) const {
   return openItemAt(holder.fd(), leaf.c_str(), out);
 }
 
+int Dir::lstat(std::string_view relative, struct stat* st) const {
+  std::string parent, leaf;
+  splitLast(relative, &parent, &leaf);
+  if (parent == ".") return fstatat(fd(), leaf.c_str(), st, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
+  UniqueFd holder;
+  if (int err = openBeneath(parent, O_PATH | O_DIRECTORY, &holder)) return err;
+  return fstatat(holder.get(), leaf.c_str(), st, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
+}
+
 int Dir::make(std::string_view hostPath, mode_t mode, bool withParents, uid_t owner, Dir* out, bool* created) {
   if (created) *created = false;
   uid_t hostUid;
@@ -260,12 +270,12 @@ int Dir::renameInto(std::string_view name, const Dir& to, std::string_view toNam
   const std::string from(name), target(toName);
   if (renameat(fd(), from.c_str(), to.fd(), target.c_str()) != 0) return errno;
   // Both directories flushed before anyone hears of the move (once when
-  // they are one).
+  // they are one); concurrent movers into a directory share its flushes.
   struct stat fromStat, toStat;
-  int err = syncDirectory(to.fd());
+  int err = flushDirectoryShared(to.fd());
   bool same = fstat(fd(), &fromStat) == 0 && fstat(to.fd(), &toStat) == 0 && fromStat.st_dev == toStat.st_dev &&
               fromStat.st_ino == toStat.st_ino;
-  if (!err && !same) err = syncDirectory(fd());
+  if (!err && !same) err = flushDirectoryShared(fd());
   return err;
 }
 

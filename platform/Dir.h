@@ -50,6 +50,9 @@ class Dir {
   int openDirectory(std::string_view relative, Dir* out) const;
   // The item relative, pinned (FileIO.h's Item); "." is this directory.
   int openItem(std::string_view relative, Item* out) const;
+  // lstat of the item relative: every level above it opened beneath this
+  // directory without following a link, the item itself not followed.
+  int lstat(std::string_view relative, struct stat* st) const;
 
   // safeMakeDirectory relative to this directory (SafePath.h): with
   // withParents every missing level of relative, each opened without
@@ -75,7 +78,8 @@ class Dir {
   int writeFileInPlace(std::string_view name, const void* data, size_t size, bool clearProtection) const;
 
   // renameat of the child name to toName in to, then both directories
-  // flushed (once when they are one): 0 means the move is durable. A failed
+  // flushed (once when they are one; movers into one directory at the same
+  // time share its flushes, FlushGroup.h): 0 means the move is durable. A failed
   // flush leaves the item at the destination. EXDEV across file systems.
   int renameInto(std::string_view name, const Dir& to, std::string_view toName) const;
 

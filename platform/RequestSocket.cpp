@@ -36,6 +36,8 @@ using Clock = std::chrono::steady_clock;
 constexpr int kWriteStallMs = 10000;
 constexpr int kDrainWriteStallMs = 2000;
 constexpr size_t kReadChunk = 64 * 1024;
+// Read ahead when no frame is pending: most requests fit in it whole.
+constexpr size_t kSmallFrame = 1024;
 // Requests of one connection queued or running at once; past this the
 // connection is not read until some finish, so a flood cannot grow memory.
 constexpr int kMaxInFlight = 256;
@@ -318,6 +320,8 @@ void RequestListener::Impl::finishEvent(const ClientRef& client, size_t charge) 
 // Reads toward the next whole frame: the length field alone, then (with the
 // whole frame taken from the budget) the rest of the frame and the next
 // length field, so that no byte is read that the budget has not admitted.
+// With nothing buffered, a small read taken from the budget ahead brings a
+// small frame in whole with one recv.
 RequestListener::Impl::ReadResult RequestListener::Impl::readEvent(const ClientRef& client, RequestEvent& event) {
   uint8_t buffer[kReadChunk];
   frame::Decoder& decoder = client->decoder;
@@ -364,6 +368,9 @@ RequestListener::Impl::ReadResult RequestListener::Impl::readEvent(const ClientR
         client->reserved = whole;
       }
       want = whole - decoder.buffered() + 4;
+    } else if (decoder.buffered() == 0 && client->reserved == 0 && budget->tryTake(kSmallFrame, client->uid)) {
+      client->reserved = kSmallFrame;
+      want = kSmallFrame;
     }
     ssize_t n = ::recv(fd, buffer, std::min(want, sizeof buffer), 0);
     if (n > 0) {
@@ -371,7 +378,14 @@ RequestListener::Impl::ReadResult RequestListener::Impl::readEvent(const ClientR
       continue;
     }
     if (n < 0 && errno == EINTR) continue;
-    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) return ReadResult::Empty;
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
+      // A read ahead that found nothing is not held while the client idles.
+      if (decoder.buffered() == 0 && client->reserved != 0) {
+        budget->give(client->reserved, client->uid);
+        client->reserved = 0;
+      }
+      return ReadResult::Empty;
+    }
     return ReadResult::Closed;
   }
 }

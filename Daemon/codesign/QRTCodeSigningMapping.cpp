@@ -503,7 +503,7 @@ void QRTCodeSigningMapping::_onQueue_deleteSystemContainerIfWithdrawn(
   if (!grantsSystemContainer(oldEntitlements) || grantsSystemContainer(newEntitlements)) return;
   QRTErrorRef lookupError;
   QRTMetadataRef container = QRTContainerCache::sharedInstance().containerForUser(
-      QRTSystemContainerUserId, QRTClassSystemData, identifier, false, &lookupError);
+      {QRTSystemContainerUserId, QRTClassSystemData, identifier}, &lookupError);
   if (!container) {
     QRTLog(kLogError, "Failed to retrieve system container %@: %@", identifier, lookupError);
     return;
@@ -593,7 +593,7 @@ uint64_t QRTCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForAppsWithout
           if (entry.isRegisteredByCaller()) return;
           for (uint64_t bundleClass : {QRTClassAppBundle, QRTClassAddonBundle, QRTClassVPNBundle}) {
             QRTErrorRef lookupError;
-            if (cache.containerForUser(QRTInstallerUserId, bundleClass, identifier, false, &lookupError)) return;
+            if (cache.containerForUser({QRTInstallerUserId, bundleClass, identifier}, &lookupError)) return;
           }
           orphans.push_back(identifier);
         });

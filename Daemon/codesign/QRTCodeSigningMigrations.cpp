@@ -337,8 +337,8 @@ void QRTCodeSigningMapping::_onQueue_migrateCachedCodeSigningInfoFromBundleConta
 std::optional<plist::Dictionary> QRTCodeSigningMapping::_onQueue_migrateCachedCodeSigningInfoFromBundleContainer(
     const std::string& identifier) {
   QRTErrorRef lookupError;
-  QRTMetadataRef bundle = QRTContainerCache::sharedInstance().containerForUser(QRTInstallerUserId, QRTClassAppBundle,
-                                                                               identifier, false, &lookupError);
+  QRTMetadataRef bundle = QRTContainerCache::sharedInstance().containerForUser(
+      {QRTInstallerUserId, QRTClassAppBundle, identifier}, &lookupError);
   const plist::Value* cached =
       bundle && bundle->info() ? plist::find(*bundle->info(), QRTCachedCodeSigningInfoKey) : nullptr;
   if (!cached || !cached->dictionaryIf()) return std::nullopt;

@@ -71,7 +71,7 @@ uint64_t QRTDataProtectionManager::_setDataProtection(uint32_t userId, const std
   }
   QRTErrorRef lookupError;
   QRTMetadataRef metadata =
-      QRTContainerCache::sharedInstance().containerForUser(userId, containerClass, identifier, false, &lookupError);
+      QRTContainerCache::sharedInstance().containerForUser({userId, containerClass, identifier}, &lookupError);
   if (!metadata) {
     return QRT_ERROR(QRTErrorNotFound, lookupError, true, "No Container with userId: %u, identifier: %@, Class: %ld",
                      userId, identifier, static_cast<long>(containerClass))

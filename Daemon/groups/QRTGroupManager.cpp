@@ -73,7 +73,7 @@ void QRTGroupManager::_removeGroupContainersIfNeededforUser(uint32_t user, uint6
     int64_t& count = referenceCounts[identifier];
     if (count == 1) {
       QRTErrorRef error;
-      QRTMetadataRef container = cache.containerForUser(user, groupContainerClass, identifier, false, &error);
+      QRTMetadataRef container = cache.containerForUser({user, groupContainerClass, identifier}, &error);
       if (!container) {
         QRTLog(kLogDebug, "Failed to retrieve group container %@ for %u : %@.  May not exist for this user", identifier,
                user, error);

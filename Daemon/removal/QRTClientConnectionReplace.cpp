@@ -172,7 +172,7 @@ QRTErrorRef locateContainers(ReplaceJob& job) {
 
   // A promotion must not shadow a permanent container of the same identifier.
   QRTErrorRef lookupError;
-  if (QRTContainerCache::sharedInstance().containerForUser(job.userIdNew, job.classNew, job.identifierNew, false,
+  if (QRTContainerCache::sharedInstance().containerForUser({job.userIdNew, job.classNew, job.identifierNew},
                                                            &lookupError)) {
     return QRT_ERROR_AS(kReplace, QRTErrorAlreadyExists, nullptr,
                         "Container with identifier: %@, class: %ld, transient: %d already exists", job.identifierNew,

@@ -49,6 +49,32 @@ namespace {
 constexpr const char* kDataSubDirectories[] = {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"};
 constexpr const char* kGroupSubDirectories[] = {"Library", "Library/Caches"};
 
+// The identifier lock creators of one identifier share; apart from the UUID
+// strings that other operations lock.
+std::string creationLockName(const std::string& identifier) { return "create:" + identifier; }
+
+// One of the user's container slots of a class, held while a container is
+// made; given back unless the cache took it over with the new container.
+class CreationSlot {
+ public:
+  CreationSlot(uint32_t userId, uint64_t containerClass) : userId_(userId), containerClass_(containerClass) {}
+  ~CreationSlot() {
+    if (held_) QRTContainerCache::sharedInstance().abandonCreation(userId_, containerClass_);
+  }
+  CreationSlot(const CreationSlot&) = delete;
+  CreationSlot& operator=(const CreationSlot&) = delete;
+  bool reserve(size_t limit, size_t* held, QRTErrorRef* error) {
+    held_ = QRTContainerCache::sharedInstance().reserveCreation(userId_, containerClass_, limit, held, error);
+    return held_;
+  }
+  void handedOver() { held_ = false; }
+
+ private:
+  uint32_t userId_;
+  uint64_t containerClass_;
+  bool held_ = false;
+};
+
 }  // namespace
 
 bool QRTClientConnection::_createDefaultDirectory(const QRTURL& url, mode_t mode, uint32_t owner, QRTErrorRef* error) {
@@ -164,8 +190,8 @@ QRTMetadataRef QRTClientConnection::_createNewContainer(uint32_t userId, const s
       QRT_CRASH_POINT("create-after-move");
       QRTMetadataRef stored;
       QRTErrorRef cacheError;
-      if (QRTContainerCache::sharedInstance().addContainerMetadata(metadata, userId, finalURL, transient, true,
-                                                                   &cacheError, &stored)) {
+      if (QRTContainerCache::sharedInstance().addCreatedContainer(metadata, userId, finalURL, transient, &cacheError,
+                                                                  &stored)) {
         return stored;
       }
       QRTSetError(error, QRT_ERROR(QRTErrorCacheAddFailed, cacheError, true,
@@ -194,9 +220,6 @@ QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(const QRTCont
   const uint32_t userId = key.userId;
   const uint64_t containerClass = key.containerClass;
   const std::optional<std::string>& identifier = key.identifier;
-  const bool createIfNecessary = mode == QRTCreateMode::CreateIfMissing;
-  const bool transient = key.transient;
-  const bool useLocking = locking == QRTLocking::TakeLocks;
   if (!identifier || containerClass < QRTClassAppBundle || containerClass > QRTClassSystemGroup) {
     reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
                          "Can't act on an invalid object: userId: %u, ID: %@, class: %ld", userId, identifier,
@@ -230,23 +253,31 @@ QRTMetadataRef QRTClientConnection::createOrLookupContainerForUser(const QRTCont
   QRTErrorRef error;
   QRTMetadataRef result;
   try {
-    result = _lookupOrCreate(userId, *identifier, createIfNecessary, containerClass, transient, useLocking, &error);
+    result = _lookupOrCreate(key, mode, locking, &error);
   } catch (...) { error = QRT_EXCEPTION_ERROR(); }
   if (!result) reportCode(error, withError);
   return result;
 }
 
-QRTMetadataRef QRTClientConnection::_lookupOrCreate(uint32_t userId, const std::string& identifier,
-                                                    bool createIfNecessary, uint64_t containerClass, bool transient,
-                                                    bool useLocking, QRTErrorRef* error) {
-  QRTAllIdentifiersLock lock(true, useLocking);
+QRTMetadataRef QRTClientConnection::_lookupOrCreate(const QRTContainerKey& key, QRTCreateMode mode, QRTLocking locking,
+                                                    QRTErrorRef* error) {
+  const uint32_t userId = key.userId;
+  const uint64_t containerClass = key.containerClass;
+  const std::string& identifier = *key.identifier;
+  const bool transient = key.transient;
+  const bool useLocking = locking == QRTLocking::TakeLocks;
+  // Creators of one identifier take its own lock: as an identifier writer it
+  // keeps every all-identifiers locker out until the container is durable and
+  // cached, while creators of other identifiers build theirs alongside.
+  QRTIdentifierLock lock(creationLockName(identifier), true, useLocking);
   QRTErrorRef lookupError;
-  QRTMetadataRef found =
-      QRTContainerCache::sharedInstance().containerForUser(userId, containerClass, identifier, transient, &lookupError);
+  QRTMetadataRef found = QRTContainerCache::sharedInstance().containerForUser(key, &lookupError);
   // Whether it existed belongs to this call: the cached object is shared.
   if (found && !transient) return found->withExisted(true);
   if (found) {
-    // A transient container is never reused.
+    // A transient container is never reused. Whoever works on it by its
+    // UUID is waited for.
+    QRTIdentifierLock victim(found->uuid().UUIDString(), true, useLocking);
     QRTErrorRef moveError;
     if (!_moveItemAtURLToDeathRow(found->url(), true, true, &moveError)) {
       QRTSetError(error, QRT_ERROR(QRTErrorRemoveTransientFailed, moveError, true,
@@ -260,27 +291,31 @@ QRTMetadataRef QRTClientConnection::_lookupOrCreate(uint32_t userId, const std::
     QRTSetError(error, lookupError);
     return nullptr;
   }
-  if (!createIfNecessary) {
+  if (mode != QRTCreateMode::CreateIfMissing) {
     QRTSetError(error,
                 QRT_ERROR(QRTErrorNotFound, nullptr, false, "Container with identifier: \"%@\" Not Found", identifier));
     return nullptr;
   }
-  // A user's containers, and so the cache's memory for them, stay bounded.
+  // A user's containers, and so the cache's memory for them, stay bounded;
+  // a slot is held from here until the container is cached.
+  CreationSlot slot(userId, containerClass);
   if (userId != 0) {
     const size_t limit = QRTGlobalConfiguration::sharedInstance().maxContainersPerClass();
     QRTErrorRef countError;
-    auto held = QRTContainerCache::sharedInstance().countOfContainersForUser(userId, containerClass, &countError);
-    if (!held) {
-      QRTSetError(error, countError);
-      return nullptr;
-    }
-    if (*held >= limit) {
+    size_t held = 0;
+    if (!slot.reserve(limit, &held, &countError)) {
+      if (countError) {
+        QRTSetError(error, countError);
+        return nullptr;
+      }
       QRTSetError(error, QRT_ERROR(QRTErrorInvalidArgument, nullptr, true,
                                    "User %u holds %llu containers of class %llu, the most allowed: not creating %@",
-                                   userId, static_cast<unsigned long long>(*held),
+                                   userId, static_cast<unsigned long long>(held),
                                    static_cast<unsigned long long>(containerClass), identifier));
       return nullptr;
     }
   }
-  return _createNewContainer(userId, identifier, containerClass, transient, error);
+  QRTMetadataRef made = _createNewContainer(userId, identifier, containerClass, transient, error);
+  if (made) slot.handedOver();
+  return made;
 }

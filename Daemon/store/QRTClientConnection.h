@@ -15,25 +15,13 @@
 #include "base/QRTURL.h"
 #include "base/QRTUUID.h"
 #include "Daemon/QRTError.h"
+#include "Daemon/store/QRTContainerKey.h"
 
 class QRTMetadata;
 namespace platform {
 class Dir;
 }
 
-// Names one container: its user, class, identifier and whether it is the
-// transient one.
-struct QRTContainerKey {
-  uint32_t userId = 0;
-  uint64_t containerClass = 0;
-  std::optional<std::string> identifier;
-  bool transient = false;
-};
-// Whether a look-up makes the container when it is missing.
-enum class QRTCreateMode : bool { LookupOnly, CreateIfMissing };
-// Whether the call takes the identifier locks itself, or runs where the
-// caller already holds them.
-enum class QRTLocking : bool { CallerHoldsLocks, TakeLocks };
 using QRTMetadataRef = std::shared_ptr<const QRTMetadata>;
 
 class QRTClientConnection {
@@ -163,8 +151,9 @@ class QRTClientConnection {
 
  private:
   // The body of createOrLookupContainerForUser, under the all-identifiers lock.
-  QRTMetadataRef _lookupOrCreate(uint32_t userId, const std::string& identifier, bool createIfNecessary,
-                                 uint64_t containerClass, bool transient, bool useLocking, QRTErrorRef* error);
+  // key.identifier is set.
+  QRTMetadataRef _lookupOrCreate(const QRTContainerKey& key, QRTCreateMode mode, QRTLocking locking,
+                                 QRTErrorRef* error);
   QRTMetadataRef _createNewContainer(uint32_t userId, const std::string& identifier, uint64_t containerClass,
                                      bool transient, QRTErrorRef* error);
   // stagingDirectory: the staging directory held, or an invalid one.

@@ -35,7 +35,7 @@ constexpr const char* kCrashCounterKey = "CrashCounter";
 QRTMetadataRef appDataContainer(uint32_t userId, const std::string& identifier, QRTErrorRef* error) {
   QRTErrorRef lookup;
   QRTMetadataRef m =
-      QRTContainerCache::sharedInstance().containerForUser(userId, QRTClassAppData, identifier, false, &lookup);
+      QRTContainerCache::sharedInstance().containerForUser({userId, QRTClassAppData, identifier}, &lookup);
   if (!m) {
     *error =
         QRT_ERROR(QRTErrorInvalidParameter, lookup, true,
@@ -127,7 +127,7 @@ std::optional<QRTURL> QRTClientConnection::userManagedAssetsPathForUser(uint32_t
     // Read again under the lock: another request may have made it meanwhile.
     QRTErrorRef ignored;
     if (QRTMetadataRef current =
-            QRTContainerCache::sharedInstance().containerForUser(userId, QRTClassAppData, identifier, false, &ignored))
+            QRTContainerCache::sharedInstance().containerForUser({userId, QRTClassAppData, identifier}, &ignored))
       m = current;
     if (!m->userManagedAssetsDirName()) {
       m = makeAssetsDirectory(m, userId, &error);
@@ -170,7 +170,7 @@ void QRTClientConnection::deleteUserManagedAssetForUser(uint32_t userId, const s
     QRTIdentifierLock lock(m->uuid().UUIDString(), true);
     QRTErrorRef ignored;
     if (QRTMetadataRef current =
-            QRTContainerCache::sharedInstance().containerForUser(userId, QRTClassAppData, identifier, false, &ignored))
+            QRTContainerCache::sharedInstance().containerForUser({userId, QRTClassAppData, identifier}, &ignored))
       m = current;
     if (m->url().empty() || !m->userManagedAssetsDirName()) {
       return reportCode(QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
@@ -221,7 +221,7 @@ std::optional<QRTURL> QRTClientConnection::stageSharedContentForIdentifier(
     }
     QRTErrorRef lookup;
     QRTMetadataRef m = QRTContainerCache::sharedInstance().containerForUser(
-        QRTSystemContainerUserId, QRTClassSystemGroup, identifier, false, &lookup);
+        {QRTSystemContainerUserId, QRTClassSystemGroup, identifier}, &lookup);
     if (!m) {
       return fail(QRT_ERROR(QRTErrorNotFound, lookup, true, "System group container with identifier %@ not found: %@",
                             identifier, lookup));

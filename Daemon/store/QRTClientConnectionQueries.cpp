@@ -177,8 +177,7 @@ std::vector<QRTMetadataRef> QRTClientConnection::_containersToRename(uint32_t us
   }
   // Every user of the device: on this platform, the current mobile user.
   for (uint32_t user : {QRTGlobalConfiguration::sharedInstance().currentMobileUserId()}) {
-    auto metadata =
-        QRTContainerCache::sharedInstance().containerForUser(user, containerClass, identifier, false, nullptr);
+    auto metadata = QRTContainerCache::sharedInstance().containerForUser({user, containerClass, identifier}, nullptr);
     if (metadata) {
       chosen.push_back(std::move(metadata));
     } else {

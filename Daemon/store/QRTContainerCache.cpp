@@ -1,6 +1,10 @@
 #include "Daemon/store/QRTContainerCache.h"
 
+#include <sys/stat.h>
+
+#include <cerrno>
 #include <cstdint>
+#include <cstring>
 
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/fileops/QRTFileManager.h"
@@ -133,8 +137,8 @@ bool QRTContainerCache::checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_
                                  suffix(transient), metadata));
     return false;
   }
+  if (!metadataMissing(metadata, userId, contentClass, transient)) return true;
   QRTURL file = metadata->url().URLByAppendingPathComponent(QRTMetadataFileName);
-  if (!QRTFileManager::defaultManager().itemDoesNotExistAtURL(file)) return true;
   QRTSetError(
       error, QRT_ERROR(QRTErrorCacheInconsistent, nullptr, true,
                        "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", className,
@@ -161,9 +165,55 @@ bool QRTContainerCache::checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_
   return false;
 }
 
-QRTMetadataRef QRTContainerCache::containerForUser(uint32_t userId, uint64_t contentClass,
-                                                   const std::optional<std::string>& identifier, bool transient,
-                                                   QRTErrorRef* error) {
+QRTContainerCache::HeldClassDirectoryRef QRTContainerCache::classDirectory(uint32_t userId, uint64_t contentClass,
+                                                                           bool transient, bool reopen) {
+  const std::string key = cacheKey(userId, contentClass) + suffix(transient);
+  if (!reopen) {
+    std::lock_guard<std::mutex> hold(cacheLock);
+    if (auto found = heldClassDirectories.find(key); found != heldClassDirectories.end()) return found->second;
+  }
+  std::optional<QRTURL> url =
+      QRTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(userId, contentClass, transient);
+  if (!url) return nullptr;
+  auto held = std::make_shared<HeldClassDirectory>();
+  held->path = url->path();
+  if (int err = platform::Dir::open(held->path, &held->directory)) {
+    QRTLog(kLogError, "Cache: %@%@: cannot open the class directory %@: %s", cacheKey(userId, contentClass),
+           suffix(transient), held->path, strerror(err));
+    return nullptr;
+  }
+  std::lock_guard<std::mutex> hold(cacheLock);
+  return heldClassDirectories[key] = std::move(held);
+}
+
+bool QRTContainerCache::metadataMissing(const QRTMetadataRef& metadata, uint32_t userId, uint64_t contentClass,
+                                        bool transient) {
+  const QRTURL& url = metadata->url();
+  QRTURL file = url.URLByAppendingPathComponent(QRTMetadataFileName);
+  const std::string parent = url.URLByDeletingLastPathComponent().path();
+  const std::string name = url.lastPathComponent() + "/" + QRTMetadataFileName;
+  // A miss or a path that differs may come from a stale held directory: it
+  // is opened afresh once, and a miss is confirmed from the device root.
+  for (bool reopen : {false, true}) {
+    HeldClassDirectoryRef held = classDirectory(userId, contentClass, transient, reopen);
+    if (!held) break;
+    if (held->path != parent) continue;
+    struct stat st;
+    const int err = held->directory.lstat(name, &st);
+    if (err == 0) return false;
+    if (err != ENOENT) {
+      QRTLog(kLogError, "Failed to determine if %@ exists: %s", file, strerror(err));
+      return false;
+    }
+  }
+  return QRTFileManager::defaultManager().itemDoesNotExistAtURL(file);
+}
+
+QRTMetadataRef QRTContainerCache::containerForUser(const QRTContainerKey& key, QRTErrorRef* error) {
+  const uint32_t userId = key.userId;
+  const uint64_t contentClass = key.containerClass;
+  const std::optional<std::string>& identifier = key.identifier;
+  const bool transient = key.transient;
   if (!validInput(contentClass, identifier, "Invalid identifier: %@", __func__, __LINE__, error)) return nullptr;
   try {
     QRTMetadataRef found;
@@ -210,7 +260,7 @@ QRTMetadataRef QRTContainerCache::containerForUser(uint32_t userId, uint64_t con
                                                    const std::optional<std::string>& identifier,
                                                    const std::string& uuidString) {
   for (bool transient : {false, true}) {
-    QRTMetadataRef metadata = containerForUser(userId, contentClass, identifier, transient, nullptr);
+    QRTMetadataRef metadata = containerForUser({userId, contentClass, identifier, transient}, nullptr);
     if (metadata && metadata->uuid().UUIDString() == uuidString) return metadata;
   }
   return nullptr;
@@ -248,9 +298,49 @@ std::optional<std::vector<QRTMetadataRef>> QRTContainerCache::allContainersForUs
   }
 }
 
+bool QRTContainerCache::reserveCreation(uint32_t userId, uint64_t contentClass, size_t limit, size_t* held,
+                                        QRTErrorRef* error) {
+  try {
+    std::unique_lock<std::mutex> hold(cacheLock);
+    size_t count = 0;
+    for (bool transient : {false, true}) {
+      ClassMap* map = lockedClassMap(hold, "countOfContainersForUser", userId, contentClass, transient, true, error);
+      if (!map) return false;
+      count += map->size();
+    }
+    size_t& inProgress = creationsInProgress[cacheKey(userId, contentClass)];
+    *held = count + inProgress;
+    if (*held >= limit) {
+      if (inProgress == 0) creationsInProgress.erase(cacheKey(userId, contentClass));
+      return false;
+    }
+    ++inProgress;
+    return true;
+  } catch (...) {
+    QRTSetError(error, QRT_EXCEPTION_ERROR());
+    return false;
+  }
+}
+
+void QRTContainerCache::abandonCreation(uint32_t userId, uint64_t contentClass) {
+  std::lock_guard<std::mutex> hold(cacheLock);
+  auto found = creationsInProgress.find(cacheKey(userId, contentClass));
+  if (found != creationsInProgress.end() && --found->second == 0) creationsInProgress.erase(found);
+}
+
 bool QRTContainerCache::addContainerMetadata(const QRTMetadataRef& metadata, uint32_t forUser, const QRTURL& url,
                                              bool transient, bool updateSandbox, QRTErrorRef* error,
                                              QRTMetadataRef* stored) {
+  return addEntry(metadata, forUser, url, transient, updateSandbox, false, error, stored);
+}
+
+bool QRTContainerCache::addCreatedContainer(const QRTMetadataRef& metadata, uint32_t forUser, const QRTURL& url,
+                                            bool transient, QRTErrorRef* error, QRTMetadataRef* stored) {
+  return addEntry(metadata, forUser, url, transient, true, true, error, stored);
+}
+
+bool QRTContainerCache::addEntry(const QRTMetadataRef& metadata, uint32_t forUser, const QRTURL& url, bool transient,
+                                 bool updateSandbox, bool releaseSlot, QRTErrorRef* error, QRTMetadataRef* stored) {
   if (!metadata || !validClass(metadata->containerClass())) {
     QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Invalid Metadata Content Class: %lld",
                                  metadata ? static_cast<long long>(metadata->containerClass()) : 0LL));
@@ -267,9 +357,13 @@ bool QRTContainerCache::addContainerMetadata(const QRTMetadataRef& metadata, uin
         metadata->url() == url && metadata->transient() == transient ? metadata : metadata->withUrl(url, transient);
     {
       std::unique_lock<std::mutex> hold(cacheLock);
-      ClassMap* map = lockedClassMap(hold, __func__, forUser, contentClass, transient, true, error);
+      ClassMap* map = lockedClassMap(hold, "addContainerMetadata", forUser, contentClass, transient, true, error);
       if (!map) return false;
       (*map)[entry->identifier()] = entry;
+      if (releaseSlot) {
+        auto slot = creationsInProgress.find(cacheKey(forUser, contentClass));
+        if (slot != creationsInProgress.end() && --slot->second == 0) creationsInProgress.erase(slot);
+      }
     }
     if (stored) *stored = entry;
     if (!transient && updateSandbox &&

@@ -12,14 +12,15 @@
 #include <vector>
 
 #include "Daemon/QRTError.h"
+#include "Daemon/store/QRTContainerKey.h"
 #include "Daemon/store/QRTMetadata.h"
+#include "platform/Dir.h"
 
 class QRTContainerCache {
  public:
   static QRTContainerCache& sharedInstance();
 
-  QRTMetadataRef containerForUser(uint32_t userId, uint64_t contentClass, const std::optional<std::string>& identifier,
-                                  bool transient, QRTErrorRef* error);
+  QRTMetadataRef containerForUser(const QRTContainerKey& key, QRTErrorRef* error);
   // By identifier and the upper-case UUID string, live map first; the found
   // metadata's transient flag names the map it came from.
   QRTMetadataRef containerForUser(uint32_t userId, uint64_t contentClass, const std::optional<std::string>& identifier,
@@ -38,6 +39,18 @@ class QRTContainerCache {
   // the given ones) goes to *stored when asked for.
   bool addContainerMetadata(const QRTMetadataRef& metadata, uint32_t forUser, const QRTURL& url, bool transient,
                             bool updateSandbox, QRTErrorRef* error, QRTMetadataRef* stored = nullptr);
+  // Creation holds one of the user's slots of the class from before it
+  // builds until its container is added (addCreatedContainer) or given up
+  // (abandonCreation), so that concurrent creators together stay within
+  // limit. False when the live and transient containers and the creations
+  // in progress already reach it (*held: how many), or with the error of a
+  // failed cache build.
+  bool reserveCreation(uint32_t userId, uint64_t contentClass, size_t limit, size_t* held, QRTErrorRef* error);
+  void abandonCreation(uint32_t userId, uint64_t contentClass);
+  // addContainerMetadata with the sandbox told, giving back the creation's
+  // slot in the same step.
+  bool addCreatedContainer(const QRTMetadataRef& metadata, uint32_t forUser, const QRTURL& url, bool transient,
+                           QRTErrorRef* error, QRTMetadataRef* stored);
   bool removeContainerForUser(uint32_t userId, uint64_t contentClass, const std::optional<std::string>& identifier,
                               bool transient, QRTErrorRef* error);
   // Tells the sandbox where a container lies (no URL withdraws it).
@@ -64,7 +77,28 @@ class QRTContainerCache {
   bool checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_t userId, uint64_t contentClass, bool transient,
                         QRTErrorRef* error);
 
+  // The class directory held open with its host path, so that a container's
+  // metadata file is checked with two components resolved beneath it rather
+  // than its whole path from the device root.
+  struct HeldClassDirectory {
+    platform::Dir directory;
+    std::string path;
+  };
+  using HeldClassDirectoryRef = std::shared_ptr<const HeldClassDirectory>;
+  // The held directory (opened when missing or when reopen is set), or null
+  // when it cannot be opened. Takes cacheLock.
+  HeldClassDirectoryRef classDirectory(uint32_t userId, uint64_t contentClass, bool transient, bool reopen);
+  // Whether the container's metadata file is missing: ENOENT beneath the held
+  // class directory, confirmed from the device root (the held directory may
+  // have been replaced, and is then opened afresh).
+  bool metadataMissing(const QRTMetadataRef& metadata, uint32_t userId, uint64_t contentClass, bool transient);
+  // addContainerMetadata, also giving back a creation's slot when releaseSlot.
+  bool addEntry(const QRTMetadataRef& metadata, uint32_t forUser, const QRTURL& url, bool transient, bool updateSandbox,
+                bool releaseSlot, QRTErrorRef* error, QRTMetadataRef* stored);
+
   std::unordered_map<std::string, ClassMap> liveContainerCache;
   std::unordered_map<std::string, ClassMap> transientContainerCache;
+  std::unordered_map<std::string, HeldClassDirectoryRef> heldClassDirectories;
+  std::unordered_map<std::string, size_t> creationsInProgress;
   std::mutex cacheLock;
 };

@@ -625,6 +625,23 @@ const Case kCases[] = {
          t.send(QRTCommandCreateOrLookupContainer, T::creation("com.example.race" + std::to_string(i)));
      },
      [](const T& t) { flip(t.containers() + "/Data", t.home() + "/fake"); }},
+    // Reads and writes of a container's metadata resolve from the held class
+    // directory while the class directory is swapped for one with a link.
+    {"RaceClassDirectoryAndLink_InfoAndMetadataReadsAndSet",
+     [](T& t) {
+       t.plant([&] {
+         return mkdir((t.home() + "/fake").c_str(), 0755) == 0 &&
+                symlink(t.outside.c_str(), (t.home() + "/fake/Application").c_str()) == 0;
+       });
+     },
+     [](T& t) {
+       for (int i = 0; i < 20; ++i) {
+         t.send(QRTCommandInfoValueForKey, with(selector(t.app), {{QRTKeyKey, "k"}}));
+         t.send(QRTCommandMetadataForContainer, selector(t.app));
+         t.send(QRTCommandSetInfoValue, with(selector(t.app), kSet));
+       }
+     },
+     [](const T& t) { flip(t.containers() + "/Data", t.home() + "/fake"); }},
     {"RaceContainersAndLinkToDecoys_WipeReplaceStageRegenerateDelete",
      [](T& t) {
        t.plant([&] {

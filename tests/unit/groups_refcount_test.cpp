@@ -52,7 +52,7 @@ class GroupRefcountTest : public ::testing::Test {
   }
   static bool present(const std::string& group) {
     QRTErrorRef error;
-    return QRTContainerCache::sharedInstance().containerForUser(501, 7, group, false, &error) != nullptr;
+    return QRTContainerCache::sharedInstance().containerForUser({501, 7, group}, &error) != nullptr;
   }
 };
 

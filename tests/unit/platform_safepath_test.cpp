@@ -10,6 +10,7 @@
 
 #include "TempDir.h"
 #include "platform/DeviceRoot.h"
+#include "platform/Dir.h"
 #include "platform/FileIO.h"
 #include "platform/SafePath.h"
 
@@ -67,6 +68,13 @@ TEST_F(SafePathTest, HostileArrangementsAreRefusedWithTheirCode) {
        [&] { return safeMakeDirectory(in("plain"), 0755, true, kAnyOwner, &fd); }, ENOTDIR},
       {"directory of another user", [&] { fs::create_directory(in("other")), chown(in("other").c_str(), 502, 502); },
        [&] { return safeMakeDirectory(in("other"), 0755, false, 501, &fd); }, EPERM},
+      {"link at an intermediate component, stat beneath a held directory", [&] { link(marker_, "mid3"); },
+       [&] {
+         Dir held;
+         struct stat st;
+         return Dir::open(user_, &held) ? -1 : held.lstat("mid3/file", &st);
+       },
+       ELOOP},
       {"FIFO read as a file", [&] { mkfifo(in("fifo").c_str(), 0600); },
        [&] { return safeReadFile(in("fifo"), &text, 1024); }, EINVAL},
   };

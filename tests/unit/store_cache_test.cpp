@@ -47,11 +47,11 @@ class ContainerCacheTest : public ::testing::Test {
 TEST_F(ContainerCacheTest, RejectsBadInputBeforeTouchingAnything) {
   QRTErrorRef error;
   for (const auto& [cls, identifier] : {std::pair<uint64_t, std::optional<std::string>>{0, "a"}, {14, "a"}, {2, {}}}) {
-    EXPECT_FALSE(cache.containerForUser(501, cls, identifier, false, &error)) << cls;
+    EXPECT_FALSE(cache.containerForUser({501, cls, identifier}, &error)) << cls;
     EXPECT_EQ(error->code(), 47) << cls;
   }
   // A user that cannot own the class: the build refuses, the look-up says rebuild failed.
-  EXPECT_FALSE(cache.containerForUser(501, 1, std::string("a"), false, &error));
+  EXPECT_FALSE(cache.containerForUser({501, 1, std::string("a")}, &error));
   EXPECT_EQ(error->code(), 43);
   ASSERT_TRUE(error->underlying());
   EXPECT_EQ(error->underlying()->code(), 47);
@@ -64,7 +64,7 @@ TEST_F(ContainerCacheTest, UUIDMatchIsExactAndListingsDropVanishedContainers) {
   QRTURL kept = writeContainer(502, 2, "com.example.kept");
   QRTURL gone = writeContainer(502, 2, "com.example.gone");
   QRTErrorRef error;
-  auto found = cache.containerForUser(502, 2, std::string("com.example.kept"), false, &error);
+  auto found = cache.containerForUser({502, 2, std::string("com.example.kept")}, &error);
   ASSERT_TRUE(found);
   EXPECT_EQ(found->url(), kept);
   // Lower case never matches the UUID's text form.
@@ -86,7 +86,7 @@ TEST_F(ContainerCacheTest, EntriesAgreeWithTheirMapAndAreNeverChangedInPlace) {
   const QRTURL url = writeContainer(502, 4, "com.example.snap", true);
   const std::string id = "com.example.snap";
   QRTErrorRef error;
-  QRTMetadataRef transient = cache.containerForUser(502, 4, id, true, &error);
+  QRTMetadataRef transient = cache.containerForUser({502, 4, id, true}, &error);
   ASSERT_TRUE(transient);
   EXPECT_TRUE(transient->transient());
   EXPECT_EQ(cache.containerForUser(502, 4, id, transient->uuid().UUIDString()), transient);
@@ -110,7 +110,7 @@ TEST_F(ContainerCacheTest, SystemClassBuildPushesSandboxMappings) {
   EXPECT_EQ(platform::sandboxStateItem(0, 4, "com.example.daemon"), live.path());
   EXPECT_EQ(platform::sandboxStateItem(0, 4, "com.example.transient"), std::nullopt);
 
-  auto metadata = cache.containerForUser(499, 12, std::string("com.example.daemon"), false, &error);
+  auto metadata = cache.containerForUser({499, 12, std::string("com.example.daemon")}, &error);
   ASSERT_TRUE(metadata);
   EXPECT_TRUE(cache.removeContainerForUser(499, 12, std::string("com.example.daemon"), false, &error));
   EXPECT_EQ(platform::sandboxStateItem(0, 4, "com.example.daemon"), std::nullopt);
