@@ -207,6 +207,23 @@ void BM_GroupChange(benchmark::State& state) {
 }
 BENCHMARK(BM_GroupChange)->Unit(benchmark::kMillisecond);
 
+// The look-ups each program start and the look-up command make, on the
+// mapping of 10,000 programs: the data class (the upcall's) and the whole
+// code-signing dictionary (command 19's; 50 groups against the floor's 2).
+void BM_MappingDataClass(benchmark::State& state) {
+  QRTCodeSigningMapping* mapping = groupMapping();
+  int i = 0;
+  for (auto _ : state) benchmark::DoNotOptimize(mapping->dataContainerTypeForIdentifier(identifier(i++ % kPrograms)));
+}
+BENCHMARK(BM_MappingDataClass)->ThreadRange(1, 8)->UseRealTime();
+
+void BM_MappingLookup(benchmark::State& state) {
+  QRTCodeSigningMapping* mapping = groupMapping();
+  int i = 0;
+  for (auto _ : state) benchmark::DoNotOptimize(mapping->getCodeSigningInfoForIdentifier(identifier(i++ % kPrograms)));
+}
+BENCHMARK(BM_MappingLookup)->ThreadRange(1, 8)->UseRealTime();
+
 }  // namespace
 
 int main(int argc, char** argv) {

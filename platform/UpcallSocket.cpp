@@ -144,7 +144,11 @@ void UpcallListener::Impl::serve(int fd) {
     message.pid = pid;
     UpcallReply reply;
     bool answer = false;
-    queue->sync([&] { answer = handler(message, &reply); });
+    if (queue) {
+      queue->sync([&] { answer = handler(message, &reply); });
+    } else {
+      answer = handler(message, &reply);
+    }
     if (!answer) return;
     start += consumed;
     std::vector<uint8_t> frame = encodeUpcallReply(reply);
@@ -152,11 +156,11 @@ void UpcallListener::Impl::serve(int fd) {
   }
 }
 
-std::unique_ptr<UpcallListener> UpcallListener::create(const std::string& path, Queue& serveQueue,
+std::unique_ptr<UpcallListener> UpcallListener::create(const std::string& path, Queue* serveQueue,
                                                        UpcallHandler handler) {
   auto impl = std::make_shared<Impl>();
   impl->path = path;
-  impl->queue = &serveQueue;
+  impl->queue = serveQueue;
   impl->handler = std::move(handler);
   // Made 0600 and listening before it has its name: no one but root ever finds it open.
   if (int err = safeListenUnixSocket(path, 0600, 0, &impl->listenFd)) {

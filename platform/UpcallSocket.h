@@ -1,7 +1,8 @@
 // The kernel upcall socket (R/run/com.norvane.quarterd.upcall): a Unix stream
 // socket, mode 0600, on which the sandbox launcher asks for a starting
 // process's containers. Frames are cut here; what a frame means is the
-// server's business, which runs on the queue given, one frame at a time.
+// server's business. Each connection has a thread of its own, which reads
+// its frames one at a time and serves each itself, or on the queue given.
 #pragma once
 
 #include <sys/types.h>
@@ -60,8 +61,10 @@ using UpcallHandler = std::function<bool(const UpcallMessage& request, UpcallRep
 class UpcallListener {
  public:
   // Binds path (mode 0600; a stale socket is replaced). Nothing, with errno
-  // set, when it cannot.
-  static std::unique_ptr<UpcallListener> create(const std::string& path, Queue& serveQueue, UpcallHandler handler);
+  // set, when it cannot. Without a queue the handler runs on the
+  // connection's thread, at once and beside the other connections' (it must
+  // be safe to call from several threads); with one, it runs there.
+  static std::unique_ptr<UpcallListener> create(const std::string& path, Queue* serveQueue, UpcallHandler handler);
   ~UpcallListener();
   // Starts accepting.
   void resume();

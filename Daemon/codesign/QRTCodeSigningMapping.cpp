@@ -60,11 +60,20 @@ plist::Value listValue(const std::vector<std::string>& list) {
 // SQLite takes text up to its first zero byte: such a name would act on another program's entry.
 bool usableIdentifier(const std::string& identifier) { return identifier.find('\0') == std::string::npos; }
 
-bool grantsSystemContainer(const std::optional<plist::Value>& entitlements) {
+// A stored entry's entitlements, read in place.
+const plist::Value* entitlementsOf(const QRTCodeSigningEntry& entry) {
+  return entry.codeSigningInfo ? plist::find(*entry.codeSigningInfo, QRTCodeSigningEntitlementsKey) : nullptr;
+}
+
+bool grantsSystemContainer(const plist::Value* entitlements) {
   const plist::Dictionary* dictionary = entitlements ? entitlements->dictionaryIf() : nullptr;
   const plist::Value* v = dictionary ? plist::find(*dictionary, QRTSystemContainerEntitlement) : nullptr;
   const bool* b = v ? v->booleanIf() : nullptr;
   return b && *b;
+}
+
+bool grantsSystemContainer(const std::optional<plist::Value>& entitlements) {
+  return grantsSystemContainer(entitlements ? &*entitlements : nullptr);
 }
 
 }  // namespace
@@ -94,7 +103,9 @@ QRTCodeSigningMapping* QRTCodeSigningMapping::sharedInstance() {
 }
 
 QRTCodeSigningMapping::QRTCodeSigningMapping(std::unique_ptr<QRTSQLiteDB> db) : codeSigningMappingDB(std::move(db)) {
-  // Before the queue exists: nothing else can reach the database yet.
+  // Before the queue exists: nothing else can reach the database yet. The
+  // import's writes read themselves back into the snapshot.
+  _onQueue_loadSnapshot();
   _migrateFromMappingFileToDBIfNecessary();
   codeSignQueue = platform::makeSerialQueue("com.norvane.QuarterKit.EntitlementQueue");
 }
@@ -120,6 +131,12 @@ uint64_t QRTCodeSigningMapping::processCallerRegisteredEntitlements(const plist:
 std::optional<plist::Dictionary> QRTCodeSigningMapping::getCodeSigningInfoForIdentifier(
     const std::optional<std::string>& identifier) {
   if (!identifier) return std::nullopt;
+  QRTCodeSigningMappingSnapshot::EntryRef entry;
+  if (_snapshotEntry(*identifier, &entry) == QRTCodeSigningMappingSnapshot::Lookup::Found) {
+    if (entry->isPlaceholder() || entry->isInvalid()) return std::nullopt;
+    return entry->codeSigningInfo;
+  }
+  // Not held: the installer's cached copy may be imported, a write.
   QRTAllIdentifiersLock lock(true);
   return onQueue([&] { return _onQueue_codeSigningInfoForIdentifier(*identifier, true); });
 }
@@ -156,26 +173,55 @@ void QRTCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChil
 }
 
 bool QRTCodeSigningMapping::codeSigningInfoExistForIdentifier(const std::string& identifier) {
+  QRTCodeSigningMappingSnapshot::EntryRef entry;
+  if (_snapshotEntry(identifier, &entry) == QRTCodeSigningMappingSnapshot::Lookup::Found) {
+    return entry->codeSigningInfo.has_value();
+  }
   return onQueue([&] { return _onQueue_codeSigningInfoExistForIdentifier(identifier); });
 }
 
 bool QRTCodeSigningMapping::identifierHasCallerRegisteredEntitlements(const std::string& identifier) {
+  QRTCodeSigningMappingSnapshot::EntryRef entry;
+  switch (_snapshotEntry(identifier, &entry)) {
+    case QRTCodeSigningMappingSnapshot::Lookup::Found: return entry->isRegisteredByCaller();
+    case QRTCodeSigningMappingSnapshot::Lookup::Absent: return false;
+    case QRTCodeSigningMappingSnapshot::Lookup::Unknown: break;
+  }
   return onQueue([&] { return _onQueue_identifierHasCallerRegisteredEntitlements(identifier); });
 }
 
 bool QRTCodeSigningMapping::identifierHasSystemContainer(const std::string& identifier) {
+  QRTCodeSigningMappingSnapshot::EntryRef entry;
+  if (_snapshotEntry(identifier, &entry) == QRTCodeSigningMappingSnapshot::Lookup::Found) {
+    return grantsSystemContainer(entitlementsOf(*entry));
+  }
   return onQueue([&] { return _onQueue_identifierHasSystemContainer(identifier); });
 }
 
 uint64_t QRTCodeSigningMapping::dataContainerTypeForIdentifier(const std::string& identifier) {
+  QRTCodeSigningMappingSnapshot::EntryRef entry;
+  switch (_snapshotEntry(identifier, &entry)) {
+    case QRTCodeSigningMappingSnapshot::Lookup::Found: return entry->dataContainerClass;
+    case QRTCodeSigningMappingSnapshot::Lookup::Absent: return 0;
+    case QRTCodeSigningMappingSnapshot::Lookup::Unknown: break;
+  }
   return onQueue([&] { return _onQueue_dataContainerTypeForIdentifier(identifier); });
 }
 
 QRTGroupList QRTCodeSigningMapping::appGroupIdentifiersForIdentifier(const std::string& identifier) {
+  QRTCodeSigningMappingSnapshot::EntryRef entry;
+  if (_snapshotEntry(identifier, &entry) == QRTCodeSigningMappingSnapshot::Lookup::Found) {
+    return _copyApplicationGroupEntitlementForIdentifier(identifier, entitlementsOf(*entry),
+                                                         QRTApplicationGroupsEntitlement);
+  }
   return onQueue([&] { return _onQueue_appGroupIdentifiersForIdentifier(identifier); });
 }
 
 QRTGroupList QRTCodeSigningMapping::systemGroupIdentifiersForIdentifier(const std::string& identifier) {
+  QRTCodeSigningMappingSnapshot::EntryRef entry;
+  if (_snapshotEntry(identifier, &entry) == QRTCodeSigningMappingSnapshot::Lookup::Found) {
+    return _withSystemGroupPrefix(_systemGroupList(identifier, entitlementsOf(*entry)));
+  }
   return onQueue([&] { return _onQueue_systemGroupIdentifiersForIdentifier(identifier); });
 }
 
@@ -217,6 +263,9 @@ bool QRTCodeSigningMapping::_onQueue_writeEntry(const std::string& identifier,
     if (stored) add(*stored, -1);
     if (wanted) add(*wanted, 1);
   }
+  // Whether written or not, the rows now say what the snapshot must.
+  _onQueue_readBack({identifier}, wanted && wanted->childBundleIdentifiers ? *wanted->childBundleIdentifiers
+                                                                           : std::vector<std::string>{});
   return written;
 }
 
@@ -262,6 +311,70 @@ bool QRTCodeSigningMapping::groupReferenceCountsMatchDatabase() {
       if (_onQueue_groupReferenceCounts(type) != _onQueue_countGroupReferences(type)) return false;
     }
     return true;
+  });
+}
+
+// ---- the snapshot ----
+
+void QRTCodeSigningMapping::_onQueue_loadSnapshot() {
+  QRTCodeSigningMappingSnapshot::Entries entries;
+  QRTErrorRef error = codeSigningMappingDB->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+      [&](const std::string& identifier, const QRTCodeSigningEntry& entry) {
+        entries[identifier] = std::make_shared<const QRTCodeSigningEntry>(entry);
+      });
+  if (error) {
+    // A row left out would answer "none": look-ups go to the database instead.
+    QRTLog(kLogError, "Cannot read the code signing database whole; look-ups read it row by row: %@", error);
+    snapshot_.invalidate();
+    return;
+  }
+  snapshot_.replaceAll(std::move(entries));
+}
+
+void QRTCodeSigningMapping::_onQueue_readBack(std::vector<std::string> identifiers,
+                                              const std::vector<std::string>& children) {
+  if (!snapshot_.loaded()) {
+    _onQueue_loadSnapshot();
+  } else {
+    // A child row names one parent: writing it under another takes it from the first.
+    for (std::string& parent : snapshot_.parentsOf(children)) identifiers.push_back(std::move(parent));
+    for (const std::string& identifier : identifiers) {
+      QRTErrorRef error;
+      std::optional<QRTCodeSigningEntry> entry = _onQueue_storedEntry(identifier, &error);
+      if (error) {
+        QRTLog(kLogError, "Cannot read back %@ after a write: %@; reading the database whole", identifier, error);
+        _onQueue_loadSnapshot();
+        break;
+      }
+      snapshot_.set(identifier, std::move(entry));
+    }
+  }
+  // Counted again once the snapshot says it: who read the count before a
+  // write and the answer after sees a count that has moved since.
+  generation_.fetch_add(1, std::memory_order_acq_rel);
+}
+
+QRTCodeSigningMappingSnapshot::Lookup QRTCodeSigningMapping::_snapshotEntry(
+    const std::string& identifier, QRTCodeSigningMappingSnapshot::EntryRef* entry) const {
+  return snapshot_.find(identifier, entry);
+}
+
+bool QRTCodeSigningMapping::snapshotMatchesDatabase() {
+  return onQueue([&] {
+    std::optional<QRTCodeSigningMappingSnapshot::Entries> held = snapshot_.copy();
+    if (!held) return false;
+    size_t rows = 0;
+    bool same = true;
+    QRTErrorRef error = codeSigningMappingDB->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+        [&](const std::string& identifier, const QRTCodeSigningEntry& entry) {
+          ++rows;
+          auto it = held->find(identifier);
+          if (it == held->end() || !(*it->second == entry)) {
+            QRTLog(kLogError, "The snapshot of %@ differs from the database", identifier);
+            same = false;
+          }
+        });
+    return !error && same && rows == held->size();
   });
 }
 
@@ -356,8 +469,7 @@ QRTGroupList QRTCodeSigningMapping::_withSystemGroupPrefix(QRTGroupList groups) 
   return prefixed;
 }
 
-QRTGroupList QRTCodeSigningMapping::_systemGroupList(const std::string& identifier,
-                                                     const std::optional<plist::Value>& entitlements) {
+QRTGroupList QRTCodeSigningMapping::_systemGroupList(const std::string& identifier, const plist::Value* entitlements) {
   QRTGroupList groups =
       _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, QRTSystemGroupsEntitlement);
   if (!groups || groups->empty()) {
@@ -367,8 +479,9 @@ QRTGroupList QRTCodeSigningMapping::_systemGroupList(const std::string& identifi
   return groups;
 }
 
-QRTGroupList QRTCodeSigningMapping::_copyApplicationGroupEntitlementForIdentifier(
-    const std::string& identifier, const std::optional<plist::Value>& entitlements, const std::string& groupKey) {
+QRTGroupList QRTCodeSigningMapping::_copyApplicationGroupEntitlementForIdentifier(const std::string& identifier,
+                                                                                  const plist::Value* entitlements,
+                                                                                  const std::string& groupKey) {
   const plist::Dictionary* dictionary = entitlements ? entitlements->dictionaryIf() : nullptr;
   const plist::Value* value = dictionary ? plist::find(*dictionary, groupKey) : nullptr;
   if (!value) return std::nullopt;
@@ -579,7 +692,14 @@ void QRTCodeSigningMapping::_onQueue_removeCodeSigningDictionariesForIdentifierA
 bool QRTCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
                                                                                           QRTErrorRef* error) {
   generation_.fetch_add(1, std::memory_order_acq_rel);
-  return codeSigningMappingDB->invalidateCodeSigningForIdentifierAndAllChildren(identifier, error);
+  std::vector<std::string> rows{identifier};
+  QRTErrorRef childError;
+  if (auto children = codeSigningMappingDB->childIdentifiersForParentIdentifier(identifier, &childError)) {
+    rows.insert(rows.end(), children->begin(), children->end());
+  }
+  const bool invalidated = codeSigningMappingDB->invalidateCodeSigningForIdentifierAndAllChildren(identifier, error);
+  _onQueue_readBack(std::move(rows), {});
+  return invalidated;
 }
 
 uint64_t QRTCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
@@ -604,6 +724,7 @@ uint64_t QRTCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForAppsWithout
         QRT_ERROR(QRTErrorDatabase, invalidateError, true, "Failed to invalidate code signing info for %@ : %@",
                   identifier, invalidateError);
       }
+      _onQueue_readBack({identifier}, {});
     }
     if (error) {
       QRTLog(kLogError, "Failed to enumerate containers when invalidating code signing info: %@", error);

@@ -2,6 +2,9 @@
 // what its entitlements grant: group containers and a system container. All
 // database work runs on one serial queue; the operations that change entries
 // hold the all-identifiers lock around it, taken before entering the queue.
+// The look-ups answer from an in-memory snapshot of the database that every
+// write brings up to date, and reach the queue only when the snapshot cannot
+// answer (an identifier it does not hold may still be imported on demand).
 #pragma once
 
 #include <atomic>
@@ -17,6 +20,7 @@
 #include "base/QRTURL.h"
 #include "Daemon/QRTError.h"
 #include "Daemon/codesign/QRTCodeSigningEntry.h"
+#include "Daemon/codesign/QRTCodeSigningMappingSnapshot.h"
 #include "platform/Queue.h"
 
 class QRTSQLiteDB;
@@ -75,6 +79,9 @@ class QRTCodeSigningMapping {
   // Whether the kept counts of both types equal a fresh count (tests).
   bool groupReferenceCountsMatchDatabase();
 
+  // Whether the snapshot holds exactly the entries the database holds (tests).
+  bool snapshotMatchesDatabase();
+
   // Counts the writes to the database, so that callers may remember an
   // answer for as long as nothing was written.
   uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
@@ -118,6 +125,15 @@ class QRTCodeSigningMapping {
   QRTGroupList _groupsOfEntry(const QRTCodeSigningEntry& entry, const std::string& identifier, QRTGroupType type);
   std::optional<QRTGroupReferenceCounts> _onQueue_countGroupReferences(QRTGroupType type);
 
+  // The snapshot: read whole from the database, or the given rows read back
+  // after a write (with the programs listing any child these name). A row
+  // that cannot be read back sets the snapshot aside until it is read whole.
+  void _onQueue_loadSnapshot();
+  void _onQueue_readBack(std::vector<std::string> identifiers, const std::vector<std::string>& children);
+  // The entry from the snapshot; Unknown when only the queue can tell.
+  QRTCodeSigningMappingSnapshot::Lookup _snapshotEntry(const std::string& identifier,
+                                                       QRTCodeSigningMappingSnapshot::EntryRef* entry) const;
+
   // The stored entry; no entry and no error when there is none (67).
   std::optional<QRTCodeSigningEntry> _onQueue_storedEntry(const std::string& identifier, QRTErrorRef* error);
   // Parallel arrays; an entry without a code-signing dictionary deletes.
@@ -128,9 +144,17 @@ class QRTCodeSigningMapping {
                                                  const std::string& identifier);
   static QRTGroupList _copyApplicationGroupEntitlementForIdentifier(const std::string& identifier,
                                                                     const std::optional<plist::Value>& entitlements,
+                                                                    const std::string& groupKey) {
+    return _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements ? &*entitlements : nullptr, groupKey);
+  }
+  static QRTGroupList _copyApplicationGroupEntitlementForIdentifier(const std::string& identifier,
+                                                                    const plist::Value* entitlements,
                                                                     const std::string& groupKey);
   // The system-groups list, or the fall-back key's when that is none or empty.
-  static QRTGroupList _systemGroupList(const std::string& identifier, const std::optional<plist::Value>& entitlements);
+  static QRTGroupList _systemGroupList(const std::string& identifier, const std::optional<plist::Value>& entitlements) {
+    return _systemGroupList(identifier, entitlements ? &*entitlements : nullptr);
+  }
+  static QRTGroupList _systemGroupList(const std::string& identifier, const plist::Value* entitlements);
   // Drops, with a log line, every identifier without the "systemgroup." prefix.
   static QRTGroupList _withSystemGroupPrefix(QRTGroupList groups);
 
@@ -148,6 +172,7 @@ class QRTCodeSigningMapping {
 
   std::shared_ptr<platform::Queue> codeSignQueue;
   std::unique_ptr<QRTSQLiteDB> codeSigningMappingDB;
+  QRTCodeSigningMappingSnapshot snapshot_;
   std::atomic<uint64_t> generation_{0};
   std::optional<QRTGroupReferenceCounts> groupCounts_[2];  // by group type; on the queue only
 };

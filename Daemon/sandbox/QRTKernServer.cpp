@@ -10,6 +10,8 @@
 
 #include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/store/QRTClientConnection.h"
+#include "Daemon/store/QRTContainerCache.h"
+#include "Daemon/store/QRTLocks.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTMetadata.h"
@@ -123,6 +125,20 @@ uint64_t dataContainerClass(const std::string& identifier, uint32_t containerTyp
   return cls;
 }
 
+// An existing container is found under the shared side of the
+// all-identifiers lock, beside other look-ups; only one that must be made
+// goes on to the create path, which takes the write side.
+QRTMetadataRef lookupOrCreate(const QRTContainerKey& key, uint64_t* error) {
+  {
+    QRTAllIdentifiersLock shared(false);
+    QRTMetadataRef found = QRTContainerCache::sharedInstance().containerForUser(key.userId, key.containerClass,
+                                                                                key.identifier, key.transient, nullptr);
+    if (found) return found;
+  }
+  return QRTClientConnection::sharedClientConnection().createOrLookupContainerForUser(
+      key, QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, error);
+}
+
 struct Resolved {
   std::optional<QRTURL> dataContainer, systemContainer, home;
   std::vector<std::pair<std::string, std::string>> groups, systemGroups;  // request order
@@ -131,13 +147,11 @@ struct Resolved {
 // Creates or finds every container asked for; false when one failed (each
 // failure logged, the rest still tried).
 bool resolveContainers(const KernRequest& request, const std::optional<std::string>& identifier, Resolved* out) {
-  QRTClientConnection& internal = QRTClientConnection::sharedClientConnection();
   bool ok = true;
   uint64_t error = 1;
   if (identifier) {
     uint64_t cls = dataContainerClass(*identifier, request.containerType);
-    QRTMetadataRef m = internal.createOrLookupContainerForUser(
-        {request.personaId, cls, identifier}, QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &error);
+    QRTMetadataRef m = lookupOrCreate({request.personaId, cls, identifier}, &error);
     if (m) {
       out->dataContainer = m->url();
     } else {
@@ -147,9 +161,8 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
     }
   }
   if (request.systemContainerId) {
-    QRTMetadataRef m = internal.createOrLookupContainerForUser(
-        {QRTSystemContainerUserId, QRTClassSystemData, request.systemContainerId}, QRTCreateMode::CreateIfMissing,
-        QRTLocking::TakeLocks, &error);
+    QRTMetadataRef m =
+        lookupOrCreate({QRTSystemContainerUserId, QRTClassSystemData, request.systemContainerId}, &error);
     if (m) {
       out->systemContainer = m->url();
     } else {
@@ -159,8 +172,7 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
     }
   }
   for (const std::string& group : request.appGroupIds) {
-    QRTMetadataRef m = internal.createOrLookupContainerForUser(
-        {request.personaId, QRTClassAppGroup, group}, QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &error);
+    QRTMetadataRef m = lookupOrCreate({request.personaId, QRTClassAppGroup, group}, &error);
     if (m) {
       out->groups.emplace_back(group, m->url().path());
     } else {
@@ -170,9 +182,7 @@ bool resolveContainers(const KernRequest& request, const std::optional<std::stri
     }
   }
   for (const std::string& group : request.systemGroupIds) {
-    QRTMetadataRef m =
-        internal.createOrLookupContainerForUser({QRTSystemContainerUserId, QRTClassSystemGroup, group},
-                                                QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &error);
+    QRTMetadataRef m = lookupOrCreate({QRTSystemContainerUserId, QRTClassSystemGroup, group}, &error);
     if (m) {
       out->systemGroups.emplace_back(group, m->url().path());
     } else {

@@ -1,6 +1,10 @@
 // The kernel upcall server: tells the sandbox, as a process starts, where its
 // data, temporary, home, group, system and system group containers are,
-// creating them when missing. Served on the main queue, one upcall at a time.
+// creating them when missing. Served on each kernel connection's own thread,
+// several at once: the data class comes from the code-signing snapshot and
+// existing containers are found under the shared side of the all-identifiers
+// lock, so an upcall that makes nothing neither waits for another thread nor
+// reads the database.
 #pragma once
 
 #include <sys/types.h>

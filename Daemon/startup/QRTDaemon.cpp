@@ -246,10 +246,11 @@ void set_first_boot_work_completed() {
 }
 
 bool QRTKernServerStart() {
-  // Served only from the main queue, which runs once start-up is over.
+  // Served on the connections' own threads, never waiting for the main
+  // queue: every process start waits on the answer. The listener starts
+  // accepting only once start-up is over.
   const std::string path = platform::hostPath("/run/com.norvane.quarterd.upcall");
-  platform::UpcallListener* listener =
-      platform::UpcallListener::create(path, platform::mainQueue(), demux_server).release();
+  platform::UpcallListener* listener = platform::UpcallListener::create(path, nullptr, demux_server).release();
   {
     std::lock_guard<std::mutex> hold(gListenerLock);
     gUpcallListener = listener;
@@ -265,8 +266,14 @@ bool QRTKernServerStart() {
   QRTClientConnection& internal = QRTClientConnection::sharedClientConnection();
   if (!internal.allowOtherIdLookup()) internal.setAllowOtherIdLookup(true);
   if (!internal.allowGroupIdLookup()) internal.setAllowGroupIdLookup(true);
-  listener->resume();
   return true;
+}
+
+// Upcalls wait in the socket's backlog until start-up work is over, then are
+// served beside requests.
+void QRTKernServerResume() {
+  std::lock_guard<std::mutex> hold(gListenerLock);
+  if (gUpcallListener && !gTerminating) gUpcallListener->resume();
 }
 
 int QRTDaemonMain(int argc, char** argv) {
@@ -338,6 +345,7 @@ int QRTDaemonMain(int argc, char** argv) {
   }
   internal.quarterCleanup();
   platform::transactionEnd();
+  QRTKernServerResume();
 
   if (!startListener()) return -1;
   // Only now does the request socket answer, and start-up work is done.

@@ -8,8 +8,10 @@ void lock_state_notification_callback();
 // Creates the first-boot marker.
 void set_first_boot_work_completed();
 
-// Starts the kernel upcall server; false when it cannot.
+// Starts the kernel upcall server; false when it cannot. It accepts once
+// resumed, when start-up work is over.
 bool QRTKernServerStart();
+void QRTKernServerResume();
 
 // The daemon: parses the command line, starts up in order and serves until
 // SIGTERM. Returns the process exit status when start-up fails.

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <functional>
 #include <map>
 #include <optional>
 #include <random>
@@ -12,6 +13,7 @@
 #include "Daemon/groups/QRTGroupManager.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTContainerCache.h"
+#include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTMetadata.h"
 #include "TempDir.h"
 #include "platform/DeviceRoot.h"
@@ -121,6 +123,81 @@ TEST_F(GroupRefcountTest, ReconcileRemovesOnlyUnnamedGroups) {
   mapping().performAllCodeSigningMigrationAndReconciliation();
   EXPECT_FALSE(present("group.nobody"));
   EXPECT_TRUE(present("group.kept"));
+}
+
+// After every kind of write the in-memory snapshot holds exactly the rows the
+// database does, child lists included.
+TEST_F(GroupRefcountTest, SnapshotFollowsEveryWrite) {
+  auto withParent = [](const std::string& parent) {
+    return plist::Dictionary{{QRTCodeSigningParentBundleIDKey, parent}};
+  };
+  auto registerWith = [](const std::string& program, plist::Dictionary entitlements, plist::Dictionary options) {
+    plist::Dictionary info{{QRTCodeSigningEntitlementsKey, std::move(entitlements)}};
+    return mapping().processCodeSigningInfo(&info, program, &options);
+  };
+  QRTClientConnection& internal = QRTClientConnection::sharedClientConnection();
+  const std::string bundle = "com.example.snap.bundle";
+  const plist::Dictionary system{{QRTSystemContainerEntitlement, true},
+                                 {QRTSystemGroupsEntitlement, plist::Array{"systemgroup.snap"}}};
+  const struct {
+    const char* write;
+    std::function<void()> run;
+  } writes[] = {
+      {"register", [&] { registerGroups("com.example.snap", {"group.snap.a"}); }},
+      {"update groups",
+       [&] {
+         registerGroups("com.example.snap", {"group.snap.b", "group.snap.c"});
+       }},
+      {"data class",
+       [&] {
+         registerWith("com.example.snap", {}, {{QRTCodeSigningDataContainerClassKey, 4}});
+       }},
+      {"child", [&] { registerGroups("com.example.snap.child", {}); }},
+      {"child under a parent", [&] { registerWith("com.example.snap.child", {}, withParent("com.example.snap")); }},
+      {"child moved to another parent",
+       [&] {
+         registerGroups("com.example.snap.other", {"group.snap.a"});
+         registerWith("com.example.snap.child", {}, withParent("com.example.snap.other"));
+       }},
+      {"placeholder",
+       [&] {
+         registerWith("com.example.snap.ph", {}, {{QRTCodeSigningPlaceholderKey, true}});
+       }},
+      {"registered by the caller",
+       [&] {
+         mapping().processCallerRegisteredEntitlements(plist::Dictionary{{"a", true}}, "com.example.snap.caller");
+       }},
+      {"system container and groups", [&] { registerWith("com.example.snap.sys", system, {}); }},
+      {"system container withdrawn", [&] { registerWith("com.example.snap.sys", {}, {}); }},
+      {"invalidate with children",
+       [&] { mapping().invalidateCodeSigningInfoForIdentifierAndItsChildren("com.example.snap.other", nullptr); }},
+      {"invalidate without bundle", [&] { mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer(); }},
+      {"import from the installer's cache",
+       [&] {
+         uint64_t code = 1;
+         auto m = internal.createOrLookupContainerForUser({QRTInstallerUserId, 1, bundle},
+                                                          QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code);
+         ASSERT_TRUE(m);
+         plist::Dictionary cached{
+             {"Entitlements", plist::Dictionary{{QRTApplicationGroupsEntitlement, "group.snap.i"}}}};
+         internal.setInfoValue(plist::Value(cached), std::string(QRTCachedCodeSigningInfoKey), QRTInstallerUserId,
+                               m->uuid(), bundle, 1, true, &code);
+         ASSERT_EQ(code, 1u);
+         EXPECT_TRUE(mapping().getCodeSigningInfoForIdentifier(bundle));
+       }},
+      {"migrations", [&] { mapping().performAllCodeSigningMigrationAndReconciliation(); }},
+      {"remove with children",
+       [&] { mapping().removeCodeSigningDictionariesForIdentifierAndItsChildren("com.example.snap"); }},
+      {"remove", [&] { drop("com.example.snap.other"); }},
+  };
+  for (const auto& row : writes) {
+    row.run();
+    EXPECT_TRUE(mapping().snapshotMatchesDatabase()) << "after " << row.write;
+  }
+  EXPECT_EQ(mapping().dataContainerTypeForIdentifier("com.example.snap.sys"), 0u);
+  EXPECT_FALSE(mapping().identifierHasSystemContainer("com.example.snap.sys"));
+  EXPECT_TRUE(mapping().identifierHasCallerRegisteredEntitlements("com.example.snap.caller"));
+  EXPECT_FALSE(mapping().getCodeSigningInfoForIdentifier("com.example.snap.ph"));
 }
 
 }  // namespace
