@@ -131,8 +131,7 @@ uint64_t dataContainerClass(const std::string& identifier, uint32_t containerTyp
 QRTMetadataRef lookupOrCreate(const QRTContainerKey& key, uint64_t* error) {
   {
     QRTAllIdentifiersLock shared(false);
-    QRTMetadataRef found = QRTContainerCache::sharedInstance().containerForUser(key.userId, key.containerClass,
-                                                                                key.identifier, key.transient, nullptr);
+    QRTMetadataRef found = QRTContainerCache::sharedInstance().containerForUser(key, nullptr);
     if (found) return found;
   }
   return QRTClientConnection::sharedClientConnection().createOrLookupContainerForUser(
