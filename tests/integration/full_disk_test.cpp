@@ -20,8 +20,7 @@ class FullDiskTest : public DaemonFixture {
     if (HasFatalFailure()) return;
     // The store on a small file system of its own, and the log on another,
     // as a journal would be, so that its lines outlive the full store.
-    if (!mountOnTmpfs(root + "/private/var", "32m") ||
-        !mountOnTmpfs(root + "/private/var/root/Library/Logs", "8m"))
+    if (!mountOnTmpfs(root + "/private/var", "32m") || !mountOnTmpfs(root + "/private/var/root/Library/Logs", "8m"))
       GTEST_SKIP() << "cannot mount a tmpfs here";
     setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
   }
@@ -34,18 +33,18 @@ class FullDiskTest : public DaemonFixture {
     ASSERT_GE(fd, 0);
     std::vector<char> block(1 << 16, 'x');
     for (size_t size = block.size(); size > 0; size /= 2)
-      while (write(fd, block.data(), size) == static_cast<ssize_t>(size)) {
-      }
+      while (write(fd, block.data(), size) == static_cast<ssize_t>(size)) {}
     close(fd);
   }
 
   uint64_t registerProgram(const std::string& id, const std::string& group) {
-    return codeOf(call(QRTCommandProcessCodeSigningInfo,
-                       {{QRTKeyIdentifier, id},
-                        {"CodeSigningInfo",
-                         plist::Dictionary{{"Entitlements", plist::Dictionary{{"com.norvane.security.application-groups",
-                                                                               plist::Array{group}}}}}},
-                        {"OptionsDictionary", plist::Dictionary{}}}));
+    return codeOf(call(
+        QRTCommandProcessCodeSigningInfo,
+        {{QRTKeyIdentifier, id},
+         {"CodeSigningInfo",
+          plist::Dictionary{
+              {"Entitlements", plist::Dictionary{{"com.norvane.security.application-groups", plist::Array{group}}}}}},
+         {"OptionsDictionary", plist::Dictionary{}}}));
   }
 
   std::string infoValue(const Container& c) {
@@ -86,18 +85,30 @@ TEST_F(FullDiskTest, EveryChangeFailsCleanlyAndWorksAgainOnceSpaceIsFreed) {
   };
   const std::string big(64 << 10, 'v');
   const std::vector<Change> changes = {
-      {"create", QRTCommandCreateOrLookupContainer,
-       {{QRTKeyUserID, 501}, {QRTKeyContainerClass, 2}, {QRTKeyIdentifier, "com.example.new"},
+      {"create",
+       QRTCommandCreateOrLookupContainer,
+       {{QRTKeyUserID, 501},
+        {QRTKeyContainerClass, 2},
+        {QRTKeyIdentifier, "com.example.new"},
         {QRTKeyCreateIfNecessary, true}}},
       {"info set", QRTCommandSetInfoValue, with(selector(kept), {{QRTKeyKey, "k"}, {QRTKeyValue, big}})},
-      {"replace", QRTCommandReplaceContainer,
-       {{QRTKeyOldContainerUUID, uuidData(kept.uuid)}, {QRTKeyOldContainerClass, 2}, {QRTKeyOldContainerUserID, 501},
-        {QRTKeyOldIdentifier, kept.identifier}, {QRTKeyNewContainerUUID, uuidData(fresh.uuid)},
-        {QRTKeyNewContainerClass, 2}, {QRTKeyNewContainerUserID, 501}, {QRTKeyNewIdentifier, fresh.identifier}}},
+      {"replace",
+       QRTCommandReplaceContainer,
+       {{QRTKeyOldContainerUUID, uuidData(kept.uuid)},
+        {QRTKeyOldContainerClass, 2},
+        {QRTKeyOldContainerUserID, 501},
+        {QRTKeyOldIdentifier, kept.identifier},
+        {QRTKeyNewContainerUUID, uuidData(fresh.uuid)},
+        {QRTKeyNewContainerClass, 2},
+        {QRTKeyNewContainerUserID, 501},
+        {QRTKeyNewIdentifier, fresh.identifier}}},
       {"wipe", QRTCommandDeleteDataContainerContent, byName(wiped)},
-      {"stage for delete", QRTCommandStageContainerForDelete,
-       {{QRTKeyContainerClassesArray, plist::Array{4u}}, {QRTKeyUserIDsArray, plist::Array{501u}},
-        {QRTKeyUUIDsArray, plist::Array{uuidData(addon.uuid)}}, {QRTKeyIdentifiersArray, plist::Array{"com.example.addon"}}}},
+      {"stage for delete",
+       QRTCommandStageContainerForDelete,
+       {{QRTKeyContainerClassesArray, plist::Array{4u}},
+        {QRTKeyUserIDsArray, plist::Array{501u}},
+        {QRTKeyUUIDsArray, plist::Array{uuidData(addon.uuid)}},
+        {QRTKeyIdentifiersArray, plist::Array{"com.example.addon"}}}},
       {"protection change", QRTCommandSetDataProtection,
        with(byName(kept), {{QRTKeyDataProtectionClass, 3}, {QRTKeyIsThirdParty, false}, {QRTKeyRetryIfLocked, false}})},
       {"code-signing registration", QRTCommandProcessCodeSigningInfo, {}},
@@ -132,8 +143,7 @@ TEST_F(FullDiskTest, EveryChangeFailsCleanlyAndWorksAgainOnceSpaceIsFreed) {
   ASSERT_EQ(unlink(filler().c_str()), 0);
   restartDaemon();
   EXPECT_EQ(make(501, "com.example.new", 2).error, 1u);
-  EXPECT_EQ(codeOf(call(QRTCommandSetInfoValue, with(selector(kept), {{QRTKeyKey, "k"}, {QRTKeyValue, "after"}}))),
-            1u);
+  EXPECT_EQ(codeOf(call(QRTCommandSetInfoValue, with(selector(kept), {{QRTKeyKey, "k"}, {QRTKeyValue, "after"}}))), 1u);
   EXPECT_EQ(infoValue(kept), "after");
   EXPECT_EQ(registerProgram("com.example.kept", "group.com.example.after"), 1u);
   EXPECT_EQ(codeOf(call(QRTCommandDeleteDataContainerContent, byName(wiped))), 1u);
