@@ -83,10 +83,10 @@ Run createWhile(const std::string& prefix, size_t minimum, const std::function<b
     static size_t made = 0;
     const auto user = static_cast<uint32_t>(501 + made++ / kPerUser);
     check(user < 501 + kUsers, "more users");
-    check(client.createOrLookupContainerForUser({user, 2, prefix + std::to_string(micros.size())},
-                                                QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks,
-                                                &code) != nullptr,
-          "create");
+    check(
+        client.createOrLookupContainerForUser({user, 2, prefix + std::to_string(micros.size())},
+                                              QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code) != nullptr,
+        "create");
     micros.push_back(std::chrono::duration<double, std::micro>(Clock::now() - start).count());
   }
   std::sort(micros.begin(), micros.end());

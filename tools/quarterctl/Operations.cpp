@@ -44,16 +44,22 @@ std::string nameOf(const plist::Dictionary& d) {
 std::string durationText(uint64_t seconds) {
   char buf[64];
   if (seconds < 60) return std::to_string(seconds) + " s";
-  if (seconds < 3600) snprintf(buf, sizeof buf, "%" PRIu64 " min %" PRIu64 " s", seconds / 60, seconds % 60);
-  else if (seconds < 86400) snprintf(buf, sizeof buf, "%" PRIu64 " h %" PRIu64 " min", seconds / 3600, seconds % 3600 / 60);
-  else snprintf(buf, sizeof buf, "%" PRIu64 " d %" PRIu64 " h", seconds / 86400, seconds % 86400 / 3600);
+  if (seconds < 3600)
+    snprintf(buf, sizeof buf, "%" PRIu64 " min %" PRIu64 " s", seconds / 60, seconds % 60);
+  else if (seconds < 86400)
+    snprintf(buf, sizeof buf, "%" PRIu64 " h %" PRIu64 " min", seconds / 3600, seconds % 3600 / 60);
+  else
+    snprintf(buf, sizeof buf, "%" PRIu64 " d %" PRIu64 " h", seconds / 86400, seconds % 86400 / 3600);
   return buf;
 }
 
 std::string microsText(uint64_t micros) {
   char buf[32];
   if (micros < 1000) return std::to_string(micros) + " us";
-  snprintf(buf, sizeof buf, micros < 10000 ? "%.2f ms" : micros < 1000000 ? "%.1f ms" : "%.2f s",
+  snprintf(buf, sizeof buf,
+           micros < 10000     ? "%.2f ms"
+           : micros < 1000000 ? "%.1f ms"
+                              : "%.2f s",
            micros < 1000000 ? static_cast<double>(micros) / 1000 : static_cast<double>(micros) / 1e6);
   return buf;
 }
@@ -123,17 +129,18 @@ nlohmann::json statusJson(const qk::Reply& reply) {
     requests.push_back(std::move(entry));
   }
   const plist::Value* upcalls = plist::find(s, QRTStatusKeyUpcalls);
-  return {{"uptime_seconds", u64Of(s, QRTStatusKeyUptime)},
-          {"containers", classes},
-          {"cached_containers", u64Of(s, QRTStatusKeyCachedContainers)},
-          {"cache_bytes", u64Of(s, QRTStatusKeyCacheBytes)},
-          {"deathrow", {{"items", u64Of(s, QRTStatusKeyDeathRowItems)}, {"bytes", u64Of(s, QRTStatusKeyDeathRowBytes)}}},
-          {"pending_protection_updates", u64Of(s, QRTStatusKeyPendingProtection)},
-          {"identities",
-           {{"entries", u64Of(s, QRTStatusKeyIdentities)}, {"refused_files", u64Of(s, QRTStatusKeyIdentitiesRefused)}}},
-          {"log_level", u64Of(s, QRTStatusKeyLogLevel)},
-          {"requests", requests},
-          {"upcalls", latencyJson(upcalls ? dictionaryOf(*upcalls) : plist::Dictionary{})}};
+  return {
+      {"uptime_seconds", u64Of(s, QRTStatusKeyUptime)},
+      {"containers", classes},
+      {"cached_containers", u64Of(s, QRTStatusKeyCachedContainers)},
+      {"cache_bytes", u64Of(s, QRTStatusKeyCacheBytes)},
+      {"deathrow", {{"items", u64Of(s, QRTStatusKeyDeathRowItems)}, {"bytes", u64Of(s, QRTStatusKeyDeathRowBytes)}}},
+      {"pending_protection_updates", u64Of(s, QRTStatusKeyPendingProtection)},
+      {"identities",
+       {{"entries", u64Of(s, QRTStatusKeyIdentities)}, {"refused_files", u64Of(s, QRTStatusKeyIdentitiesRefused)}}},
+      {"log_level", u64Of(s, QRTStatusKeyLogLevel)},
+      {"requests", requests},
+      {"upcalls", latencyJson(upcalls ? dictionaryOf(*upcalls) : plist::Dictionary{})}};
 }
 
 // ---- OpenMetrics ----
@@ -241,7 +248,9 @@ const Group kOperations{
          "Prints what the daemon is doing and how fast.\nUptime, cached containers per class, the death-row "
          "backlog, pending protection updates, the\nidentity registry, and per command the requests served and "
          "failed with their p50 and p99\nlatency, kernel upcalls alike.",
-         [](G g, A) { return deliver(g, [](qk::Connection& c) { return qk::status(c); }, {showStatus, statusJson}); }},
+         [](G g, A) {
+           return deliver(g, [](qk::Connection& c) { return qk::status(c); }, {showStatus, statusJson});
+         }},
         {"metrics",
          "102",
          {},
