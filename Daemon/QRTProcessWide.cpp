@@ -8,7 +8,7 @@ uint32_t gQRTLogFileCount = 1;
 
 platform::Queue& QRTDeathRowQueue() {
   static std::shared_ptr<platform::Queue> queue =
-      platform::makeSerialQueue("com.norvane.quarterd.deathrow", platform::QueuePriority::Background);
+      platform::makeSerialQueue("com.norvane.quarterd.deathrow", platform::QueuePriority::Idle);
   return *queue;
 }
 

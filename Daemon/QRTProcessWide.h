@@ -6,7 +6,8 @@
 
 #include "platform/Queue.h"
 
-// Serial, background priority: destruction of death-row items. Made on first use.
+// Serial, idle priority for the processor and the disk: destruction of
+// death-row items, which yields to every request. Made on first use.
 platform::Queue& QRTDeathRowQueue();
 // Serial, suspended while the device is locked: protection changes.
 platform::Queue& QRTLockStateQueue();

@@ -41,6 +41,9 @@ SAME_COMMAND(stageSharedContent, StageSharedContent);
 SAME_COMMAND(setNetworkExtension, SetNetworkExtension);
 SAME_COMMAND(userManagedAssetsPath, UserManagedAssetsPath);
 SAME_COMMAND(deleteUserManagedAsset, DeleteUserManagedAsset);
+SAME_COMMAND(status, Status);
+SAME_COMMAND(metrics, Metrics);
+SAME_COMMAND(setLogLevel, SetLogLevel);
 #undef SAME_COMMAND
 static_assert(static_cast<uint64_t>(Command::deleteUserManagedAsset) + 1 == QRTCommandCount, "a command is missing");
 
@@ -334,6 +337,14 @@ Result deleteUserManagedAsset(Connection& c, const std::optional<std::string>& i
   return perform(c, Request(Command::deleteUserManagedAsset)
                         .string(QRTKeyIdentifier, identifier)
                         .string(QRTKeySourcePath, relativePath));
+}
+
+Result status(Connection& c) { return perform(c, Request(Command::status)); }
+
+Result metrics(Connection& c) { return perform(c, Request(Command::metrics)); }
+
+Result setLogLevel(Connection& c, uint64_t level) {
+  return perform(c, Request(Command::setLogLevel).u64(QRTKeyLogLevel, level));
 }
 
 }  // namespace quarterkit

@@ -39,9 +39,16 @@ enum QRTCommand : uint64_t {
   QRTCommandSetNetworkExtension = 27,
   QRTCommandUserManagedAssetsPath = 28,
   QRTCommandDeleteUserManagedAsset = 29,
+  // Administrative commands, numbered from 100 upward so that the table above
+  // can grow without meeting them.
+  QRTCommandStatus = 101,
+  QRTCommandMetrics = 102,
+  QRTCommandSetLogLevel = 103,
 };
-// One past the last command; a request naming it or more is invalid.
+// One past the last command of the main table; from there up to the first
+// administrative command a request is invalid.
 inline constexpr uint64_t QRTCommandCount = 30;
+inline constexpr uint64_t QRTCommandFirstExtension = 100;
 
 // Keys of a request.
 inline constexpr const char* QRTKeyCommand = "Command";
@@ -74,6 +81,7 @@ inline constexpr const char* QRTKeyNumRetryCrashes = "NumRetryCrashes";
 inline constexpr const char* QRTKeySourcePath = "SourcePath";
 inline constexpr const char* QRTKeyDestPath = "DestPath";
 inline constexpr const char* QRTKeyIsRelative = "IsRelative";
+inline constexpr const char* QRTKeyLogLevel = "LogLevel";
 
 // Keys of a reply. "ReplyError" is in every reply: 1 is success.
 inline constexpr const char* QRTReplyKeyError = "ReplyError";
@@ -89,6 +97,32 @@ inline constexpr const char* QRTReplyKeyInfoDictionary = "ReplyInfoDictionary";
 inline constexpr const char* QRTReplyKeyGroupContainerDict = "ReplyGroupContainerDict";
 inline constexpr const char* QRTReplyKeyGroupIdentifiersArray = "ReplyGroupIdentifiersArray";
 inline constexpr const char* QRTReplyKeyDiskUsage = "ReplyDiskUsage";
+inline constexpr const char* QRTReplyKeyStatus = "ReplyStatus";
+inline constexpr const char* QRTReplyKeyLogLevel = "ReplyLogLevel";
+
+// Keys inside "ReplyStatus" (commands 101 and 102). Latencies are in
+// microseconds; "Buckets" (102 only) counts what took under 1 µs, then under
+// 2, 4, 8 ... µs, the last everything longer.
+inline constexpr const char* QRTStatusKeyUptime = "UptimeSeconds";
+inline constexpr const char* QRTStatusKeyContainersPerClass = "ContainersPerClass";  // index: class
+inline constexpr const char* QRTStatusKeyCachedContainers = "CachedContainers";
+inline constexpr const char* QRTStatusKeyCacheBytes = "CacheBytes";
+inline constexpr const char* QRTStatusKeyDeathRowItems = "DeathRowItems";
+inline constexpr const char* QRTStatusKeyDeathRowBytes = "DeathRowBytes";
+inline constexpr const char* QRTStatusKeyPendingProtection = "PendingProtectionUpdates";
+inline constexpr const char* QRTStatusKeyIdentities = "IdentityEntries";
+inline constexpr const char* QRTStatusKeyIdentitiesRefused = "IdentityFilesRefused";
+inline constexpr const char* QRTStatusKeyLogLevel = "LogLevel";
+inline constexpr const char* QRTStatusKeyRequests = "Requests";  // array of latency dictionaries
+inline constexpr const char* QRTStatusKeyUpcalls = "Upcalls";    // one latency dictionary
+inline constexpr const char* QRTStatusKeyCommand = "Command";
+inline constexpr const char* QRTStatusKeyName = "Name";
+inline constexpr const char* QRTStatusKeyServed = "Served";
+inline constexpr const char* QRTStatusKeyFailed = "Failed";
+inline constexpr const char* QRTStatusKeyP50 = "P50";
+inline constexpr const char* QRTStatusKeyP99 = "P99";
+inline constexpr const char* QRTStatusKeySum = "SumMicros";
+inline constexpr const char* QRTStatusKeyBuckets = "Buckets";
 
 // Entitlements a command asks of its caller.
 inline constexpr const char* QRTEntitlementNone = "com.norvane.private.QuarterKit.none";

@@ -120,6 +120,7 @@ struct Registry {
   bool loaded = false;
   DirectoryStamp stamp;
   IdentityMap byExecutable;
+  size_t refusedFiles = 0;  // registry files skipped at the last read
   // Kept from the last look; looked at again on a mismatch.
   std::unordered_map<std::string, FileId> files;
 };
@@ -210,7 +211,8 @@ std::optional<Entry> entryOf(const plist::Dictionary& file, const std::string& p
 }
 
 // Adds one file's entry; a later file replaces an earlier one's whole entry.
-void addRegistryFile(int dirfd, const std::string& directory, const std::string& name, IdentityMap& identities) {
+// False when the file is skipped.
+bool addRegistryFile(int dirfd, const std::string& directory, const std::string& name, IdentityMap& identities) {
   const std::string path = directory + "/" + name;
   std::string bytes;
   UniqueFd fd(openNoFollowAt(dirfd, name.c_str(), O_RDONLY));
@@ -220,12 +222,12 @@ void addRegistryFile(int dirfd, const std::string& directory, const std::string&
     QRTLog(kLogError,
            "Skipping identity file %s: owned by %u with mode %o; it must be root's and writable by no one else",
            path.c_str(), static_cast<unsigned>(st.st_uid), static_cast<unsigned>(st.st_mode & 07777));
-    return;
+    return false;
   }
   if (err == 0) err = readOpened(fd.get(), &bytes, 16u << 20);
   if (err != 0) {
     QRTLog(kLogError, "Cannot read identity file %s: %s", path.c_str(), strerror(err));
-    return;
+    return false;
   }
   std::string error;
   std::optional<plist::Value> value = plist::parse(bytes.data(), bytes.size(), &error);
@@ -236,17 +238,18 @@ void addRegistryFile(int dirfd, const std::string& directory, const std::string&
            !value  ? error.c_str()
            : !file ? "not a dictionary"
                    : "no Executable string");
-    return;
+    return false;
   }
   std::optional<Entry> entry = entryOf(*file, path, &error);
   if (!entry) {
     QRTLog(kLogError, "Refusing identity file %s: %s", path.c_str(), error.c_str());
-    return;
+    return false;
   }
   identities[executable->string()] = std::move(*entry);
+  return true;
 }
 
-IdentityMap loadRegistry(const std::string& directory) {
+IdentityMap loadRegistry(const std::string& directory, size_t* refused) {
   IdentityMap identities;
   UniqueFd fd;
   struct stat st;
@@ -257,7 +260,8 @@ IdentityMap loadRegistry(const std::string& directory) {
            directory.c_str(), static_cast<unsigned>(st.st_uid), static_cast<unsigned>(st.st_mode & 07777));
     return identities;
   }
-  for (const std::string& name : registryFileNames(fd.get())) addRegistryFile(fd.get(), directory, name, identities);
+  for (const std::string& name : registryFileNames(fd.get()))
+    if (!addRegistryFile(fd.get(), directory, name, identities)) ++*refused;
   return identities;
 }
 
@@ -298,7 +302,8 @@ std::optional<std::pair<Entry, std::optional<FileId>>> currentEntry(const std::s
   if (!reg.loaded || !(reg.stamp == now)) {
     // The stamp was taken before reading, so a change made meanwhile shows
     // up as a new stamp on the next call.
-    reg.byExecutable = now.present ? loadRegistry(now.path) : IdentityMap{};
+    reg.refusedFiles = 0;
+    reg.byExecutable = now.present ? loadRegistry(now.path, &reg.refusedFiles) : IdentityMap{};
     reg.files.clear();
     reg.stamp = std::move(now);
     reg.loaded = true;
@@ -368,6 +373,13 @@ std::shared_ptr<const CodeIdentity> identityForPeer(const PeerCredentials& peer)
   const Entry& entry = current->first;
   const bool listed = std::find(entry.users.begin(), entry.users.end(), peer.uid) != entry.users.end();
   return listed ? entry.whole : entry.userPart;
+}
+
+IdentityRegistryStats identityRegistryStats() {
+  currentEntry("");  // brings the registry up to date
+  Registry& reg = registry();
+  std::shared_lock lock(reg.mutex);
+  return IdentityRegistryStats{reg.byExecutable.size(), reg.refusedFiles};
 }
 
 }  // namespace platform

@@ -4,6 +4,7 @@
 
 #include <sys/types.h>
 
+#include <cstddef>
 #include <memory>
 #include <optional>
 #include <string>
@@ -56,5 +57,13 @@ std::shared_ptr<const CodeIdentity> identityForExecutable(const std::string& exe
 // there is none). Anyone may run any program, with a preloaded library or
 // under a debugger, but no one can fake the uid the socket recorded.
 std::shared_ptr<const CodeIdentity> identityForPeer(const PeerCredentials& peer);
+
+// The registry's entries and the files it skipped (unreadable, not root's,
+// refused) at its last read, brought up to date first.
+struct IdentityRegistryStats {
+  size_t entries = 0;
+  size_t refusedFiles = 0;
+};
+IdentityRegistryStats identityRegistryStats();
 
 }  // namespace platform

@@ -21,4 +21,10 @@ DescriptorLimit raiseDescriptorLimit();
 // allocator refuses the setting (sanitizer allocators do).
 bool returnLargeAllocationsToSystem(size_t bytes);
 
+// The calling thread yields to every other: the idle scheduling policy
+// (SCHED_IDLE) for the processor and the idle I/O class for the disk, so that
+// background work runs only when nothing else wants either. Threads it starts
+// inherit both. The errno of the first refusal, or 0.
+int makeThisThreadIdle();
+
 }  // namespace platform

@@ -17,6 +17,7 @@
 #include <thread>
 
 #include "platform/Log.h"
+#include "platform/ProcessLimits.h"
 
 namespace platform {
 
@@ -112,6 +113,10 @@ void serialWorker(std::shared_ptr<SerialState> state) {
   tCurrentQueue = state.get();
   nameThisThread(state->label);
   if (state->priority == QueuePriority::Background) lowerThisThreadPriority();
+  if (state->priority == QueuePriority::Idle) {
+    if (int error = makeThisThreadIdle())
+      QRTLog(kLogError, "%s stays at normal priority: %s", state->label.c_str(), strerror(error));
+  }
   std::unique_lock lock(state->mutex);
   for (;;) {
     state->wake.wait(lock, [&] { return state->closing || (state->suspended == 0 && !state->items.empty()); });

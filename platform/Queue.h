@@ -12,7 +12,9 @@ namespace platform {
 
 using Work = std::function<void()>;
 
-enum class QueuePriority { Default, Background };
+// Background lowers the worker's nice value; Idle makes it yield the
+// processor and the disk to all other work (makeThisThreadIdle).
+enum class QueuePriority { Default, Background, Idle };
 
 class Queue {
  public:

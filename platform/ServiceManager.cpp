@@ -5,6 +5,7 @@
 #include <systemd/sd-daemon.h>
 #include <systemd/sd-journal.h>
 
+#include <cstdlib>
 #include <cstring>
 #include <mutex>
 #include <system_error>
@@ -42,7 +43,35 @@ void logToJournal() { logSetSink(journalSink); }
 
 void serviceNotifyReady(const std::string& status) { notify("READY=1\nSTATUS=" + status); }
 
-void serviceNotifyStopping(const std::string& status) { notify("STOPPING=1\nSTATUS=" + status); }
+namespace {
+// Once stopping is announced, the periodic status line stays quiet.
+std::mutex gStatusLock;
+bool gStopping = false;
+}  // namespace
+
+void serviceNotifyStopping(const std::string& status) {
+  std::lock_guard<std::mutex> hold(gStatusLock);
+  gStopping = true;
+  notify("STOPPING=1\nSTATUS=" + status);
+}
+
+void serviceStatusEvery(std::chrono::seconds interval, std::function<std::string()> status) {
+  if (!getenv("NOTIFY_SOCKET")) return;
+  try {
+    std::thread([interval, status = std::move(status)] {
+      pthread_setname_np(pthread_self(), "status");
+      std::string last;
+      for (;;) {
+        std::this_thread::sleep_for(interval);
+        std::string now = status();
+        std::lock_guard<std::mutex> hold(gStatusLock);
+        if (gStopping) return;
+        if (now != last) notify("STATUS=" + now);
+        last = std::move(now);
+      }
+    }).detach();
+  } catch (const std::system_error& e) { QRTLog(kLogError, "Cannot start the status line: %s", e.what()); }
+}
 
 void serviceNotifyStatus(const std::string& status) { notify("STATUS=" + status); }
 

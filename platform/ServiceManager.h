@@ -3,6 +3,7 @@
 // SIGHUP that asks for the log to be reopened.
 #pragma once
 
+#include <chrono>
 #include <functional>
 #include <string>
 
@@ -13,6 +14,9 @@ void serviceNotifyReady(const std::string& status);
 // STOPPING=1 with a STATUS= line.
 void serviceNotifyStopping(const std::string& status);
 void serviceNotifyStatus(const std::string& status);
+// Under a service manager: a thread that sends status() as the STATUS= line
+// every interval when it changed, until stopping is announced.
+void serviceStatusEvery(std::chrono::seconds interval, std::function<std::string()> status);
 
 // Sends the log's lines to the systemd journal (level as PRIORITY, the
 // function as CODE_FUNC) instead of the file.

@@ -13,6 +13,13 @@ void QRTReply::send(uint64_t code) {
   dictionary[QRTReplyKeyError] = code;
   const platform::SendResult sent = connection_->send(messageId_, dictionary);
   done();
+  if (counted_) {
+    const uint64_t micros = QRTMetrics::microsSince(received_);
+    QRTMetrics::requests(slot_).record(micros, code != QRTErrorNone);
+    QRTLogAs(platform::kLogDebug, "QRTProcessRelayEvent", "Served %s for uid %u pid %d (%@): %llu in %llu us", name_,
+             callerUid_, callerPid_, callerIdentifier_, static_cast<unsigned long long>(code),
+             static_cast<unsigned long long>(micros));
+  }
   if (sent != platform::SendResult::TooLarge) return;
   // The stream stays whole: the client gets an error in place of the reply.
   QRTLog(kLogError, "Reply to message %llu with code %llu does not fit in one frame; answering %llu",

@@ -13,6 +13,7 @@
 #include "base/PlistValue.h"
 #include "base/QRTProtocol.h"
 #include "base/QRTUUID.h"
+#include "Daemon/QRTMetrics.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "platform/RequestSocket.h"
 
@@ -30,6 +31,16 @@ class QRTReply {
   plist::Dictionary dictionary;
   // Stores code under "ReplyError" and sends the reply.
   void send(uint64_t code);
+  // Counts the request under its command when the reply goes out, and logs
+  // it at debug level with its caller, result and time taken.
+  void countAs(uint64_t command, const char* name, uint32_t callerUid, int callerPid) {
+    counted_ = true;
+    slot_ = QRTMetrics::slotForCommand(command);
+    name_ = name;
+    callerUid_ = callerUid;
+    callerPid_ = callerPid;
+  }
+  void setCallerIdentifier(std::optional<std::string> identifier) { callerIdentifier_ = std::move(identifier); }
 
  private:
   void done() {
@@ -38,6 +49,13 @@ class QRTReply {
   platform::ConnectionRef connection_;
   uint64_t messageId_;
   std::atomic<bool> done_{false};
+  QRTMetrics::Clock::time_point received_ = QRTMetrics::Clock::now();
+  bool counted_ = false;
+  size_t slot_ = 0;
+  const char* name_ = "";
+  uint32_t callerUid_ = 0;
+  int callerPid_ = 0;
+  std::optional<std::string> callerIdentifier_;
 };
 using QRTReplyRef = std::shared_ptr<QRTReply>;
 

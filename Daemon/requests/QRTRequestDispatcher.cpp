@@ -7,6 +7,7 @@
 #include "Daemon/requests/QRTCodeSigningCommands.h"
 #include "Daemon/requests/QRTContainerCommands.h"
 #include "Daemon/requests/QRTDataProtectionCommands.h"
+#include "Daemon/requests/QRTOperationsCommands.h"
 #include "Daemon/requests/QRTSpecialCommands.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTError.h"
@@ -76,7 +77,19 @@ const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
     SERVED(QRTCommandDeleteUserManagedAsset, "deleteUserManagedAsset", QRTHandleDeleteUserManagedAsset,
            QRTEntitlementUserManagedAssets, 1),
 };
+const QRTCommandRow QRTExtensionCommandTable[] = {
+    SERVED(QRTCommandStatus, "status", QRTHandleStatus, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandMetrics, "metrics", QRTHandleMetrics, QRTEntitlementAllowed, 1),
+    SERVED(QRTCommandSetLogLevel, "setLogLevel", QRTHandleSetLogLevel, QRTEntitlementAllowed, 1),
+};
 #undef SERVED
+
+const QRTCommandRow* QRTCommandRowFor(uint64_t command) {
+  if (command < QRTCommandCount) return &QRTCommandTable[command];
+  for (const QRTCommandRow& row : QRTExtensionCommandTable)
+    if (row.command == command) return &row;
+  return nullptr;
+}
 
 void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::RequestEvent& event) {
   if (!event.message) {
@@ -92,12 +105,17 @@ void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::R
   auto reply = std::make_shared<QRTReply>(connection, event.messageId);
   uint64_t result = QRTErrorNone;
   bool handled = false;
-  if (command >= QRTCommandCount) {
+  const QRTCommandRow* found = QRTCommandRowFor(command);
+  reply->countAs(command, found ? found->name : "invalidCommand", peer ? peer->uid : UINT32_MAX,
+                 peer ? static_cast<int>(peer->pid) : 0);
+  if (!found) {
     QRTLog(kLogError, "Invalid command index: %lld", static_cast<long long>(command));
     result = QRTErrorInvalidRequest;
   } else {
-    const QRTCommandRow& row = QRTCommandTable[command];
+    const QRTCommandRow& row = *found;
     std::optional<QRTClientConnection> client = checkEntitlementsAndInitClientObject(*connection, row.entitlement);
+    if (client && platform::logEnabled(platform::kLogDebug))
+      reply->setCallerIdentifier(client->clientBundleIdentifier());
     if (!client) {
       result = QRTErrorNotEntitled;
     } else if (!requestIdentifiersValid(request, client->clientUserId(), command)) {
@@ -108,7 +126,7 @@ void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::R
       if (failure) result = failure->resultCode();
     }
   }
-  if (!handled || QRTCommandTable[command].replyOnReturn == 1 || result != QRTErrorNone) reply->send(result);
+  if (!handled || found->replyOnReturn == 1 || result != QRTErrorNone) reply->send(result);
 }
 
 namespace {

@@ -23,6 +23,9 @@ struct QRTCommandRow {
 };
 
 extern const QRTCommandRow QRTCommandTable[QRTCommandCount];
+// The row of a command number, in the main table or among the administrative
+// commands; nothing for a number no row serves.
+const QRTCommandRow* QRTCommandRowFor(uint64_t command);
 
 // The handler of every event on a client connection.
 void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::RequestEvent& event);

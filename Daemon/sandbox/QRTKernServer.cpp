@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "Daemon/QRTMetrics.h"
 #include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTContainerCache.h"
@@ -324,6 +325,7 @@ bool demux_server(const platform::UpcallMessage& request, platform::UpcallReply*
   int32_t code = 0;
   QRTKernVerdict verdict = QRTKernCheckRequest(request, &code);
   if (verdict == QRTKernVerdict::NotOurs) return false;
+  QRTMetrics::Timer timed(QRTMetrics::upcalls(), &code);
   QRTLog(kLogDebug, "handling incomming request for quarter server");
   reply->id = request.id + QRTKernServerReplyIdOffset;
   reply->data.clear();

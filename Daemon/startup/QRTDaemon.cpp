@@ -16,9 +16,11 @@
 #include <string>
 #include <vector>
 
+#include "Daemon/QRTMetrics.h"
 #include "Daemon/QRTProcessWide.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
+#include "Daemon/requests/QRTOperationsCommands.h"
 #include "Daemon/requests/QRTRequestDispatcher.h"
 #include "Daemon/sandbox/QRTKernServer.h"
 #include "platform/DeviceProperties.h"
@@ -282,6 +284,7 @@ int QRTDaemonMain(int argc, char** argv) {
     usage(stderr);
     return 2;
   }
+  QRTMetrics::startTime();  // uptime counts from here
   if (options.help || options.version) {
     if (options.help)
       usage(stdout);
@@ -350,5 +353,6 @@ int QRTDaemonMain(int argc, char** argv) {
   if (!startListener()) return -1;
   // Only now does the request socket answer, and start-up work is done.
   platform::serviceNotifyReady("Serving requests");
+  platform::serviceStatusEvery(std::chrono::seconds(10), QRTServiceStatusLine);
   return platform::runMainLoop();
 }

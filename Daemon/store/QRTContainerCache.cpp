@@ -447,3 +447,23 @@ bool QRTContainerCache::setSandboxContainerMappingForUser(uint32_t userId, const
   }
   return true;
 }
+
+QRTContainerCache::Stats QRTContainerCache::stats() {
+  Stats stats;
+  std::lock_guard<std::mutex> hold(cacheLock);
+  for (const auto* caches : {&liveContainerCache, &transientContainerCache}) {
+    for (const auto& [key, map] : *caches) {
+      stats.approximateBytes += sizeof(key) + key.capacity() + sizeof(ClassMap) + map.bucket_count() * sizeof(void*);
+      for (const auto& [identifier, metadata] : map) {
+        stats.approximateBytes += sizeof(ClassMap::value_type) + identifier.capacity() + 2 * sizeof(void*);
+        if (!metadata) continue;
+        stats.approximateBytes +=
+            sizeof(QRTMetadata) + metadata->identifier().capacity() + metadata->url().path().capacity();
+        const uint64_t contentClass = metadata->containerClass();
+        if (contentClass < stats.containersPerClass.size()) ++stats.containersPerClass[contentClass];
+        ++stats.containers;
+      }
+    }
+  }
+  return stats;
+}

@@ -3,6 +3,7 @@
 // directory is scanned once; later changes go through add and remove.
 #pragma once
 
+#include <array>
 #include <cstdint>
 #include <memory>
 #include <mutex>
@@ -56,6 +57,16 @@ class QRTContainerCache {
   // Tells the sandbox where a container lies (no URL withdraws it).
   bool setSandboxContainerMappingForUser(uint32_t userId, const std::string& identifier, uint64_t containerClass,
                                          const std::optional<QRTURL>& url);
+
+  // What the cache holds now: containers per class (index 1 to 13, live and
+  // transient together) and the approximate memory of its entries, info
+  // values left out.
+  struct Stats {
+    std::array<uint64_t, 14> containersPerClass{};
+    uint64_t containers = 0;
+    uint64_t approximateBytes = 0;
+  };
+  Stats stats();
 
  private:
   using ClassMap = std::unordered_map<std::string, QRTMetadataRef>;

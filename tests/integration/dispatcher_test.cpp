@@ -31,11 +31,14 @@ TEST_F(DispatcherTest, CommandsOutsideTheTableAnswer49) {
     EXPECT_EQ(replyError(request(command)), kNotServed) << command;
 }
 
-// Without entitlements only the open commands pass; the master entitlement passes every row.
+// Without entitlements only the open commands pass; the master entitlement passes every row,
+// the administrative ones too.
 TEST_F(DispatcherTest, EntitlementsOpenTheCommandTable) {
   for (bool allowed : {false, true}) {
     if (allowed) setOwnIdentity("com.example.installer", {{kAllowed, true}});
-    for (uint64_t command = 0; command < QRTCommandCount; ++command) {
+    std::vector<uint64_t> commands{QRTCommandStatus, QRTCommandMetrics, QRTCommandSetLogLevel};
+    for (uint64_t command = 0; command < QRTCommandCount; ++command) commands.push_back(command);
+    for (uint64_t command : commands) {
       // Command 17 itself refuses (55) a group the caller may not reach; a well-known one it may.
       plist::Dictionary keys;
       if (command == QRTCommandSystemGroupContainerPath)

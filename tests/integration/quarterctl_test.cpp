@@ -227,6 +227,42 @@ TEST_F(QuarterctlTest, CodeSigningAndGroups) {
   EXPECT_EQ(run("codesign set --identifier com.example.app").status, 2) << "one of the three is required";
 }
 
+TEST_F(QuarterctlTest, StatusMetricsAndTheLogLevelOfTheRunningDaemon) {
+  // Served requests are logged at 7 only; the level changes without a restart.
+  EXPECT_EQ(run("log-level 5").out, "log level 5 (was 7)\n");
+  ASSERT_EQ(run("create --class app-data --identifier com.example.quiet").status, 0);
+  EXPECT_EQ(run("log-level 7").out, "log level 7 (was 5)\n");
+  ASSERT_EQ(run("create --class app-data --identifier com.example.loud").status, 0);
+  const std::string served = "Served createOrLookupContainer for uid 0 pid ";
+  ASSERT_TRUE(logContains(served));
+  const std::string log = logText();
+  EXPECT_EQ(log.find(served), log.rfind(served)) << "one line, for the request made at 7";
+  EXPECT_TRUE(contains(log.substr(log.find(served)), "(com.norvane.quarterctl): 1 in ")) << log;
+  EXPECT_EQ(run("log-level 8").status, 2);
+  EXPECT_EQ(run("raw Command=u64:103 LogLevel=u64:9").status, 1);
+  EXPECT_EQ(run("raw Command=u64:99").status, 1);
+
+  auto status = call(QRTCommandStatus);
+  ASSERT_TRUE(status) << "not entitled: the test program has no identity";
+  EXPECT_EQ(plist::find(*status, QRTReplyKeyError)->integer().bits, 55u);
+  const std::string json = run("--json status").out;
+  for (const std::string part :
+       {"\"containers\":{\"addon-bundle\":0,", "\"app-data\":2,", "\"deathrow\":{\"bytes\":0,\"items\":0}",
+        "\"identities\":{\"entries\":1,\"refused_files\":0}", "\"failed\":1,\"name\":\"other\"",
+        "\"name\":\"createOrLookupContainer\",\"p50_us\":", "\"upcalls\":{\"failed\":0,"})
+    EXPECT_TRUE(contains(json, part)) << part << " in " << json;
+  EXPECT_TRUE(contains(run("status").out, "\ndeath row                   0 items, 0 B\n"));
+
+  const std::string metrics = run("metrics").out;
+  for (const std::string part :
+       {"# TYPE quarterd_request_duration_seconds histogram\n", "quarterd_containers{class=\"app-data\"} 2\n",
+        "quarterd_request_duration_seconds_count{command=\"createOrLookupContainer\"} 2\n",
+        "quarterd_request_duration_seconds_bucket{command=\"setLogLevel\",le=\"+Inf\"} ",
+        "quarterd_requests_failed_total{command=\"other\"} 1\n", "quarterd_upcall_duration_seconds_count 0\n"})
+    EXPECT_TRUE(contains(metrics, part)) << part << " in " << metrics;
+  EXPECT_TRUE(metrics.ends_with("\n# EOF\n"));
+}
+
 // Each command with its --options, as one source names them; "" holds the global options.
 using Commands = std::map<std::string, std::set<std::string>>;
 

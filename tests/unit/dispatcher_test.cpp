@@ -1,4 +1,5 @@
-// The request layer's pure rules: user-id validation and message readers.
+// The request layer's pure rules: user-id validation, message readers and
+// the latency histogram.
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 
@@ -120,6 +121,35 @@ TEST(ReplySending, OversizedReplyBecomesErrorFortyOnAnIntactStream) {
   EXPECT_EQ(replies, (std::vector<std::pair<uint64_t, uint64_t>>{{7, QRTErrorException}, {8, 1}}));
   EXPECT_EQ(connection->repliesDue(), 0);
   close(fds[1]);
+}
+
+// Quantiles come from the bucket that holds the rank, interpolated inside it:
+// within a factor of two of the truth, never from a neighbouring bucket.
+TEST(LatencyHistogram, QuantilesFallInTheBucketOfTheirRank) {
+  struct {
+    std::vector<std::pair<uint64_t, int>> samples;  // microseconds, how many
+    double q;
+    uint64_t low, high;
+  } rows[] = {
+      {{}, 0.5, 0, 0},
+      {{{0, 10}}, 0.99, 0, 1},
+      {{{100, 99}, {5000, 1}}, 0.5, 64, 128},
+      {{{100, 98}, {5000, 2}}, 0.99, 4096, 8192},
+      {{{3, 50}, {1000, 50}}, 0.5, 2, 4},
+      {{{UINT64_MAX, 1}}, 0.5, uint64_t{1} << 30, uint64_t{1} << 31},
+  };
+  for (const auto& row : rows) {
+    QRTLatencyHistogram histogram;
+    for (const auto& [micros, count] : row.samples)
+      for (int i = 0; i < count; ++i) histogram.record(micros, i % 2 == 1);
+    const QRTLatencyHistogram::Snapshot snapshot = histogram.snapshot();
+    const uint64_t q = snapshot.quantileMicros(row.q);
+    EXPECT_GE(q, row.low) << row.q;
+    EXPECT_LE(q, row.high) << row.q;
+    uint64_t served = 0;
+    for (const auto& sample : row.samples) served += static_cast<uint64_t>(sample.second);
+    EXPECT_EQ(snapshot.served, served);
+  }
 }
 
 }  // namespace

@@ -1,5 +1,7 @@
+#include <sched.h>
 #include <signal.h>
 #include <sys/resource.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -87,7 +89,19 @@ TEST(SerialQueue, SyncRunsOnTheWorkerInlineFromItsOwnWorkAndSurvivesThrowingWork
   EXPECT_EQ(inner, worker);
 }
 
-TEST(SerialQueue, BackgroundPriorityRaisesTheWorkersNiceValue) {
+TEST(SerialQueue, LowerPrioritiesReachTheWorker) {
+  // The idle queue's worker (and the threads it starts) yield the processor and the disk.
+  int policy = -1;
+  long ioClass = -1;
+  makeSerialQueue("test.idle", QueuePriority::Idle)->sync([&] {
+    std::thread([&] {
+      policy = sched_getscheduler(0);
+      ioClass = syscall(SYS_ioprio_get, 1, 0) >> 13;  // this thread; the class is above bit 13
+    }).join();
+  });
+  EXPECT_EQ(policy, SCHED_IDLE);
+  EXPECT_EQ(ioClass, 3) << "the idle I/O class";
+
   auto niceOf = [](Queue& queue) {
     int nice = 0;
     queue.sync([&] { nice = getpriority(PRIO_PROCESS, static_cast<id_t>(gettid())); });

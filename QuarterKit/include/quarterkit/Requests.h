@@ -47,6 +47,10 @@ enum class Command : uint64_t {
   setNetworkExtension = 27,
   userManagedAssetsPath = 28,
   deleteUserManagedAsset = 29,
+  // Administrative commands (the master entitlement).
+  status = 101,
+  metrics = 102,
+  setLogLevel = 103,
 };
 
 // Builds one request message. Optional values that are absent leave their key
@@ -178,5 +182,11 @@ Result setNetworkExtension(Connection& c, const std::optional<std::string>& iden
 Result userManagedAssetsPath(Connection& c, const std::optional<std::string>& identifier, bool isRelative);
 Result deleteUserManagedAsset(Connection& c, const std::optional<std::string>& identifier,
                               const std::optional<std::string>& relativePath);
+// The daemon's figures under "ReplyStatus"; metrics adds the latency buckets.
+Result status(Connection& c);
+Result metrics(Connection& c);
+// Sets the daemon's log level (0 to 7; 7 logs every request); the reply's
+// "ReplyLogLevel" is the level before.
+Result setLogLevel(Connection& c, uint64_t level);
 
 }  // namespace quarterkit
