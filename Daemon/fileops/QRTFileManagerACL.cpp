@@ -266,6 +266,29 @@ bool QRTFileManager::setTopLevelACL(const platform::Dir* directory, const QRTURL
   return false;
 }
 
+bool QRTFileManager::topLevelSystemContainerACLMatchesAtURL(const QRTURL& url, bool* matches, QRTErrorRef* error) {
+  QRTErrorRef listError;
+  SystemContainerACLPtr list = _CopyTopLevelSystemContainerACLWithError(&listError);
+  platform::Item item;
+  Acl expected, found;
+  int err = list ? platform::safeOpenItem(url.path(), &item) : EINVAL;
+  if (!err && S_ISLNK(item.st.st_mode)) err = ELOOP;
+  if (!err) err = list->access.duplicate(&expected);
+  if (!err) err = expected.adoptModeBits(item.st.st_mode);
+  if (!err) err = Acl::readFrom(item, false, &found);
+  if (err) {
+    QRTSetError(error,
+                QRT_ERROR(QRTErrorACLFailed, listError, false, "Failed to read ACL of %@: %s", url, errorText(err)));
+    return false;
+  }
+  *matches = expected.text() == found.text();
+  if (*matches && list->inherited && S_ISDIR(item.st.st_mode)) {
+    Acl inherited;
+    *matches = Acl::readFrom(item, true, &inherited) == 0 && inherited.text() == list->inherited.text();
+  }
+  return true;
+}
+
 bool QRTFileManager::standardizeACLsAtURL(const QRTURL& url, bool isSystemContainer, QRTErrorRef* error) {
   StampLists lists;
   if (!(lists.topLevel = _CopyTopLevelSystemContainerACLWithError(error)) ||
