@@ -39,9 +39,13 @@ enum QRTCommand : uint64_t {
   QRTCommandSetNetworkExtension = 27,
   QRTCommandUserManagedAssetsPath = 28,
   QRTCommandDeleteUserManagedAsset = 29,
+  // Extensions for administrators, numbered from 100.
+  QRTCommandVerify = 100,
 };
 // One past the last command; a request naming it or more is invalid.
 inline constexpr uint64_t QRTCommandCount = 30;
+// The first extension command; those from here on have a table of their own.
+inline constexpr uint64_t QRTExtensionCommandFirst = 100;
 
 // Keys of a request.
 inline constexpr const char* QRTKeyCommand = "Command";
@@ -74,6 +78,7 @@ inline constexpr const char* QRTKeyNumRetryCrashes = "NumRetryCrashes";
 inline constexpr const char* QRTKeySourcePath = "SourcePath";
 inline constexpr const char* QRTKeyDestPath = "DestPath";
 inline constexpr const char* QRTKeyIsRelative = "IsRelative";
+inline constexpr const char* QRTKeyRepair = "Repair";
 
 // Keys of a reply. "ReplyError" is in every reply: 1 is success.
 inline constexpr const char* QRTReplyKeyError = "ReplyError";
@@ -89,6 +94,16 @@ inline constexpr const char* QRTReplyKeyInfoDictionary = "ReplyInfoDictionary";
 inline constexpr const char* QRTReplyKeyGroupContainerDict = "ReplyGroupContainerDict";
 inline constexpr const char* QRTReplyKeyGroupIdentifiersArray = "ReplyGroupIdentifiersArray";
 inline constexpr const char* QRTReplyKeyDiskUsage = "ReplyDiskUsage";
+// Command 100: the containers looked at, and one dictionary per finding with
+// the keys below.
+inline constexpr const char* QRTReplyKeyVerifiedContainers = "ReplyVerifiedContainers";
+inline constexpr const char* QRTReplyKeyFindings = "ReplyFindings";
+inline constexpr const char* QRTFindingKeyKind = "Kind";
+inline constexpr const char* QRTFindingKeySeverity = "Severity";  // "error", "warning" or "notice"
+inline constexpr const char* QRTFindingKeySubject = "Subject";
+inline constexpr const char* QRTFindingKeyDetail = "Detail";
+inline constexpr const char* QRTFindingKeyAction = "Action";
+inline constexpr const char* QRTFindingKeyRepaired = "Repaired";
 
 // Entitlements a command asks of its caller.
 inline constexpr const char* QRTEntitlementNone = "com.norvane.private.QuarterKit.none";

@@ -1,5 +1,6 @@
 #include "Daemon/requests/QRTRequestDispatcher.h"
 
+#include <iterator>
 #include <mutex>
 #include <unordered_map>
 
@@ -8,6 +9,7 @@
 #include "Daemon/requests/QRTContainerCommands.h"
 #include "Daemon/requests/QRTDataProtectionCommands.h"
 #include "Daemon/requests/QRTSpecialCommands.h"
+#include "Daemon/requests/QRTVerifyCommand.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTError.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
@@ -76,7 +78,19 @@ const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
     SERVED(QRTCommandDeleteUserManagedAsset, "deleteUserManagedAsset", QRTHandleDeleteUserManagedAsset,
            QRTEntitlementUserManagedAssets, 1),
 };
+// The extensions, from command 100 on.
+const QRTCommandRow QRTExtensionCommandTable[] = {
+    SERVED(QRTCommandVerify, "verify", QRTHandleVerify, QRTEntitlementAllowed, 0),
+};
 #undef SERVED
+
+const QRTCommandRow* QRTCommandRowFor(uint64_t command) {
+  if (command < QRTCommandCount) return &QRTCommandTable[command];
+  const uint64_t extension = command - QRTExtensionCommandFirst;
+  if (command >= QRTExtensionCommandFirst && extension < std::size(QRTExtensionCommandTable))
+    return &QRTExtensionCommandTable[extension];
+  return nullptr;
+}
 
 void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::RequestEvent& event) {
   if (!event.message) {
@@ -92,11 +106,12 @@ void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::R
   auto reply = std::make_shared<QRTReply>(connection, event.messageId);
   uint64_t result = QRTErrorNone;
   bool handled = false;
-  if (command >= QRTCommandCount) {
+  const QRTCommandRow* found = QRTCommandRowFor(command);
+  if (!found) {
     QRTLog(kLogError, "Invalid command index: %lld", static_cast<long long>(command));
     result = QRTErrorInvalidRequest;
   } else {
-    const QRTCommandRow& row = QRTCommandTable[command];
+    const QRTCommandRow& row = *found;
     std::optional<QRTClientConnection> client = checkEntitlementsAndInitClientObject(*connection, row.entitlement);
     if (!client) {
       result = QRTErrorNotEntitled;
@@ -108,7 +123,7 @@ void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::R
       if (failure) result = failure->resultCode();
     }
   }
-  if (!handled || QRTCommandTable[command].replyOnReturn == 1 || result != QRTErrorNone) reply->send(result);
+  if (!handled || found->replyOnReturn == 1 || result != QRTErrorNone) reply->send(result);
 }
 
 namespace {

@@ -23,6 +23,8 @@ struct QRTCommandRow {
 };
 
 extern const QRTCommandRow QRTCommandTable[QRTCommandCount];
+// The row of a command, in either table; nothing for a number neither holds.
+const QRTCommandRow* QRTCommandRowFor(uint64_t command);
 
 // The handler of every event on a client connection.
 void QRTProcessRelayEvent(const platform::ConnectionRef& connection, platform::RequestEvent& event);
