@@ -41,6 +41,7 @@ SAME_COMMAND(stageSharedContent, StageSharedContent);
 SAME_COMMAND(setNetworkExtension, SetNetworkExtension);
 SAME_COMMAND(userManagedAssetsPath, UserManagedAssetsPath);
 SAME_COMMAND(deleteUserManagedAsset, DeleteUserManagedAsset);
+SAME_COMMAND(verify, Verify);
 #undef SAME_COMMAND
 static_assert(static_cast<uint64_t>(Command::deleteUserManagedAsset) + 1 == QRTCommandCount, "a command is missing");
 
@@ -332,6 +333,12 @@ Result deleteUserManagedAsset(Connection& c, const std::optional<std::string>& i
   return perform(c, Request(Command::deleteUserManagedAsset)
                         .string(QRTKeyIdentifier, identifier)
                         .string(QRTKeySourcePath, relativePath));
+}
+
+Result verify(Connection& c, bool repair) {
+  Request request(Command::verify);
+  if (repair) request.boolean(QRTKeyRepair, true);
+  return perform(c, request);
 }
 
 }  // namespace quarterkit

@@ -47,6 +47,8 @@ enum class Command : uint64_t {
   setNetworkExtension = 27,
   userManagedAssetsPath = 28,
   deleteUserManagedAsset = 29,
+  // Extensions for administrators.
+  verify = 100,
 };
 
 // Builds one request message. Optional values that are absent leave their key
@@ -178,5 +180,8 @@ Result setNetworkExtension(Connection& c, const std::optional<std::string>& iden
 Result userManagedAssetsPath(Connection& c, const std::optional<std::string>& identifier, bool isRelative);
 Result deleteUserManagedAsset(Connection& c, const std::optional<std::string>& identifier,
                               const std::optional<std::string>& relativePath);
+// Checks the store and, with repair, fixes what is safe to fix; the reply
+// lists the findings.
+Result verify(Connection& c, bool repair);
 
 }  // namespace quarterkit
