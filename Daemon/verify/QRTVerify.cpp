@@ -2,6 +2,7 @@
 
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <chrono>
 #include <ctime>
 #include <future>
@@ -123,8 +124,9 @@ class Verifier {
     QRTGlobalConfiguration& configuration = QRTGlobalConfiguration::sharedInstance();
     QRTContainerCache& cache = QRTContainerCache::sharedInstance();
     std::optional<QRTURL> directory =
-        QRTIsGlobalClass(containerClass) ? configuration.globalContainerBaseURLWithContentClass(containerClass, transient)
-                                         : configuration.containerDirectoryURLForUser(userId, containerClass, transient);
+        QRTIsGlobalClass(containerClass)
+            ? configuration.globalContainerBaseURLWithContentClass(containerClass, transient)
+            : configuration.containerDirectoryURLForUser(userId, containerClass, transient);
     QRTFileManager& fm = QRTFileManager::defaultManager();
     if (!directory || !fm.itemExistsAtURL(*directory)) return;
     QRTErrorRef error;
@@ -134,10 +136,13 @@ class Verifier {
           "check the directory's owner and mode");
       return;
     }
+    // Held once, so that each container's owner costs one look-up of its name.
+    platform::Dir held;
+    platform::Dir::open(directory->path(), &held);
     std::map<std::string, std::vector<QRTMetadataRef>> onDisk;
     for (const QRTURL& item : *items) {
-      QRTMetadataRef metadata = checkContainer(item, userId, containerClass);
-      if (metadata) onDisk[metadata->identifier()].push_back(metadata->withUrl(item, transient));
+      QRTMetadataRef metadata = checkContainer(held, item, userId, containerClass);
+      if (metadata) onDisk[metadata->identifier()].push_back(transient ? metadata->withTransient(true) : metadata);
     }
     std::optional<std::vector<QRTMetadataRef>> cached = cache.builtContainersForUser(userId, containerClass, transient);
     if (!cached) return;  // the cache reads the directory when it is first asked
@@ -151,12 +156,13 @@ class Verifier {
         known[entry->identifier()] = entry;
         continue;
       }
-      QRTFinding& finding = add("cache-entry-stale", Severity::warning, entry->url().path(),
-                                "the cache holds " + entry->identifier() + " but its directory is gone or invalid",
-                                "forget the entry");
+      QRTFinding& finding =
+          add("cache-entry-stale", Severity::warning, entry->url().path(),
+              "the cache holds " + entry->identifier() + " but its directory is gone or invalid", "forget the entry");
       QRTErrorRef removeError;
-      if (repair_) finding.repaired = cache.removeContainerForUser(userId, containerClass, entry->identifier(),
-                                                                   transient, &removeError);
+      if (repair_)
+        finding.repaired =
+            cache.removeContainerForUser(userId, containerClass, entry->identifier(), transient, &removeError);
     }
     for (const auto& [identifier, containers] : onDisk) {
       auto entry = known.find(identifier);
@@ -181,7 +187,8 @@ class Verifier {
 
   // The container's metadata, when it is one of this user and class; every
   // other entry is a finding.
-  QRTMetadataRef checkContainer(const QRTURL& item, uint32_t userId, uint64_t containerClass) {
+  QRTMetadataRef checkContainer(const platform::Dir& classDirectory, const QRTURL& item, uint32_t userId,
+                                uint64_t containerClass) {
     QRTErrorRef error;
     std::shared_ptr<QRTMetadata> metadata = QRTMetadata::readAndValidateMetadataAtUrl(item, userId, true, &error);
     if (!metadata) {
@@ -194,15 +201,14 @@ class Verifier {
       return nullptr;
     }
     ++report_.containers;
-    struct stat st;
     const std::optional<uid_t> owner = expectedOwner(userId, containerClass);
-    if (owner && platform::safeStat(item.path(), &st) == 0 && st.st_uid != *owner) {
+    platform::Item top;
+    if (owner && classDirectory.valid() && classDirectory.openItem(item.lastPathComponent(), &top) == 0 &&
+        S_ISDIR(top.st.st_mode) && top.st.st_uid != *owner) {
       QRTFinding& finding = add("owner-drift", Severity::warning, item.path(),
-                                "owned by " + std::to_string(st.st_uid) + ", made for " + std::to_string(*owner),
+                                "owned by " + std::to_string(top.st.st_uid) + ", made for " + std::to_string(*owner),
                                 "give the directory back to its owner");
-      platform::Item top;
-      if (repair_ && platform::safeOpenItem(item.path(), &top) == 0 && S_ISDIR(top.st.st_mode))
-        finding.repaired = platform::Dir::setOwner(top, *owner, static_cast<gid_t>(-1)) == 0;
+      if (repair_) finding.repaired = platform::Dir::setOwner(top, *owner, static_cast<gid_t>(-1)) == 0;
     }
     if (QRTIsSystemClass(containerClass)) {
       QRTFileManager& fm = QRTFileManager::defaultManager();
@@ -228,11 +234,12 @@ class Verifier {
     for (const auto& [identifier, container] : known) {
       std::optional<std::string> target = platform::sandboxStateItem(slot->user, slot->itemType, identifier);
       if (target == container->url().path()) continue;
-      QRTFinding& finding = add(target ? "sandbox-mapping-wrong" : "sandbox-mapping-missing", Severity::warning,
-                                identifier, target ? "leads to " + *target : "no mapping",
-                                "point the mapping at the container");
+      QRTFinding& finding =
+          add(target ? "sandbox-mapping-wrong" : "sandbox-mapping-missing", Severity::warning, identifier,
+              target ? "leads to " + *target : "no mapping", "point the mapping at the container");
       if (repair_)
-        finding.repaired = cache.setSandboxContainerMappingForUser(userId, identifier, containerClass, container->url());
+        finding.repaired =
+            cache.setSandboxContainerMappingForUser(userId, identifier, containerClass, container->url());
     }
     for (const std::string& identifier : platform::sandboxStateItems(slot->user, slot->itemType)) {
       if (known.count(identifier)) continue;
@@ -245,7 +252,8 @@ class Verifier {
       QRTFinding& finding =
           add("sandbox-mapping-orphan", Severity::warning, identifier,
               dangling ? "leads nowhere" : "leads to " + *target + ", which is no container", "withdraw the mapping");
-      if (repair_) finding.repaired = platform::sandboxSetStateItem(slot->user, slot->itemType, identifier, nullptr) == 0;
+      if (repair_)
+        finding.repaired = platform::sandboxSetStateItem(slot->user, slot->itemType, identifier, nullptr) == 0;
     }
   }
 
@@ -296,8 +304,8 @@ class Verifier {
       items += listed ? listed->size() : 0;
     }
     if (items == 0) return;
-    QRTFinding& finding = add("deathrow-backlog", Severity::notice, first, std::to_string(items) + " items wait",
-                              "run a death-row pass");
+    QRTFinding& finding =
+        add("deathrow-backlog", Severity::notice, first, std::to_string(items) + " items wait", "run a death-row pass");
     if (!repair_) return;
     auto done = std::make_shared<std::promise<uint64_t>>();
     std::future<uint64_t> result = done->get_future();
@@ -363,11 +371,11 @@ QRTVerifyReport QRTVerifyStore(bool repair) {
   QRTVerifyReport report = Verifier(repair).run();
   size_t repaired = 0;
   for (const QRTFinding& finding : report.findings) repaired += finding.repaired ? 1 : 0;
-  QRTLog(kLogNotice, "verify%s: %llu containers, %llu findings, %llu repaired, %lld ms", repair ? " --repair" : "",
-         static_cast<unsigned long long>(report.containers), static_cast<unsigned long long>(report.findings.size()),
-         static_cast<unsigned long long>(repaired),
-         static_cast<long long>(std::chrono::duration_cast<std::chrono::milliseconds>(
-                                    std::chrono::steady_clock::now() - started)
-                                    .count()));
+  QRTLog(
+      kLogNotice, "verify%s: %llu containers, %llu findings, %llu repaired, %lld ms", repair ? " --repair" : "",
+      static_cast<unsigned long long>(report.containers), static_cast<unsigned long long>(report.findings.size()),
+      static_cast<unsigned long long>(repaired),
+      static_cast<long long>(
+          std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - started).count()));
   return report;
 }
