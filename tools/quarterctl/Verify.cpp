@@ -51,9 +51,11 @@ int verify(G g, A a) {
                 table.print();
               }
               std::cout << reply.u64(QRTReplyKeyVerifiedContainers) << " containers checked, ";
-              if (all.empty()) std::cout << "nothing found\n";
-              else std::cout << all.size() << " findings" << (repair ? ", " + std::to_string(repaired) + " repaired" : "")
-                             << '\n';
+              if (all.empty())
+                std::cout << "nothing found\n";
+              else
+                std::cout << all.size() << " findings" << (repair ? ", " + std::to_string(repaired) + " repaired" : "")
+                          << '\n';
             },
             [](const qk::Reply& reply) -> nlohmann::json {
               nlohmann::json list = nlohmann::json::array();
@@ -66,7 +68,8 @@ int verify(G g, A a) {
                                 {"repaired", repairedAt(*finding)}});
               return {{"containers", reply.u64(QRTReplyKeyVerifiedContainers)}, {"findings", std::move(list)}};
             }};
-  return deliver(g, [&](qk::Connection& c) { return qk::verify(c, repair); }, show);
+  return deliver(
+      g, [&](qk::Connection& c) { return qk::verify(c, repair); }, show);
 }
 
 const Group kVerify{40,
