@@ -41,6 +41,7 @@ SAME_COMMAND(stageSharedContent, StageSharedContent);
 SAME_COMMAND(setNetworkExtension, SetNetworkExtension);
 SAME_COMMAND(userManagedAssetsPath, UserManagedAssetsPath);
 SAME_COMMAND(deleteUserManagedAsset, DeleteUserManagedAsset);
+SAME_COMMAND(verify, Verify);
 SAME_COMMAND(status, Status);
 SAME_COMMAND(metrics, Metrics);
 SAME_COMMAND(setLogLevel, SetLogLevel);
@@ -345,6 +346,12 @@ Result metrics(Connection& c) { return perform(c, Request(Command::metrics)); }
 
 Result setLogLevel(Connection& c, uint64_t level) {
   return perform(c, Request(Command::setLogLevel).u64(QRTKeyLogLevel, level));
+}
+
+Result verify(Connection& c, bool repair) {
+  Request request(Command::verify);
+  if (repair) request.boolean(QRTKeyRepair, true);
+  return perform(c, request);
 }
 
 }  // namespace quarterkit

@@ -41,6 +41,7 @@ enum QRTCommand : uint64_t {
   QRTCommandDeleteUserManagedAsset = 29,
   // Administrative commands, numbered from 100 upward so that the table above
   // can grow without meeting them.
+  QRTCommandVerify = 100,
   QRTCommandStatus = 101,
   QRTCommandMetrics = 102,
   QRTCommandSetLogLevel = 103,
@@ -82,6 +83,7 @@ inline constexpr const char* QRTKeySourcePath = "SourcePath";
 inline constexpr const char* QRTKeyDestPath = "DestPath";
 inline constexpr const char* QRTKeyIsRelative = "IsRelative";
 inline constexpr const char* QRTKeyLogLevel = "LogLevel";
+inline constexpr const char* QRTKeyRepair = "Repair";
 
 // Keys of a reply. "ReplyError" is in every reply: 1 is success.
 inline constexpr const char* QRTReplyKeyError = "ReplyError";
@@ -123,6 +125,16 @@ inline constexpr const char* QRTStatusKeyP50 = "P50";
 inline constexpr const char* QRTStatusKeyP99 = "P99";
 inline constexpr const char* QRTStatusKeySum = "SumMicros";
 inline constexpr const char* QRTStatusKeyBuckets = "Buckets";
+// Command 100: the containers looked at, and one dictionary per finding with
+// the keys below.
+inline constexpr const char* QRTReplyKeyVerifiedContainers = "ReplyVerifiedContainers";
+inline constexpr const char* QRTReplyKeyFindings = "ReplyFindings";
+inline constexpr const char* QRTFindingKeyKind = "Kind";
+inline constexpr const char* QRTFindingKeySeverity = "Severity";  // "error", "warning" or "notice"
+inline constexpr const char* QRTFindingKeySubject = "Subject";
+inline constexpr const char* QRTFindingKeyDetail = "Detail";
+inline constexpr const char* QRTFindingKeyAction = "Action";
+inline constexpr const char* QRTFindingKeyRepaired = "Repaired";
 
 // Entitlements a command asks of its caller.
 inline constexpr const char* QRTEntitlementNone = "com.norvane.private.QuarterKit.none";

@@ -112,4 +112,23 @@ int Acl::applyTo(const Item& item, bool asDefault) const {
              : errno;
 }
 
+int Acl::readFrom(const Item& item, bool asDefault, Acl* out) {
+  const std::string path = itemProcPath(item);
+  acl_t list = acl_get_file(path.c_str(), asDefault ? ACL_TYPE_DEFAULT : ACL_TYPE_ACCESS);
+  if (!list) return errno;
+  Acl read;
+  read.list_ = list;
+  *out = std::move(read);
+  return 0;
+}
+
+std::string Acl::text() const {
+  if (!list_) return {};
+  char* raw = acl_to_any_text(static_cast<acl_t>(list_), nullptr, ',', TEXT_ABBREVIATE | TEXT_NUMERIC_IDS);
+  if (!raw) return {};
+  std::string out(raw);
+  acl_free(raw);
+  return out;
+}
+
 }  // namespace platform

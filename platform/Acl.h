@@ -6,6 +6,7 @@
 #include <sys/types.h>
 
 #include <cstdint>
+#include <string>
 
 #include "platform/FileIO.h"
 
@@ -49,6 +50,12 @@ class Acl {
   // the item's own descriptor entry (the inode is reached without opening
   // it). 0 or an errno value.
   int applyTo(const Item& item, bool asDefault) const;
+  // The item's access list, or its default list, read the same way. 0 or an
+  // errno value.
+  static int readFrom(const Item& item, bool asDefault, Acl* out);
+  // The entries in their short text form, in libacl's order, so that two
+  // lists compare equal when their texts do; empty for no list.
+  std::string text() const;
 
  private:
   void* list_ = nullptr;  // acl_t

@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "platform/DeviceRoot.h"
+#include "platform/Dir.h"
 #include "platform/FileIO.h"
 #include "platform/Random.h"
 #include "platform/SafePath.h"
@@ -70,6 +71,14 @@ std::optional<std::string> sandboxStateItem(uint32_t userId, uint64_t itemType, 
     if (buffer.size() >= kMaxLinkLength) return std::nullopt;
     buffer.resize(buffer.size() * 2);
   }
+}
+
+std::vector<std::string> sandboxStateItems(uint32_t userId, uint64_t itemType) {
+  std::vector<std::string> names;
+  Dir directory;
+  if (Dir::open(itemDirectory(userId, itemType), &directory) != 0) return names;
+  directory.list(&names);
+  return names;
 }
 
 }  // namespace platform

@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace platform {
 
@@ -16,5 +17,7 @@ int sandboxSetStateItem(uint32_t userId, uint64_t itemType, const std::string& i
 
 // The path the mapping points to; nothing when there is none.
 std::optional<std::string> sandboxStateItem(uint32_t userId, uint64_t itemType, const std::string& identifier);
+// The identifiers that have a mapping of the user and item type.
+std::vector<std::string> sandboxStateItems(uint32_t userId, uint64_t itemType);
 
 }  // namespace platform

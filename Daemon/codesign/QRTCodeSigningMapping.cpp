@@ -378,6 +378,32 @@ bool QRTCodeSigningMapping::snapshotMatchesDatabase() {
   });
 }
 
+QRTCodeSigningMapping::DatabaseCheck QRTCodeSigningMapping::checkDatabase(bool recount) {
+  return onQueue([&] {
+    DatabaseCheck check;
+    check.problems = codeSigningMappingDB->integrityProblems();
+    QRTContainerCache& cache = QRTContainerCache::sharedInstance();
+    QRTErrorRef error = codeSigningMappingDB->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+        [&](const std::string& identifier, const QRTCodeSigningEntry& entry) {
+          if (entry.isRegisteredByCaller() || entry.isInvalid()) return;
+          for (uint64_t bundleClass : {QRTClassAppBundle, QRTClassAddonBundle, QRTClassVPNBundle}) {
+            QRTErrorRef lookupError;
+            if (cache.containerForUser(QRTContainerKey{QRTInstallerUserId, bundleClass, identifier}, &lookupError))
+              return;
+          }
+          check.withoutBundle.push_back(identifier);
+        });
+    if (error) check.problems.push_back("reading the entries: " + error->description());
+    for (QRTGroupType type : {QRTGroupTypeApplication, QRTGroupTypeSystem}) {
+      std::optional<QRTGroupReferenceCounts> fresh = _onQueue_countGroupReferences(type);
+      if (_onQueue_groupReferenceCounts(type) == fresh) continue;
+      check.driftedCounts.push_back(type);
+      if (recount) groupCounts_[type] = std::move(fresh);
+    }
+    return check;
+  });
+}
+
 // ---- reading ----
 
 std::optional<QRTCodeSigningEntry> QRTCodeSigningMapping::_onQueue_storedEntry(const std::string& identifier,

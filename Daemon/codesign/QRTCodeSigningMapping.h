@@ -81,6 +81,17 @@ class QRTCodeSigningMapping {
 
   // Whether the snapshot holds exactly the entries the database holds (tests).
   bool snapshotMatchesDatabase();
+  // What an administrator's check looks at: the database's own consistency
+  // checks, the programs whose bundle container is gone (registered by the
+  // caller and invalid ones left out), and the group types whose kept
+  // reference counts differ from a fresh count; with recount, those are
+  // taken afresh, as the next start would.
+  struct DatabaseCheck {
+    std::vector<std::string> problems;
+    std::vector<std::string> withoutBundle;
+    std::vector<QRTGroupType> driftedCounts;
+  };
+  DatabaseCheck checkDatabase(bool recount);
 
   // Counts the writes to the database, so that callers may remember an
   // answer for as long as nothing was written.

@@ -516,3 +516,28 @@ std::optional<std::vector<std::string>> QRTSQLiteDB::childIdentifiersForParentId
   }
   return children;
 }
+
+std::vector<std::string> QRTSQLiteDB::integrityProblems() {
+  std::vector<std::string> problems;
+  auto collect = [&](const char* pragma, const char* prefix) {
+    sqlite3_stmt* statement = nullptr;
+    if (sqlite3_prepare_v2(db_, pragma, -1, &statement, nullptr) != SQLITE_OK) {
+      problems.push_back(std::string(pragma) + " " + sqlite3_errmsg(db_));
+      return;
+    }
+    int step;
+    while ((step = sqlite3_step(statement)) == SQLITE_ROW) {
+      std::string row;
+      for (int column = 0; column < sqlite3_column_count(statement); ++column) {
+        const unsigned char* text = sqlite3_column_text(statement, column);
+        row += (row.empty() ? "" : " ") + std::string(text ? reinterpret_cast<const char*>(text) : "null");
+      }
+      if (row != "ok") problems.push_back(prefix + row);
+    }
+    if (step != SQLITE_DONE) problems.push_back(std::string(pragma) + " " + sqlite3_errmsg(db_));
+    sqlite3_finalize(statement);
+  };
+  collect("PRAGMA integrity_check;", "");
+  collect("PRAGMA foreign_key_check;", "foreign key: ");
+  return problems;
+}

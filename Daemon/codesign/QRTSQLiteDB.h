@@ -44,6 +44,9 @@ class QRTSQLiteDB {
   // Error 67 (not logged) when the parent has no children.
   std::optional<std::vector<std::string>> childIdentifiersForParentIdentifier(const std::string& identifier,
                                                                               QRTErrorRef* error);
+  // What "PRAGMA integrity_check" and "PRAGMA foreign_key_check" report, one
+  // line per problem; empty when the database is sound.
+  std::vector<std::string> integrityProblems();
 
  private:
   QRTSQLiteDB(sqlite3* db, QRTURL url);

@@ -135,6 +135,10 @@ class QRTFileManager {
   bool setTopLevelSystemContainerACLAtURL(const QRTURL& url, QRTErrorRef* error);
   // The same on a directory already held (url names it in errors).
   bool setTopLevelSystemContainerACL(const platform::Dir& directory, const QRTURL& url, QRTErrorRef* error);
+  // Whether the top directory carries the lists setTopLevelSystemContainerACL
+  // gives it (its own mode bits in the owner, group and other entries); false
+  // with error 63 when they cannot be read or built.
+  bool topLevelSystemContainerACLMatchesAtURL(const QRTURL& url, bool* matches, QRTErrorRef* error);
   // Stamps the tree; single entries that cannot be changed are only logged.
   bool standardizeACLsAtURL(const QRTURL& url, bool isSystemContainer, QRTErrorRef* error);
   bool standardizeACLsForSystemContainerAtURL(const QRTURL& url, QRTErrorRef* error);

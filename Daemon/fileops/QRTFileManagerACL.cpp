@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <algorithm>
 #include <cstring>
 #include <memory>
 #include <string>
@@ -139,6 +140,19 @@ int applyList(const platform::Item& item, const QRTFileManager::SystemContainerA
   return access->applyTo(item, false);
 }
 
+// The entries of a list's text that name a user or group ("g:1001:rwx").
+std::string namedEntries(const std::string& text) {
+  std::string named;
+  for (size_t at = 0; at < text.size();) {
+    size_t end = std::min(text.find(',', at), text.size());
+    const std::string entry = text.substr(at, end - at);
+    if (entry.size() > 2 && entry.find(':') != std::string::npos && entry[entry.find(':') + 1] != ':')
+      named += entry + ",";
+    at = end + 1;
+  }
+  return named;
+}
+
 bool isMetadataPath(const char* path) { return strstr(path, kMetadataFileName) != nullptr; }
 
 struct StampLists {
@@ -264,6 +278,29 @@ bool QRTFileManager::setTopLevelACL(const platform::Dir* directory, const QRTURL
   QRTSetError(error,
               QRT_ERROR(QRTErrorACLFailed, listError, false, "Failed to set ACL on %@: %s", url, errorText(err)));
   return false;
+}
+
+bool QRTFileManager::topLevelSystemContainerACLMatchesAtURL(const QRTURL& url, bool* matches, QRTErrorRef* error) {
+  QRTErrorRef listError;
+  SystemContainerACLPtr list = _CopyTopLevelSystemContainerACLWithError(&listError);
+  platform::Item item;
+  Acl found;
+  int err = list ? platform::safeOpenItem(url.path(), &item) : EINVAL;
+  if (!err && S_ISLNK(item.st.st_mode)) err = ELOOP;
+  if (!err) err = Acl::readFrom(item, false, &found);
+  if (err) {
+    QRTSetError(error,
+                QRT_ERROR(QRTErrorACLFailed, listError, false, "Failed to read ACL of %@: %s", url, errorText(err)));
+    return false;
+  }
+  // The owner, group and other entries follow the mode, and the mask with
+  // them; what the stamp adds are the named entries.
+  *matches = namedEntries(found.text()) == namedEntries(list->access.text());
+  if (*matches && list->inherited && S_ISDIR(item.st.st_mode)) {
+    Acl inherited;
+    *matches = Acl::readFrom(item, true, &inherited) == 0 && inherited.text() == list->inherited.text();
+  }
+  return true;
 }
 
 bool QRTFileManager::standardizeACLsAtURL(const QRTURL& url, bool isSystemContainer, QRTErrorRef* error) {

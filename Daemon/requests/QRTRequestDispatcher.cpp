@@ -1,5 +1,6 @@
 #include "Daemon/requests/QRTRequestDispatcher.h"
 
+#include <iterator>
 #include <mutex>
 #include <unordered_map>
 
@@ -9,6 +10,7 @@
 #include "Daemon/requests/QRTDataProtectionCommands.h"
 #include "Daemon/requests/QRTOperationsCommands.h"
 #include "Daemon/requests/QRTSpecialCommands.h"
+#include "Daemon/requests/QRTVerifyCommand.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTError.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
@@ -78,6 +80,7 @@ const QRTCommandRow QRTCommandTable[QRTCommandCount] = {
            QRTEntitlementUserManagedAssets, 1),
 };
 const QRTCommandRow QRTExtensionCommandTable[] = {
+    SERVED(QRTCommandVerify, "verify", QRTHandleVerify, QRTEntitlementAllowed, 0),
     SERVED(QRTCommandStatus, "status", QRTHandleStatus, QRTEntitlementAllowed, 1),
     SERVED(QRTCommandMetrics, "metrics", QRTHandleMetrics, QRTEntitlementAllowed, 1),
     SERVED(QRTCommandSetLogLevel, "setLogLevel", QRTHandleSetLogLevel, QRTEntitlementAllowed, 1),

@@ -5,6 +5,7 @@
 #include <cerrno>
 #include <cstdint>
 #include <cstring>
+#include <set>
 
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/fileops/QRTFileManager.h"
@@ -46,6 +47,28 @@ bool validInput(uint64_t contentClass, const std::optional<std::string>& identif
 QRTContainerCache& QRTContainerCache::sharedInstance() {
   static QRTContainerCache* instance = new QRTContainerCache();
   return *instance;
+}
+
+std::optional<std::vector<QRTMetadataRef>> QRTContainerCache::builtContainersForUser(uint32_t userId,
+                                                                                     uint64_t contentClass,
+                                                                                     bool transient) {
+  std::lock_guard<std::mutex> hold(cacheLock);
+  const auto& caches = transient ? transientContainerCache : liveContainerCache;
+  auto map = caches.find(cacheKey(userId, contentClass));
+  if (map == caches.end()) return std::nullopt;
+  std::vector<QRTMetadataRef> containers;
+  containers.reserve(map->second.size());
+  for (const auto& [identifier, metadata] : map->second) containers.push_back(metadata);
+  return containers;
+}
+
+std::vector<uint32_t> QRTContainerCache::usersWithBuiltClassMaps() {
+  std::set<uint32_t> users;
+  std::lock_guard<std::mutex> hold(cacheLock);
+  for (const auto* caches : {&liveContainerCache, &transientContainerCache})
+    for (const auto& [key, map] : *caches)
+      users.insert(static_cast<uint32_t>(std::stoul(key.substr(0, key.find('-')))));
+  return {users.begin(), users.end()};
 }
 
 std::optional<QRTContainerCache::ClassMap> QRTContainerCache::buildClassMap(uint32_t userId, uint64_t contentClass,

@@ -54,6 +54,12 @@ class QRTContainerCache {
                            QRTErrorRef* error, QRTMetadataRef* stored);
   bool removeContainerForUser(uint32_t userId, uint64_t contentClass, const std::optional<std::string>& identifier,
                               bool transient, QRTErrorRef* error);
+  // What a built class map holds, copied under the lock; nothing when the
+  // map has not been built.
+  std::optional<std::vector<QRTMetadataRef>> builtContainersForUser(uint32_t userId, uint64_t contentClass,
+                                                                    bool transient);
+  // The users with at least one built class map.
+  std::vector<uint32_t> usersWithBuiltClassMaps();
   // Tells the sandbox where a container lies (no URL withdraws it).
   bool setSandboxContainerMappingForUser(uint32_t userId, const std::string& identifier, uint64_t containerClass,
                                          const std::optional<QRTURL>& url);

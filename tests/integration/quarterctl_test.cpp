@@ -5,11 +5,14 @@
 #include <sys/wait.h>
 
 #include <filesystem>
+#include <functional>
 #include <map>
 #include <set>
 #include <sstream>
 #include <string>
 #include <vector>
+
+#include <nlohmann/json.hpp>
 
 #include "DaemonFixture.h"
 #include "base/PlistCodec.h"
@@ -261,6 +264,113 @@ TEST_F(QuarterctlTest, StatusMetricsAndTheLogLevelOfTheRunningDaemon) {
         "quarterd_requests_failed_total{command=\"other\"} 1\n", "quarterd_upcall_duration_seconds_count 0\n"})
     EXPECT_TRUE(contains(metrics, part)) << part << " in " << metrics;
   EXPECT_TRUE(metrics.ends_with("\n# EOF\n"));
+}
+
+// Every kind of finding planted on one device root: verify reports each,
+// --repair fixes what it may and leaves the rest, which a new run reports again.
+TEST_F(QuarterctlTest, VerifyReportsAndRepairsEveryPlantedFinding) {
+  namespace fs = std::filesystem;
+  const Container sys = createOrLookup(0, "com.norvane.mapsd", 12, true, false, QRTCommandSystemContainerPath),
+                  moved = make(501, "com.example.moved", 2), owned = make(501, "com.example.owned", 2),
+                  addon = make(501, "com.example.addon", 4), twin = make(501, "com.example.twin", 2);
+  auto verify = [&](const std::string& args) {
+    CtlRun r = run("--json verify " + args);
+    EXPECT_EQ(r.status, 0) << r.err;
+    return nlohmann::json::parse(r.out.empty() ? "{}" : r.out);
+  };
+  ASSERT_EQ(verify("")["findings"], nlohmann::json::array()) << "a sound store";
+  const std::string app = appClassDir() + "/", caches = daemonCaches() + "/",
+                    library = root + "/private/var/root/Library/QuarterKit/",
+                    maps = root + "/run/sandbox/mappings/0/4/";
+  const uint32_t owner = ownerAndMode(owned.path).first;
+  const std::string named = "getfacl -cp " + sys.path + " | grep -E '^(default:)?(user|group):[^:]'",
+                    acl = output(named);
+  auto gone = [](std::string path) { return [path] { return !fs::exists(fs::symlink_status(path)); }; };
+  auto kept = [](std::string path) { return [path] { return fs::exists(fs::symlink_status(path)); }; };
+  auto relink = [](std::string link, std::string to) {
+    return [=] {
+      fs::remove(link);
+      fs::create_symlink(to, link);
+    };
+  };
+  auto oldFile = [](std::string path) {
+    return [path] { writeFile(path, "x"), output("touch -d 2000-01-01 " + path); };
+  };
+  const plist::Data ents = plist::writeBinary(plist::Dictionary{{"com.norvane.security.application-groups", "g.one"}});
+  struct {
+    const char* kind;
+    std::string subject;
+    std::function<void()> plant;  // none: planted by the row above
+    std::function<bool()> after;  // the state --repair leaves
+    bool repaired;
+  } plants[] = {
+      {"metadata-unreadable", app + "junk",
+       [&] { fs::create_directories(app + "junk"), writeFile(app + "junk/" + kMetadataFile, "not a plist"); },
+       gone(app + "junk"), true},
+      {"metadata-wrong-class", app + "addon", [&] { fs::rename(addon.path, app + "addon"); }, gone(app + "addon"),
+       true},
+      {"cache-entry-stale",
+       addon.path,
+       {},
+       [&] { return createOrLookup(501, addon.identifier, 4, false).error == 21; },
+       true},
+      {"cache-entry-stale", moved.path, [&] { fs::rename(moved.path, app + "renamed"); },
+       [&] { return createOrLookup(501, moved.identifier, 2, false).path == app + "renamed"; }, true},
+      {"cache-entry-missing", app + "renamed", {}, kept(app + "renamed"), true},
+      {"owner-drift", owned.path, [&] { output("chown 4242 " + owned.path); },
+       [&] { return ownerAndMode(owned.path).first == owner; }, true},
+      {"identifier-duplicate", app + "twin", [&] { fs::copy(twin.path, app + "twin", fs::copy_options::recursive); },
+       kept(app + "twin"), false},
+      {"owner-drift", app + "twin", {}, [&] { return ownerAndMode(app + "twin").first == owner; }, true},
+      {"acl-drift", sys.path, [&] { output("setfacl -b " + sys.path); }, [&] { return output(named) == acl; }, true},
+      {"sandbox-mapping-wrong", std::string("com.norvane.mapsd"),
+       relink(maps + std::string("com.norvane.mapsd"), "/nowhere"),
+       [&] { return readLink(maps + std::string("com.norvane.mapsd")) == sys.path; }, true},
+      {"sandbox-mapping-orphan", "com.example.gone", relink(maps + "com.example.gone", "/nowhere"),
+       gone(maps + "com.example.gone"), true},
+      {"staging-leftover", caches + "Staging/left", [&] { fs::create_directories(caches + "Staging/left"); },
+       gone(caches + "Staging/left"), true},
+      {"transient-leftover", caches + "Temp/stray", [&] { fs::create_directories(caches + "Temp/stray"); },
+       gone(caches + "Temp/stray"), true},
+      {"deathrow-backlog", caches + "Dead", [&] { fs::create_directories(caches + "Dead/old"); },
+       gone(caches + "Dead/old"), true},
+      {"replace-journal-stale", library + "Replace/j", oldFile(library + "Replace/j"), kept(library + "Replace/j"),
+       false},
+      {"protection-update-stale", library + "PendingUpdates/u", oldFile(library + "PendingUpdates/u"),
+       kept(library + "PendingUpdates/u"), false},
+      {"codesign-orphan", "com.example.nobundle",
+       [&] {
+         writeFile(root + "/ents.plist", std::string(ents.begin(), ents.end()));
+         run("codesign set --identifier com.example.nobundle --entitlements " + root + "/ents.plist");
+       },
+       [] { return true; }, true},
+  };
+  for (const auto& p : plants)
+    if (p.plant) p.plant();
+  auto findingsOf = [](const nlohmann::json& reply) {
+    std::multimap<std::pair<std::string, std::string>, nlohmann::json> found;
+    for (const auto& f : reply["findings"]) found.emplace(std::pair{f["kind"], f["subject"]}, f);
+    return found;
+  };
+  const nlohmann::json first = verify("");
+  const auto reported = findingsOf(first);
+  const auto repaired = findingsOf(verify("--repair"));
+  EXPECT_EQ(run("deathrow").status, 0) << "what the repair moved to death row goes";
+  const auto left = findingsOf(verify(""));
+  for (const auto& p : plants) {
+    const std::pair<std::string, std::string> key{p.kind, p.subject};
+    ASSERT_EQ(reported.count(key), 1u) << p.kind << " " << p.subject;
+    const nlohmann::json& f = reported.find(key)->second;
+    EXPECT_EQ(f.size(), 6u) << f;
+    EXPECT_FALSE(f["detail"].get<std::string>().empty() || f["action"].get<std::string>().empty()) << f;
+    EXPECT_TRUE(f["severity"] == "error" || f["severity"] == "warning" || f["severity"] == "notice") << f;
+    ASSERT_EQ(repaired.count(key), 1u) << p.kind;
+    EXPECT_EQ(repaired.find(key)->second["repaired"], p.repaired) << p.kind << " " << p.subject;
+    EXPECT_TRUE(p.after()) << p.kind << " " << p.subject;
+    EXPECT_EQ(left.count(key), p.repaired ? 0u : 1u) << p.kind << " " << p.subject;
+  }
+  EXPECT_EQ(reported.size(), std::size(plants)) << first.dump(1);
+  EXPECT_TRUE(contains(run("verify").out, "containers checked, 3 findings\n"));
 }
 
 // Each command with its --options, as one source names them; "" holds the global options.

@@ -48,6 +48,7 @@ enum class Command : uint64_t {
   userManagedAssetsPath = 28,
   deleteUserManagedAsset = 29,
   // Administrative commands (the master entitlement).
+  verify = 100,
   status = 101,
   metrics = 102,
   setLogLevel = 103,
@@ -188,5 +189,8 @@ Result metrics(Connection& c);
 // Sets the daemon's log level (0 to 7; 7 logs every request); the reply's
 // "ReplyLogLevel" is the level before.
 Result setLogLevel(Connection& c, uint64_t level);
+// Checks the store and, with repair, fixes what is safe to fix; the reply
+// lists the findings.
+Result verify(Connection& c, bool repair);
 
 }  // namespace quarterkit
