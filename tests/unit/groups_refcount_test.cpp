@@ -178,10 +178,10 @@ TEST_F(GroupRefcountTest, SnapshotFollowsEveryWrite) {
          auto m = internal.createOrLookupContainerForUser({QRTInstallerUserId, 1, bundle},
                                                           QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code);
          ASSERT_TRUE(m);
-         plist::Dictionary cached{
-             {"Entitlements", plist::Dictionary{{QRTApplicationGroupsEntitlement, "group.snap.i"}}}};
-         internal.setInfoValue(plist::Value(cached), std::string(QRTCachedCodeSigningInfoKey), QRTInstallerUserId,
-                               m->uuid(), bundle, 1, true, &code);
+         const plist::Value cached =
+             plist::Dictionary{{"Entitlements", plist::Dictionary{{QRTApplicationGroupsEntitlement, "group.snap.i"}}}};
+         internal.setInfoValue(cached, std::string(QRTCachedCodeSigningInfoKey), QRTInstallerUserId, m->uuid(), bundle,
+                               1, true, &code);
          ASSERT_EQ(code, 1u);
          EXPECT_TRUE(mapping().getCodeSigningInfoForIdentifier(bundle));
        }},
