@@ -67,7 +67,6 @@ std::vector<uint8_t> encodeUpcallReply(const UpcallReply& reply) {
 struct UpcallListener::Impl {
   std::string path;
   std::atomic<bool> stopping{false};
-  Queue* queue = nullptr;
   UpcallHandler handler;
   UniqueFd listenFd;
   std::atomic<int> connections{0};
@@ -143,24 +142,16 @@ void UpcallListener::Impl::serve(int fd) {
     message.credentialsValid = credentialsValid;
     message.pid = pid;
     UpcallReply reply;
-    bool answer = false;
-    if (queue) {
-      queue->sync([&] { answer = handler(message, &reply); });
-    } else {
-      answer = handler(message, &reply);
-    }
-    if (!answer) return;
+    if (!handler(message, &reply)) return;
     start += consumed;
     std::vector<uint8_t> frame = encodeUpcallReply(reply);
     if (!frame::sendAll(fd, frame.data(), frame.size())) return;
   }
 }
 
-std::unique_ptr<UpcallListener> UpcallListener::create(const std::string& path, Queue* serveQueue,
-                                                       UpcallHandler handler) {
+std::unique_ptr<UpcallListener> UpcallListener::create(const std::string& path, UpcallHandler handler) {
   auto impl = std::make_shared<Impl>();
   impl->path = path;
-  impl->queue = serveQueue;
   impl->handler = std::move(handler);
   // Made 0600 and listening before it has its name: no one but root ever finds it open.
   if (int err = safeListenUnixSocket(path, 0600, 0, &impl->listenFd)) {

@@ -2,7 +2,7 @@
 // socket, mode 0600, on which the sandbox launcher asks for a starting
 // process's containers. Frames are cut here; what a frame means is the
 // server's business. Each connection has a thread of its own, which reads
-// its frames one at a time and serves each itself, or on the queue given.
+// its frames one at a time and serves each itself.
 #pragma once
 
 #include <sys/types.h>
@@ -14,8 +14,6 @@
 #include <span>
 #include <string>
 #include <vector>
-
-#include "platform/Queue.h"
 
 namespace platform {
 
@@ -61,10 +59,10 @@ using UpcallHandler = std::function<bool(const UpcallMessage& request, UpcallRep
 class UpcallListener {
  public:
   // Binds path (mode 0600; a stale socket is replaced). Nothing, with errno
-  // set, when it cannot. Without a queue the handler runs on the
-  // connection's thread, at once and beside the other connections' (it must
-  // be safe to call from several threads); with one, it runs there.
-  static std::unique_ptr<UpcallListener> create(const std::string& path, Queue* serveQueue, UpcallHandler handler);
+  // set, when it cannot. The handler runs on the connection's thread, at
+  // once and beside the other connections' (it must be safe to call from
+  // several threads).
+  static std::unique_ptr<UpcallListener> create(const std::string& path, UpcallHandler handler);
   ~UpcallListener();
   // Starts accepting.
   void resume();

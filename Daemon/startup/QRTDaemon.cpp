@@ -252,7 +252,7 @@ bool QRTKernServerStart() {
   // queue: every process start waits on the answer. The listener starts
   // accepting only once start-up is over.
   const std::string path = platform::hostPath("/run/com.norvane.quarterd.upcall");
-  platform::UpcallListener* listener = platform::UpcallListener::create(path, nullptr, demux_server).release();
+  platform::UpcallListener* listener = platform::UpcallListener::create(path, demux_server).release();
   {
     std::lock_guard<std::mutex> hold(gListenerLock);
     gUpcallListener = listener;
