@@ -150,6 +150,11 @@ int Dir::lstat(std::string_view relative, struct stat* st) const {
   return fstatat(holder.get(), leaf.c_str(), st, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
 }
 
+int Dir::exists(std::string_view relative) const {
+  UniqueFd item;
+  return openBeneath(relative, O_PATH, &item);
+}
+
 int Dir::make(std::string_view hostPath, mode_t mode, bool withParents, uid_t owner, Dir* out, bool* created) {
   if (created) *created = false;
   uid_t hostUid;

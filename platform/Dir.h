@@ -53,6 +53,9 @@ class Dir {
   // lstat of the item relative: every level above it opened beneath this
   // directory without following a link, the item itself not followed.
   int lstat(std::string_view relative, struct stat* st) const;
+  // 0 when an entry of any kind (a link included, not followed) is at
+  // relative, reached without following a link: one open of a path handle.
+  int exists(std::string_view relative) const;
 
   // safeMakeDirectory relative to this directory (SafePath.h): with
   // withParents every missing level of relative, each opened without

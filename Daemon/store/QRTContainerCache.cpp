@@ -211,25 +211,25 @@ QRTContainerCache::HeldClassDirectoryRef QRTContainerCache::classDirectory(uint3
 
 bool QRTContainerCache::metadataMissing(const QRTMetadataRef& metadata, uint32_t userId, uint64_t contentClass,
                                         bool transient) {
-  const QRTURL& url = metadata->url();
-  QRTURL file = url.URLByAppendingPathComponent(QRTMetadataFileName);
-  const std::string parent = url.URLByDeletingLastPathComponent().path();
-  const std::string name = url.lastPathComponent() + "/" + QRTMetadataFileName;
+  const std::string& path = metadata->url().path();
+  const size_t slash = path.rfind('/');
+  const std::string_view parent = std::string_view(path).substr(0, slash == 0 ? 1 : slash);
+  const std::string name = path.substr(slash + 1) + "/" + QRTMetadataFileName;
   // A miss or a path that differs may come from a stale held directory: it
   // is opened afresh once, and a miss is confirmed from the device root.
   for (bool reopen : {false, true}) {
     HeldClassDirectoryRef held = classDirectory(userId, contentClass, transient, reopen);
     if (!held) break;
     if (held->path != parent) continue;
-    struct stat st;
-    const int err = held->directory.lstat(name, &st);
+    const int err = held->directory.exists(name);
     if (err == 0) return false;
     if (err != ENOENT) {
-      QRTLog(kLogError, "Failed to determine if %@ exists: %s", file, strerror(err));
+      QRTLog(kLogError, "Failed to determine if %@/%s exists: %s", path, QRTMetadataFileName, strerror(err));
       return false;
     }
   }
-  return QRTFileManager::defaultManager().itemDoesNotExistAtURL(file);
+  return QRTFileManager::defaultManager().itemDoesNotExistAtURL(
+      metadata->url().URLByAppendingPathComponent(QRTMetadataFileName));
 }
 
 QRTMetadataRef QRTContainerCache::containerForUser(const QRTContainerKey& key, QRTErrorRef* error) {
