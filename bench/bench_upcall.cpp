@@ -16,12 +16,18 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <memory>
 #include <optional>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include "QuarterKit/Upcall.h"
+#include "QuarterKit/QuarterKit.h"
+#include "QuarterKit/Requests.h"
+#include "base/PlistCodec.h"
+#include "base/PlistValue.h"
+#include "base/QRTProtocol.h"
 #include "bench/BenchLoad.h"
 #include "packbuff/packbuff.h"
 #include "platform/UpcallSocket.h"
@@ -173,6 +179,14 @@ class Daemon {
                                            "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
     std::ofstream(root_ / "etc/group") << "wheel:x:0:root\n_installer:x:33:\nsystemusers:x:498:_installer,_system\n"
                                           "_system:x:499:\nmobile:x:501:\n";
+    // This program registers the one it launches, as an installer would.
+    const plist::Dictionary identity{{"Executable", std::filesystem::read_symlink("/proc/self/exe").string()},
+                                     {"SigningIdentifier", std::string("com.norvane.bench-upcall")},
+                                     {"Entitlements", plist::Dictionary{{QRTEntitlementAllowed, true}}}};
+    std::filesystem::create_directories(root_ / "etc/quarterd/identities");
+    const plist::Data bytes = plist::writeBinary(identity);
+    std::ofstream(root_ / "etc/quarterd/identities/bench-upcall.plist")
+        .write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
     pid_ = fork();
     if (pid_ == 0) {
       std::string rootArg = root_.string();
@@ -187,8 +201,22 @@ class Daemon {
     std::error_code ignored;
     std::filesystem::remove_all(root_, ignored);
   }
-  // Waits up to 20 s for the upcall socket to answer.
+  // Waits up to 20 s for the daemon to answer, then registers the program
+  // as an installer would, so each upcall takes the path of a real launch.
   bool waitUntilServing() {
+    std::unique_ptr<qk::Connection> installer;
+    for (int i = 0; i < 200 && !(installer = qk::Connection::connect(qk::requestSocketPath(root_.string()))); ++i)
+      usleep(100'000);
+    const plist::Dictionary info{{"com.norvane.QuarterKit.Entitlements", plist::Dictionary{}}};
+    const plist::Dictionary options{{"com.norvane.QuarterKit.DataContainerClass", 2}};
+    if (!installer) return false;
+    const qk::Result registered = qk::processCodeSigningInfo(*installer, programWithGroups().codeSignatureId,
+                                                             plist::Value(info), plist::Value(options));
+    if (!registered || !registered->ok()) {
+      fprintf(stderr, "bench_upcall: the program's registration failed: error %s\n",
+              registered ? std::to_string(registered->error()).c_str() : "no reply");
+      return false;
+    }
     for (int i = 0; i < 200; ++i) {
       if (auto k = qk::UpcallClient::connect(socketPath())) {
         if (auto a = k->call(programWithGroups()); a && a->status == 1u) return true;
