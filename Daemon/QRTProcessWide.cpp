@@ -12,9 +12,9 @@ platform::Queue& QRTDeathRowQueue() {
   return *queue;
 }
 
-platform::Queue& QRTLockStateQueue() {
-  static std::shared_ptr<platform::Queue> queue = platform::makeSerialQueue("com.norvane.quarterd.lockstate");
-  return *queue;
+const std::shared_ptr<platform::Queue>& QRTLockStateQueue() {
+  static const std::shared_ptr<platform::Queue> queue = platform::makeSerialQueue("com.norvane.quarterd.lockstate");
+  return queue;
 }
 
 void run_async_with_transaction(platform::Queue& queue, platform::Work work) {

@@ -3,14 +3,16 @@
 #pragma once
 
 #include <cstdint>
+#include <memory>
 
 #include "platform/Queue.h"
 
 // Serial, idle priority for the processor and the disk: destruction of
 // death-row items, which yields to every request. Made on first use.
 platform::Queue& QRTDeathRowQueue();
-// Serial, suspended while the device is locked: protection changes.
-platform::Queue& QRTLockStateQueue();
+// Serial, suspended while the device is locked: protection changes. Start-up
+// drives it and hands it to the data-protection manager's calls.
+const std::shared_ptr<platform::Queue>& QRTLockStateQueue();
 // The log file count (1, or 4 on an internal build).
 extern uint32_t gQRTLogFileCount;
 

@@ -21,6 +21,7 @@
 #include "Daemon/QRTError.h"
 #include "Daemon/codesign/QRTCodeSigningEntry.h"
 #include "Daemon/codesign/QRTCodeSigningMappingSnapshot.h"
+#include "Daemon/groups/QRTGroupNames.h"
 #include "platform/Queue.h"
 
 class QRTSQLiteDB;
@@ -36,12 +37,11 @@ inline constexpr const char* QRTSystemGroupsEntitlement = "com.norvane.security.
 inline constexpr const char* QRTSystemGroupContainersEntitlement = "com.norvane.security.system-group-containers";
 inline constexpr const char* QRTSystemContainerEntitlement = "com.norvane.security.system-container";
 
-using QRTGroupList = std::optional<std::vector<std::string>>;
 // Group identifier to the number of stored programs naming it.
 using QRTGroupReferenceCounts = std::map<std::string, int64_t>;
 enum QRTGroupType : int64_t;
 
-class QRTCodeSigningMapping {
+class QRTCodeSigningMapping : public QRTGroupNames {
  public:
   // Made on first use; null when the database can't be opened (logged
   // "Failed to initialize database.").
@@ -65,8 +65,8 @@ class QRTCodeSigningMapping {
   bool identifierHasCallerRegisteredEntitlements(const std::string& identifier);
   bool identifierHasSystemContainer(const std::string& identifier);
   uint64_t dataContainerTypeForIdentifier(const std::string& identifier);
-  QRTGroupList appGroupIdentifiersForIdentifier(const std::string& identifier);
-  QRTGroupList systemGroupIdentifiersForIdentifier(const std::string& identifier);
+  QRTGroupList appGroupIdentifiersForIdentifier(const std::string& identifier) override;
+  QRTGroupList systemGroupIdentifiersForIdentifier(const std::string& identifier) override;
 
   // Must be called on the queue.
   void iterateGroupIdsWithKey(

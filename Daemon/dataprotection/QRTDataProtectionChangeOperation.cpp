@@ -311,7 +311,7 @@ std::optional<plist::Dictionary> QRTDataProtectionChangeOperation::_readAndValid
 }
 
 QRTDataProtectionChangeOperation::Ref QRTDataProtectionChangeOperation::dataProtectionChangeOperationAtURL(
-    const QRTURL& url, QueueRef queue, QRTErrorRef* error) {
+    const QRTURL& url, QueueRef queue, QueueRef lockStateQueue, QRTErrorRef* error) {
   QRTErrorRef readError;
   auto d = _readAndValidateDataProtectionUpdateAtURL(url, &readError);
   if (!d) {
@@ -338,7 +338,7 @@ QRTDataProtectionChangeOperation::Ref QRTDataProtectionChangeOperation::dataProt
   return std::make_shared<QRTDataProtectionChangeOperation>(
       std::move(metadata), static_cast<int32_t>(integerAt(*d, kProtectionClassKey)->asSigned()), retryIfLocked,
       static_cast<uint32_t>(integerAt(*d, kChangeTypeKey)->asUnsigned()),
-      QRTUUID::fromString(plist::find(*d, kInternalIDKey)->string()), std::move(queue));
+      QRTUUID::fromString(plist::find(*d, kInternalIDKey)->string()), std::move(queue), std::move(lockStateQueue));
 }
 
 bool QRTDataProtectionChangeOperation::deleteUpdateFileWithIdentifier(const std::string& identifier,
@@ -354,21 +354,24 @@ bool QRTDataProtectionChangeOperation::deleteUpdateFileWithIdentifier(const std:
 
 QRTDataProtectionChangeOperation::Ref
 QRTDataProtectionChangeOperation::dataProtectionChangeOperationWithContainerMetadata(
-    QRTMetadataRef metadata, int32_t settingClass, bool retryingIfLocked, uint32_t changeType, QueueRef queue) {
+    QRTMetadataRef metadata, int32_t settingClass, bool retryingIfLocked, uint32_t changeType, QueueRef queue,
+    QueueRef lockStateQueue) {
   return std::make_shared<QRTDataProtectionChangeOperation>(std::move(metadata), settingClass, retryingIfLocked,
-                                                            changeType, std::nullopt, std::move(queue));
+                                                            changeType, std::nullopt, std::move(queue),
+                                                            std::move(lockStateQueue));
 }
 
 QRTDataProtectionChangeOperation::QRTDataProtectionChangeOperation(QRTMetadataRef metadata, int32_t newClass,
                                                                    bool retryingIfLocked, uint32_t changeType,
                                                                    std::optional<QRTUUID> internalChangeID,
-                                                                   QueueRef queue)
+                                                                   QueueRef queue, QueueRef lockStateQueue)
     : retryIfLocked_(retryingIfLocked),
       dataContainerMetadata_(std::move(metadata)),
       newDataProtectionClass_(newClass),
       changeType_(changeType),
       internalChangeID_(internalChangeID.value_or(QRTUUID::random())),
-      queue_(std::move(queue)) {}
+      queue_(std::move(queue)),
+      lockStateQueue_(std::move(lockStateQueue)) {}
 
 bool QRTDataProtectionChangeOperation::writeToDiskWithError(QRTErrorRef* error) {
   bool ok = false;
@@ -519,7 +522,7 @@ void QRTDataProtectionChangeOperation::performChangeOperation() {
            "containerClass: %llu",
            newDataProtectionClass_, m->userId(), m->identifier(), containerClass);
     // The queue runs only while the device is unlocked.
-    run_async_with_transaction(QRTLockStateQueue(), [self = shared_from_this()] {
+    run_async_with_transaction(*lockStateQueue_, [self = shared_from_this()] {
       if (!self->retried_ && self->retryStartBlock_) self->retryStartBlock_();
       self->retried_ = true;
       self->performChangeOperation();

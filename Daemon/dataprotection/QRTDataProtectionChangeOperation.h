@@ -2,7 +2,8 @@
 // change is recorded in a pending-update file before any item is touched and
 // the file goes only when the change is over, so that start-up can carry out
 // a change that a crash interrupted; a change that finds the device locked
-// waits on the lock-state queue and runs again after the unlock.
+// waits on the lock-state queue it was given (which runs only while the
+// device is unlocked) and runs again after the unlock.
 #pragma once
 
 #include <cstdint>
@@ -37,17 +38,20 @@ class QRTDataProtectionChangeOperation : public std::enable_shared_from_this<QRT
   static std::optional<plist::Dictionary> _readAndValidateDataProtectionUpdateAtURL(const std::optional<QRTURL>& url,
                                                                                     QRTErrorRef* error);
   // The operation of a pending-update file, with the file's change id.
-  static Ref dataProtectionChangeOperationAtURL(const QRTURL& url, QueueRef queue, QRTErrorRef* error);
+  static Ref dataProtectionChangeOperationAtURL(const QRTURL& url, QueueRef queue, QueueRef lockStateQueue,
+                                                QRTErrorRef* error);
   // A missing file counts as deleted.
   static bool deleteUpdateFileWithIdentifier(const std::string& identifier, uint64_t containerClass, uint32_t userId,
                                              QRTErrorRef* error);
   static Ref dataProtectionChangeOperationWithContainerMetadata(QRTMetadataRef metadata, int32_t settingClass,
                                                                 bool retryingIfLocked, uint32_t changeType,
-                                                                QueueRef queue);
+                                                                QueueRef queue, QueueRef lockStateQueue);
 
-  // No change id makes a fresh one.
+  // No change id makes a fresh one. queue is the pending-update files' queue;
+  // a change that waits for the unlock runs again on lockStateQueue.
   QRTDataProtectionChangeOperation(QRTMetadataRef metadata, int32_t newClass, bool retryingIfLocked,
-                                   uint32_t changeType, std::optional<QRTUUID> internalChangeID, QueueRef queue);
+                                   uint32_t changeType, std::optional<QRTUUID> internalChangeID, QueueRef queue,
+                                   QueueRef lockStateQueue);
 
   // Each runs its _onQueue_ counterpart synchronously on the file queue.
   bool writeToDiskWithError(QRTErrorRef* error);
@@ -100,4 +104,5 @@ class QRTDataProtectionChangeOperation : public std::enable_shared_from_this<QRT
   CompletionBlock completionBlock_;
   QRTUUID internalChangeID_;
   QueueRef queue_;
+  QueueRef lockStateQueue_;
 };

@@ -49,12 +49,13 @@ QRTDataProtectionManager::QRTDataProtectionManager()
 
 void QRTDataProtectionManager::setDataProtectionOnDataContainerForUser(
     uint32_t userId, const std::optional<std::string>& identifier, uint64_t containerClass, int32_t dataProtectionClass,
-    bool isSecondOrThirdPartyApp, bool retryIfLocked, Completion withCompletion) {
+    bool isSecondOrThirdPartyApp, bool retryIfLocked, const std::shared_ptr<platform::Queue>& lockStateQueue,
+    Completion withCompletion) {
   Completion completion = once(std::move(withCompletion));
   uint64_t code;
   try {
     code = _setDataProtection(userId, identifier, containerClass, dataProtectionClass, isSecondOrThirdPartyApp,
-                              retryIfLocked, completion);
+                              retryIfLocked, lockStateQueue, completion);
   } catch (...) { code = QRT_EXCEPTION_ERROR()->resultCode(); }
   if (code != 0 && completion) completion(code);
 }
@@ -62,6 +63,7 @@ void QRTDataProtectionManager::setDataProtectionOnDataContainerForUser(
 uint64_t QRTDataProtectionManager::_setDataProtection(uint32_t userId, const std::optional<std::string>& identifier,
                                                       uint64_t containerClass, int32_t dataProtectionClass,
                                                       bool isSecondOrThirdPartyApp, bool retryIfLocked,
+                                                      const std::shared_ptr<platform::Queue>& lockStateQueue,
                                                       const Completion& completion) {
   if (!identifier || !QRTIsPerUserClass(containerClass)) {
     return QRT_ERROR(QRTErrorInvalidParameter, nullptr, true,
@@ -108,7 +110,7 @@ uint64_t QRTDataProtectionManager::_setDataProtection(uint32_t userId, const std
                                               QRTDataProtectionChangeOperation::QRTChangeFilesOnlyToLowerClass)
                                            : QRTDataProtectionChangeOperation::QRTChangeDirectories;
   auto operation = QRTDataProtectionChangeOperation::dataProtectionChangeOperationWithContainerMetadata(
-      metadata, dataProtectionClass, retryIfLocked, changeType, protectionOperationFileQueue_);
+      metadata, dataProtectionClass, retryIfLocked, changeType, protectionOperationFileQueue_, lockStateQueue);
   QRTErrorRef writeError;
   if (!operation->writeToDiskWithError(&writeError)) {
     QRTLog(kLogError, "Failed to write data protection update file to disk: %@", writeError);
@@ -158,7 +160,8 @@ void QRTDataProtectionManager::_startDataProtectionChangeOperation(
   operation->performChangeOperation();
 }
 
-bool QRTDataProtectionManager::restartPendingDataProtectionOperationsWithError(QRTErrorRef* error) {
+bool QRTDataProtectionManager::restartPendingDataProtectionOperationsWithError(
+    const std::shared_ptr<platform::Queue>& lockStateQueue, QRTErrorRef* error) {
   const QRTURL directory = QRTGlobalConfiguration::sharedInstance().pendingUpdatesDirectory();
   QRTErrorRef listError;
   auto files = QRTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(directory, &listError);
@@ -170,17 +173,18 @@ bool QRTDataProtectionManager::restartPendingDataProtectionOperationsWithError(Q
   }
   for (const QRTURL& file : *files) {
     // One bad file must not keep the others from being carried out.
-    if (QRTErrorRef failure = QRT_GUARD([&] { _restartPendingOperationAtURL(file); }))
+    if (QRTErrorRef failure = QRT_GUARD([&] { _restartPendingOperationAtURL(file, lockStateQueue); }))
       QRTLog(kLogError, "Failed to read data protection change operation at %@ : %@", file, failure);
   }
   return true;
 }
 
-void QRTDataProtectionManager::_restartPendingOperationAtURL(const QRTURL& file) {
+void QRTDataProtectionManager::_restartPendingOperationAtURL(const QRTURL& file,
+                                                             const std::shared_ptr<platform::Queue>& lockStateQueue) {
   QRTLog(kLogNotice, "Found pending data protection operation at %@", file);
   QRTErrorRef readError;
   auto operation = QRTDataProtectionChangeOperation::dataProtectionChangeOperationAtURL(
-      file, protectionOperationFileQueue_, &readError);
+      file, protectionOperationFileQueue_, lockStateQueue, &readError);
   if (!operation) {
     QRTLog(kLogError, "Failed to read data protection change operation at %@ : %@", file, readError);
     return;

@@ -24,11 +24,15 @@ class QRTDataProtectionManager {
   static QRTDataProtectionManager& defaultManager();
 
   // The completion is called exactly once, possibly after the next unlock.
+  // A change that finds the device locked runs again on lockStateQueue,
+  // which its owner runs only while the device is unlocked.
   void setDataProtectionOnDataContainerForUser(uint32_t userId, const std::optional<std::string>& identifier,
                                                uint64_t containerClass, int32_t dataProtectionClass,
                                                bool isSecondOrThirdPartyApp, bool retryIfLocked,
+                                               const std::shared_ptr<platform::Queue>& lockStateQueue,
                                                Completion withCompletion);
-  bool restartPendingDataProtectionOperationsWithError(QRTErrorRef* error);
+  bool restartPendingDataProtectionOperationsWithError(const std::shared_ptr<platform::Queue>& lockStateQueue,
+                                                       QRTErrorRef* error);
   void _startDataProtectionChangeOperation(const QRTDataProtectionChangeOperation::Ref& operation,
                                            Completion withCompletion);
 
@@ -41,8 +45,8 @@ class QRTDataProtectionManager {
   // failure before the change started, or 0 once the change owns the completion.
   uint64_t _setDataProtection(uint32_t userId, const std::optional<std::string>& identifier, uint64_t containerClass,
                               int32_t dataProtectionClass, bool isSecondOrThirdPartyApp, bool retryIfLocked,
-                              const Completion& completion);
-  void _restartPendingOperationAtURL(const QRTURL& file);
+                              const std::shared_ptr<platform::Queue>& lockStateQueue, const Completion& completion);
+  void _restartPendingOperationAtURL(const QRTURL& file, const std::shared_ptr<platform::Queue>& lockStateQueue);
 
   std::shared_ptr<platform::Queue> protectionOperationFileQueue_;
 };

@@ -195,6 +195,7 @@ constexpr QRTWriteOptions operator|(QRTWriteOptions a, QRTWriteOptions b) {
   return static_cast<QRTWriteOptions>(static_cast<uint32_t>(a) | static_cast<uint32_t>(b));
 }
 
+// ---- Property-list files (QRTFileManagerPlist.cpp) ----
 // Writes the dictionary as a binary property list. Atomic: a hidden
 // temporary (mode 0644, exclusive, no link followed) in the safely opened
 // directory, written, fsync'd, renameat over the name, the directory fsync'd;

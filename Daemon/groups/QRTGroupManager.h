@@ -11,6 +11,7 @@
 #include <vector>
 
 class QRTClientConnection;
+class QRTGroupNames;
 
 enum QRTGroupType : int64_t { QRTGroupTypeApplication = 0, QRTGroupTypeSystem = 1 };
 
@@ -33,13 +34,14 @@ class QRTGroupManager {
   void reconcileGroupContainersOfType(QRTGroupType type, const std::optional<ReferenceCounts>& counts);
 
   // Group identifier to container path, the containers made on demand
-  // (QRTEntitledGroupContainers.cpp, with the mapping).
+  // (QRTEntitledGroupContainers.cpp). The program's groups come from names
+  // (the code-signing mapping); none when it is null.
   std::optional<std::map<std::string, std::string>> groupContainerPathsForUser(
       uint32_t userId, QRTClientConnection& clientConnection, const std::optional<std::string>& identifier,
-      uint64_t* withError);
+      QRTGroupNames* names, uint64_t* withError);
   std::optional<std::vector<std::string>> groupContainerIdentifiersForUser(uint32_t userId,
                                                                            const std::optional<std::string>& identifier,
-                                                                           uint64_t* withError);
+                                                                           QRTGroupNames* names, uint64_t* withError);
 
  private:
   QRTGroupManager() = default;

@@ -10,7 +10,6 @@
 #include "Daemon/store/QRTContainerCache.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/QRTCrashPoint.h"
-#include "Daemon/dataprotection/QRTDataProtectionManager.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTGlobalConfiguration.h"
 #include "Daemon/store/QRTLocks.h"

@@ -29,9 +29,9 @@ plist::Dictionary pathDictionary(const std::map<std::string, std::string>& paths
 }
 
 void replyGroupPaths(uint32_t userId, const plist::Dictionary& request, const QRTReplyRef& reply,
-                     QRTClientConnection& client, uint64_t* result) {
+                     QRTClientConnection& client, QRTCodeSigningMapping* mapping, uint64_t* result) {
   auto paths = QRTGroupManager::defaultManager().groupContainerPathsForUser(
-      userId, client, QRTMessageIdentifier(request, client.clientBundleIdentifier()), result);
+      userId, client, QRTMessageIdentifier(request, client.clientBundleIdentifier()), mapping, result);
   if (paths) reply->dictionary[QRTReplyKeyGroupContainerDict] = pathDictionary(*paths);
 }
 
@@ -52,8 +52,9 @@ void QRTHandleGroupContainerPaths(const plist::Dictionary& request, const QRTRep
   uint32_t userId = 0;
   auto requested = static_cast<uint32_t>(QRTMessageU64(request, QRTKeyUserID));
   if (!validateUserId(requested, QRTClassAppGroup, client, &userId, result)) return;
-  if (!mappingOr66(result)) return;
-  replyGroupPaths(userId, request, reply, client, result);
+  QRTCodeSigningMapping* mapping = mappingOr66(result);
+  if (!mapping) return;
+  replyGroupPaths(userId, request, reply, client, mapping, result);
 }
 
 void QRTHandleGroupContainerIdentifiers(const plist::Dictionary& request, const QRTReplyRef& reply,
@@ -61,17 +62,19 @@ void QRTHandleGroupContainerIdentifiers(const plist::Dictionary& request, const 
   uint32_t userId = 0;
   auto requested = static_cast<uint32_t>(QRTMessageU64(request, QRTKeyUserID));
   if (!validateUserId(requested, QRTClassAppGroup, client, &userId, result)) return;
-  if (!mappingOr66(result)) return;
+  QRTCodeSigningMapping* mapping = mappingOr66(result);
+  if (!mapping) return;
   auto identifiers = QRTGroupManager::defaultManager().groupContainerIdentifiersForUser(
-      userId, QRTMessageIdentifier(request, client.clientBundleIdentifier()), result);
+      userId, QRTMessageIdentifier(request, client.clientBundleIdentifier()), mapping, result);
   if (identifiers)
     reply->dictionary[QRTReplyKeyGroupIdentifiersArray] = plist::Array(identifiers->begin(), identifiers->end());
 }
 
 void QRTHandleSystemGroupContainerPaths(const plist::Dictionary& request, const QRTReplyRef& reply,
                                         QRTClientConnection& client, uint64_t* result) {
-  if (!mappingOr66(result)) return;
-  replyGroupPaths(QRTSystemContainerUserId, request, reply, client, result);
+  QRTCodeSigningMapping* mapping = mappingOr66(result);
+  if (!mapping) return;
+  replyGroupPaths(QRTSystemContainerUserId, request, reply, client, mapping, result);
 }
 
 void QRTHandleSystemGroupContainerPath(const plist::Dictionary& request, const QRTReplyRef& reply,
@@ -88,7 +91,7 @@ void QRTHandleSystemGroupContainerPath(const plist::Dictionary& request, const Q
   std::optional<std::string> path;
   if (group && entitled && std::find(entitled->begin(), entitled->end(), *group) != entitled->end()) {
     auto paths = QRTGroupManager::defaultManager().groupContainerPathsForUser(QRTSystemContainerUserId, client,
-                                                                              identifier, result);
+                                                                              identifier, mapping, result);
     if (paths) {
       if (auto it = paths->find(*group); it != paths->end()) path = it->second;
     }

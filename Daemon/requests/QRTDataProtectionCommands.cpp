@@ -3,6 +3,7 @@
 #include <cstdint>
 #include <limits>
 
+#include "Daemon/QRTProcessWide.h"
 #include "Daemon/dataprotection/QRTDataProtectionManager.h"
 #include "platform/Log.h"
 
@@ -22,6 +23,6 @@ void QRTHandleSetDataProtection(const plist::Dictionary& request, const QRTReply
   // From here on the completion sends the one reply and the result stays 1.
   QRTDataProtectionManager::defaultManager().setDataProtectionOnDataContainerForUser(
       userId, QRTMessageString(request, QRTKeyIdentifier), containerClass, static_cast<int32_t>(protectionClass),
-      QRTMessageBool(request, QRTKeyIsThirdParty), QRTMessageBool(request, QRTKeyRetryIfLocked),
+      QRTMessageBool(request, QRTKeyIsThirdParty), QRTMessageBool(request, QRTKeyRetryIfLocked), QRTLockStateQueue(),
       [reply](uint64_t code) { reply->send(code); });
 }

@@ -11,6 +11,7 @@
 #include <cstring>
 
 #include "Daemon/QRTCrashPoint.h"
+#include "Daemon/QRTProcessWide.h"
 #include "Daemon/dataprotection/QRTDataProtectionManager.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/migration/QRTContainerMigrator.h"
@@ -43,7 +44,8 @@ void QRTClientConnection::quarterSetup() {
     gReplaceRecoveryIncomplete = true;
   }
   QRTErrorRef protectionError;
-  if (!QRTDataProtectionManager::defaultManager().restartPendingDataProtectionOperationsWithError(&protectionError)) {
+  if (!QRTDataProtectionManager::defaultManager().restartPendingDataProtectionOperationsWithError(QRTLockStateQueue(),
+                                                                                                  &protectionError)) {
     QRTLog(platform::kLogError, "Failed restarting pending data protection operations: %@", protectionError);
   }
 }

@@ -233,10 +233,10 @@ void lock_state_notification_callback() {
   int state = platform::deviceLockState();
   QRTLog(kLogDebug, "LockState=%d", state);
   if (state == 1) {
-    if (gLastAppliedLockState != 1) QRTLockStateQueue().suspend();
+    if (gLastAppliedLockState != 1) QRTLockStateQueue()->suspend();
     gLastAppliedLockState = 1;
   } else if (state == 0) {
-    if (gLastAppliedLockState == 1) QRTLockStateQueue().resume();
+    if (gLastAppliedLockState == 1) QRTLockStateQueue()->resume();
     gLastAppliedLockState = 0;
   }
 }

@@ -48,7 +48,7 @@ class GroupRefcountTest : public ::testing::Test {
   static std::map<std::string, std::string> paths(const std::string& program) {
     QRTClientConnection client(program, 0, false, std::nullopt);
     uint64_t code = 1;
-    auto found = QRTGroupManager::defaultManager().groupContainerPathsForUser(501, client, program, &code);
+    auto found = QRTGroupManager::defaultManager().groupContainerPathsForUser(501, client, program, &mapping(), &code);
     EXPECT_EQ(code, 1u);
     return found ? *found : std::map<std::string, std::string>{};
   }

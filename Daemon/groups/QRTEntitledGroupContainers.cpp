@@ -1,5 +1,6 @@
 // The group containers that a program's entitlements name, made on demand:
-// the group manager's lookups that read the code-signing mapping.
+// the group manager's look-ups, which learn the names from the mapping
+// through QRTGroupNames.
 
 #include <map>
 #include <optional>
@@ -7,8 +8,8 @@
 #include <vector>
 
 #include "Daemon/QRTError.h"
-#include "Daemon/codesign/QRTCodeSigningMapping.h"
 #include "Daemon/groups/QRTGroupManager.h"
+#include "Daemon/groups/QRTGroupNames.h"
 #include "Daemon/store/QRTClientConnection.h"
 #include "Daemon/store/QRTContentClass.h"
 #include "Daemon/store/QRTLocks.h"
@@ -35,7 +36,7 @@ bool identifierGiven(const char* function, uint32_t userId, const std::optional<
 
 std::optional<std::map<std::string, std::string>> QRTGroupManager::groupContainerPathsForUser(
     uint32_t userId, QRTClientConnection& clientConnection, const std::optional<std::string>& identifier,
-    uint64_t* withError) {
+    QRTGroupNames* names, uint64_t* withError) {
   if (!identifierGiven(__func__, userId, identifier, withError)) return std::nullopt;
   std::optional<std::map<std::string, std::string>> paths;
   auto body = [&] {
@@ -43,9 +44,9 @@ std::optional<std::map<std::string, std::string>> QRTGroupManager::groupContaine
     const bool system = userId == QRTSystemContainerUserId;
     const uint64_t groupClass = system ? QRTClassSystemGroup : QRTClassAppGroup;
     QRTGroupList groups;
-    if (QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance()) {
-      groups = system ? mapping->systemGroupIdentifiersForIdentifier(*identifier)
-                      : mapping->appGroupIdentifiersForIdentifier(*identifier);
+    if (names) {
+      groups = system ? names->systemGroupIdentifiersForIdentifier(*identifier)
+                      : names->appGroupIdentifiersForIdentifier(*identifier);
     }
     if (identifier != clientConnection.clientBundleIdentifier() && !clientConnection.allowOtherIdLookup() &&
         platform::deviceIsInternalBuild()) {
@@ -78,13 +79,12 @@ std::optional<std::map<std::string, std::string>> QRTGroupManager::groupContaine
 }
 
 std::optional<std::vector<std::string>> QRTGroupManager::groupContainerIdentifiersForUser(
-    uint32_t userId, const std::optional<std::string>& identifier, uint64_t* withError) {
+    uint32_t userId, const std::optional<std::string>& identifier, QRTGroupNames* names, uint64_t* withError) {
   if (!identifierGiven(__func__, userId, identifier, withError)) return std::nullopt;
   std::optional<std::vector<std::string>> identifiers;
   QRTErrorRef failure = QRT_GUARD([&] {
     QRTAllIdentifiersLock lock(true);
-    QRTCodeSigningMapping* mapping = QRTCodeSigningMapping::sharedInstance();
-    QRTGroupList groups = mapping ? mapping->appGroupIdentifiersForIdentifier(*identifier) : std::nullopt;
+    QRTGroupList groups = names ? names->appGroupIdentifiersForIdentifier(*identifier) : std::nullopt;
     identifiers = groups ? std::move(*groups) : std::vector<std::string>{};
   });
   if (failure) {
