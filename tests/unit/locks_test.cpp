@@ -218,10 +218,12 @@ TEST_F(IdentifierLockTest, WaitingWriterIsNotStarvedByArrivingReaders) {
   };
   for (const auto& [lock, unlock] : writers) {
     std::atomic<bool> writerDone{false}, inWhileReadersRan{false};
-    std::atomic<int> readersDone{0};
+    std::atomic<int> readersDone{0}, readersIn{0};
     auto reader = [&](int index) {
       for (int i = 0; i < 3000 && !writerDone; ++i) {
-        QRTIdentifierLock hold(i % 2 ? "a" : "b" + std::to_string(index), false);
+        // Every reader holds "a" throughout, so that it is never free for long.
+        QRTIdentifierListLock hold({"a", "b" + std::to_string(index)}, false);
+        readersIn += i == 0;
         std::this_thread::sleep_for(200us);
       }
       ++readersDone;
@@ -229,7 +231,7 @@ TEST_F(IdentifierLockTest, WaitingWriterIsNotStarvedByArrivingReaders) {
     std::vector<std::function<void()>> bodies;
     for (int r = 0; r < 4; ++r) bodies.push_back([&, r] { reader(r); });
     bodies.push_back([&] {
-      while (QRTLocksGetSnapshot().identifierReaderCount == 0) std::this_thread::yield();
+      while (readersIn < 4) std::this_thread::yield();
       lock();
       inWhileReadersRan = readersDone == 0;
       unlock();
