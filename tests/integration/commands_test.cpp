@@ -62,13 +62,8 @@ struct CodeCase {
   uint64_t expected;
 };
 
-class CommandTest : public DaemonFixture {
+class CommandTest : public InstallerFixture {
  protected:
-  void SetUp() override {
-    DaemonFixture::SetUp();
-    if (!HasFatalFailure()) setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
-  }
-
   static plist::Dictionary unknown(const Container& c) {
     return with(selector(c), {{QRTKeyUUID, uuidData(QRTUUID::random())}});
   }

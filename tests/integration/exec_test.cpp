@@ -21,8 +21,6 @@ struct Launched {
   std::string out, err;
 };
 
-bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
-
 class ExecTest : public DaemonFixture {
  protected:
   void SetUp() override {

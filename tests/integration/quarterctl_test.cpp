@@ -1,6 +1,5 @@
 // The quarterctl binary against the real daemon: what it prints for people
 // and for scripts, and the exit status that scripts rely on.
-#include <limits.h>
 #include <stdlib.h>
 #include <sys/wait.h>
 
@@ -24,8 +23,6 @@ struct CtlRun {
   int status = -1;
   std::string out, err;
 };
-
-bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
 
 // The rows of a table, cut at the columns of its header line.
 std::vector<std::map<std::string, std::string>> rows(const std::string& out) {
@@ -53,16 +50,11 @@ std::vector<std::map<std::string, std::string>> rows(const std::string& out) {
 
 class QuarterctlTest : public DaemonFixture {
  protected:
+  // The daemon knows callers by executable path, so a copy of its own
+  // gets the master entitlement and the original none.
   void SetUp() override {
     DaemonFixture::SetUp();
-    // The daemon knows callers by executable path, so a copy of its own
-    // gets the master entitlement and the original none.
-    ctl = root + "/bin/quarterctl";
-    std::filesystem::create_directories(root + "/bin");
-    std::filesystem::copy_file(QRT_QUARTERCTL_PATH, ctl);
-    char resolved[PATH_MAX];
-    ASSERT_NE(realpath(ctl.c_str(), resolved), nullptr);
-    setIdentity("quarterctl", resolved, "com.norvane.quarterctl", {{QRTEntitlementAllowed, true}});
+    if (!HasFatalFailure()) ctl = entitledQuarterctl();
   }
 
   // Runs the binary with --root and the arguments, as a shell splits them.
