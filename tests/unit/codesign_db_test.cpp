@@ -131,38 +131,4 @@ TEST_F(CodeSigningDBTest, UndecodableRowsFailLookupAndVanishFromEnumeration) {
   EXPECT_EQ(seen, std::vector<std::string>{"good"});
 }
 
-TEST_F(CodeSigningDBTest, SecondConnectionIsLockedOutWhileOpen) {
-  ASSERT_TRUE(add("x", entryWith("x")));
-  sqlite3* raw = nullptr;
-  ASSERT_EQ(sqlite3_open((dir / "containers.sqlite3").c_str(), &raw), SQLITE_OK);
-  const int rc = sqlite3_exec(raw, "SELECT count(*) FROM code_signing_info;", nullptr, nullptr, nullptr);
-  sqlite3_close(raw);
-  EXPECT_EQ(rc, SQLITE_BUSY);
-  // Reopening keeps what was written.
-  db.reset();
-  db = QRTSQLiteDB::initWithParentDirectoryURL(QRTURL::fileURL(dir.path(), true));
-  ASSERT_TRUE(db && get("x"));
-}
-
-TEST(CodeSigningEntryTest, EqualityHashAndDictionaryForm) {
-  QRTCodeSigningEntry a = entryWith("m", std::vector<std::string>{"x", "y"});
-  QRTCodeSigningEntry reordered = entryWith("m", std::vector<std::string>{"y", "x"});
-  EXPECT_FALSE(a == reordered);
-  QRTCodeSigningEntry small = entryWith("m"), wide = entryWith("m");
-  small.dataContainerClass = 5;
-  wide.dataContainerClass = 5 + (1ull << 32);
-  EXPECT_FALSE(small == wide);
-  EXPECT_EQ(small.hash(), wide.hash());
-  EXPECT_EQ(QRTCodeSigningEntry::fromSerializedDictionary(a.serialize()), a);
-  EXPECT_EQ(QRTCodeSigningEntry::fromSerializedDictionary(wide.serialize()), wide);
-  const QRTCodeSigningEntry bare =
-      QRTCodeSigningEntry::fromSerializedDictionary({{"CodeSigningInfo", plist::Dictionary{}}});
-  EXPECT_EQ(bare, QRTCodeSigningEntry(plist::Dictionary{}));
-  QRTCodeSigningEntry flagged = entryWith("m");
-  flagged.invalid = flagged.registeredByCaller = true;
-  flagged.dataContainerClass = 2;
-  EXPECT_NE(flagged.description().find("invalid: Y, placeholder: N, regByCaller: Y, dataClass: 2,"), std::string::npos)
-      << flagged.description();
-}
-
 }  // namespace
