@@ -131,4 +131,19 @@ TEST_F(CodeSigningDBTest, UndecodableRowsFailLookupAndVanishFromEnumeration) {
   EXPECT_EQ(seen, std::vector<std::string>{"good"});
 }
 
+// Equality decides whether a registration is written again: children in
+// order, the whole 64-bit class; the stored form keeps both.
+TEST(CodeSigningEntryTest, EqualityAndDictionaryForm) {
+  QRTCodeSigningEntry a = entryWith("m", std::vector<std::string>{"x", "y"});
+  EXPECT_FALSE(a == entryWith("m", std::vector<std::string>{"y", "x"}));
+  QRTCodeSigningEntry small = entryWith("m"), wide = entryWith("m");
+  small.dataContainerClass = 5;
+  wide.dataContainerClass = 5 + (1ull << 32);
+  EXPECT_FALSE(small == wide);
+  EXPECT_EQ(QRTCodeSigningEntry::fromSerializedDictionary(a.serialize()), a);
+  EXPECT_EQ(QRTCodeSigningEntry::fromSerializedDictionary(wide.serialize()), wide);
+  EXPECT_EQ(QRTCodeSigningEntry::fromSerializedDictionary({{"CodeSigningInfo", plist::Dictionary{}}}),
+            QRTCodeSigningEntry(plist::Dictionary{}));
+}
+
 }  // namespace
