@@ -1,6 +1,7 @@
 // The request socket under pressure and the daemon's process life: per-user
 // connection limit, the byte budget, descriptor exhaustion, one daemon per
-// root, and SIGTERM with a client that does not read.
+// root, SIGTERM with a client that does not read, and the message readers'
+// rules seen from a client.
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
@@ -17,6 +18,7 @@
 #include <future>
 #include <sstream>
 #include <thread>
+#include <tuple>
 #include <vector>
 
 #include "DaemonFixture.h"
@@ -283,6 +285,27 @@ TEST_F(ResourcesTest, SigtermEndsInTimeWithAClientThatNeverReads) {
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
   EXPECT_LT(took, 15s);
   close(fd);
+}
+
+// A value of the wrong type reads as missing: a non-string Identifier is the
+// caller's own, a non-integer class is 0, a non-boolean flag is false.
+TEST_F(ResourcesTest, MistypedKeysReadAsMissing) {
+  setOwnIdentity("com.example.self", {});
+  const plist::Dictionary base{{QRTKeyUserID, 0}, {QRTKeyContainerClass, 2}, {QRTKeyCreateIfNecessary, true}};
+  const std::tuple<plist::Dictionary, uint64_t, const char*> cases[] = {
+      // keys, code, identifier answered
+      {with(base, {{QRTKeyIdentifier, 17}}), 1, "com.example.self"},
+      {with(base, {{QRTKeyIdentifier, plist::Data{'a', 'b'}}}), 1, "com.example.self"},
+      {with(base, {{QRTKeyIdentifier, plist::Array{"com.example.other"}}}), 1, "com.example.self"},
+      {with(base, {{QRTKeyIdentifier, "com.example.named"}}), 1, "com.example.named"},
+      {with(base, {{QRTKeyIdentifier, "com.example.flag"}, {QRTKeyCreateIfNecessary, 1}}), 21, nullptr},
+      {with(base, {{QRTKeyIdentifier, "com.example.cls"}, {QRTKeyContainerClass, "2"}}), 38, nullptr},
+  };
+  for (const auto& [keys, code, identifier] : cases) {
+    auto reply = call(QRTCommandCreateOrLookupContainer, keys);
+    EXPECT_EQ(codeOf(reply), code) << plist::describe(keys);
+    if (identifier) { EXPECT_EQ(at(reply, QRTReplyKeyIdentifier), plist::Value(identifier)) << plist::describe(keys); }
+  }
 }
 
 }  // namespace
