@@ -381,6 +381,15 @@ void hardLinks(T& t) {
   ASSERT_EQ(link((t.outside + "/secret").c_str(), t.in(t.app, "Documents/secret").c_str()), 0);
   ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/suid").c_str()), 0);
 }
+// As the user: a class directory of their own whose application class is a link outside, and the race that
+// swaps it with the real one.
+void plantFakeClassDirectory(T& t) {
+  t.plant([&] {
+    return mkdir((t.home() + "/fake").c_str(), 0755) == 0 &&
+           symlink(t.outside.c_str(), (t.home() + "/fake/Application").c_str()) == 0;
+  });
+}
+void swapClassDirectoryForFake(const T& t) { flip(t.containers() + "/Data", t.home() + "/fake"); }
 void freshApp(T& t) { t.fresh = t.make(kUser, "com.example.app", 2, true); }
 // A root copy of quarterctl with the master entitlement (root's alone), and a system container it could delete.
 const std::vector<std::string> kDeleteSystemContainer{"Command=u64:10", "UserID=u64:499", "ContainerClass=u64:12",
@@ -580,27 +589,15 @@ const Case kCases[] = {
        static int i = 0;
        flip(t.deadDirectory() + "/" + baseName(t.app.path) + "/Documents/d" + std::to_string(i++ % 40), t.outside);
      }},
-    {"RaceClassDirectoryAndLink_Create",
-     [](T& t) {
-       t.plant([&] {
-         return mkdir((t.home() + "/fake").c_str(), 0755) == 0 &&
-                symlink(t.outside.c_str(), (t.home() + "/fake/Application").c_str()) == 0;
-       });
-     },
+    {"RaceClassDirectoryAndLink_Create", plantFakeClassDirectory,
      [](T& t) {
        for (int i = 0; i < 20; ++i)
          t.send(QRTCommandCreateOrLookupContainer, T::creation("com.example.race" + std::to_string(i)));
      },
-     [](const T& t) { flip(t.containers() + "/Data", t.home() + "/fake"); }},
+     swapClassDirectoryForFake},
     // Reads and writes of a container's metadata resolve from the held class
     // directory while the class directory is swapped for one with a link.
-    {"RaceClassDirectoryAndLink_InfoAndMetadataReadsAndSet",
-     [](T& t) {
-       t.plant([&] {
-         return mkdir((t.home() + "/fake").c_str(), 0755) == 0 &&
-                symlink(t.outside.c_str(), (t.home() + "/fake/Application").c_str()) == 0;
-       });
-     },
+    {"RaceClassDirectoryAndLink_InfoAndMetadataReadsAndSet", plantFakeClassDirectory,
      [](T& t) {
        for (int i = 0; i < 20; ++i) {
          t.send(QRTCommandInfoValueForKey, with(selector(t.app), {{QRTKeyKey, "k"}}));
@@ -608,7 +605,7 @@ const Case kCases[] = {
          t.send(QRTCommandSetInfoValue, with(selector(t.app), kSet));
        }
      },
-     [](const T& t) { flip(t.containers() + "/Data", t.home() + "/fake"); }},
+     swapClassDirectoryForFake},
     {"RaceContainersAndLinkToDecoys_WipeReplaceStageRegenerateDelete",
      [](T& t) {
        t.plant([&] {
