@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <cmath>
+#include <fstream>
 #include <string>
 
 #include "base/PlistCodec.h"
@@ -31,36 +32,15 @@ std::string nested(size_t levels) {
   return s;
 }
 
-const std::string kEntitlements = kHeader + std::string(R"(<dict>
-	<!-- written by the signing tool -->
-	<key>DisplayName</key>
-	<string>Notes &amp; Lists</string>
-	<key>application-groups</key>
-	<array>
-		<string>group.com.example.shared</string>
-		<string>group.com.example.widgets</string>
-	</array>
-	<key>credential-store-groups</key><array/>
-	<key>system-program</key><true/>
-	<key>shares-files</key><false/>
-	<key>limits</key>
-	<dict>
-		<key>family</key><array><integer>1</integer><integer>2</integer></array>
-		<key>ratio</key><real>0.75</real>
-		<key>since</key><date>2020-06-22T17:00:00Z</date>
-		<key>token</key>
-		<data>
-		AAECAwQF
-		BgcICQ==
-		</data>
-	</dict>
-</dict>
-</plist>
-)");
+// A signing tool's document (also a seed of the reader's fuzzer).
+std::string entitlementsFile() {
+  std::ifstream in(QRT_TEST_SOURCE_DIR "/../fuzz/seeds/fuzz_plist_xml/entitlements.plist");
+  return std::string(std::istreambuf_iterator<char>(in), {});
+}
 
 TEST(PlistXMLTest, ReadsSigningToolDocument) {
   std::string error;
-  auto v = parseText(kEntitlements, &error);
+  auto v = parseText(entitlementsFile(), &error);
   ASSERT_TRUE(v) << error;
   EXPECT_EQ(*v, Value(Dictionary{
                     {"DisplayName", "Notes & Lists"},
