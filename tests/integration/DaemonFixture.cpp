@@ -288,17 +288,12 @@ Container DaemonFixture::createOrLookup(uint64_t user, const std::string& identi
                               {QRTKeyIdentifier, identifier},
                               {QRTKeyCreateIfNecessary, create},
                               {QRTKeyTransient, transient}});
-  Container c;
-  c.user = user;
-  c.cls = cls;
-  c.error = codeOf(reply);
-  if (!reply) return c;
-  if (auto* v = plist::find(*reply, QRTReplyKeyIdentifier); v && v->isString()) c.identifier = v->string();
-  if (auto* v = plist::find(*reply, QRTReplyKeyPath); v && v->isString()) c.path = v->string();
-  if (auto* v = plist::find(*reply, QRTReplyKeyExisted); v && v->isBoolean()) c.existed = v->boolean();
-  if (auto* v = plist::find(*reply, QRTReplyKeyUUID); v && v->isData()) {
+  Container c{user, cls, codeOf(reply), "", "", {}, false};
+  if (auto v = at(reply, QRTReplyKeyIdentifier); v && v->isString()) c.identifier = v->string();
+  if (auto v = at(reply, QRTReplyKeyPath); v && v->isString()) c.path = v->string();
+  if (auto v = at(reply, QRTReplyKeyExisted); v && v->isBoolean()) c.existed = v->boolean();
+  if (auto v = at(reply, QRTReplyKeyUUID); v && v->isData())
     c.uuid = QRTUUID::fromBytes(v->data().data(), v->data().size()).value_or(QRTUUID());
-  }
   return c;
 }
 
