@@ -4,7 +4,6 @@
 // refuse any of these; it must never change anything outside the user's reach
 // and must keep serving.
 #include <fcntl.h>
-#include <grp.h>
 #include <sched.h>
 #include <sys/mount.h>
 #include <sys/mman.h>
@@ -107,28 +106,6 @@ std::string firstOwnedBy(const std::string& tree, uid_t uid) {
   return "";
 }
 
-void becomeUser(uid_t uid) {
-  if (setgroups(0, nullptr) != 0 || setresgid(uid, uid, uid) != 0 || setresuid(uid, uid, uid) != 0) _exit(126);
-}
-
-int exitStatus(pid_t pid) {
-  int status = -1;
-  waitpid(pid, &status, 0);
-  return WIFEXITED(status) ? WEXITSTATUS(status) : 255;
-}
-
-// Runs step in a child as the user; the child's wait status (0 when step returned true).
-int asUser(uid_t uid, const std::function<bool()>& step) {
-  pid_t pid = fork();
-  if (pid == 0) {
-    becomeUser(uid);
-    _exit(step() ? 0 : 1);
-  }
-  int status = -1;
-  waitpid(pid, &status, 0);
-  return status;
-}
-
 // A child of the user's that repeats a step until stopped or out of time.
 // Forked while this process has no connection open, hence no other thread.
 class Racer {
@@ -198,7 +175,8 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
  public:
   using DaemonFixture::deadDirectory, DaemonFixture::make, DaemonFixture::restartDaemon, DaemonFixture::root,
       DaemonFixture::createOrLookup, DaemonFixture::setIdentity, DaemonFixture::logContains, DaemonFixture::stopDaemon,
-      DaemonFixture::startDaemon, DaemonFixture::daemon, DaemonFixture::logText, DaemonFixture::mountHomeOnTmpfs;
+      DaemonFixture::startDaemon, DaemonFixture::daemon, DaemonFixture::logText, DaemonFixture::mountHomeOnTmpfs,
+      DaemonFixture::reboot;
   void SetUp() override {
     DaemonFixture::SetUp();
     if (HasFatalFailure()) return;
@@ -302,18 +280,6 @@ class AdversarialTest : public DaemonFixture, public ::testing::WithParamInterfa
 
   void plant(const std::function<bool()>& step) { ASSERT_EQ(asUser(kUser, step), 0) << "the user could not plant"; }
 
-  static plist::Dictionary stage(const Container& c) {
-    return {{QRTKeyContainerClassesArray, plist::Array{c.cls}},
-            {QRTKeyUserIDsArray, plist::Array{c.user}},
-            {QRTKeyUUIDsArray, plist::Array{uuidData(c.uuid)}},
-            {QRTKeyIdentifiersArray, plist::Array{c.identifier}}};
-  }
-  static plist::Dictionary replace(const Container& old, const Container& fresh) {
-    return {{QRTKeyOldContainerUUID, uuidData(old.uuid)},   {QRTKeyOldContainerClass, old.cls},
-            {QRTKeyOldContainerUserID, old.user},           {QRTKeyOldIdentifier, old.identifier},
-            {QRTKeyNewContainerUUID, uuidData(fresh.uuid)}, {QRTKeyNewContainerClass, fresh.cls},
-            {QRTKeyNewContainerUserID, fresh.user},         {QRTKeyNewIdentifier, fresh.identifier}};
-  }
   static plist::Dictionary creation(const std::string& identifier, bool transient = false) {
     return with(byName(kUser, 2, identifier), {{QRTKeyCreateIfNecessary, true}, {QRTKeyTransient, transient}});
   }
@@ -415,6 +381,15 @@ void hardLinks(T& t) {
   ASSERT_EQ(link((t.outside + "/secret").c_str(), t.in(t.app, "Documents/secret").c_str()), 0);
   ASSERT_EQ(link((t.outside + "/suid").c_str(), t.in(t.app, "Library/suid").c_str()), 0);
 }
+// As the user: a class directory of their own whose application class is a link outside, and the race that
+// swaps it with the real one.
+void plantFakeClassDirectory(T& t) {
+  t.plant([&] {
+    return mkdir((t.home() + "/fake").c_str(), 0755) == 0 &&
+           symlink(t.outside.c_str(), (t.home() + "/fake/Application").c_str()) == 0;
+  });
+}
+void swapClassDirectoryForFake(const T& t) { flip(t.containers() + "/Data", t.home() + "/fake"); }
 void freshApp(T& t) { t.fresh = t.make(kUser, "com.example.app", 2, true); }
 // A root copy of quarterctl with the master entitlement (root's alone), and a system container it could delete.
 const std::vector<std::string> kDeleteSystemContainer{"Command=u64:10", "UserID=u64:499", "ContainerClass=u64:12",
@@ -444,7 +419,7 @@ bool plantContainer(const std::string& dir, const std::string& identifier, uint6
 // The next start counts as the first after a boot.
 void reboot(T& t) {
   if (t.daemon > 0) { ASSERT_EQ(t.stopDaemon(), 0); }
-  unlink((t.root + "/run/quarterd.fb_check").c_str());
+  t.reboot();
   t.startDaemon();
 }
 std::string newUUIDIn(const std::string& dir) { return dir + "/" + QRTUUID::random().UUIDString(); }
@@ -534,7 +509,7 @@ const Case kCases[] = {
     swapped(
         "ContainerLinkToOutside_StageAndPass", appPath, outsideDir,
         [](T& t) {
-          t.sends({{QRTCommandStageContainerForDelete, T::stage(t.app)}, {QRTCommandDeleteContainersOnDeathRow, {}}});
+          t.sends({{QRTCommandStageContainerForDelete, stageKeys(t.app)}, {QRTCommandDeleteContainersOnDeathRow, {}}});
         }),
     swapped("ContainerLinkToOtherUsersContainer_DeleteAndPass", appPath, otherContainer,
             byNameThenPass(QRTCommandDeleteContainer)),
@@ -552,7 +527,8 @@ const Case kCases[] = {
        t.plant([&] { return swapForLink(t.app.path, t.other.path); });
      },
      [](T& t) {
-       t.sends({{QRTCommandReplaceContainer, T::replace(t.app, t.fresh)}, {QRTCommandDeleteContainersOnDeathRow, {}}});
+       t.sends(
+           {{QRTCommandReplaceContainer, replaceKeys(&t.app, t.fresh)}, {QRTCommandDeleteContainersOnDeathRow, {}}});
      }},
     {"NewContainerLinkToOtherUsersContainer_Replace",
      [](T& t) {
@@ -560,7 +536,7 @@ const Case kCases[] = {
        t.plant([&] { return swapForLink(t.fresh.path, t.other.path); });
      },
      [](T& t) {
-       t.sends({{QRTCommandReplaceContainer, T::replace(t.app, t.fresh)},
+       t.sends({{QRTCommandReplaceContainer, replaceKeys(&t.app, t.fresh)},
                 {QRTCommandRecreateDefaultStructure, selector(t.app)},
                 {QRTCommandDeleteContainersOnDeathRow, {}}});
      }},
@@ -606,34 +582,22 @@ const Case kCases[] = {
        ASSERT_EQ(system(("chown -R 501:501 " + t.in(t.app, "Documents")).c_str()), 0);
      },
      [](T& t) {
-       t.sends({{QRTCommandStageContainerForDelete, T::stage(t.app)}, {QRTCommandDeleteContainersOnDeathRow, {}}});
+       t.sends({{QRTCommandStageContainerForDelete, stageKeys(t.app)}, {QRTCommandDeleteContainersOnDeathRow, {}}});
      },
      // The staged container stays the user's, and reachable, inside the death-row directory.
      [](const T& t) {
        static int i = 0;
        flip(t.deadDirectory() + "/" + baseName(t.app.path) + "/Documents/d" + std::to_string(i++ % 40), t.outside);
      }},
-    {"RaceClassDirectoryAndLink_Create",
-     [](T& t) {
-       t.plant([&] {
-         return mkdir((t.home() + "/fake").c_str(), 0755) == 0 &&
-                symlink(t.outside.c_str(), (t.home() + "/fake/Application").c_str()) == 0;
-       });
-     },
+    {"RaceClassDirectoryAndLink_Create", plantFakeClassDirectory,
      [](T& t) {
        for (int i = 0; i < 20; ++i)
          t.send(QRTCommandCreateOrLookupContainer, T::creation("com.example.race" + std::to_string(i)));
      },
-     [](const T& t) { flip(t.containers() + "/Data", t.home() + "/fake"); }},
+     swapClassDirectoryForFake},
     // Reads and writes of a container's metadata resolve from the held class
     // directory while the class directory is swapped for one with a link.
-    {"RaceClassDirectoryAndLink_InfoAndMetadataReadsAndSet",
-     [](T& t) {
-       t.plant([&] {
-         return mkdir((t.home() + "/fake").c_str(), 0755) == 0 &&
-                symlink(t.outside.c_str(), (t.home() + "/fake/Application").c_str()) == 0;
-       });
-     },
+    {"RaceClassDirectoryAndLink_InfoAndMetadataReadsAndSet", plantFakeClassDirectory,
      [](T& t) {
        for (int i = 0; i < 20; ++i) {
          t.send(QRTCommandInfoValueForKey, with(selector(t.app), {{QRTKeyKey, "k"}}));
@@ -641,7 +605,7 @@ const Case kCases[] = {
          t.send(QRTCommandSetInfoValue, with(selector(t.app), kSet));
        }
      },
-     [](const T& t) { flip(t.containers() + "/Data", t.home() + "/fake"); }},
+     swapClassDirectoryForFake},
     {"RaceContainersAndLinkToDecoys_WipeReplaceStageRegenerateDelete",
      [](T& t) {
        t.plant([&] {
@@ -651,8 +615,10 @@ const Case kCases[] = {
      },
      [](T& t) {
        t.send(QRTCommandDeleteDataContainerContent, byName(t.app));
-       t.sends({{QRTCommandReplaceContainer, T::replace(t.app, t.make(kUser, "com.example.app", 2, true))},
-                {QRTCommandStageContainerForDelete, T::stage(t.addon)}});
+       // The race may have the transient container refused; the replace then is too.
+       t.sends({{QRTCommandReplaceContainer,
+                 replaceKeys(&t.app, t.createOrLookup(kUser, "com.example.app", 2, true, true))},
+                {QRTCommandStageContainerForDelete, stageKeys(t.addon)}});
        // Last: a new directory name lives in one of the two trees only.
        onApp({QRTCommandRegenerateDirectoryUUID, QRTCommandRegenerateDirectoryUUID, QRTCommandRegenerateDirectoryUUID})(
            t);

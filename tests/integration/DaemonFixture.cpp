@@ -1,15 +1,21 @@
 #include "DaemonFixture.h"
 
 #include <dirent.h>
+#include <grp.h>
+#include <limits.h>
 #include <signal.h>
 #include <stdlib.h>
 #include <sys/mount.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <cstdio>
+#include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <sstream>
 #include <thread>
@@ -46,6 +52,59 @@ plist::Dictionary selector(const Container& c) { return with(byName(c), {{QRTKey
 plist::Dictionary with(plist::Dictionary keys, plist::Dictionary more) { return more.merge(keys), more; }
 plist::Dictionary without(plist::Dictionary keys, const std::string& key) { return keys.erase(key), keys; }
 
+plist::Dictionary replaceKeys(const Container* old, const Container& fresh) {
+  plist::Dictionary keys{{QRTKeyNewContainerUUID, uuidData(fresh.uuid)},
+                         {QRTKeyNewContainerClass, fresh.cls},
+                         {QRTKeyNewContainerUserID, fresh.user},
+                         {QRTKeyNewIdentifier, fresh.identifier}};
+  if (!old) return keys;
+  return with(keys, {{QRTKeyOldContainerUUID, uuidData(old->uuid)},
+                     {QRTKeyOldContainerClass, old->cls},
+                     {QRTKeyOldContainerUserID, old->user},
+                     {QRTKeyOldIdentifier, old->identifier}});
+}
+
+plist::Dictionary stageKeys(const Container& c) {
+  return {{QRTKeyContainerClassesArray, plist::Array{c.cls}},
+          {QRTKeyUserIDsArray, plist::Array{c.user}},
+          {QRTKeyUUIDsArray, plist::Array{uuidData(c.uuid)}},
+          {QRTKeyIdentifiersArray, plist::Array{c.identifier}}};
+}
+
+plist::Array strings(std::initializer_list<const char*> items) { return plist::Array(items.begin(), items.end()); }
+
+void becomeUser(uid_t uid) {
+  if (setgroups(0, nullptr) != 0 || setresgid(uid, uid, uid) != 0 || setresuid(uid, uid, uid) != 0) _exit(126);
+}
+
+int exitStatus(pid_t pid) {
+  int status = -1;
+  waitpid(pid, &status, 0);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : 255;
+}
+
+int asUser(uid_t uid, const std::function<bool()>& step, pid_t* pid) {
+  pid_t child = fork();
+  if (child == 0) {
+    becomeUser(uid);
+    _exit(step() ? 0 : 1);
+  }
+  if (pid) *pid = child;
+  return exitStatus(child);
+}
+
+int rawConnect(const std::string& path) {
+  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
+  if (fd >= 0 && connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0) return fd;
+  if (fd >= 0) close(fd);
+  return -1;
+}
+
+bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
+
 std::string baseName(const std::string& path) { return path.substr(path.rfind('/') + 1); }
 std::string parentOf(const std::string& path) { return path.substr(0, path.rfind('/')); }
 
@@ -58,6 +117,11 @@ std::pair<uint32_t, uint32_t> ownerAndMode(const std::string& path) {
 void writeFile(const std::string& path, const std::string& text) {
   std::ofstream out(path, std::ios::binary | std::ios::trunc);
   out << text;
+}
+
+void writePlist(const std::string& path, const plist::Dictionary& dictionary) {
+  plist::Data bytes = plist::writeBinary(dictionary);
+  writeFile(path, std::string(bytes.begin(), bytes.end()));
 }
 
 std::string output(const std::string& command) {
@@ -141,15 +205,19 @@ bool DaemonFixture::mountOnTmpfs(const std::string& directory, const std::string
   return done;
 }
 
-void DaemonFixture::startDaemon() {
-  std::string socketPath = qk::requestSocketPath(root);
-  unlink(socketPath.c_str());
+void DaemonFixture::launchDaemon() {
   daemon = fork();
   ASSERT_GE(daemon, 0);
   if (daemon == 0) {
     execl(QRT_DAEMON_PATH, QRT_DAEMON_PATH, "--root", root.c_str(), "--log-level", "7", nullptr);
     _exit(127);
   }
+}
+
+void DaemonFixture::startDaemon() {
+  std::string socketPath = qk::requestSocketPath(root);
+  unlink(socketPath.c_str());
+  launchDaemon();
   for (int i = 0; i < 400; ++i) {
     struct stat st;
     if (stat(socketPath.c_str(), &st) == 0) return;
@@ -170,6 +238,22 @@ int DaemonFixture::stopDaemon() {
 void DaemonFixture::restartDaemon() {
   ASSERT_EQ(stopDaemon(), 0);
   startDaemon();
+}
+
+void DaemonFixture::expectKilledAt(const std::string& point, std::optional<uint64_t> command,
+                                   const plist::Dictionary& keys) {
+  writeFile(root + "/run/quarterd.crashpoint", point + "\n");
+  if (!command) {
+    launchDaemon();
+  } else {
+    if (daemon <= 0) startDaemon();
+    EXPECT_FALSE(call(*command, keys)) << "the daemon answered instead of dying at " << point;
+  }
+  int status = 0;
+  ASSERT_EQ(waitpid(daemon, &status, 0), daemon);
+  EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL) << point << ": status " << status;
+  daemon = -1;
+  unlink((root + "/run/quarterd.crashpoint").c_str());
 }
 
 void DaemonFixture::killDaemon() {
@@ -204,17 +288,12 @@ Container DaemonFixture::createOrLookup(uint64_t user, const std::string& identi
                               {QRTKeyIdentifier, identifier},
                               {QRTKeyCreateIfNecessary, create},
                               {QRTKeyTransient, transient}});
-  Container c;
-  c.user = user;
-  c.cls = cls;
-  c.error = codeOf(reply);
-  if (!reply) return c;
-  if (auto* v = plist::find(*reply, QRTReplyKeyIdentifier); v && v->isString()) c.identifier = v->string();
-  if (auto* v = plist::find(*reply, QRTReplyKeyPath); v && v->isString()) c.path = v->string();
-  if (auto* v = plist::find(*reply, QRTReplyKeyExisted); v && v->isBoolean()) c.existed = v->boolean();
-  if (auto* v = plist::find(*reply, QRTReplyKeyUUID); v && v->isData()) {
+  Container c{user, cls, codeOf(reply), "", "", {}, false};
+  if (auto v = at(reply, QRTReplyKeyIdentifier); v && v->isString()) c.identifier = v->string();
+  if (auto v = at(reply, QRTReplyKeyPath); v && v->isString()) c.path = v->string();
+  if (auto v = at(reply, QRTReplyKeyExisted); v && v->isBoolean()) c.existed = v->boolean();
+  if (auto v = at(reply, QRTReplyKeyUUID); v && v->isData())
     c.uuid = QRTUUID::fromBytes(v->data().data(), v->data().size()).value_or(QRTUUID());
-  }
   return c;
 }
 
@@ -230,10 +309,9 @@ void DaemonFixture::setIdentity(const std::string& name, const std::string& exec
   plist::Dictionary identity{
       {"Executable", executable}, {"SigningIdentifier", signingIdentifier}, {"Entitlements", entitlements}};
   if (!users.empty()) identity["Users"] = users;
-  plist::Data bytes = plist::writeBinary(identity);
   std::string dir = root + "/etc/quarterd/identities";
   std::string tmp = dir + "/." + name + ".tmp";
-  writeFile(tmp, std::string(bytes.begin(), bytes.end()));
+  writePlist(tmp, identity);
   chmod(tmp.c_str(), 0644);  // the daemon skips a registry file others can write
   rename(tmp.c_str(), (dir + "/" + name + ".plist").c_str());
 }
@@ -243,6 +321,23 @@ void DaemonFixture::setOwnIdentity(const std::string& signingIdentifier, const p
 }
 
 void DaemonFixture::clearOwnIdentity() { unlink((root + "/etc/quarterd/identities/self.plist").c_str()); }
+
+std::string DaemonFixture::entitledQuarterctl() {
+  const std::string ctl = root + "/bin/quarterctl";
+  std::filesystem::create_directories(root + "/bin");
+  std::filesystem::copy_file(QRT_QUARTERCTL_PATH, ctl);
+  char resolved[PATH_MAX];
+  EXPECT_NE(realpath(ctl.c_str(), resolved), nullptr);
+  setIdentity("quarterctl", resolved, "com.norvane.quarterctl", {{QRTEntitlementAllowed, true}});
+  return ctl;
+}
+
+size_t DaemonFixture::logCount(const std::string& text) const {
+  const std::string log = logText();
+  size_t n = 0;
+  for (size_t at = log.find(text); at != std::string::npos; at = log.find(text, at + 1)) ++n;
+  return n;
+}
 
 std::string DaemonFixture::logText() const {
   return readFile(root + "/private/var/root/Library/Logs/QuarterKit/quarterd.log");

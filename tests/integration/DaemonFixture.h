@@ -3,7 +3,10 @@
 #pragma once
 
 #include <sys/types.h>
+#include <unistd.h>
 
+#include <functional>
+#include <initializer_list>
 #include <memory>
 #include <optional>
 #include <string>
@@ -76,13 +79,39 @@ class DaemonFixture : public ::testing::Test {
   bool mountOnTmpfs(const std::string& directory, const std::string& size);
   bool mountHomeOnTmpfs() { return mountOnTmpfs(root + "/private/var/mobile", "96m"); }
 
+  // A copy of quarterctl under the root that holds the master entitlement; its path.
+  std::string entitledQuarterctl();
+
+  // Arms the crash point and expects the daemon to die there by SIGKILL while
+  // it serves the command (started first if it is stopped), or with no command
+  // while it starts. The daemon is left stopped and the point disarmed.
+  void expectKilledAt(const std::string& point, std::optional<uint64_t> command, const plist::Dictionary& keys = {});
+  // The next start counts as the first after a boot.
+  void reboot() { unlink((root + "/run/quarterd.fb_check").c_str()); }
+
   std::string logText() const;
   // Waits (up to 5 s) until the log holds the text.
   bool logContains(const std::string& text) const;
+  // How often the log holds the text now.
+  size_t logCount(const std::string& text) const;
 
   std::string root;
   pid_t daemon = -1;
   std::vector<std::string> mounted;  // innermost last
+
+ private:
+  void launchDaemon();
+};
+
+// The fixture with this test program registered as an installer that holds
+// the master entitlement.
+class InstallerFixture : public DaemonFixture {
+ protected:
+  void SetUp() override {
+    DaemonFixture::SetUp();
+    if (!HasFatalFailure()) beInstaller();
+  }
+  void beInstaller() { setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}}); }
 };
 
 plist::Dictionary request(uint64_t command, plist::Dictionary keys = {});
@@ -100,6 +129,21 @@ plist::Dictionary byName(const Container& c);
 plist::Dictionary selector(const Container& c);
 plist::Dictionary with(plist::Dictionary keys, plist::Dictionary more);
 plist::Dictionary without(plist::Dictionary keys, const std::string& key);
+// Command 2's keys: fresh replaces old, or (no old) a transient container is promoted.
+plist::Dictionary replaceKeys(const Container* old, const Container& fresh);
+// Command 11's parallel arrays for one container.
+plist::Dictionary stageKeys(const Container& c);
+plist::Array strings(std::initializer_list<const char*> items);
+
+// Drops every group and takes uid as user and group, or exits 126.
+void becomeUser(uid_t uid);
+// The child's exit status; 255 when it did not exit.
+int exitStatus(pid_t pid);
+// Runs step in a child as the user: its exit status, 0 when step returned
+// true; *pid (when given) receives the child's pid.
+int asUser(uid_t uid, const std::function<bool()>& step, pid_t* pid = nullptr);
+// A connected stream socket, or -1.
+int rawConnect(const std::string& path);
 
 inline const char* const kMetadataFile = ".com.norvane.quarter_kit.metadata.plist";
 std::string baseName(const std::string& path);
@@ -107,8 +151,10 @@ std::string parentOf(const std::string& path);
 // The owner and permission bits (stat follows links); all ones when missing.
 std::pair<uint32_t, uint32_t> ownerAndMode(const std::string& path);
 
+bool contains(const std::string& text, const std::string& part);
 // File helpers; a missing file reads as empty, a missing directory lists nothing.
 void writeFile(const std::string& path, const std::string& text);
+void writePlist(const std::string& path, const plist::Dictionary& dictionary);
 std::string readFile(const std::string& path);
 // What a shell command prints on standard output.
 std::string output(const std::string& command);

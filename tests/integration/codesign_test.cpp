@@ -12,24 +12,15 @@
 
 namespace {
 
-constexpr const char* kAllowed = QRTEntitlementAllowed;
 constexpr const char* kAppGroups = "com.norvane.security.application-groups";
 constexpr const char* kSystemGroups = "com.norvane.security.system-groups";
 constexpr const char* kSystemContainer = "com.norvane.security.system-container";
 constexpr const char* kEntitlementsKey = "com.norvane.QuarterKit.Entitlements";
 
-plist::Array strings(std::initializer_list<const char*> items) { return plist::Array(items.begin(), items.end()); }
-
 plist::Dictionary info(plist::Dictionary entitlements) { return {{kEntitlementsKey, std::move(entitlements)}}; }
 
-class CodesignTest : public DaemonFixture {
+class CodesignTest : public InstallerFixture {
  protected:
-  void SetUp() override {
-    DaemonFixture::SetUp();
-    if (!HasFatalFailure()) beInstaller();
-  }
-  void beInstaller() { setOwnIdentity("com.example.installer", {{kAllowed, true}}); }
-
   uint64_t registerProgram(const std::string& id, plist::Dictionary entitlements, plist::Dictionary options = {}) {
     return codeOf(call(QRTCommandProcessCodeSigningInfo, {{QRTKeyIdentifier, id},
                                                           {"CodeSigningInfo", info(std::move(entitlements))},

@@ -23,13 +23,8 @@ void together(const std::vector<std::function<void()>>& bodies) {
   for (auto& thread : threads) thread.join();
 }
 
-class ConcurrencyTest : public DaemonFixture {
+class ConcurrencyTest : public InstallerFixture {
  protected:
-  void SetUp() override {
-    DaemonFixture::SetUp();
-    if (!HasFatalFailure()) setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
-  }
-
   // Command 1's UUIDs for user 501, class 2.
   std::set<std::string> listedUUIDs(bool transient) {
     auto reply = call(QRTCommandContainersForUser,

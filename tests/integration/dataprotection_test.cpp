@@ -1,11 +1,7 @@
 // Protection-class changes of data containers (command 21) against the real
 // daemon: what the walk touches, the locked device, kills at each step of a
 // change, the termination assertion, and that each request gets one reply.
-#include <limits.h>
 #include <stdlib.h>
-#include <sys/socket.h>
-#include <sys/un.h>
-#include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -18,6 +14,7 @@
 #include <thread>
 
 #include "DaemonFixture.h"
+#include "base/Frame.h"
 #include "base/PlistCodec.h"
 
 namespace fs = std::filesystem;
@@ -53,58 +50,26 @@ std::map<int32_t, int> classesUnder(const std::string& top) {
 // One framed request on a raw socket, then a second one: the next frame must
 // answer the second, so the first got exactly one reply. The first reply's code.
 uint64_t codeOfOnlyReply(const std::string& socketPath, const plist::Dictionary& first) {
-  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  strncpy(address.sun_path, socketPath.c_str(), sizeof address.sun_path - 1);
-  EXPECT_EQ(connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
-  auto send = [&](uint64_t id, const plist::Dictionary& message) {
-    plist::Data body = plist::writeBinary(plist::Value(message));
-    std::string frame(12, '\0');
-    const uint32_t length = static_cast<uint32_t>(body.size() + 8);
-    memcpy(frame.data(), &length, 4);
-    memcpy(frame.data() + 4, &id, 8);
-    frame.append(body.begin(), body.end());
-    EXPECT_EQ(write(fd, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+  const int fd = rawConnect(socketPath);
+  frame::Decoder decoder;
+  auto exchange = [&](uint64_t id, const plist::Dictionary& message) {
+    const std::vector<uint8_t> bytes = frame::encode(id, message);
+    EXPECT_TRUE(frame::sendAll(fd, bytes.data(), bytes.size()));
+    std::optional<frame::RawFrame> reply;
+    uint8_t buffer[4096];
+    for (ssize_t n; !(reply = decoder.next()) && (n = read(fd, buffer, sizeof buffer)) > 0;)
+      decoder.append(buffer, static_cast<size_t>(n));
+    EXPECT_EQ(reply ? reply->messageId : 0, id) << "a second reply to the first request";
+    return reply ? frame::decodeMessage(reply->payload) : std::nullopt;
   };
-  auto receive = [&](uint64_t* id) -> std::optional<plist::Dictionary> {
-    auto readAll = [&](void* into, size_t size) {
-      for (size_t done = 0; done < size;) {
-        ssize_t n = read(fd, static_cast<char*>(into) + done, size - done);
-        if (n <= 0) return false;
-        done += static_cast<size_t>(n);
-      }
-      return true;
-    };
-    uint32_t length = 0;
-    if (!readAll(&length, 4) || length < 8) return std::nullopt;
-    std::string payload(length, '\0');
-    if (!readAll(payload.data(), length)) return std::nullopt;
-    memcpy(id, payload.data(), 8);
-    auto value = plist::parse(payload.data() + 8, length - 8);
-    if (!value || !value->isDictionary()) return std::nullopt;
-    return value->dictionary();
-  };
-  send(1, first);
-  uint64_t id = 0;
-  auto reply = receive(&id);
-  EXPECT_EQ(id, 1u);
-  send(2, request(QRTCommandMetadataForContainer,
-                  {{QRTKeyUserID, 501}, {QRTKeyContainerClass, 2}, {QRTKeyIdentifier, "com.example.nothing"}}));
-  uint64_t nextId = 0;
-  EXPECT_TRUE(receive(&nextId));
-  EXPECT_EQ(nextId, 2u) << "a second reply to the first request";
+  const uint64_t code = codeOf(exchange(1, first));
+  exchange(2, request(QRTCommandCount));
   close(fd);
-  return codeOf(reply);
+  return code;
 }
 
-class DataProtectionTest : public DaemonFixture {
+class DataProtectionTest : public InstallerFixture {
  protected:
-  void SetUp() override {
-    DaemonFixture::SetUp();
-    if (!HasFatalFailure()) setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
-  }
-
   void TearDown() override {
     setLocked(false);  // a held change would keep the daemon from stopping at once
     DaemonFixture::TearDown();
@@ -164,13 +129,6 @@ class DataProtectionTest : public DaemonFixture {
   static std::string retrying(const std::string& id, int32_t cls) {
     return "Retrying container protection update to " + std::to_string(cls) +
            " on next unlock for user: 501, id: " + id;
-  }
-
-  size_t occurrences(const std::string& text) const {
-    const std::string log = logText();
-    size_t count = 0;
-    for (size_t at = log.find(text); at != std::string::npos; at = log.find(text, at + 1)) ++count;
-    return count;
   }
 
   // Waits (up to 5 s) for the path to exist or not.
@@ -285,13 +243,7 @@ TEST_F(DataProtectionTest, KilledChangeIsCompletedAtStart) {
     SCOPED_TRACE(point);
     const std::string id = std::string("com.example.") + point;
     Container c = makeApp(id, 40);
-    writeFile(root + "/run/quarterd.crashpoint", std::string(point) + "\n");
-    EXPECT_FALSE(call(kSetDataProtection, protect(id, 1, true))) << "answered instead of dying";
-    int status = 0;
-    ASSERT_EQ(waitpid(daemon, &status, 0), daemon);
-    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL) << "status " << status;
-    daemon = -1;
-    unlink((root + "/run/quarterd.crashpoint").c_str());
+    ASSERT_NO_FATAL_FAILURE(expectKilledAt(point, kSetDataProtection, protect(id, 1, true)));
     EXPECT_EQ(listDirectory(pendingDir()).size(), 2u);
     startDaemon();
     EXPECT_EQ(listDirectory(pendingDir()), garbageOnly);
@@ -316,13 +268,13 @@ TEST_F(DataProtectionTest, ApplicationIsHeldWhileTheChangeRunsAfterUnlock) {
     auto reply = protectLater(protect(id, 1, true));
     ASSERT_TRUE(logContains(retrying(id, 1)));
     const std::string paused = "Pause point protection-walk reached";
-    const size_t pausesBefore = occurrences(paused);
+    const size_t pausesBefore = logCount(paused);
     writeFile(root + "/run/quarterd.pausepoint", "protection-walk\n");
     setLocked(false);
     // The pause comes on the run after the unlock, with the assertion held.
-    for (int i = 0; i < 500 && occurrences(paused) == pausesBefore; ++i)
+    for (int i = 0; i < 500 && logCount(paused) == pausesBefore; ++i)
       std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    EXPECT_GT(occurrences(paused), pausesBefore);
+    EXPECT_GT(logCount(paused), pausesBefore);
     EXPECT_EQ(exists(assertionFile(id)), !refuse);
     unlink((root + "/run/quarterd.pausepoint").c_str());
     EXPECT_EQ(codeOf(reply.get()), 1u);
@@ -334,12 +286,7 @@ TEST_F(DataProtectionTest, ApplicationIsHeldWhileTheChangeRunsAfterUnlock) {
 
 TEST_F(DataProtectionTest, QuarterctlProtect) {
   Container c = makeApp("com.example.ctl", 4);
-  const std::string ctl = root + "/quarterctl";
-  fs::copy_file(QRT_QUARTERCTL_PATH, ctl);
-  char resolved[PATH_MAX];
-  ASSERT_NE(realpath(ctl.c_str(), resolved), nullptr);
-  setIdentity("quarterctl", resolved, "com.norvane.quarterctl", {{QRTEntitlementAllowed, true}});
-  const std::string command = ctl + " --root " + root + " protect --identifier com.example.ctl ";
+  const std::string command = entitledQuarterctl() + " --root " + root + " protect --identifier com.example.ctl ";
   EXPECT_EQ(WEXITSTATUS(system((command + "--protection-class 1 >/dev/null").c_str())), 0);
   EXPECT_EQ(classOf(c.path + "/Documents/d0/f0"), 1);
   EXPECT_EQ(WEXITSTATUS(system((command + "--protection-class 2 >/dev/null").c_str())), 1);

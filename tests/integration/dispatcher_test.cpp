@@ -123,17 +123,4 @@ TEST_F(DispatcherTest, PipelinedRequestsAreMatchedByMessageId) {
   }
 }
 
-TEST_F(DispatcherTest, StartsInOrderAndMarksTheFirstBoot) {
-  EXPECT_TRUE(logContains("quarterd performing first boot initialization"));
-  EXPECT_TRUE(logContains("quarterd first boot cleanup complete"));
-  // A restart in the same boot skips the first-boot work.
-  stopDaemon();
-  std::string before = logText();
-  startDaemon();
-  ASSERT_EQ(replyError(request(QRTCommandCount)), kNotServed);
-  std::string after = logText().substr(before.size());
-  EXPECT_EQ(after.find("first boot"), std::string::npos);
-  EXPECT_NE(after.find("started"), std::string::npos);
-}
-
 }  // namespace

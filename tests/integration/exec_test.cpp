@@ -21,8 +21,6 @@ struct Launched {
   std::string out, err;
 };
 
-bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
-
 class ExecTest : public DaemonFixture {
  protected:
   void SetUp() override {
@@ -152,57 +150,39 @@ TEST_F(ExecTest, ProgramReachesItsContainersAndNothingElse) {
 
 TEST_F(ExecTest, RefusesWithClearMessages) {
   const std::vector<std::string> noLandlock{QRT_SECCOMP_RUN_PATH, "--deny", "landlock_create_ruleset", "--"};
-  const std::vector<std::string> run{"--user", "501", "--identifier", "com.example.a", "--", probe};
-  auto with = [&](std::vector<std::string> before, std::vector<std::string> after = {}) {
-    before.insert(before.begin(), {"--root", root});
-    before.insert(before.end(), run.begin(), run.end());
-    before.insert(before.end(), after.begin(), after.end());
-    return before;
+  // The options, then the run's user, identifier and program ("" leaves one out), then what follows.
+  auto with = [&](std::vector<std::string> options, std::vector<std::string> after = {},
+                  const std::string& user = "501", const std::string& identifier = "com.example.a",
+                  const std::string& program = "probe") {
+    options.insert(options.begin(), {"--root", root});
+    if (!user.empty()) options.insert(options.end(), {"--user", user});
+    options.insert(options.end(), {"--identifier", identifier});
+    if (!program.empty()) options.insert(options.end(), {"--", program == "probe" ? probe : program});
+    options.insert(options.end(), after.begin(), after.end());
+    return options;
   };
   struct Case {
     std::vector<std::string> args;
-    uid_t user;
     int status;
-    std::string message, out;
-    std::vector<std::string> command;
+    std::string message;
+    uid_t user = 0;
+    std::string out = "";
+    std::vector<std::string> command = {};
   } cases[] = {
-      {with({}), 501, 1, "must be run as root", "", {}},
-      {{"--root", root, "--user", "501", "--identifier", "com.example.nobody", "--", probe},
-       0,
-       1,
-       "unknown identifier com.example.nobody: " + probe + " is registered as com.example.a",
-       "",
-       {}},
-      {{"--root", root, "--user", "501", "--identifier", "com.example.a", "--", "/bin/true"},
-       0,
-       1,
-       "unknown identifier com.example.a: /usr/bin/true has no identity",
-       "",
-       {}},
-      {{"--root", root, "--user", "777", "--identifier", "com.example.a", "--", probe},
-       0,
-       1,
-       "no account for user 777",
-       "",
-       {}},
-      {{"--root", root, "--user", "0", "--identifier", "com.example.a", "--", probe},
-       0,
-       2,
-       "--user 0: root cannot be",
-       "",
-       {}},
-      {{"--root", root, "--identifier", "com.example.a", "--", probe}, 0, 2, "--user is required", "", {}},
-      {{"--root", root, "--user", "501", "--identifier", "com.example.a"}, 0, 2, "no program given", "", {}},
-      {{"--root", root, "--user", "501", "--identifier", "com.example.a", "--", "/no/such"},
-       0,
-       127,
-       "cannot find",
-       "",
-       {}},
-      {with({}), 0, 1, "the kernel offers no Landlock", "", noLandlock},
-      {with({"--allow-unconfined"}), 0, 0, "warning: " + probe + " runs without any confinement", "", noLandlock},
-      {with({}, {"n:1"}), 0, 0, "", "ECONNREFUSED\n", {}},
-      {with({"--no-network"}, {"n:1"}), 0, 0, "", "EACCES\n", {}},
+      {with({}), 1, "must be run as root", 501},
+      {with({}, {}, "501", "com.example.nobody"), 1,
+       "unknown identifier com.example.nobody: " + probe + " is registered as com.example.a"},
+      {with({}, {}, "501", "com.example.a", "/bin/true"), 1,
+       "unknown identifier com.example.a: /usr/bin/true has no identity"},
+      {with({}, {}, "777"), 1, "no account for user 777"},
+      {with({}, {}, "0"), 2, "--user 0: root cannot be"},
+      {with({}, {}, ""), 2, "--user is required"},
+      {with({}, {}, "501", "com.example.a", ""), 2, "no program given"},
+      {with({}, {}, "501", "com.example.a", "/no/such"), 127, "cannot find"},
+      {with({}), 1, "the kernel offers no Landlock", 0, "", noLandlock},
+      {with({"--allow-unconfined"}), 0, "warning: " + probe + " runs without any confinement", 0, "", noLandlock},
+      {with({}, {"n:1"}), 0, "", 0, "ECONNREFUSED\n"},
+      {with({"--no-network"}, {"n:1"}), 0, "", 0, "EACCES\n"},
   };
   for (const Case& c : cases) {
     Launched launched = launch(c.args, c.user, c.command);

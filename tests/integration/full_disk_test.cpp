@@ -13,16 +13,15 @@
 
 namespace {
 
-class FullDiskTest : public DaemonFixture {
+class FullDiskTest : public InstallerFixture {
  protected:
   void SetUp() override {
-    DaemonFixture::SetUp();
+    InstallerFixture::SetUp();
     if (HasFatalFailure()) return;
     // The store on a small file system of its own, and the log on another,
     // as a journal would be, so that its lines outlive the full store.
     if (!mountOnTmpfs(root + "/private/var", "32m") || !mountOnTmpfs(root + "/private/var/root/Library/Logs", "8m"))
       GTEST_SKIP() << "cannot mount a tmpfs here";
-    setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
   }
 
   std::string filler() const { return root + "/private/var/filler"; }
@@ -92,23 +91,9 @@ TEST_F(FullDiskTest, EveryChangeFailsCleanlyAndWorksAgainOnceSpaceIsFreed) {
         {QRTKeyIdentifier, "com.example.new"},
         {QRTKeyCreateIfNecessary, true}}},
       {"info set", QRTCommandSetInfoValue, with(selector(kept), {{QRTKeyKey, "k"}, {QRTKeyValue, big}})},
-      {"replace",
-       QRTCommandReplaceContainer,
-       {{QRTKeyOldContainerUUID, uuidData(kept.uuid)},
-        {QRTKeyOldContainerClass, 2},
-        {QRTKeyOldContainerUserID, 501},
-        {QRTKeyOldIdentifier, kept.identifier},
-        {QRTKeyNewContainerUUID, uuidData(fresh.uuid)},
-        {QRTKeyNewContainerClass, 2},
-        {QRTKeyNewContainerUserID, 501},
-        {QRTKeyNewIdentifier, fresh.identifier}}},
+      {"replace", QRTCommandReplaceContainer, replaceKeys(&kept, fresh)},
       {"wipe", QRTCommandDeleteDataContainerContent, byName(wiped)},
-      {"stage for delete",
-       QRTCommandStageContainerForDelete,
-       {{QRTKeyContainerClassesArray, plist::Array{4u}},
-        {QRTKeyUserIDsArray, plist::Array{501u}},
-        {QRTKeyUUIDsArray, plist::Array{uuidData(addon.uuid)}},
-        {QRTKeyIdentifiersArray, plist::Array{"com.example.addon"}}}},
+      {"stage for delete", QRTCommandStageContainerForDelete, stageKeys(addon)},
       {"protection change", QRTCommandSetDataProtection,
        with(byName(kept), {{QRTKeyDataProtectionClass, 3}, {QRTKeyIsThirdParty, false}, {QRTKeyRetryIfLocked, false}})},
       {"code-signing registration", QRTCommandProcessCodeSigningInfo, {}},

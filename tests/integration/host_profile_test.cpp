@@ -12,6 +12,7 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <filesystem>
 #include <thread>
 
 #include "DaemonFixture.h"
@@ -98,24 +99,21 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
   ASSERT_NE(mkdtemp(tmpl), nullptr);
   const std::string dir = tmpl;
   ASSERT_EQ(chmod(dir.c_str(), 0755), 0);
-  ASSERT_EQ(system(("cp -a /etc " + dir + "/etc && mkdir -p " + dir + "/etc/quarterd/identities " + dir +
-                    "/home/alice " + dir + "/home/bob " + dir + "/home/carol " + dir + "/victim && chown 1500 " + dir +
-                    "/home/alice && chown 1501 " + dir + "/home/bob && chown 1502 " + dir + "/home/carol && ln -s " +
-                    dir + "/victim " + dir + "/home/carol/.local")
-                       .c_str()),
-            0);
+  ASSERT_EQ(
+      system(("cp -a /etc " + dir + "/etc && mkdir -p " + dir + "/etc/quarterd/identities " + dir + "/victim").c_str()),
+      0);
   // www-data keeps uid 33, as on Debian: it must never own a container.
-  writeFile(dir + "/etc/passwd", readFile("/etc/passwd") +
-                                     "quarterd-installer:x:990:990::/var/lib/quarterd/installer:/usr/sbin/nologin\n"
-                                     "quarterd-system:x:991:991::/nonexistent:/usr/sbin/nologin\n"
-                                     "alice:x:1500:1500::" +
-                                     dir +
-                                     "/home/alice:/bin/sh\n"
-                                     "bob:x:1501:1501::" +
-                                     dir +
-                                     "/home/bob:/bin/sh\n"
-                                     "carol:x:1502:1502::" +
-                                     dir + "/home/carol:/bin/sh\n");
+  std::string passwd = readFile("/etc/passwd") +
+                       "quarterd-installer:x:990:990::/var/lib/quarterd/installer:/usr/sbin/nologin\n"
+                       "quarterd-system:x:991:991::/nonexistent:/usr/sbin/nologin\n";
+  for (auto [name, uid] : {std::pair{"alice", kAlice}, {"bob", kBob}, {"carol", kCarol}}) {
+    const std::string home = dir + "/home/" + name;
+    std::filesystem::create_directories(home);
+    ASSERT_EQ(chown(home.c_str(), uid, static_cast<gid_t>(-1)), 0);
+    passwd += std::string(name) + ":x:" + std::to_string(uid) + ":" + std::to_string(uid) + "::" + home + ":/bin/sh\n";
+  }
+  writeFile(dir + "/etc/passwd", passwd);
+  ASSERT_EQ(symlink((dir + "/victim").c_str(), (dir + "/home/carol/.local").c_str()), 0);
   writeFile(dir + "/etc/group", readFile("/etc/group") +
                                     "quarterd-installer:x:990:\nquarterd-system:x:991:\nquarterd-systemusers:x:992:\n"
                                     "alice:x:1500:\nbob:x:1501:\n");
@@ -124,8 +122,7 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
   plist::Dictionary identity{{"Executable", readLink("/proc/self/exe")},
                              {"SigningIdentifier", "com.example.installer"},
                              {"Entitlements", plist::Dictionary{{QRTEntitlementAllowed, true}}}};
-  plist::Data bytes = plist::writeBinary(identity);
-  writeFile(dir + "/etc/quarterd/identities/installer.plist", std::string(bytes.begin(), bytes.end()));
+  writePlist(dir + "/etc/quarterd/identities/installer.plist", identity);
 
   HostProfile host(dir);
   ASSERT_TRUE(host.waitForSocket());

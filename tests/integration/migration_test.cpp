@@ -1,10 +1,7 @@
 // Migrations and start-up through the real daemon: the code-signing imports
 // of older stores (command 24), the build-upgrade migration, the first start
 // after a reboot, and a SIGKILL inside each of them.
-#include <signal.h>
 #include <sqlite3.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <array>
 #include <filesystem>
@@ -28,13 +25,7 @@ const char* const kGlobalClassDirs[] = {"Bundle/Application", "Bundle/AddonPlugi
 const char* const kUserClassDirs[] = {"Data/Application",  "Data/AddonPlugin",    "Data/VPNPlugin", "Shared/AppGroup",
                                       "Data/RelayService", "Data/InternalDaemon", "Data/TempDir"};
 
-plist::Array strings(std::initializer_list<const char*> items) { return plist::Array(items.begin(), items.end()); }
 plist::Dictionary ents(const char* group) { return {{kAppGroups, strings({group})}}; }
-
-void writePlist(const std::string& path, const plist::Dictionary& dictionary) {
-  plist::Data bytes = plist::writeBinary(dictionary);
-  writeFile(path, std::string(bytes.begin(), bytes.end()));
-}
 
 // invalid, placeholder, registered by caller, data container class.
 using Row = std::array<int64_t, 4>;
@@ -47,18 +38,12 @@ std::string crashPointName(const ::testing::TestParamInfo<const char*>& info) {
   return name;
 }
 
-class MigrationTest : public DaemonFixture {
+class MigrationTest : public InstallerFixture {
  protected:
-  void SetUp() override {
-    DaemonFixture::SetUp();
-    if (!HasFatalFailure()) setOwnIdentity("com.example.migrator", {{QRTEntitlementAllowed, true}});
-  }
-
   std::string containers() const { return root + "/private/var/containers"; }
   std::string mobile() const { return root + "/private/var/mobile"; }
   std::string library() const { return root + "/private/var/root/Library/QuarterKit"; }
   std::string statusFile() const { return library() + "/qrt_migration_status.plist"; }
-  void reboot() { unlink((root + "/run/quarterd.fb_check").c_str()); }
 
   // Every container's metadata file by path, and its bytes.
   std::map<std::string, std::string> snapshot() const {
@@ -173,33 +158,6 @@ class MigrationTest : public DaemonFixture {
                  plist::Dictionary{{"org.legacy.selfreg", true}, {"org.legacy.legacy", false}}},
                 {"com.norvane.QuarterKit.PlaceholderEntitlements", plist::Dictionary{{"org.legacy.legacy", true}}}});
   }
-
-  // Starts the daemon on the armed point and expects it to die there.
-  void runUntilKilled(const std::string& point, const std::optional<uint64_t>& command) {
-    writeFile(root + "/run/quarterd.crashpoint", point + "\n");
-    if (command) {
-      startDaemon();
-      EXPECT_FALSE(call(*command)) << "the daemon answered instead of dying at " << point;
-    } else {  // the point lies in start-up itself: the socket never appears
-      daemon = fork();
-      ASSERT_GE(daemon, 0);
-      if (daemon == 0) {
-        execl(QRT_DAEMON_PATH, QRT_DAEMON_PATH, "--root", root.c_str(), "--log-level", "7", nullptr);
-        _exit(127);
-      }
-    }
-    int status = 0;
-    ASSERT_EQ(waitpid(daemon, &status, 0), daemon);
-    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL) << point << ": status " << status;
-    daemon = -1;
-    unlink((root + "/run/quarterd.crashpoint").c_str());
-  }
-  size_t count(const std::string& text) const {
-    const std::string log = logText();
-    size_t n = 0;
-    for (size_t at = log.find(text); at != std::string::npos; at = log.find(text, at + 1)) ++n;
-    return n;
-  }
 };
 
 // ---- code-signing imports, whole and interrupted at each step ----
@@ -209,7 +167,7 @@ class DataMigrationTest : public MigrationTest, public ::testing::WithParamInter
 TEST_P(DataMigrationTest, ImportsEveryOlderStoreOnce) {
   ASSERT_NO_FATAL_FAILURE(prepareLegacyStore());
   const std::string point = GetParam();
-  if (!point.empty()) { ASSERT_NO_FATAL_FAILURE(runUntilKilled(point, QRTCommandPerformDataMigration)); }
+  if (!point.empty()) { ASSERT_NO_FATAL_FAILURE(expectKilledAt(point, QRTCommandPerformDataMigration)); }
   startDaemon();
   ASSERT_EQ(codeOf(call(QRTCommandPerformDataMigration)), 1u);
 
@@ -291,7 +249,7 @@ TEST_P(BuildUpgradeTest, RunsOncePerNewBuild) {
   for (const char* name : {"old.log", "old.log.0", "old.log.3"}) writeFile(oldLogs + "/" + name, name);
   writePlist(root + "/etc/system-version.plist", {{"BuildVersion", "24B200"}, {"ReleaseType", "Internal"}});
   reboot();
-  if (*GetParam()) { ASSERT_NO_FATAL_FAILURE(runUntilKilled(GetParam(), std::nullopt)); }
+  if (*GetParam()) { ASSERT_NO_FATAL_FAILURE(expectKilledAt(GetParam(), std::nullopt)); }
   startDaemon();
 
   EXPECT_TRUE(logContains("Detected upgrade from 24A100 (Internal) to 24B200 (Internal)"));
@@ -308,14 +266,14 @@ TEST_P(BuildUpgradeTest, RunsOncePerNewBuild) {
   EXPECT_FALSE(exists(mobile() + "/Library/QuarterKit"));
 
   // The same build again, after a reboot and after a plain restart: no upgrade.
-  const size_t upgrades = count("Detected upgrade from");
+  const size_t upgrades = logCount("Detected upgrade from");
   reboot();
   restartDaemon();
   restartDaemon();
   EXPECT_TRUE(
       logContains("Current build version (24B200 / Internal) equal to last version recorded (24B200 / Internal); "
                   "skipping upgrade"));
-  EXPECT_EQ(count("Detected upgrade from"), upgrades);
+  EXPECT_EQ(logCount("Detected upgrade from"), upgrades);
   EXPECT_EQ(plist::find(*readPlist(statusFile()), "LastBuildInfo")->dictionary().at("BuildVersion"),
             plist::Value("24B200"));
 }

@@ -2,7 +2,6 @@
 // wipe built on it, and what a daemon killed at each step of a replace finds
 // when it starts again.
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -22,20 +21,6 @@ const char* kMarkerFile = "replace-marker";
 
 std::string markerAt(const std::string& containerPath) { return readFile(containerPath + "/" + kMarkerFile); }
 
-plist::Dictionary replaceKeys(const Container* old, const Container& fresh) {
-  plist::Dictionary keys{{QRTKeyNewContainerUUID, uuidData(fresh.uuid)},
-                         {QRTKeyNewContainerClass, 2},
-                         {QRTKeyNewContainerUserID, 501},
-                         {QRTKeyNewIdentifier, fresh.identifier}};
-  if (old) {
-    keys[QRTKeyOldContainerUUID] = uuidData(old->uuid);
-    keys[QRTKeyOldContainerClass] = 2;
-    keys[QRTKeyOldContainerUserID] = 501;
-    keys[QRTKeyOldIdentifier] = old->identifier;
-  }
-  return keys;
-}
-
 // The keys with one of them set to the value, or erased when there is none.
 plist::Dictionary changed(plist::Dictionary keys, const char* key, const std::optional<plist::Value>& value) {
   keys.erase(key);
@@ -43,13 +28,8 @@ plist::Dictionary changed(plist::Dictionary keys, const char* key, const std::op
   return keys;
 }
 
-class ReplaceTest : public DaemonFixture {
+class ReplaceTest : public InstallerFixture {
  protected:
-  void SetUp() override {
-    DaemonFixture::SetUp();
-    setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
-  }
-
   std::string replaceDir() const { return root + "/private/var/root/Library/QuarterKit/Replace"; }
   std::string stagingDir() const { return daemonCaches() + "/Staging"; }
   std::string movedIn(const Container& fresh) const { return appClassDir() + "/" + baseName(fresh.path); }
@@ -85,13 +65,7 @@ class ReplaceTest : public DaemonFixture {
 
   // Sends a request that must kill the daemon at the point, then starts it again unarmed.
   void crashAndRestart(uint64_t command, const plist::Dictionary& keys, const std::string& point) {
-    writeFile(root + "/run/quarterd.crashpoint", point + "\n");
-    EXPECT_FALSE(call(command, keys)) << "the daemon answered instead of dying at " << point;
-    int status = 0;
-    ASSERT_EQ(waitpid(daemon, &status, 0), daemon);
-    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL) << "status " << status;
-    daemon = -1;
-    unlink((root + "/run/quarterd.crashpoint").c_str());
+    expectKilledAt(point, command, keys);
     startDaemon();
   }
 

@@ -8,7 +8,6 @@
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -43,19 +42,6 @@ constexpr bool kSanitized = true;  // shadow memory and quarantines make residen
 #else
 constexpr bool kSanitized = false;
 #endif
-
-int rawConnect(const std::string& path) {
-  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (fd < 0) return -1;
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  memcpy(address.sun_path, path.c_str(), path.size() + 1);
-  if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
-    close(fd);
-    return -1;
-  }
-  return fd;
-}
 
 // The daemon closed it (it never writes unasked).
 bool closedByPeer(int fd) {
@@ -112,7 +98,7 @@ TEST_F(ResourcesTest, ConnectionsPerUserAreCappedAndOtherUsersAreStillServed) {
   if (child == 0) {
     rlimit files{4096, 4096};
     setrlimit(RLIMIT_NOFILE, &files);
-    if (setresgid(501, 501, 501) != 0 || setresuid(501, 501, 501) != 0) _exit(2);
+    becomeUser(501);
     std::vector<int> fds;
     for (int i = 0; i < 2000; ++i) {
       int fd = rawConnect(path);
@@ -203,7 +189,7 @@ TEST_F(ResourcesTest, OneUserCannotHoldTheWholeBudget) {
   pid_t child = fork();
   ASSERT_GE(child, 0);
   if (child == 0) {
-    if (setresgid(501, 501, 501) != 0 || setresuid(501, 501, 501) != 0) _exit(2);
+    becomeUser(501);
     std::vector<int> fds;
     for (int i = 0; i < 5; ++i) {
       fds.push_back(rawConnect(path));

@@ -17,8 +17,6 @@
 
 namespace {
 
-bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
-
 class ServiceTest : public DaemonFixture {
  protected:
   // Restarts the daemon with NOTIFY_SOCKET naming a datagram socket of ours.

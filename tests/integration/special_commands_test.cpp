@@ -36,31 +36,24 @@ TEST_F(SpecialCommandsTest, UserManagedAssetsStayInsideTheirDirectory) {
   const std::string outside = root + "/outside";
   ASSERT_EQ(mkdir(outside.c_str(), 0755), 0);
   writeFile(outside + "/file", "not yours");
-  pid_t pid = fork();
-  if (pid == 0) {
-    if (setresgid(501, 501, 501) != 0 || setresuid(501, 501, 501) != 0) _exit(2);
-    bool ok = mkdir((assets + "/sub").c_str(), 0755) == 0 &&
-              symlink(outside.c_str(), (assets + "/out_dir").c_str()) == 0 &&
-              symlink((outside + "/file").c_str(), (assets + "/out_file").c_str()) == 0 &&
-              symlink("sub", (assets + "/mid").c_str()) == 0 &&
-              symlink("../../../../../../outside", (assets + "/up").c_str()) == 0;
-    FILE* f = fopen((assets + "/sub/file").c_str(), "w");
-    _exit(ok && f && fclose(f) == 0 ? 0 : 1);
-  }
-  int status = 0;
-  ASSERT_EQ(waitpid(pid, &status, 0), pid);
-  ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  ASSERT_EQ(asUser(501,
+                   [&] {
+                     FILE* f = nullptr;
+                     return mkdir((assets + "/sub").c_str(), 0755) == 0 &&
+                            symlink(outside.c_str(), (assets + "/out_dir").c_str()) == 0 &&
+                            symlink((outside + "/file").c_str(), (assets + "/out_file").c_str()) == 0 &&
+                            symlink("sub", (assets + "/mid").c_str()) == 0 &&
+                            symlink("../../../../../../outside", (assets + "/up").c_str()) == 0 &&
+                            (f = fopen((assets + "/sub/file").c_str(), "w")) && fclose(f) == 0;
+                   }),
+            0);
 
-  struct Case {
-    const char* path;
-    uint64_t code;
-  };
-  for (Case c : {Case{"../../Library", 10}, Case{"sub/../sub/file", 10}, Case{"out_dir/file", 10}, Case{"out_dir", 10},
-                 Case{"out_file", 10}, Case{"mid/file", 10}, Case{"up", 10}, Case{"/etc/passwd", 10}, Case{"", 10}}) {
+  for (const char* path : {"../../Library", "sub/../sub/file", "out_dir/file", "out_dir", "out_file", "mid/file", "up",
+                           "/etc/passwd", ""}) {
     EXPECT_EQ(codeOf(call(QRTCommandDeleteUserManagedAsset,
-                          {{QRTKeyIdentifier, "com.example.app"}, {QRTKeySourcePath, c.path}})),
-              c.code)
-        << c.path;
+                          {{QRTKeyIdentifier, "com.example.app"}, {QRTKeySourcePath, path}})),
+              10u)
+        << path;
   }
   EXPECT_EQ(readFile(outside + "/file"), "not yours");
   EXPECT_TRUE(exists(root + "/etc/passwd"));

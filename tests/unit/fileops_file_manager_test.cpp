@@ -1,5 +1,7 @@
 // QRTFileManager against a real ext4 scratch directory (and tmpfs mounts where
-// the machine allows them).
+// the machine allows them): removal, creation, copies, listings, traversal,
+// property-list files, disk usage, protection classes and the tree dump; and
+// the error values it reports.
 #include <fcntl.h>
 #include <sys/acl.h>
 #include <sys/mount.h>
@@ -10,9 +12,11 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdlib>
+#include <stdexcept>
 #include <tuple>
 #include <vector>
 
+#include "Daemon/QRTError.h"
 #include "Daemon/fileops/QRTFileManager.h"
 #include "TempDir.h"
 #include "base/PlistCodec.h"
@@ -67,6 +71,13 @@ class FileManagerTest : public ::testing::Test {
     makeFile(rel + "/leaf");
   }
   bool exists(const std::string& rel) const { return fs::exists(fs::symlink_status(path(rel))); }
+  uint64_t allocated(const std::string& rel) const { return static_cast<uint64_t>(lstatOf(path(rel)).st_blocks) * 512; }
+  std::string logText() const { return fileText(tmp_ / "quarterd.log"); }
+  int32_t classOf(const std::string& rel) {
+    int32_t cls = -100;
+    EXPECT_TRUE(fm_.dataProtectionClassOfItemAtURL(url(rel), &cls, &error_)) << rel;
+    return cls;
+  }
   // The errno of a call that must fail: 0 when it succeeded.
   int errnoOf(bool succeeded) const { return succeeded ? 0 : error_ ? error_->code() : -1; }
   // A 16 MiB tmpfs at rel, or false where mounting is refused.
@@ -302,6 +313,121 @@ TEST(FileManagerStrings, DotDotComponentsAndFileSystemRepresentation) {
   for (const char* p : {"a/..b", "a/b../c/...", ""}) EXPECT_FALSE(containsDotDotPathComponents(p)) << p;
   EXPECT_EQ(stringWithFileSystemRepresentation("/a/bc", 4), "/a/b");
   EXPECT_EQ(stringWithFileSystemRepresentation(nullptr), "");
+}
+
+// ---- disk usage, protection classes and the tree dump ----
+
+using UsageTest = FileManagerTest;
+
+// Hard links in every directory, so that the walk's two threads both meet
+// the same inode; one twin lies outside the tree.
+TEST_F(UsageTest, CountsAllocatedBytesOfEverythingButDirectoriesAndEachInodeOnce) {
+  makeFile("c/empty", "");
+  makeFile("c/a/large", std::string(300000, 'x'));
+  makeFile("shared", std::string(20000, 'x'));
+  ASSERT_EQ(symlink(std::string(200, 'y').c_str(), path("c/a/link").c_str()), 0);  // a link with its own block
+  ASSERT_EQ(link(path("shared").c_str(), path("c/a/inside").c_str()), 0);
+  fs::create_directories(path("c/a/b/hollow/hollower"));
+  auto wide = [](int i) { return "c/wide/d" + std::to_string(i % 40) + "/f" + std::to_string(i); };
+  for (int i = 0; i < 300; ++i) makeFile(wide(i), std::string(50 * i, 'x'));
+  for (int i = 0; i < 40; ++i)
+    ASSERT_EQ(link(path("c/a/large").c_str(), path("c/wide/d" + std::to_string(i) + "/twin").c_str()), 0);
+  sync();
+  uint64_t expected = allocated("c/a/large") + allocated("c/a/link") + allocated("shared");
+  for (int i = 0; i < 300; ++i) expected += allocated(wide(i));
+  ASSERT_GT(allocated("c/a/link"), 0u);
+  EXPECT_EQ(fm_.diskUsageForURL(url("c")), expected);
+  EXPECT_EQ(fm_.diskUsageForURL(url("c")), expected);  // nothing remembered between walks
+  EXPECT_EQ(fm_.diskUsageForURL(url("c/a/b/hollow")), 0u);
+}
+
+TEST_F(UsageTest, RootThatIsNoDirectoryMeasuresZeroAndIsLogged) {
+  makeFile("file", std::string(5000, 'x'));
+  for (const char* rel : {"missing", "file"})
+    EXPECT_EQ(fm_.diskUsageForURL(url(rel)), 0u) << rel;  // links: hostile suite
+  EXPECT_EQ(fm_.diskUsageForURL(QRTURL()), 0u);
+}
+
+// An app can nest directories deeper than any path the kernel takes.
+TEST_F(UsageTest, ChildDirectoryBeyondPathMaxIsLeftOut) {
+  makeFile("c/counted", std::string(4000, 'x'));
+  const std::string name(200, 'n');
+  int fd = open(path("c").c_str(), O_RDONLY | O_DIRECTORY);
+  for (int depth = 0; depth < 25 && fd >= 0; ++depth) {
+    ASSERT_EQ(mkdirat(fd, name.c_str(), 0755), 0);
+    int next = openat(fd, name.c_str(), O_RDONLY | O_DIRECTORY);
+    close(fd);
+    fd = next;
+  }
+  ASSERT_GE(fd, 0);
+  int file = openat(fd, "deep", O_WRONLY | O_CREAT, 0644);
+  ASSERT_EQ(write(file, "deep", 4), 4);
+  close(file);
+  close(fd);
+  sync();
+  EXPECT_EQ(fm_.diskUsageForURL(url("c")), allocated("c/counted"));
+  fs::remove_all(path("c"));  // the TempDir's removal would stop at the long path
+}
+
+TEST_F(UsageTest, ClassIsSetAndReadOnFilesAndDirectoriesUnlessThePredicateDeclines) {
+  makeFile("f", std::string(10, 'x'));
+  fs::create_directories(path("d"));
+  EXPECT_EQ(classOf("f"), 0);  // no attribute yet
+  for (const char* rel : {"f", "d"}) {
+    ASSERT_TRUE(fm_.setDataProtectionClassOfItemAtURL(url(rel), -7, {}, &error_)) << error_->description();
+    EXPECT_EQ(classOf(rel), -7) << rel;
+    ASSERT_TRUE(fm_.setDataProtectionClassOfItemAtURL(url(rel), 4, {}, &error_));
+    EXPECT_EQ(classOf(rel), 4) << rel;
+  }
+  int32_t seen = -1;
+  EXPECT_TRUE(fm_.setDataProtectionClassOfItemAtURL(
+      url("f"), 2, [&](int32_t current) { return seen = current, false; }, &error_));
+  EXPECT_EQ(seen, 4);
+  EXPECT_EQ(classOf("f"), 4);
+  EXPECT_TRUE(fm_.setDataProtectionClassOfItemAtURL(
+      url("f"), 2, [](int32_t current) { return current == 4; }, &error_));
+  EXPECT_EQ(classOf("f"), 2);
+  EXPECT_FALSE(error_);
+  // Links are refused with the others in the hostile suite.
+  EXPECT_FALSE(fm_.setDataProtectionClassOfItemAtURL(url("missing"), 3, {}, &error_));
+  EXPECT_EQ(error_->code(), ENOENT);
+}
+
+TEST_F(UsageTest, DumpLogsEveryItemOnceAndErrorsForMissingRoots) {
+  makeFile("c/sub/file", std::string(10, 'x'));
+  ASSERT_EQ(symlink("nowhere", path("c/dangling").c_str()), 0);
+  fm_.printDirectoryStructureAtURL(url("c"));
+  fm_.printDirectoryStructureAtURL(url("missing"));
+  const std::string log = logText();
+  for (const char* rel : {"c", "c/sub", "c/sub/file", "c/dangling"}) {
+    const std::string line = "\tOrphaned File: " + path(rel) + "\n";
+    EXPECT_NE(log.find(line), std::string::npos) << rel;
+    EXPECT_EQ(log.find(line), log.rfind(line)) << rel << " logged twice";
+  }
+  EXPECT_NE(log.find("FTS returned error for " + path("missing") + " : No such file or directory"), std::string::npos);
+}
+
+// ---- error values: what they carry and the exception guard ----
+
+// The text a log line shows; without a format there is none, and negative codes widen by sign.
+TEST(QRTErrorTest, CarriesDescriptionOriginAndCause) {
+  QRTErrorRef cause = QRT_POSIX_ERROR(2, "stat of %@ failed: %s", std::string("/a"), "No such file");
+  EXPECT_EQ(cause->description(), "QRTPOSIXErrorDomain 2: stat of /a failed: No such file");
+  QRTErrorRef error = QRTCreateError("f", 1, QRTErrorDomain, -1, cause, nullptr, true, nullptr);
+  EXPECT_EQ(error->underlying(), cause);
+  EXPECT_EQ(error->localizedDescription(), std::nullopt);
+  EXPECT_EQ(error->description(), "QRTErrorDomain -1");
+  EXPECT_EQ(error->resultCode(), UINT64_MAX);
+}
+
+TEST(QRTErrorTest, GuardTurnsExceptionsIntoError40) {
+  EXPECT_EQ(QRT_GUARD([] {}), nullptr);
+  QRTErrorRef error = QRT_GUARD([] { throw std::runtime_error("boom"); });
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code(), 40);
+  EXPECT_NE(error->localizedDescription()->find("Got exception: "), std::string::npos);
+  EXPECT_NE(error->localizedDescription()->find(" : boom"), std::string::npos);
+  EXPECT_EQ(QRT_GUARD([] { throw 7; })->code(), 40);
 }
 
 }  // namespace

@@ -12,18 +12,21 @@ namespace {
 
 using Bytes = std::vector<uint8_t>;
 
-void header(Bytes& b, uint16_t itemType, uint16_t valueType, uint32_t value) {
-  uint8_t h[8];
-  memcpy(h, &itemType, 2);
-  memcpy(h + 2, &valueType, 2);
-  memcpy(h + 4, &value, 4);
-  b.insert(b.end(), h, h + 8);
+// One item: its header, then (when given) its data and padding.
+Bytes item(uint16_t itemType, uint16_t valueType, uint32_t value, const std::string& s = "", size_t pad = 0) {
+  Bytes b(8 + s.size() + pad);
+  memcpy(b.data(), &itemType, 2);
+  memcpy(b.data() + 2, &valueType, 2);
+  memcpy(b.data() + 4, &value, 4);
+  if (!s.empty()) memcpy(b.data() + 8, s.data(), s.size());
+  return b;
 }
-void data(Bytes& b, const std::string& s, size_t pad) {
-  b.insert(b.end(), s.begin(), s.end());
-  b.insert(b.end(), pad, 0);
+const Bytes kEnd(8, 0);
+Bytes cat(std::initializer_list<Bytes> parts) {
+  Bytes b;
+  for (const Bytes& p : parts) b.insert(b.end(), p.begin(), p.end());
+  return b;
 }
-void end(Bytes& b) { header(b, 0, 0, 0); }
 
 // Reads every item the way the upcall server does (value type 0 inline,
 // 1 string, 2 bytes) and answers 0 only when a whole end marker was reached.
@@ -52,74 +55,30 @@ int readAll(Bytes bytes, std::vector<std::string>* strings = nullptr) {
 }
 
 TEST(Packbuff, HostileBuffersAreRefused) {
-  struct Case {
+  const std::string six("abcde\0", 6);
+  const struct {
     const char* name;
     Bytes bytes;
     int expected;
+  } cases[] = {
+      {"empty", {}, ERANGE},
+      {"half an end marker", Bytes(4, 0), ERANGE},
+      {"header only", item(2, 1, 6), ERANGE},
+      {"data cut short", item(2, 1, 6, "abc"), ERANGE},
+      {"no end marker", item(2, 1, 6, six, 2), ERANGE},
+      {"end marker cut", cat({item(2, 1, 6, six, 2), Bytes(4, 0)}), ERANGE},
+      {"length over the end marker", cat({item(2, 1, 16, std::string("abcdefg\0", 8)), kEnd}), ERANGE},
+      {"length near 4 GiB", cat({item(3, 2, 0xFFFFFFFFu), kEnd}), ERANGE},
+      {"inline then cut", item(1, 0, 7), ERANGE},
+      {"string without NUL", cat({item(2, 1, 3, "abc", 5), kEnd}), EINVAL},
+      {"empty string", cat({item(2, 1, 0), kEnd}), EINVAL},
+      {"inner NUL", cat({item(2, 1, 4, std::string("a\0b\0", 4), 4), kEnd}), EINVAL},
+      {"unknown item type", cat({item(9, 1, 0), kEnd}), EINVAL},
+      {"inline read as string", cat({item(1, 1, 5), kEnd}), EINVAL},
+      // Bytes after the end marker are not read.
+      {"valid", cat({item(1, 0, 42), item(2, 1, 6, six, 2), item(3, 2, 0), kEnd, {1, 2, 3}}), 0},
   };
-  std::vector<Case> cases;
-  auto add = [&](const char* name, int expected, auto build) {
-    Bytes b;
-    build(b);
-    cases.push_back({name, b, expected});
-  };
-  add("empty", ERANGE, [](Bytes&) {});
-  add("half an end marker", ERANGE, [](Bytes& b) { b.assign(4, 0); });
-  add("header only", ERANGE, [](Bytes& b) { header(b, 2, 1, 6); });
-  add("data cut short", ERANGE, [](Bytes& b) {
-    header(b, 2, 1, 6);
-    data(b, "abc", 0);
-  });
-  add("no end marker", ERANGE, [](Bytes& b) {
-    header(b, 2, 1, 6);
-    data(b, std::string("abcde\0", 6), 2);
-  });
-  add("end marker cut", ERANGE, [](Bytes& b) {
-    header(b, 2, 1, 6);
-    data(b, std::string("abcde\0", 6), 2);
-    b.insert(b.end(), 4, 0);
-  });
-  add("length over the end marker", ERANGE, [](Bytes& b) {
-    header(b, 2, 1, 16);
-    data(b, std::string("abcdefg\0", 8), 0);
-    end(b);
-  });
-  add("length near 4 GiB", ERANGE, [](Bytes& b) {
-    header(b, 3, 2, 0xFFFFFFFFu);
-    end(b);
-  });
-  add("inline then cut", ERANGE, [](Bytes& b) { header(b, 1, 0, 7); });
-  add("string without NUL", EINVAL, [](Bytes& b) {
-    header(b, 2, 1, 3);
-    data(b, "abc", 5);
-    end(b);
-  });
-  add("empty string", EINVAL, [](Bytes& b) {
-    header(b, 2, 1, 0);
-    end(b);
-  });
-  add("inner NUL", EINVAL, [](Bytes& b) {
-    header(b, 2, 1, 4);
-    data(b, std::string("a\0b\0", 4), 4);
-    end(b);
-  });
-  add("unknown item type", EINVAL, [](Bytes& b) {
-    header(b, 9, 1, 0);
-    end(b);
-  });
-  add("inline read as string", EINVAL, [](Bytes& b) {
-    header(b, 1, 1, 5);
-    end(b);
-  });
-  add("valid", 0, [](Bytes& b) {
-    header(b, 1, 0, 42);
-    header(b, 2, 1, 6);
-    data(b, std::string("abcde\0", 6), 2);
-    header(b, 3, 2, 0);
-    end(b);
-    b.insert(b.end(), {1, 2, 3});  // bytes after the end marker are not read
-  });
-  for (const Case& c : cases) EXPECT_EQ(readAll(c.bytes), c.expected) << c.name;
+  for (const auto& c : cases) EXPECT_EQ(readAll(c.bytes), c.expected) << c.name;
 }
 
 TEST(Packbuff, PackedLayoutAndGrowth) {
@@ -144,13 +103,8 @@ TEST(Packbuff, PackedLayoutAndGrowth) {
   ASSERT_EQ(sb_packbuff_pack_string(pb, 8, "abcdefgh", 8), 0);
   ASSERT_EQ(sb_packbuff_pack_uint32(pb, 9, 0xdeadbeef), 0);
   EXPECT_EQ(sb_packbuff_pack_string(pb, 1, "abc", 2), EINVAL);  // no NUL at the length
-  Bytes expected;
-  header(expected, 2, 7, 6);
-  data(expected, std::string("hello\0", 6), 2);
-  header(expected, 2, 8, 9);
-  data(expected, std::string("abcdefgh\0", 9), 7);
-  header(expected, 1, 9, 0xdeadbeef);
-  end(expected);
+  const Bytes expected = cat({item(2, 7, 6, std::string("hello\0", 6), 2),
+                              item(2, 8, 9, std::string("abcdefgh\0", 9), 7), item(1, 9, 0xdeadbeef), kEnd});
   ASSERT_EQ(sb_packbuff_get_size(pb), expected.size());
   EXPECT_EQ(Bytes(static_cast<uint8_t*>(sb_packbuff_get_bytes(pb)),
                   static_cast<uint8_t*>(sb_packbuff_get_bytes(pb)) + expected.size()),

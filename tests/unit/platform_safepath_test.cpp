@@ -1,6 +1,7 @@
 // The safe path primitive against the arrangements a user can make in a
 // directory they own. A marker tree outside the device root stands for
-// everything the user may not change; no case may touch it.
+// everything the user may not change; no case may touch it. The sandbox
+// mappings, links under the same root, are checked here too.
 #include <fcntl.h>
 #include <unistd.h>
 
@@ -13,6 +14,7 @@
 #include "platform/Dir.h"
 #include "platform/FileIO.h"
 #include "platform/SafePath.h"
+#include "platform/SandboxMappings.h"
 
 namespace fs = std::filesystem;
 using namespace platform;
@@ -35,6 +37,9 @@ class SafePathTest : public ::testing::Test {
   std::string in(const std::string& rel) const { return user_ + "/" + rel; }
   void link(const std::string& target, const std::string& rel) {
     ASSERT_EQ(symlink(target.c_str(), in(rel).c_str()), 0) << rel;
+  }
+  std::string linkPath(uint32_t user, uint64_t type, const std::string& identifier) const {
+    return root_ + "/run/sandbox/mappings/" + std::to_string(user) + "/" + std::to_string(type) + "/" + identifier;
   }
 
   TempDir tmp_{"/var/tmp/qrt-safepath"};
@@ -127,6 +132,26 @@ TEST_F(SafePathTest, CreationAcceptsOwnOrRootDirectoriesAndGivesThemToTheOwner) 
   std::string relative;
   EXPECT_EQ(pathBelowDeviceRoot(root_ + "//home/./user/", &relative), 0);
   EXPECT_EQ(relative, "home/user");
+}
+
+// The sandbox mappings' links live under the device root too.
+using SandboxMappingsTest = SafePathTest;
+
+TEST_F(SandboxMappingsTest, BadIdentifiersAreRefused) {
+  for (const std::string& bad : {std::string(), std::string("."), std::string(".."), std::string("a/b"),
+                                 std::string("/abs"), std::string("nul\0byte", 8)}) {
+    EXPECT_EQ(sandboxSetStateItem(501, 1, bad, "/data/x"), EINVAL) << bad;
+    EXPECT_EQ(sandboxSetStateItem(501, 1, bad, nullptr), EINVAL) << bad;
+    EXPECT_FALSE(sandboxStateItem(501, 1, bad));
+  }
+  EXPECT_FALSE(fs::exists(root_ + "/run/sandbox"));
+}
+
+TEST_F(SandboxMappingsTest, ADirectoryInTheWayFailsCleanly) {
+  fs::create_directories(linkPath(501, 1, "com.example.app") + "/inner");
+  EXPECT_NE(sandboxSetStateItem(501, 1, "com.example.app", "/data/one"), 0);
+  EXPECT_NE(sandboxSetStateItem(501, 1, "com.example.app", nullptr), 0);
+  EXPECT_EQ(std::distance(fs::directory_iterator(linkPath(501, 1, "")), {}), 1);
 }
 
 }  // namespace

@@ -1,9 +1,12 @@
+// Container metadata files: what is written, what the reader accepts and in
+// which order it checks; and the lists of well-known container names.
 #include <gtest/gtest.h>
 
 #include <tuple>
 
 #include "Daemon/fileops/QRTFileManager.h"
 #include "Daemon/store/QRTMetadata.h"
+#include "Daemon/store/QRTWhitelist.h"
 #include "TempDir.h"
 
 namespace fs = std::filesystem;
@@ -165,6 +168,32 @@ TEST_F(MetadataTest, MissingPersonaIsTheExpectedUserAndClassPathMustBeTheParent)
   QRTURL nested = container("Data/Application/extra");
   writeRaw(nested, validDictionary(2));
   expectFailure(nested, 501, 29, urlMismatch(nested, "Data/Data/Application"));
+}
+
+// Each list answers only for its own class, and only for the exact name.
+TEST(WhitelistTest, EachListAnswersOnlyForItsClassAndTheExactName) {
+  QRTWhitelist lists({{"a.b", "dir.a"}}, {{"systemgroup.x", "dir.x"}});
+  const std::tuple<const char*, uint64_t, const char*> cases[] = {
+      {"a.b", 12, "dir.a"},
+      {"a.b", 13, nullptr},
+      {"systemgroup.x", 13, "dir.x"},
+      {"systemgroup.x", 12, nullptr},
+      {"A.b", 12, nullptr},
+      {"", 12, nullptr},
+      {"a.b", 2, nullptr},
+      {"systemgroup.x", 14, nullptr},
+      {"SystemGroup.x", 13, nullptr},
+  };
+  for (const auto& [identifier, cls, directory] : cases) {
+    EXPECT_EQ(lists.containerIdIsWellknown(identifier, cls), directory != nullptr) << identifier << " " << cls;
+    EXPECT_EQ(lists.wellknownContainerForId(identifier, cls),
+              directory ? std::optional<std::string>(directory) : std::nullopt)
+        << identifier << " " << cls;
+  }
+  EXPECT_FALSE(lists.systemContainerIdIsWellknown("systemgroup.x"));
+  EXPECT_FALSE(lists.systemGroupContainerIdIsWellknown("a.b"));
+  // The shared instance carries the shipped lists.
+  EXPECT_TRUE(QRTWhitelist::sharedWhitelist().containerIdIsWellknown("com.norvane.mapsd", 12));
 }
 
 }  // namespace
