@@ -75,6 +75,10 @@ int readLinkAt(int dirfd, const char* name, std::string* target, size_t limit) {
 
 int openSystemPathAt(int dirfd, const char* name) { return openat(dirfd, name, O_PATH | O_CLOEXEC); }
 
+int statSystemPathAt(int dirfd, const char* name, struct stat* st, bool followLink) {
+  return fstatat(dirfd, name, st, followLink ? 0 : AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
+}
+
 int chownOpened(int fd, uid_t uid, gid_t gid) { return fchown(fd, uid, gid) == 0 ? 0 : errno; }
 
 int chmodOpened(int fd, mode_t mode) { return fchmod(fd, mode) == 0 ? 0 : errno; }

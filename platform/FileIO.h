@@ -76,6 +76,9 @@ int readLinkAt(int dirfd, const char* name, std::string* target, size_t limit);
 // own system directories only, never for anything inside the device root.
 // -1 with errno on failure.
 int openSystemPathAt(int dirfd, const char* name);
+// fstatat of a system directory's entry, a final link followed or not; 0 or
+// errno. Like openSystemPathAt, for root's own system directories only.
+int statSystemPathAt(int dirfd, const char* name, struct stat* st, bool followLink);
 // fchown and fchmod of an open descriptor; 0 or an errno value.
 int chownOpened(int fd, uid_t uid, gid_t gid);
 int chmodOpened(int fd, mode_t mode);

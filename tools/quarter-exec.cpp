@@ -324,19 +324,37 @@ class Ruleset {
     struct stat dir;
     // /bin is /usr/bin on a merged /usr: one walk.
     if (abi_ <= 0 || stat(path, &dir) != 0 || !seen->insert({dir.st_dev, dir.st_ino}).second) return 0;
+    auto allowed = [&](const struct stat& st) {
+      return S_ISREG(st.st_mode) && (st.st_mode & 0111) && st.st_uid == 0 && !(st.st_mode & 022) &&
+             !excluded.count({st.st_dev, st.st_ino});
+    };
+    std::vector<std::string> elsewhere;
+    if (dir.st_uid == 0 && !(dir.st_mode & 022) && onlyAllowedFiles(path, allowed, &elsewhere)) {
+      // Every file would be allowed on its own, and only root adds more: one
+      // rule for the directory, and one for each file a link names elsewhere.
+      if (int err = allowSystemPath(path, kExecute | kReadFile)) return err;
+      for (const std::string& link : elsewhere) {
+        const int fd = open((std::string(path) + "/" + link).c_str(), O_PATH | O_CLOEXEC);
+        struct stat st;
+        const int err = fd >= 0 && fstat(fd, &st) == 0 && allowed(st) ? allow(fd, kExecute | kReadFile, false) : 0;
+        if (fd >= 0) close(fd);
+        if (err) return err;
+      }
+      return 0;
+    }
     return forEachFile(
         path, [](const char*) { return true; },
         [&](int fd, const struct stat& st) {
-          const bool program = S_ISREG(st.st_mode) && (st.st_mode & 0111) && st.st_uid == 0 && !(st.st_mode & 022);
-          if (!program || excluded.count({st.st_dev, st.st_ino}) || !seen->insert({st.st_dev, st.st_ino}).second)
-            return 0;
+          if (!allowed(st) || !seen->insert({st.st_dev, st.st_ino}).second) return 0;
           return allow(fd, kExecute | kReadFile, false);
         });
   }
 
   // The dynamic loaders (ld-*.so*), which the kernel executes for a program.
-  int allowLoaders(const char* path) {
-    if (abi_ <= 0) return 0;
+  int allowLoaders(const char* path, std::set<FileId>* seen) {
+    struct stat dir;
+    // /lib is /usr/lib on a merged /usr: one walk.
+    if (abi_ <= 0 || stat(path, &dir) != 0 || !seen->insert({dir.st_dev, dir.st_ino}).second) return 0;
     return forEachFile(
         path, [](const char* name) { return strncmp(name, "ld-", 3) == 0 && strstr(name, ".so"); },
         [&](int fd, const struct stat& st) {
@@ -347,6 +365,41 @@ class Ruleset {
   int restrictSelf() { return abi_ <= 0 || syscall(SYS_landlock_restrict_self, fd_, 0) == 0 ? 0 : errno; }
 
  private:
+  // Whether every entry of the directory is a link or a file that
+  // allowed(st) accepts (no hidden names), with the names of the links that
+  // lead to none of those files.
+  template <typename Allowed>
+  static bool onlyAllowedFiles(const char* path, Allowed allowed, std::vector<std::string>* elsewhere) {
+    int dirFd = open(path, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (dirFd < 0) return false;
+    DIR* listing = fdopendir(dirFd);
+    if (!listing) return close(dirFd), false;
+    std::set<FileId> files;
+    std::vector<std::string> links;
+    bool only = true;
+    while (dirent* entry = readdir(listing)) {
+      const std::string name = entry->d_name;
+      if (name == "." || name == "..") continue;
+      struct stat st;
+      if (name[0] == '.' || platform::statSystemPathAt(dirFd, name.c_str(), &st, false) != 0) {
+        only = false;
+      } else if (S_ISLNK(st.st_mode)) {
+        links.push_back(name);
+      } else if ((only = allowed(st))) {
+        files.insert({st.st_dev, st.st_ino});
+      }
+      if (!only) break;
+    }
+    for (const std::string& name : links) {
+      struct stat st;
+      if (only && platform::statSystemPathAt(dirFd, name.c_str(), &st, true) == 0 &&
+          !files.count({st.st_dev, st.st_ino}))
+        elsewhere->push_back(name);
+    }
+    closedir(listing);
+    return only;
+  }
+
   // fn(fd, st) for each entry of a system directory whose name wanted(name)
   // accepts, links followed (root's own); a missing directory is nothing to do.
   template <typename Wanted, typename Fn>
@@ -510,7 +563,7 @@ int run(const Options& options) {
     if (int err = rules.allowPrograms(dir, otherPrograms, &seen))
       return fail(kExitFailure, std::string("cannot open up ") + dir + ": " + strerror(err));
   for (const std::string& dir : libraryDirectories())
-    if (int err = rules.allowLoaders(dir.c_str()))
+    if (int err = rules.allowLoaders(dir.c_str(), &seen))
       return fail(kExitFailure, "cannot open up " + dir + ": " + strerror(err));
   for (const char* device : {"/dev/null", "/dev/zero", "/dev/full", "/dev/random", "/dev/urandom", "/dev/tty"})
     if (int err = rules.allowSystemPath(
