@@ -262,29 +262,4 @@ TEST(PlistParse, ChoosesFormatByLeadingBytes) {
   EXPECT_EQ(plist::parse(xml.data(), xml.size()), Value("a"));
 }
 
-TEST(PlistDescribe, ScalarsAndContainers) {
-  const std::pair<Value, const char*> cases[] = {
-      {Value(-42), "-42"},
-      {Value(UINT64_MAX), "18446744073709551615"},
-      {Value(Integer{UINT64_MAX, false}), "-1"},
-      {Value(2.5), "2.5"},
-      {Value(true), "1"},
-      {Value(Date{611411696.5}), "2020-05-17 12:34:56 +0000"},
-      {Value(Date{-3187296001.0}), "1899-12-31 23:59:59 +0000"},
-      {Value(Date{1e300}), "1e+300"},
-      {Value(Data{}), "<>"},
-      {Value(Data{0x0a, 0x1b, 0x2c, 0x3d, 0x4e}), "<0a1b2c3d 4e>"},
-      {Value(Array{}), "( )"},
-      {Value(Dictionary{}), "{ }"},
-      {Value(Array{"a", 1, Array{}}), "( a, 1, ( ) )"},
-  };
-  for (const auto& [value, text] : cases) EXPECT_EQ(plist::describe(value), text);
-  Value d(Dictionary{{"key", "value"},
-                     {"k2", Array{"/a/b:c.d-e_f$+", "x y", "", "q\"\\\n\x01"}},
-                     {"two words", Dictionary{{"n", 1}}}});
-  EXPECT_EQ(plist::describe(d),
-            "{ k2 = ( /a/b:c.d-e_f$+, \"x y\", \"\", \"q\\\"\\\\\\n\\001\" ); key = value; "
-            "\"two words\" = { n = 1; }; }");
-}
-
 }  // namespace

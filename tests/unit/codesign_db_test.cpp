@@ -74,30 +74,6 @@ TEST_F(CodeSigningDBTest, AddKeepsRowIdReplacesDataAndNeverDropsChildren) {
   EXPECT_EQ(sql("SELECT count(*) FROM code_signing_data"), 2);
 }
 
-TEST_F(CodeSigningDBTest, DeleteCascadesAndCountsRows) {
-  ASSERT_TRUE(add("parent", entryWith("one", std::vector<std::string>{"a", "b"})));
-  QRTErrorRef error;
-  EXPECT_FALSE(db->deleteCodeSigningEntryWithIdentifier("unknown", &error));
-  EXPECT_EQ(error->code(), QRTErrorDatabase);
-  EXPECT_EQ(error->underlying()->code(), QRTErrorUnexpectedChangeCount);
-  EXPECT_FALSE(db->deleteCodeSigningEntryWithIdentifier(std::nullopt, &error));
-  EXPECT_EQ(error->code(), QRTErrorInvalidArgument);
-  EXPECT_TRUE(db->deleteCodeSigningEntryWithIdentifier("parent", nullptr));
-  EXPECT_EQ(sql("SELECT (SELECT count(*) FROM code_signing_info) + (SELECT count(*) FROM code_signing_data) + "
-                "(SELECT count(*) FROM child_bundles)"),
-            0);
-}
-
-TEST_F(CodeSigningDBTest, InvalidateMarksParentAndChildrenAndToleratesUnknown) {
-  ASSERT_TRUE(add("parent", entryWith("p", std::vector<std::string>{"kid"})));
-  ASSERT_TRUE(add("kid", entryWith("k")));
-  ASSERT_TRUE(add("alone", entryWith("a")));
-  EXPECT_TRUE(db->invalidateCodeSigningWithIdentifier("unknown", nullptr));
-  EXPECT_TRUE(db->invalidateCodeSigningForIdentifierAndAllChildren("parent", nullptr));
-  EXPECT_TRUE(db->invalidateCodeSigningForIdentifierAndAllChildren("alone", nullptr));
-  for (const char* id : {"parent", "kid", "alone"}) EXPECT_TRUE(get(id)->invalid) << id;
-}
-
 TEST_F(CodeSigningDBTest, UndecodableRowsFailLookupAndVanishFromEnumeration) {
   ASSERT_TRUE(add("good", entryWith("g")));
   ASSERT_TRUE(add("array", entryWith("a")));

@@ -210,15 +210,6 @@ TEST_F(FileManagerTest, CopyKeepsDataModeOwnerXattrsAclsAndLinks) {
   EXPECT_EQ(errnoOf(fm_.copyItemAtURL(url("src"), url("src/sub/inside"), &error_)), EINVAL);
 }
 
-TEST_F(FileManagerTest, MissingSourceDependsOnFailIfSrcMissing) {
-  EXPECT_TRUE(fm_.copyItemIfExistsAtURL(url("nothing"), url("c"), &error_));
-  EXPECT_TRUE(fm_.moveItemIfExistsAtURL(url("nothing"), url("m"), &error_));
-  EXPECT_FALSE(error_);
-  EXPECT_EQ(errnoOf(fm_.copyItemAtURL(url("nothing"), url("c"), &error_)), ENOENT);
-  EXPECT_EQ(errnoOf(fm_.moveItemAtURL(url("nothing"), url("m"), &error_)), ENOENT);
-  EXPECT_FALSE(exists("c") || exists("m"));
-}
-
 TEST_F(FileManagerTest, TemporaryDirectoriesAreUniqueAndPrivate) {
   error_ = QRT_POSIX_ERROR(1, "stale");
   auto a = fm_.createTemporaryDirectoryInDirectoryURL(url(""), "job.", &error_);
@@ -252,41 +243,6 @@ TEST_F(FileManagerTest, ListingSkipsHiddenNamesAndExistenceAnswersFalseWhenUnsur
   EXPECT_FALSE(fm_.itemExistsAtURL(url("d/file/below")) || fm_.itemDoesNotExistAtURL(url("d/file/below")));
 }
 
-TEST_F(FileManagerTest, TraversalSeesDirectoriesTwiceAndCanSkipOrStop) {
-  makeFile("r/f");
-  makeFile("r/skip/hidden");
-  ASSERT_EQ(symlink("f", path("r/l").c_str()), 0);
-  std::vector<std::string> seen;
-  auto record = [&](QRTTraversalEntry& e, QRTErrorRef*) {
-    static const char* kinds[] = {"pre", "post", "file", "link", "other"};
-    std::string rel = std::string(e.path).substr(root_.size() + 1);
-    seen.push_back(std::string(kinds[static_cast<int>(e.kind)]) + ":" + rel + ":" + std::to_string(e.level));
-    e.skipDescendants = rel == "r/skip";
-    return true;
-  };
-  ASSERT_TRUE(fm_._traverseDirectory(url("r"), &error_, record));
-  std::sort(seen.begin() + 1, seen.end() - 1);
-  EXPECT_EQ(seen, (std::vector<std::string>{"pre:r:0", "file:r/f:1", "link:r/l:1", "post:r/skip:1", "pre:r/skip:1",
-                                            "post:r:0"}));
-  int calls = 0;
-  EXPECT_FALSE(fm_._traverseDirectory(url("r"), &error_, [&](QRTTraversalEntry&, QRTErrorRef* e) {
-    *e = QRT_POSIX_ERROR(EIO, "visitor gave up");
-    return ++calls < 2;
-  }));
-  EXPECT_EQ(calls, 2);
-  EXPECT_EQ(error_->localizedDescription(), "visitor gave up");
-
-  makeDeepTree();
-  int pre = 0, post = 0, files = 0;
-  ASSERT_TRUE(fm_._traverseDirectory(url("deep"), &error_, [&](QRTTraversalEntry& e, QRTErrorRef*) {
-    pre += e.kind == QRTTraversalEntry::Kind::DirectoryPre;
-    post += e.kind == QRTTraversalEntry::Kind::DirectoryPost;
-    files += e.kind == QRTTraversalEntry::Kind::File && e.level == 151;
-    return true;
-  }));
-  EXPECT_EQ(std::tuple(pre, post, files), std::tuple(151, 151, 1));
-}
-
 // Planted links and FIFOs in place of the file: the adversarial suite.
 TEST_F(FileManagerTest, PropertyListFilesRoundTripAndRejectOtherShapes) {
   plist::Dictionary dict{{"Identifier", "com.example.app"}, {"Class", 2}};
@@ -306,13 +262,6 @@ TEST_F(FileManagerTest, PropertyListFilesRoundTripAndRejectOtherShapes) {
     EXPECT_EQ(error_->domain(), domain) << rel;
     EXPECT_EQ(error_->code(), code) << rel;
   }
-}
-
-TEST(FileManagerStrings, DotDotComponentsAndFileSystemRepresentation) {
-  for (const char* p : {"a/../b", "..", "/a/b/.."}) EXPECT_TRUE(containsDotDotPathComponents(p)) << p;
-  for (const char* p : {"a/..b", "a/b../c/...", ""}) EXPECT_FALSE(containsDotDotPathComponents(p)) << p;
-  EXPECT_EQ(stringWithFileSystemRepresentation("/a/bc", 4), "/a/b");
-  EXPECT_EQ(stringWithFileSystemRepresentation(nullptr), "");
 }
 
 // ---- disk usage, protection classes and the tree dump ----
@@ -391,20 +340,6 @@ TEST_F(UsageTest, ClassIsSetAndReadOnFilesAndDirectoriesUnlessThePredicateDeclin
   // Links are refused with the others in the hostile suite.
   EXPECT_FALSE(fm_.setDataProtectionClassOfItemAtURL(url("missing"), 3, {}, &error_));
   EXPECT_EQ(error_->code(), ENOENT);
-}
-
-TEST_F(UsageTest, DumpLogsEveryItemOnceAndErrorsForMissingRoots) {
-  makeFile("c/sub/file", std::string(10, 'x'));
-  ASSERT_EQ(symlink("nowhere", path("c/dangling").c_str()), 0);
-  fm_.printDirectoryStructureAtURL(url("c"));
-  fm_.printDirectoryStructureAtURL(url("missing"));
-  const std::string log = logText();
-  for (const char* rel : {"c", "c/sub", "c/sub/file", "c/dangling"}) {
-    const std::string line = "\tOrphaned File: " + path(rel) + "\n";
-    EXPECT_NE(log.find(line), std::string::npos) << rel;
-    EXPECT_EQ(log.find(line), log.rfind(line)) << rel << " logged twice";
-  }
-  EXPECT_NE(log.find("FTS returned error for " + path("missing") + " : No such file or directory"), std::string::npos);
 }
 
 // ---- error values: what they carry and the exception guard ----

@@ -131,18 +131,6 @@ TEST_F(LogTest, RotationShiftsOlderFilesUpAndDropsTheOldest) {
   }
 }
 
-TEST_F(LogTest, FailedRotationStepIsReportedOnStandardError) {
-  fs::create_directories(logPath() + ".0/occupied");  // no file can be renamed over it
-  ASSERT_TRUE(logOpen(logPath(), "com.norvane.quarterd", kLogNotice));
-  logSetRotation(1, 100);
-  testing::internal::CaptureStderr();
-  for (int i = 0; i < 5; ++i) logWrite(kLogNotice, "f", "a line long enough to rotate " + std::to_string(i));
-  std::string report = testing::internal::GetCapturedStderr();
-  EXPECT_NE(report.find("Log rotation failed to rename " + logPath() + ": Is a directory"), std::string::npos)
-      << report;
-  logClose();
-}
-
 // ---- user database and identities ----
 
 TEST_F(DeviceRootTest, UserDatabaseReadsTheRootsFilesOnEveryLookup) {
@@ -280,28 +268,6 @@ TEST_F(DeviceRootTest, PeerCredentialsOfAnExitedPeerAreNotVerified) {
 }
 
 // ---- device state ----
-
-// The watcher and the properties the daemon acts on are exercised end to end
-// by the data-protection integration tests; here, the reading of odd files.
-TEST_F(DeviceRootTest, DeviceStateFilesDefaultWhenMissingOrMistyped) {
-  EXPECT_FALSE(deviceIsInternalBuild() || systemVersionRecord());
-  EXPECT_EQ(deviceLockState(), 0);
-  writePlist(at("/etc/device-properties.plist"), plist::Dictionary{{"InternalBuild", "yes"}, {"MultiUserFlags", true}});
-  EXPECT_FALSE(deviceIsInternalBuild()) << "a value of another type is the default";
-  EXPECT_EQ(deviceMultiUserFlags(), 0u);
-  writePlist(at("/etc/device-properties.plist"), plist::Dictionary{{"MultiUserFlags", 0x80000000ull}});
-  EXPECT_EQ(deviceMultiUserFlags(), 0x80000000u);
-  writePlist(at("/etc/system-version.plist"), plist::Dictionary{{"BuildVersion", "21A100"}});
-  ASSERT_TRUE(systemVersionRecord());
-  EXPECT_EQ(plist::find(*systemVersionRecord(), "BuildVersion")->string(), "21A100");
-  writePlist(at("/etc/system-version.plist"), plist::Array{"not", "a", "dictionary"});
-  EXPECT_FALSE(systemVersionRecord());
-  writeFile(at("/run/device/lockstate"), "3");
-  EXPECT_EQ(deviceLockState(), 3);
-  writeFile(at("/run/device/lockstate"), "locked");
-  EXPECT_NE(deviceLockState(), 0) << "unreadable counts as neither unlocked...";
-  EXPECT_NE(deviceLockState(), 1) << "...nor plainly locked";
-}
 
 TEST_F(DeviceRootTest, FirstBootMarkerHoldsThisBootsId) {
   ASSERT_TRUE(createFirstBootMarker()) << strerror(errno);

@@ -95,13 +95,6 @@ TEST(StoreLayoutGlobal, RemovedDirectoriesComeBack) {
   expectDirectory(host("/private/var/mobile/Containers/Data/Application"), 501);
 }
 
-TEST(StoreLayoutGlobal, MigrationFileExistsOnlyDirectlyInTheLibrary) {
-  appendFile(config().libraryDirectory().path() + "/qrt_marker", "x");
-  EXPECT_TRUE(config().migrationFileExistsWithName("qrt_marker"));
-  EXPECT_FALSE(config().migrationFileExistsWithName("qrt_absent"));
-  EXPECT_FALSE(config().migrationFileExistsWithName("../QuarterKit/qrt_marker"));
-}
-
 TEST(StoreLayoutClasses, ClassDirectoriesAndOwnersTransientOnesToo) {
   for (uint64_t cls = 1; cls <= 13; ++cls) {
     const bool global = cls == 1 || cls == 3 || cls == 5 || cls == 8 || cls >= 12;

@@ -56,22 +56,6 @@ class MetadataTest : public ::testing::Test {
   TempDir root_{"/tmp/qrt-metadata"};
 };
 
-TEST_F(MetadataTest, RoundTripKeepsInfoAndAssetsDirectoryButNotTheFlags) {
-  QRTURL url = container("Data/Application");
-  plist::Dictionary info{{"com.norvane.Emplacer.ContentProtectionClass", 3}, {"tags", plist::Array{"a", "b"}}};
-  QRTMetadata original(502, QRTUUID::random(), 2, "com.example.app", info, url, std::string("Assets"));
-  QRTMetadataRef metadata = original.withTransient(true)->withExisted(true);
-  EXPECT_FALSE(original.transient() || original.existed()) << "a copy leaves its original alone";
-  ASSERT_TRUE(metadata->writeMetadataToDiskWithError(nullptr));
-  auto read = expectSuccess(url, 502);
-  ASSERT_TRUE(read);
-  EXPECT_EQ(std::tuple(read->identifier(), read->uuid(), read->containerClass(), read->uid(), read->url()),
-            std::tuple("com.example.app", metadata->uuid(), 2u, 502u, url));
-  EXPECT_EQ(read->info(), info);
-  EXPECT_EQ(read->userManagedAssetsDirName(), "Assets");
-  EXPECT_FALSE(read->transient() || read->existed());
-}
-
 TEST_F(MetadataTest, WriteFailureIs34AndUnreadableFileIs12) {
   QRTURL missing = QRTURL::fileURL(root_ / "missing/" + kUUID, true);
   QRTMetadata metadata(501, QRTUUID::random(), 2, "com.example.app", std::nullopt, missing, std::nullopt);
