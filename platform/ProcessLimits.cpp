@@ -7,6 +7,8 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <mutex>
+#include <set>
 
 namespace platform {
 
@@ -34,7 +36,14 @@ constexpr int kIoprioClassShift = 13;
 constexpr int kIoprioClassIdle = 3;
 }  // namespace
 
+std::mutex gIdleLock;
+std::set<pid_t> gIdleThreads;  // under gIdleLock
+bool gIdleEnded = false;       // under gIdleLock
+
 int makeThisThreadIdle() {
+  std::lock_guard<std::mutex> hold(gIdleLock);
+  if (gIdleEnded) return 0;
+  gIdleThreads.insert(gettid());
   int error = 0;
   sched_param param{};
   if (sched_setscheduler(0, SCHED_IDLE, &param) != 0) error = errno;
@@ -42,6 +51,22 @@ int makeThisThreadIdle() {
   if (syscall(SYS_ioprio_set, kIoprioWhoProcess, 0, kIoprioClassIdle << kIoprioClassShift) != 0 && error == 0)
     error = errno;
   return error;
+}
+
+void forgetThisIdleThread() {
+  std::lock_guard<std::mutex> hold(gIdleLock);
+  gIdleThreads.erase(gettid());
+}
+
+void endIdlePriority() {
+  std::lock_guard<std::mutex> hold(gIdleLock);
+  gIdleEnded = true;
+  sched_param param{};
+  for (pid_t tid : gIdleThreads) {
+    sched_setscheduler(tid, SCHED_OTHER, &param);
+    syscall(SYS_ioprio_set, kIoprioWhoProcess, tid, 0);  // class none: follows the processor's
+  }
+  gIdleThreads.clear();
 }
 
 }  // namespace platform

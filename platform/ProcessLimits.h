@@ -26,5 +26,11 @@ bool returnLargeAllocationsToSystem(size_t bytes);
 // background work runs only when nothing else wants either. Threads it starts
 // inherit both. The errno of the first refusal, or 0.
 int makeThisThreadIdle();
+// Forgets the calling thread, made idle before, as it ends.
+void forgetThisIdleThread();
+// Every idle thread back to the normal policy and I/O class, and no more
+// made idle: at termination, background work still running must finish in
+// time, not wait for a machine that is never idle.
+void endIdlePriority();
 
 }  // namespace platform

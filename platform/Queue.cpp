@@ -126,6 +126,7 @@ void serialWorker(std::shared_ptr<SerialState> state) {
   std::deque<Work> dropped;
   dropped.swap(state->items);
   lock.unlock();
+  if (state->priority == QueuePriority::Idle) forgetThisIdleThread();
 }
 
 class SerialQueue final : public QueueBase {

@@ -221,6 +221,7 @@ bool startListener() {
 
 void stopListener() {
   platform::serviceNotifyStopping("Stopping: finishing running requests");
+  platform::endIdlePriority();  // a death-row pass under way finishes at normal priority
   std::lock_guard<std::mutex> hold(gListenerLock);
   gTerminating = true;
   if (gListener) gListener->stopAccepting();
