@@ -238,6 +238,7 @@ TEST_F(QuarterctlTest, StatusMetricsAndTheLogLevelOfTheRunningDaemon) {
   auto status = call(QRTCommandStatus);
   ASSERT_TRUE(status) << "not entitled: the test program has no identity";
   EXPECT_EQ(plist::find(*status, QRTReplyKeyError)->integer().bits, 55u);
+  ASSERT_EQ(run("deathrow").status, 0) << "start-up's pass, at idle priority, is over first";
   const std::string json = run("--json status").out;
   for (const std::string part :
        {"\"containers\":{\"addon-bundle\":0,", "\"app-data\":2,", "\"deathrow\":{\"bytes\":0,\"items\":0}",
