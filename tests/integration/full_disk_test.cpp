@@ -59,7 +59,7 @@ class FullDiskTest : public InstallerFixture {
     size_t start = 0, files = 0;
     for (size_t end; (end = out.find('\n', start)) != std::string::npos; start = end + 1, ++files) {
       const std::string path = out.substr(start, end - start);
-      EXPECT_TRUE(readPlist(path)) << path;
+      EXPECT_TRUE(readPlist(path) || !exists(path)) << path;  // death row's may go meanwhile
     }
     EXPECT_GT(files, 0u);
   }
