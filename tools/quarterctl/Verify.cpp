@@ -50,12 +50,13 @@ int verify(G g, A a) {
                 }
                 table.print();
               }
-              std::cout << reply.u64(QRTReplyKeyVerifiedContainers) << " containers checked, ";
+              const uint64_t checked = reply.u64(QRTReplyKeyVerifiedContainers);
+              std::cout << checked << (checked == 1 ? " container" : " containers") << " checked, ";
               if (all.empty())
                 std::cout << "nothing found\n";
               else
-                std::cout << all.size() << " findings" << (repair ? ", " + std::to_string(repaired) + " repaired" : "")
-                          << '\n';
+                std::cout << all.size() << (all.size() == 1 ? " finding" : " findings")
+                          << (repair ? ", " + std::to_string(repaired) + " repaired" : "") << '\n';
             },
             [](const qk::Reply& reply) -> nlohmann::json {
               nlohmann::json list = nlohmann::json::array();
