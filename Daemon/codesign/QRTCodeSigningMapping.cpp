@@ -319,8 +319,8 @@ bool QRTCodeSigningMapping::groupReferenceCountsMatchDatabase() {
 void QRTCodeSigningMapping::_onQueue_loadSnapshot() {
   QRTCodeSigningMappingSnapshot::Entries entries;
   QRTErrorRef error = codeSigningMappingDB->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
-      [&](const std::string& identifier, const QRTCodeSigningEntry& entry) {
-        entries[identifier] = std::make_shared<const QRTCodeSigningEntry>(entry);
+      [&](const std::string& identifier, QRTCodeSigningEntry&& entry) {
+        entries.emplace(identifier, std::make_shared<const QRTCodeSigningEntry>(std::move(entry)));
       });
   if (error) {
     // A row left out would answer "none": look-ups go to the database instead.

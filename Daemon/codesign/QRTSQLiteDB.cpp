@@ -50,6 +50,10 @@ constexpr const char* kSelectAll =
     "code_signing_info.registered_by_caller, code_signing_info.data_container_class, "
     "code_signing_info.code_signing_id_text FROM code_signing_info, code_signing_data WHERE code_signing_info.id "
     "= code_signing_data.cs_info_id;";
+// Every child row with its parent's identifier, in the order each parent's look-up gives them.
+constexpr const char* kSelectAllChildren =
+    "SELECT code_signing_info.code_signing_id_text, child_bundles.child_code_signing_id_text FROM child_bundles, "
+    "code_signing_info WHERE child_bundles.parent_id=code_signing_info.id ORDER BY child_bundles.id;";
 constexpr const char* kSelectChildren =
     "SELECT child_bundles.child_code_signing_id_text FROM child_bundles, code_signing_info WHERE "
     "code_signing_info.code_signing_id_text = ? AND child_bundles.parent_id=code_signing_info.id;";
@@ -453,7 +457,23 @@ bool QRTSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::st
 }
 
 QRTErrorRef QRTSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(
-    const std::function<void(const std::string& identifier, const QRTCodeSigningEntry& entry)>& block) {
+    const std::function<void(const std::string& identifier, QRTCodeSigningEntry&& entry)>& block) {
+  // The children first, in one pass, rather than one look-up for each entry.
+  std::unordered_map<std::string, std::vector<std::string>> children;
+  {
+    Statement statement(*statements_, kSelectAllChildren);
+    if (!statement.prepared())
+      return DB_ERROR(nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_, sqlite3_errmsg(db_));
+    for (;;) {
+      const int rc = sqlite3_step(statement.get());
+      if (rc == SQLITE_DONE) break;
+      if (rc != SQLITE_ROW) return DB_ERROR(nullptr, "sqlite3_step for %@ failed: %s", url_, sqlite3_errmsg(db_));
+      const unsigned char* parent = sqlite3_column_text(statement.get(), 0);
+      const unsigned char* child = sqlite3_column_text(statement.get(), 1);
+      if (parent && child)
+        children[reinterpret_cast<const char*>(parent)].emplace_back(reinterpret_cast<const char*>(child));
+    }
+  }
   Statement statement(*statements_, kSelectAll);
   if (!statement.prepared())
     return DB_ERROR(nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_, sqlite3_errmsg(db_));
@@ -473,14 +493,9 @@ QRTErrorRef QRTSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(
       continue;
     }
     const std::string identifier(reinterpret_cast<const char*>(text));
-    QRTErrorRef childFailure;
-    std::optional<std::vector<std::string>> children = childIdentifiersForParentIdentifier(identifier, &childFailure);
-    if (!children && !isError(childFailure, QRTErrorNotInDatabase)) {
-      result = DB_ERROR(childFailure, "Error retrieving childBundleIds: %@", childFailure);
-      continue;
-    }
-    entry->childBundleIdentifiers = std::move(children);
-    block(identifier, *entry);
+    if (auto found = children.find(identifier); found != children.end())
+      entry->childBundleIdentifiers = std::move(found->second);
+    block(identifier, std::move(*entry));
   }
   return result;
 }

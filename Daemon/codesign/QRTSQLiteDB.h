@@ -40,7 +40,7 @@ class QRTSQLiteDB {
   bool invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier, QRTErrorRef* error);
   // The last error met, or null when every row went through.
   QRTErrorRef enumerateIdentifiersAndCodeSigningInfoUsingBlock(
-      const std::function<void(const std::string& identifier, const QRTCodeSigningEntry& entry)>& block);
+      const std::function<void(const std::string& identifier, QRTCodeSigningEntry&& entry)>& block);
   // Error 67 (not logged) when the parent has no children.
   std::optional<std::vector<std::string>> childIdentifiersForParentIdentifier(const std::string& identifier,
                                                                               QRTErrorRef* error);
