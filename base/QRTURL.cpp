@@ -4,6 +4,8 @@ namespace {
 
 // Collapses repeated slashes and drops a trailing one ("/" stays "/").
 std::string normalisePath(std::string_view path) {
+  // Most paths are already in the form: one copy, no character-by-character rebuild.
+  if (path.find("//") == std::string_view::npos && (path.size() <= 1 || path.back() != '/')) return std::string(path);
   std::string out;
   out.reserve(path.size());
   for (char c : path) {
