@@ -58,13 +58,7 @@ void expectDirectory(const std::string& path, uint32_t owner) {
   EXPECT_EQ(st.st_gid, owner) << path;
 }
 
-int32_t protectionClassOf(const QRTURL& url) {
-  uint8_t b[4] = {};
-  if (getxattr(url.path().c_str(), "trusted.com.norvane.protection-class", b, sizeof b) != sizeof b) return 0;
-  return static_cast<int32_t>(b[0] | b[1] << 8 | b[2] << 16 | static_cast<uint32_t>(b[3]) << 24);
-}
-
-TEST(StoreLayoutGlobal, GettersCreateTheirDirectories) {
+TEST(StoreLayoutGlobal, GettersCreateTheirDirectoriesAgainOnceRemoved) {
   // Where they lie is checked end to end through the paths the daemon hands out.
   EXPECT_EQ(config().currentMobileUserId(), 501u);
   for (const QRTURL& url : {config().sharedContainersDirectory(), config().bundleDirectory(), config().logDirectory(),
@@ -73,17 +67,16 @@ TEST(StoreLayoutGlobal, GettersCreateTheirDirectories) {
                             config().pendingUpdatesDirectory()})
     expectDirectory(url.path(), 0);
   for (const QRTURL& url : {config().logDirectory(), config().cachesDirectory(), config().libraryDirectory()})
-    EXPECT_EQ(protectionClassOf(url), 4) << url.path();
-  EXPECT_EQ(protectionClassOf(config().stagingDirectory()), 0);
+    EXPECT_EQ(protectionClassOf(url.path()), 4) << url.path();
+  EXPECT_EQ(protectionClassOf(config().stagingDirectory().path()), 0);
 
   // Each of the three levels belongs to the installer.
   config().transientBundleDirectory();
   const std::string installer = host("/private/var/emplacerd");
   for (const char* level : {"/Library", "/Library/Caches", "/Library/Caches/com.norvane.quarterd"})
     expectDirectory(installer + level, 33);
-}
 
-TEST(StoreLayoutGlobal, RemovedDirectoriesComeBack) {
+  // Removed directories come back.
   QRTURL staging = config().stagingDirectory();
   fs::remove_all(staging.path());
   EXPECT_EQ(config().stagingDirectory(), staging);
