@@ -135,7 +135,7 @@ TEST_F(FileManagerTest, RemovalNeverFollowsLinksAndCopesWithMissingAndDeepTrees)
   EXPECT_FALSE(exists("deep"));
 }
 
-TEST_F(FileManagerTest, CreateSetsModeOnlyWhenCreatingAndOwnerAndClassWhenAsked) {
+TEST_F(FileManagerTest, CreationSetsModeOwnerAndClassAsAskedButNotClassOneWhileLocked) {
   EXPECT_TRUE(fm_.createDirectoryAtURL(url("a/b"), true, 0750, &error_));
   EXPECT_EQ(fs::status(path("a")).permissions(), fs::perms(0750));
   EXPECT_EQ(fs::status(path("a/b")).permissions(), fs::perms(0750));
@@ -151,9 +151,8 @@ TEST_F(FileManagerTest, CreateSetsModeOnlyWhenCreatingAndOwnerAndClassWhenAsked)
   EXPECT_EQ(st.st_mode & 07777, 0711u);
   EXPECT_EQ(protectionClassOf(path("a")), 3);
   EXPECT_EQ(protectionClassOf(path("a/b")), 0);
-}
 
-TEST_F(FileManagerTest, WhileLockedClassOneCanNeitherBeSetNorLeft) {
+  // While locked, class 1 can neither be set nor left.
   platform::setDeviceRoot(tmp_.path());
   fs::create_directories(tmp_ / "run/device");
   EXPECT_TRUE(fm_.createDirectoryAtURL(url("was-one"), false, 0755, 1, &error_));

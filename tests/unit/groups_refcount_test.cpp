@@ -101,7 +101,7 @@ TEST_F(GroupRefcountTest, ContainerGoesWithTheLastProgramNamingIt) {
   }
 }
 
-TEST_F(GroupRefcountTest, ReorderingOrRepeatingChangesNothing) {
+TEST_F(GroupRefcountTest, ReorderingRepeatingOrReconcilingKeepsNamedGroups) {
   ASSERT_EQ(registerGroups("com.example.order", {"group.order.a", "group.order.b"}), 1u);
   ASSERT_EQ(paths("com.example.order").size(), 2u);
   const uint64_t before = mapping().generation();
@@ -114,9 +114,8 @@ TEST_F(GroupRefcountTest, ReorderingOrRepeatingChangesNothing) {
       QRTGroupTypeApplication, mapping().groupReferenceCounts(QRTGroupTypeApplication));
   EXPECT_TRUE(present("group.order.a"));
   EXPECT_TRUE(present("group.order.b"));
-}
 
-TEST_F(GroupRefcountTest, ReconcileRemovesOnlyUnnamedGroups) {
+  // Reconciliation removes only groups no program names.
   uint64_t code = 1;
   ASSERT_TRUE(QRTClientConnection::sharedClientConnection().createOrLookupContainerForUser(
       {501, 7, std::string("group.nobody")}, QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code));

@@ -81,7 +81,7 @@ TEST(Packbuff, HostileBuffersAreRefused) {
   for (const auto& c : cases) EXPECT_EQ(readAll(c.bytes), c.expected) << c.name;
 }
 
-TEST(Packbuff, PackedLayoutAndGrowth) {
+TEST(Packbuff, PackedLayoutGrowthAndReadBack) {
   sb_packbuff* pb = sb_packbuff_new(8);  // small blocks: each item grows the buffer
   ASSERT_NE(pb, nullptr);
   EXPECT_EQ(sb_packbuff_get_size(pb), 8u);  // the end marker alone
@@ -105,9 +105,8 @@ TEST(Packbuff, PackedLayoutAndGrowth) {
   EXPECT_EQ(sb_packbuff_pack_uint32(pb, 0, 2), 0);
   EXPECT_EQ(sb_packbuff_pack_uint32(pb, 0, 3), ENOTSUP);
   sb_packbuff_free(pb);
-}
 
-TEST(Packbuff, ReadBackKeysAndCursor) {
+  // Read back: keys and the cursor.
   sb_packbuff* out = sb_packbuff_new(0);  // 0: the default block size
   ASSERT_EQ(sb_packbuff_pack_key_with_string_value(out, 3, "group.one", 4, "/g/one"), 0);
   ASSERT_EQ(sb_packbuff_pack_uint32(out, 0, 1), 0);

@@ -88,7 +88,7 @@ TEST(StoreLayoutGlobal, GettersCreateTheirDirectoriesAgainOnceRemoved) {
   expectDirectory(host("/private/var/mobile/Containers/Data/Application"), 501);
 }
 
-TEST(StoreLayoutClasses, ClassDirectoriesAndOwnersTransientOnesToo) {
+TEST(StoreLayoutClasses, ClassDirectoriesAndOwnersAndInvalidClasses) {
   for (uint64_t cls = 1; cls <= 13; ++cls) {
     const bool global = cls == 1 || cls == 3 || cls == 5 || cls == 8 || cls >= 12;
     const uint32_t user = !global ? 502 : cls >= 12 ? 499 : 33;
@@ -109,9 +109,8 @@ TEST(StoreLayoutClasses, ClassDirectoriesAndOwnersTransientOnesToo) {
     expectDirectory(url->path(), owner);
   }
   expectDirectory(host(userCaches + "/Temp"), 502);
-}
 
-TEST(StoreLayoutClasses, InvalidClassesGiveNothingAndGlobalBaseURLsAreNotCreated) {
+  // Invalid classes give nothing, and global base URLs are not created.
   auto mobile = config().getPerUserConfigurationForUserId(501);
   for (uint64_t cls : {uint64_t{0}, uint64_t{14}, UINT64_MAX}) {
     EXPECT_FALSE(config().globalContainerBaseURLWithContentClass(cls, true)) << cls;
