@@ -56,15 +56,8 @@ class FileManagerTest : public ::testing::Test {
     fs::create_directories(fs::path(path(rel)).parent_path());
     std::ofstream(path(rel)) << content;
   }
-  // deep/d/d/.../leaf, 150 levels: deeper than a walk keeps directories open at once.
-  void makeDeepTree() {
-    std::string rel = "deep";
-    for (int i = 0; i < 150; ++i) rel += "/d";
-    makeFile(rel + "/leaf");
-  }
   bool exists(const std::string& rel) const { return fs::exists(fs::symlink_status(path(rel))); }
   uint64_t allocated(const std::string& rel) const { return static_cast<uint64_t>(lstatOf(path(rel)).st_blocks) * 512; }
-  std::string logText() const { return fileText(tmp_ / "quarterd.log"); }
   int32_t classOf(const std::string& rel) {
     int32_t cls = -100;
     EXPECT_TRUE(fm_.dataProtectionClassOfItemAtURL(url(rel), &cls, &error_)) << rel;
@@ -130,7 +123,9 @@ TEST_F(FileManagerTest, RemovalNeverFollowsLinksAndCopesWithMissingAndDeepTrees)
   EXPECT_FALSE(exists("tree"));
   EXPECT_TRUE(exists("outside/precious"));
 
-  makeDeepTree();
+  std::string deep = "deep";  // 150 levels: deeper than a walk keeps directories open at once
+  for (int i = 0; i < 150; ++i) deep += "/d";
+  makeFile(deep + "/leaf");
   EXPECT_TRUE(fm_.removeItemAtURL(url("deep"), &error_));
   EXPECT_FALSE(exists("deep"));
 }
