@@ -78,7 +78,7 @@ class LogTest : public DeviceRootTest {
 
 // Only exactly these lines: the debug line written before the level was
 // lowered must not be among them.
-TEST_F(LogTest, LinesCarryTimeProgramPidLevelAndFunctionAndGoToStderrOnRequest) {
+TEST_F(LogTest, LinesCarryTheirPrefixGoToStderrOnRequestAndRotate) {
   ASSERT_TRUE(logOpen(logPath(), "com.norvane.quarterd", kLogNotice));
   EXPECT_TRUE(logEnabled(kLogNotice));
   EXPECT_FALSE(logEnabled(kLogDebug));
@@ -103,11 +103,9 @@ TEST_F(LogTest, LinesCarryTimeProgramPidLevelAndFunctionAndGoToStderrOnRequest) 
   EXPECT_TRUE(logEnabled(kLogDebug)) << "without a file every line goes to the system log";
   EXPECT_FALSE(logOpen(root_ / "missing/quarterd.log", "com.norvane.quarterd", kLogNotice));
   EXPECT_TRUE(logEnabled(kLogDebug));
-}
 
-// quarterd.log is newest, then .0, .1, ...; files beyond the count (even
-// stale ones left by a larger count) are deleted.
-TEST_F(LogTest, RotationShiftsOlderFilesUpAndDropsTheOldest) {
+  // quarterd.log is newest, then .0, .1, ...; files beyond the count (even
+  // stale ones left by a larger count) are deleted.
   for (uint32_t count : {1u, 3u}) {
     SCOPED_TRACE(count);
     const std::string stale[] = {logPath() + "." + std::to_string(count), logPath() + "." + std::to_string(count + 1)};
@@ -117,11 +115,11 @@ TEST_F(LogTest, RotationShiftsOlderFilesUpAndDropsTheOldest) {
     for (int i = 0; i < 40; ++i) logWrite(kLogNotice, "f", "line " + std::to_string(1000 + i));
     int newer = 2000;
     for (int i = -1; i < static_cast<int>(count); ++i) {
-      std::string content = fileText(i < 0 ? logPath() : logPath() + "." + std::to_string(i));
-      EXPECT_LE(content.size(), 300u) << i;
-      size_t at = content.find("line ");
+      const std::string file = fileText(i < 0 ? logPath() : logPath() + "." + std::to_string(i));
+      EXPECT_LE(file.size(), 300u) << i;
+      size_t at = file.find("line ");
       ASSERT_NE(at, std::string::npos) << i;
-      int first = std::stoi(content.substr(at + 5));
+      int first = std::stoi(file.substr(at + 5));
       EXPECT_LT(first, newer) << i;
       EXPECT_GT(first, 1000) << i << ": the oldest lines were deleted";
       newer = first;
@@ -133,7 +131,13 @@ TEST_F(LogTest, RotationShiftsOlderFilesUpAndDropsTheOldest) {
 
 // ---- user database and identities ----
 
-TEST_F(DeviceRootTest, UserDatabaseReadsTheRootsFilesOnEveryLookup) {
+plist::Dictionary identityEntry(const std::string& executable, const std::string& signing, bool entitled) {
+  plist::Dictionary entry{{"Executable", executable}, {"SigningIdentifier", signing}};
+  if (entitled) entry["Entitlements"] = plist::Dictionary{{QRTEntitlementAllowed, true}};
+  return entry;
+}
+
+TEST_F(DeviceRootTest, UserDatabaseAndIdentityRegistryAreReadOnEveryLookup) {
   writeFile(at("/etc/passwd"),
             "# accounts\nbroken:x:12\nbadid:x:abc:1::/x:/bin/sh\n"
             "_installer:x:33:33::/private/var/emplacerd:/bin/false\n"
@@ -155,18 +159,7 @@ TEST_F(DeviceRootTest, UserDatabaseReadsTheRootsFilesOnEveryLookup) {
   fs::remove(at("/etc/passwd"));
   EXPECT_FALSE(userByName("mobile"));
 
-  setDeviceRoot("/");  // the system's own database
-  EXPECT_EQ(userById(0).value_or(UserAccount{}).name, "root");
-  EXPECT_TRUE(groupByName("root"));
-}
-
-plist::Dictionary identityEntry(const std::string& executable, const std::string& signing, bool entitled) {
-  plist::Dictionary entry{{"Executable", executable}, {"SigningIdentifier", signing}};
-  if (entitled) entry["Entitlements"] = plist::Dictionary{{QRTEntitlementAllowed, true}};
-  return entry;
-}
-
-TEST_F(DeviceRootTest, IdentityRegistryLastSortedFileWinsAndChangesAreSeen) {
+  // The identity registry: the last file in sorted order wins.
   fs::path registry = at("/etc/quarterd/identities");
   writePlist(registry / "10-a.plist", identityEntry("/usr/bin/tool", "com.example.a", false));
   writePlist(registry / "20-b.plist", identityEntry("/usr/bin/tool", "com.example.b", true));
@@ -201,6 +194,9 @@ TEST_F(DeviceRootTest, IdentityRegistryLastSortedFileWinsAndChangesAreSeen) {
   EXPECT_EQ(identityForExecutable("/usr/bin/tool")->signingIdentifier, "com.example.b");
   fs::remove_all(registry);
   EXPECT_FALSE(identityForExecutable("/usr/bin/tool")->signingIdentifier);
+  setDeviceRoot("/");  // the system's own database
+  EXPECT_EQ(userById(0).value_or(UserAccount{}).name, "root");
+  EXPECT_TRUE(groupByName("root"));
 }
 
 // The entry is the file the peer runs; system-level entitlements go only to
