@@ -1,7 +1,6 @@
 #include <gtest/gtest.h>
 
 #include <cstdint>
-#include <set>
 
 #include "base/QRTFormat.h"
 #include "base/QRTURL.h"
