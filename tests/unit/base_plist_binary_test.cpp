@@ -101,7 +101,7 @@ TEST(PlistBinaryForeign, ReadsAnotherWritersFileExactly) {
   EXPECT_EQ(*v, expected);
 }
 
-TEST(PlistBinaryWriter, UsesSmallestEncodingsAndUniquesValues) {
+TEST(PlistBinaryEncodings, WriterUsesTheSmallestAndUniquesValuesReaderAcceptsOthers) {
   auto objectBytes = [](const Value& v) {
     Data d = plist::writeBinary(v);
     return Data(d.begin() + 8, d.end() - 32 - trailerOf(d).offsetSize);
@@ -126,9 +126,8 @@ TEST(PlistBinaryWriter, UsesSmallestEncodingsAndUniquesValues) {
   t = trailerOf(plist::writeBinary(Value(big)));
   EXPECT_EQ(t.refSize, 2);
   EXPECT_EQ(t.offsetSize, 2);
-}
 
-TEST(PlistBinaryReader, AcceptsOtherValidEncodings) {
+  // The reader accepts the other valid encodings.
   // A 4-byte real, a negative value as a 16-byte integer, and a UTF-16 key.
   Data negative{0x14};
   negative.resize(16, 0xff), negative.push_back(0xfd);

@@ -38,7 +38,7 @@ std::string entitlementsFile() {
   return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
-TEST(PlistXMLTest, ReadsSigningToolDocument) {
+TEST(PlistXMLTest, ReadsSigningToolDocumentEveryElementTypeAndDecodesTextLikeXML) {
   std::string error;
   auto v = parseText(entitlementsFile(), &error);
   ASSERT_TRUE(v) << error;
@@ -53,9 +53,8 @@ TEST(PlistXMLTest, ReadsSigningToolDocument) {
                                           {"since", Date{614538000}},
                                           {"token", Data{0, 1, 2, 3, 4, 5, 6, 7, 8, 9}}}},
                 }));
-}
 
-TEST(PlistXMLTest, ReadsEveryElementTypeAndDecodesTextLikeXML) {
+  // Every element type, one at a time.
   const std::pair<std::string, Value> cases[] = {
       {"<string/>", ""},
       {"<string>  keeps\n spaces </string>", "  keeps\n spaces "},

@@ -120,7 +120,7 @@ TEST(SerialQueue, DestroyingDropsSuspendedWorkAndMayHappenOnItsOwnWorker) {
   EXPECT_TRUE(released.waitFor(1));
 }
 
-TEST(ConcurrentQueue, GrowsWhileItemsBlock) {
+TEST(Queues, ConcurrentOneGrowsAndBothKeepSuspendedWorkAndFinishPendingWork) {
   auto queue = makeConcurrentQueue("test.concurrent");
   constexpr int kItems = 8;
   Gate inside, finished;
@@ -134,9 +134,8 @@ TEST(ConcurrentQueue, GrowsWhileItemsBlock) {
   }
   ASSERT_TRUE(finished.waitFor(kItems));
   EXPECT_EQ(sawAll, kItems);
-}
 
-TEST(BothQueues, SuspendKeepsItemsAndNestsAndDestroyingRunsOrWaitsForPendingWork) {
+  // Both kinds: suspending keeps items and nests; destroying runs or waits for pending work.
   for (bool serial : {true, false}) {
     Gate ran;
     auto queue = serial ? makeSerialQueue("test.suspend") : makeConcurrentQueue("test.suspend");

@@ -127,7 +127,7 @@ TEST(StoreLayoutClasses, ClassDirectoriesAndOwnersAndInvalidClasses) {
   EXPECT_FALSE(fs::exists(url->path()));
 }
 
-TEST(StoreLayoutPerUser, HomesAndBackupPaths) {
+TEST(StoreLayoutPerUser, HomesAndBackupPathsAndUsersWithoutAccountOrHome) {
   auto mobile = config().getPerUserConfigurationForCurrentMobileUser();
   ASSERT_TRUE(mobile->systemGroupContainerBackupDirectory());
   EXPECT_FALSE(fs::exists(host("/private/var/mobile/Library/Backup"))) << "named, not made";
@@ -143,9 +143,8 @@ TEST(StoreLayoutPerUser, HomesAndBackupPaths) {
   EXPECT_FALSE(second->existsUserBaseDirectory());
   ASSERT_TRUE(second->userBaseDirectory());
   EXPECT_TRUE(second->existsUserBaseDirectory());
-}
 
-TEST(StoreLayoutPerUser, UserWithoutAccountOrHomeGivesNothingUntilAdded) {
+  // A user without an account or a home gets nothing until added.
   for (uint32_t uid : {777u, 505u}) {
     auto user = config().getPerUserConfigurationForUserId(uid);
     EXPECT_FALSE(user->userHomeDirectory() || user->existsUserBaseDirectory() || user->transientDirectory() ||

@@ -56,7 +56,7 @@ class MetadataTest : public ::testing::Test {
   TempDir root_{"/tmp/qrt-metadata"};
 };
 
-TEST_F(MetadataTest, WriteFailureIs34AndUnreadableFileIs12) {
+TEST_F(MetadataTest, WriteFailureIs34OverBudgetIs38AndUnreadableFileIs12) {
   QRTURL missing = QRTURL::fileURL(root_ / "missing/" + kUUID, true);
   QRTMetadata metadata(501, QRTUUID::random(), 2, "com.example.app", std::nullopt, missing, std::nullopt);
   QRTErrorRef error;
@@ -72,11 +72,9 @@ TEST_F(MetadataTest, WriteFailureIs34AndUnreadableFileIs12) {
     if (*content) std::ofstream(metadataFile(url).path()) << content;
     expectFailure(url, 501, 12, "Failed to read metadata at URL " + url.path());
   }
-}
 
-// What the reader would refuse is never written: over 1 MiB, over 100,000
-// objects (a shared value counts at every use) or over 32 levels.
-TEST_F(MetadataTest, InfoBeyondTheBudgetIsRefusedAndNotWritten) {
+  // What the reader would refuse is never written: over 1 MiB, over 100,000
+  // objects (a shared value counts at every use) or over 32 levels.
   QRTURL url = container("Data/Application");
   writeRaw(url, validDictionary());
   plist::Value deep = 1;
