@@ -308,6 +308,10 @@ Requests onApp(std::vector<uint64_t> commands) {
     for (uint64_t c : commands) t.send(c, selector(t.app));
   };
 }
+// The app container staged, then a death-row pass.
+void stageThenPass(T& t) {
+  t.sends({{QRTCommandStageContainerForDelete, stageKeys(t.app)}, {QRTCommandDeleteContainersOnDeathRow, {}}});
+}
 // The command on a container by name, then a death-row pass.
 Requests byNameThenPass(uint64_t command, Container T::*c = &T::app) {
   return [=](T& t) { t.sends({{command, byName(t.*c)}, {QRTCommandDeleteContainersOnDeathRow, {}}}); };
@@ -452,11 +456,7 @@ const Case kCases[] = {
         [](const T& t) { return t.root + "/private/var/root/Library"; },
         [](T& t) { t.send(QRTCommandCreateOrLookupContainer, T::creation("com.example.new", true)); }),
     // The container directory itself.
-    swapped(
-        "ContainerLinkToOutside_StageAndPass", appPath, outsideDir,
-        [](T& t) {
-          t.sends({{QRTCommandStageContainerForDelete, stageKeys(t.app)}, {QRTCommandDeleteContainersOnDeathRow, {}}});
-        }),
+    swapped("ContainerLinkToOutside_StageAndPass", appPath, outsideDir, stageThenPass),
     swapped("ContainerLinkToOtherUsersContainer_DeleteAndPass", appPath, otherContainer,
             byNameThenPass(QRTCommandDeleteContainer)),
     swapped("ContainerLinkToOtherUsersContainer_RegenerateUUID", appPath, otherContainer,
@@ -527,9 +527,7 @@ const Case kCases[] = {
        }
        ASSERT_EQ(system(("chown -R 501:501 " + t.in(t.app, "Documents")).c_str()), 0);
      },
-     [](T& t) {
-       t.sends({{QRTCommandStageContainerForDelete, stageKeys(t.app)}, {QRTCommandDeleteContainersOnDeathRow, {}}});
-     },
+     stageThenPass,
      // The staged container stays the user's, and reachable, inside the death-row directory.
      [](const T& t) {
        static int i = 0;
