@@ -51,7 +51,6 @@ TEST(QRTFormatTest, ObjectConversionsBadFormatsAndMissingArguments) {
   EXPECT_EQ(QRTFormat("%@ %s %@ %@", Described(), Described(), shared, std::shared_ptr<Described>()),
             "described described described (null)");
 
-  // Bad formats and missing arguments.
   EXPECT_EQ(QRTFormat("%d %s %@ %f %x|%c|%p"), "0 (null) (null) 0.000000 0||0x0");
   EXPECT_EQ(QRTFormat("%*d", 5), "    0");
   EXPECT_EQ(QRTFormat("%n %k %1$s", 1), "%n %k %1$s");

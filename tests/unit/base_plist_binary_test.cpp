@@ -127,7 +127,6 @@ TEST(PlistBinaryEncodings, WriterUsesTheSmallestAndUniquesValuesReaderAcceptsOth
   EXPECT_EQ(t.refSize, 2);
   EXPECT_EQ(t.offsetSize, 2);
 
-  // The reader accepts the other valid encodings.
   // A 4-byte real, a negative value as a 16-byte integer, and a UTF-16 key.
   Data negative{0x14};
   negative.resize(16, 0xff), negative.push_back(0xfd);
@@ -173,7 +172,6 @@ TEST(PlistBinaryReader, BoundsExpansionOfSharedReferencesAndNesting) {
   EXPECT_GE(footprint, 999'001u * sizeof(Value));
   EXPECT_LE(footprint, plist::kMaxFootprint);
 
-  // The nesting limit.
   auto nested = [](size_t levels) {
     std::vector<Data> objects;
     for (size_t i = 0; i < levels; ++i) {
@@ -221,7 +219,6 @@ TEST(PlistBinaryReader, RefusesBadStructureAndUnsupportedOrInvalidObjects) {
   EXPECT_EQ(refusal(assemble({{0x13, 1, 2}})), "object out of range");
   EXPECT_EQ(refusal(assemble({{0x5F, 0x14, 0}})), "bad length marker");
 
-  // Unsupported or invalid objects.
   Data wide{0x14, 0, 0, 0, 0, 0, 0, 0, 1}, onesThenPositive{0x14};
   wide.resize(17, 0), onesThenPositive.resize(9, 0xff), onesThenPositive.resize(17, 0);
   const std::pair<std::vector<Data>, const char*> cases[] = {

@@ -54,7 +54,6 @@ TEST(PlistXMLTest, ReadsSigningToolDocumentEveryElementTypeAndDecodesTextLikeXML
                                           {"token", Data{0, 1, 2, 3, 4, 5, 6, 7, 8, 9}}}},
                 }));
 
-  // Every element type, one at a time.
   const std::pair<std::string, Value> cases[] = {
       {"<string/>", ""},
       {"<string>  keeps\n spaces </string>", "  keeps\n spaces "},
@@ -147,7 +146,6 @@ TEST(PlistXMLTest, RefusesMalformedAndHostileDocumentsAndEnforcesLimits) {
     EXPECT_FALSE(error.empty()) << text;
   }
 
-  // The nesting and object limits.
   EXPECT_TRUE(parseBody(nested(kMaxDepth)));
   std::string error;
   EXPECT_FALSE(parseBody(nested(kMaxDepth + 1), &error));

@@ -122,7 +122,6 @@ TEST_F(FileManagerACLTest, TopLevelACLAloneForOneOrEveryContainerAndRefusesMissi
   // Links are refused with the others in the hostile suite.
   EXPECT_EQ(codeOf(fm.setTopLevelSystemContainerACLAtURL(dirURL(base_ + "/missing"), &error)), 63);
 
-  // Every container of a class.
   std::string classDir = base_ + "/Data/System";
   std::filesystem::create_directories(classDir + "/one/sub");
   std::filesystem::create_directories(classDir + "/two");
@@ -133,7 +132,7 @@ TEST_F(FileManagerACLTest, TopLevelACLAloneForOneOrEveryContainerAndRefusesMissi
   EXPECT_TRUE(fm.standardizeAllSystemContainerACLsAtURL(dirURL(base_ + "/nothing"), &error));
 }
 
-TEST_F(FileManagerACLTest, WithoutTheGroupNothingIsChanged) {
+TEST_F(FileManagerACLTest, WithoutTheGroupNothingIsChangedAndOwnershipResetSetsModesByKind) {
   writeGroups(false);
   const auto before = std::tuple(aclText(root_ + "/a/b/file"), ownerAndMode(root_ + "/a/b/file"));
   EXPECT_EQ(codeOf(fm.standardizeACLsAtURL(dirURL(root_), false, &error)), 63);
@@ -146,9 +145,7 @@ TEST_F(FileManagerACLTest, WithoutTheGroupNothingIsChanged) {
 
   EXPECT_EQ(std::tuple(aclText(root_ + "/a/b/file"), ownerAndMode(root_ + "/a/b/file")), before);
   EXPECT_EQ(aclText(root_, ACL_TYPE_DEFAULT), "none");
-}
 
-TEST_F(FileManagerACLTest, OwnershipResetChangesLinksThemselvesAndSetsModesByKind) {
   ASSERT_EQ(chmod((root_ + "/a/b").c_str(), 0700), 0);
   ASSERT_EQ(chmod((root_ + "/a/b/file").c_str(), 0666), 0);
   ASSERT_TRUE(fm.standardizeOwnershipAtURL(dirURL(root_), 501, 502, &error));

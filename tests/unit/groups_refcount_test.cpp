@@ -114,7 +114,6 @@ TEST_F(GroupRefcountTest, ContainerGoesWithTheLastProgramNamingItAndNoSooner) {
   EXPECT_TRUE(present("group.order.a"));
   EXPECT_TRUE(present("group.order.b"));
 
-  // Reconciliation removes only groups no program names.
   uint64_t code = 1;
   ASSERT_TRUE(QRTClientConnection::sharedClientConnection().createOrLookupContainerForUser(
       {501, 7, std::string("group.nobody")}, QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code));

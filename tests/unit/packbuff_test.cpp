@@ -106,7 +106,6 @@ TEST(Packbuff, PackedLayoutGrowthAndReadBack) {
   EXPECT_EQ(sb_packbuff_pack_uint32(pb, 0, 3), ENOTSUP);
   sb_packbuff_free(pb);
 
-  // Read back: keys and the cursor.
   sb_packbuff* out = sb_packbuff_new(0);  // 0: the default block size
   ASSERT_EQ(sb_packbuff_pack_key_with_string_value(out, 3, "group.one", 4, "/g/one"), 0);
   ASSERT_EQ(sb_packbuff_pack_uint32(out, 0, 1), 0);

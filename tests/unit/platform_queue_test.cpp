@@ -161,7 +161,7 @@ TEST(Queues, ConcurrentOneGrowsAndBothKeepSuspendedWorkAndFinishPendingWork) {
   }
 }
 
-TEST(MainQueue, RunsOnlyInsideRunMainLoop) {
+TEST(MainQueue, RunsOnlyInsideRunMainLoopAndTransactionWaitsEndAtZero) {
   std::atomic<bool> ran{false};
   std::thread::id runner;
   mainQueue().async([&] {
@@ -178,9 +178,7 @@ TEST(MainQueue, RunsOnlyInsideRunMainLoop) {
   stopper.join();
   EXPECT_TRUE(ran);
   EXPECT_EQ(runner, std::this_thread::get_id());
-}
 
-TEST(QueueTransactions, WaitEndsWhenTheCountFallsToZero) {
   ASSERT_EQ(transactionCount(), 0);
   transactionBegin();
   transactionBegin();

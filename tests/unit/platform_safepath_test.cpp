@@ -144,7 +144,6 @@ TEST_F(SandboxMappingsTest, BadIdentifiersAndADirectoryInTheWayFailCleanly) {
     EXPECT_FALSE(sandboxStateItem(501, 1, bad));
   }
   EXPECT_FALSE(fs::exists(root_ + "/run/sandbox"));
-  // A directory in the way fails cleanly.
   fs::create_directories(linkPath(501, 1, "com.example.app") + "/inner");
   EXPECT_NE(sandboxSetStateItem(501, 1, "com.example.app", "/data/one"), 0);
   EXPECT_NE(sandboxSetStateItem(501, 1, "com.example.app", nullptr), 0);

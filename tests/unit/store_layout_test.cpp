@@ -76,7 +76,6 @@ TEST(StoreLayoutGlobal, GettersCreateTheirDirectoriesAgainOnceRemoved) {
   for (const char* level : {"/Library", "/Library/Caches", "/Library/Caches/com.norvane.quarterd"})
     expectDirectory(installer + level, 33);
 
-  // Removed directories come back.
   QRTURL staging = config().stagingDirectory();
   fs::remove_all(staging.path());
   EXPECT_EQ(config().stagingDirectory(), staging);

@@ -17,7 +17,6 @@ const char* const kUUID = "0A1B2C3D-4E5F-4071-8293-A4B5C6D7E8F9";
 
 class MetadataTest : public ::testing::Test {
  protected:
-  // A container directory root/<classPath>/<uuid>, created.
   QRTURL container(const std::string& classPath, const std::string& name = kUUID) {
     QRTURL url = QRTURL::fileURL(root_ / classPath + "/" + name, true);
     fs::create_directories(url.path());
@@ -34,7 +33,6 @@ class MetadataTest : public ::testing::Test {
             {"QRTMetadataPersona", 501}};
   }
 
-  // Reads and expects a failure with the code and the description.
   void expectFailure(const QRTURL& url, uint32_t forUser, int32_t code, const std::string& description) {
     QRTErrorRef error;
     EXPECT_EQ(QRTMetadata::readAndValidateMetadataAtUrl(url, forUser, true, &error), nullptr);
