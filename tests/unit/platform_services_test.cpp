@@ -50,7 +50,6 @@ class DeviceRootTest : public ::testing::Test {
     logSetRotation(1, 0);
     setDeviceRoot("/");
   }
-  fs::path at(const std::string& devicePath) const { return hostPath(devicePath); }
 
   TempDir root_{"/tmp/qrt-platform"};
 };
@@ -138,11 +137,11 @@ plist::Dictionary identityEntry(const std::string& executable, const std::string
 }
 
 TEST_F(DeviceRootTest, UserDatabaseAndIdentityRegistryAreReadOnEveryLookup) {
-  writeFile(at("/etc/passwd"),
+  writeFile(hostPath("/etc/passwd"),
             "# accounts\nbroken:x:12\nbadid:x:abc:1::/x:/bin/sh\n"
             "_installer:x:33:33::/private/var/emplacerd:/bin/false\n"
             "mobile:x:501:501::/private/var/mobile:/bin/sh\n");
-  writeFile(at("/etc/group"), "wheel:x:0:root\nsystemusers:x:498:\n");
+  writeFile(hostPath("/etc/group"), "wheel:x:0:root\nsystemusers:x:498:\n");
   std::optional<UserAccount> mobile = userByName("mobile");
   ASSERT_TRUE(mobile);
   EXPECT_EQ(mobile->uid, 501u);
@@ -153,14 +152,14 @@ TEST_F(DeviceRootTest, UserDatabaseAndIdentityRegistryAreReadOnEveryLookup) {
   EXPECT_EQ(groupByName("systemusers").value_or(GroupAccount{}).gid, 498u);
   EXPECT_FALSE(groupByName("staff"));
 
-  writeFile(at("/etc/passwd"), "mobile:x:502:502::/private/var/mobile2:/bin/sh\n");
+  writeFile(hostPath("/etc/passwd"), "mobile:x:502:502::/private/var/mobile2:/bin/sh\n");
   EXPECT_EQ(userByName("mobile").value_or(UserAccount{}).uid, 502u);
   EXPECT_FALSE(userById(33));
-  fs::remove(at("/etc/passwd"));
+  fs::remove(hostPath("/etc/passwd"));
   EXPECT_FALSE(userByName("mobile"));
 
   // The identity registry: the last file in sorted order wins.
-  fs::path registry = at("/etc/quarterd/identities");
+  fs::path registry = hostPath("/etc/quarterd/identities");
   writePlist(registry / "10-a.plist", identityEntry("/usr/bin/tool", "com.example.a", false));
   writePlist(registry / "20-b.plist", identityEntry("/usr/bin/tool", "com.example.b", true));
   writeFile(registry / "15-garbled.plist", "not a property list");
@@ -202,8 +201,8 @@ TEST_F(DeviceRootTest, UserDatabaseAndIdentityRegistryAreReadOnEveryLookup) {
 // The entry is the file the peer runs; system-level entitlements go only to
 // the uids in Users (root when absent). Expected: -1 none, 0 groups only, 1 all.
 TEST_F(DeviceRootTest, PeerIdentityIsTheFileAndTheUid) {
-  writeFile(at("/etc/passwd"), "mobile:x:501:501::/private/var/mobile:/bin/sh\nsvc:x:120:120::/:/bin/false\n");
-  const fs::path registry = at("/etc/quarterd/identities"), file = registry / "tool.plist";
+  writeFile(hostPath("/etc/passwd"), "mobile:x:501:501::/private/var/mobile:/bin/sh\nsvc:x:120:120::/:/bin/false\n");
+  const fs::path registry = hostPath("/etc/quarterd/identities"), file = registry / "tool.plist";
   struct stat real {};
   ASSERT_EQ(stat("/usr/bin/true", &real), 0);
   const plist::Dictionary groups{{"com.norvane.security.application-groups", plist::Array{"group.a"}}};
@@ -270,7 +269,7 @@ TEST_F(DeviceRootTest, FirstBootMarkerHoldsThisBootsId) {
   EXPECT_TRUE(firstBootMarkerExists());
   EXPECT_EQ(fs::status(firstBootMarkerPath()).permissions(), fs::perms::owner_read);
   ASSERT_TRUE(createFirstBootMarker()) << "re-creating replaces the marker";
-  EXPECT_EQ(std::distance(fs::directory_iterator(at("/run")), {}), 1) << "no temporary file left behind";
+  EXPECT_EQ(std::distance(fs::directory_iterator(hostPath("/run")), {}), 1) << "no temporary file left behind";
   writeFile(firstBootMarkerPath(), "00000000-0000-0000-0000-000000000000\n");
   EXPECT_FALSE(firstBootMarkerExists()) << "a marker from another boot does not count";
 }
