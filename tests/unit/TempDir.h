@@ -5,9 +5,12 @@
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
+#include <unistd.h>
 
+#include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <map>
 #include <sstream>
 #include <stdexcept>
@@ -49,26 +52,44 @@ inline void makeMarkerTree(const std::string& marker) {
   if (setxattr((marker + "/file").c_str(), "user.mark", "m", 1, 0) != 0) throw std::runtime_error("setxattr");
 }
 
+// The protection class an item carries: 0 without the attribute.
+inline int32_t protectionClassOf(const std::string& path) {
+  uint8_t b[4] = {};
+  if (lgetxattr(path.c_str(), "trusted.com.norvane.protection-class", b, sizeof b) != sizeof b) return 0;
+  return static_cast<int32_t>(b[0] | b[1] << 8 | b[2] << 16 | static_cast<uint32_t>(b[3]) << 24);
+}
+
 inline std::string fileText(const std::string& path) {
   std::stringstream s;
   s << std::ifstream(path).rdbuf();
   return s.str();
 }
 
-// Owner, mode, link count (if asked), attribute names and content of every
-// item below dir: what a marker tree compares before and after a test.
+// Owner, mode, link count (if asked), size, content, link target and
+// attributes of the item, "" when there is none: whatever a write, chown,
+// chmod, setxattr or unlink through a followed link would change.
+inline std::string itemState(const std::string& path, bool linkCount = true) {
+  struct stat st {};
+  if (lstat(path.c_str(), &st) != 0) return "";
+  std::ostringstream o;
+  o << "owner " << st.st_uid << ':' << st.st_gid << " mode " << std::oct << st.st_mode << std::dec << " links "
+    << (linkCount ? st.st_nlink : 0) << " size " << (S_ISDIR(st.st_mode) ? 0 : st.st_size);
+  if (S_ISREG(st.st_mode)) o << " content " << std::hash<std::string>{}(fileText(path));
+  char buffer[4096];
+  ssize_t n = readlink(path.c_str(), buffer, sizeof buffer);
+  if (n >= 0) o << " -> " << std::string(buffer, static_cast<size_t>(n));
+  char names[4096];
+  n = llistxattr(path.c_str(), names, sizeof names);
+  for (ssize_t i = 0; i < n; i += static_cast<ssize_t>(strlen(names + i)) + 1) {
+    ssize_t v = lgetxattr(path.c_str(), names + i, buffer, sizeof buffer);
+    o << ' ' << names + i << '=' << std::hash<std::string>{}(std::string(buffer, v > 0 ? static_cast<size_t>(v) : 0));
+  }
+  return o.str();
+}
+
+// The state of every item below dir: what a marker tree compares before and after.
 inline std::map<std::string, std::string> treeSnapshot(const std::string& dir, bool linkCount = true) {
   std::map<std::string, std::string> items;
-  for (auto& e : std::filesystem::recursive_directory_iterator(dir)) {
-    struct stat st {};
-    lstat(e.path().c_str(), &st);
-    char names[1024] = {};
-    ssize_t n = llistxattr(e.path().c_str(), names, sizeof names);
-    std::ostringstream o;
-    o << st.st_uid << ':' << st.st_gid << ':' << std::oct << st.st_mode << ':' << (linkCount ? st.st_nlink : 0) << ':'
-      << std::string(names, n > 0 ? static_cast<size_t>(n) : 0);
-    if (S_ISREG(st.st_mode)) o << ':' << fileText(e.path());
-    items[e.path()] = o.str();
-  }
+  for (auto& e : std::filesystem::recursive_directory_iterator(dir)) items[e.path()] = itemState(e.path(), linkCount);
   return items;
 }

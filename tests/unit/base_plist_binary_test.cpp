@@ -101,7 +101,7 @@ TEST(PlistBinaryForeign, ReadsAnotherWritersFileExactly) {
   EXPECT_EQ(*v, expected);
 }
 
-TEST(PlistBinaryWriter, UsesSmallestEncodingsAndUniquesValues) {
+TEST(PlistBinaryEncodings, WriterUsesTheSmallestAndUniquesValuesReaderAcceptsOthers) {
   auto objectBytes = [](const Value& v) {
     Data d = plist::writeBinary(v);
     return Data(d.begin() + 8, d.end() - 32 - trailerOf(d).offsetSize);
@@ -126,9 +126,7 @@ TEST(PlistBinaryWriter, UsesSmallestEncodingsAndUniquesValues) {
   t = trailerOf(plist::writeBinary(Value(big)));
   EXPECT_EQ(t.refSize, 2);
   EXPECT_EQ(t.offsetSize, 2);
-}
 
-TEST(PlistBinaryReader, AcceptsOtherValidEncodings) {
   // A 4-byte real, a negative value as a 16-byte integer, and a UTF-16 key.
   Data negative{0x14};
   negative.resize(16, 0xff), negative.push_back(0xfd);
@@ -138,7 +136,7 @@ TEST(PlistBinaryReader, AcceptsOtherValidEncodings) {
   EXPECT_EQ(*v, Value(Dictionary{{"f", 1.5}, {"g", Value(-3)}}));
 }
 
-TEST(PlistBinaryReader, BoundsExpansionOfSharedReferences) {
+TEST(PlistBinaryReader, BoundsExpansionOfSharedReferencesAndNesting) {
   // Five levels of 50 references to the level below: ~320 bytes that would
   // expand to 50^5 objects.
   std::vector<Data> levels;
@@ -173,9 +171,7 @@ TEST(PlistBinaryReader, BoundsExpansionOfSharedReferences) {
   ASSERT_TRUE(built);
   EXPECT_GE(footprint, 999'001u * sizeof(Value));
   EXPECT_LE(footprint, plist::kMaxFootprint);
-}
 
-TEST(PlistBinaryReader, NestingLimit) {
   auto nested = [](size_t levels) {
     std::vector<Data> objects;
     for (size_t i = 0; i < levels; ++i) {
@@ -196,7 +192,7 @@ TEST(PlistBinaryReader, NestingLimit) {
   EXPECT_EQ(refusal(assemble(objects)), "nesting too deep");
 }
 
-TEST(PlistBinaryReader, RefusesBadStructure) {
+TEST(PlistBinaryReader, RefusesBadStructureAndUnsupportedOrInvalidObjects) {
   const Data good = assemble({{0xA1, 1}, {0x51, 'x'}});
   ASSERT_TRUE(parseData(good));
   for (size_t n = 0; n < good.size(); ++n) EXPECT_FALSE(plist::parseBinary(good.data(), n)) << n;
@@ -222,9 +218,7 @@ TEST(PlistBinaryReader, RefusesBadStructure) {
   EXPECT_EQ(refusal(assemble({{0xDF, 0x13, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff}})), "object out of range");
   EXPECT_EQ(refusal(assemble({{0x13, 1, 2}})), "object out of range");
   EXPECT_EQ(refusal(assemble({{0x5F, 0x14, 0}})), "bad length marker");
-}
 
-TEST(PlistBinaryReader, RefusesUnsupportedOrInvalidObjects) {
   Data wide{0x14, 0, 0, 0, 0, 0, 0, 0, 1}, onesThenPositive{0x14};
   wide.resize(17, 0), onesThenPositive.resize(9, 0xff), onesThenPositive.resize(17, 0);
   const std::pair<std::vector<Data>, const char*> cases[] = {

@@ -38,7 +38,7 @@ std::string entitlementsFile() {
   return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
-TEST(PlistXMLTest, ReadsSigningToolDocument) {
+TEST(PlistXMLTest, ReadsSigningToolDocumentEveryElementTypeAndDecodesTextLikeXML) {
   std::string error;
   auto v = parseText(entitlementsFile(), &error);
   ASSERT_TRUE(v) << error;
@@ -53,9 +53,7 @@ TEST(PlistXMLTest, ReadsSigningToolDocument) {
                                           {"since", Date{614538000}},
                                           {"token", Data{0, 1, 2, 3, 4, 5, 6, 7, 8, 9}}}},
                 }));
-}
 
-TEST(PlistXMLTest, ReadsEveryElementType) {
   const std::pair<std::string, Value> cases[] = {
       {"<string/>", ""},
       {"<string>  keeps\n spaces </string>", "  keeps\n spaces "},
@@ -95,9 +93,8 @@ TEST(PlistXMLTest, ReadsEveryElementType) {
   for (const char* bad : {"18446744073709551616", "-9223372036854775809", "0x10000000000000000", "", "-", "0x", "1.0",
                           "12a", "1 2", "--1"})
     EXPECT_FALSE(parseBody(std::string("<integer>") + bad + "</integer>")) << bad;
-}
 
-TEST(PlistXMLTest, DecodesTextLikeXML) {
+  // Text is decoded as XML decodes it.
   EXPECT_EQ(parseBody("<string>&lt;&gt;&amp;&quot;&apos;</string>"), Value("<>&\"'"));
   EXPECT_EQ(parseBody("<string>&#65;&#x42;&#x1F600;</string>"), Value("AB\xF0\x9F\x98\x80"));
   EXPECT_EQ(parseBody("<string><![CDATA[<b>&amp;</b>]]> after</string>"), Value("<b>&amp;</b> after"));
@@ -108,7 +105,7 @@ TEST(PlistXMLTest, DecodesTextLikeXML) {
     EXPECT_FALSE(parseBody(std::string("<string>") + bad + "</string>")) << bad;
 }
 
-TEST(PlistXMLTest, RefusesMalformedAndHostileDocuments) {
+TEST(PlistXMLTest, RefusesMalformedAndHostileDocumentsAndEnforcesLimits) {
   const std::string documents[] = {
       "<?xml version=\"1.0\"?><!DOCTYPE plist [<!ENTITY x \"boom\">]><plist><string>&x;</string></plist>",
       "<?xml version=\"1.0\"?><!ENTITY x SYSTEM \"file:///etc/passwd\"><plist><string/></plist>",
@@ -148,9 +145,7 @@ TEST(PlistXMLTest, RefusesMalformedAndHostileDocuments) {
     EXPECT_FALSE(parseText(text, &error)) << text;
     EXPECT_FALSE(error.empty()) << text;
   }
-}
 
-TEST(PlistXMLTest, EnforcesNestingAndObjectLimits) {
   EXPECT_TRUE(parseBody(nested(kMaxDepth)));
   std::string error;
   EXPECT_FALSE(parseBody(nested(kMaxDepth + 1), &error));

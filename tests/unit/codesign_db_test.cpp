@@ -27,14 +27,13 @@ class CodeSigningDBTest : public ::testing::Test {
     sqlite3* raw = nullptr;
     int64_t last = -1;
     sqlite3_open((dir / "containers.sqlite3").c_str(), &raw);
-    EXPECT_EQ(
-        sqlite3_exec(
-            raw, statements.c_str(),
-            [](void* out, int, char** values, char**) { return *static_cast<int64_t*>(out) = atoll(values[0]), 0; },
-            &last, nullptr),
-        SQLITE_OK);
+    EXPECT_EQ(sqlite3_exec(raw, statements.c_str(), lastFirstColumn, &last, nullptr), SQLITE_OK);
     sqlite3_close(raw);
     return last;
+  }
+  static int lastFirstColumn(void* out, int, char** values, char**) {
+    *static_cast<int64_t*>(out) = atoll(values[0]);
+    return 0;
   }
   bool add(const std::string& id, const QRTCodeSigningEntry& entry) {
     return db->addCodeSigningEntry(&entry, id, nullptr);

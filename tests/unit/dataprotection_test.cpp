@@ -16,12 +16,6 @@ namespace {
 using Op = QRTDataProtectionChangeOperation;
 constexpr const char* kAttribute = "trusted.com.norvane.protection-class";
 
-int32_t classOf(const std::string& path) {
-  uint8_t b[4];
-  if (lgetxattr(path.c_str(), kAttribute, b, sizeof b) != sizeof b) return 0;
-  return static_cast<int32_t>(b[0] | b[1] << 8 | b[2] << 16 | static_cast<uint32_t>(b[3]) << 24);
-}
-
 void setClassOf(const std::string& path, int32_t cls) {
   if (cls == 0) {
     lremovexattr(path.c_str(), kAttribute);
@@ -67,12 +61,13 @@ TEST(DataProtectionWalk, ClassRulesPerKindThroughADeepTree) {
         Op::setProtectionClassOfTreeAtURL(QRTURL::fileURL(top, true), test.target, test.changeType, &locked, &error))
         << (error ? error->description() : "");
     EXPECT_FALSE(locked);
-    for (int cls = 0; cls <= 4; ++cls) EXPECT_EQ(classOf(top + "/file" + std::to_string(cls)), test.files[cls]) << cls;
-    EXPECT_EQ(classOf(top + "/kept"), 2) << "class 2 is never changed";
-    EXPECT_EQ(classOf(top), test.directories);
-    EXPECT_EQ(classOf(deep), test.directories);
-    EXPECT_EQ(classOf(top + "/d/d"), test.directories);
-    EXPECT_EQ(classOf(deep + "/file"), test.deepFile);
+    for (int cls = 0; cls <= 4; ++cls)
+      EXPECT_EQ(protectionClassOf(top + "/file" + std::to_string(cls)), test.files[cls]) << cls;
+    EXPECT_EQ(protectionClassOf(top + "/kept"), 2) << "class 2 is never changed";
+    EXPECT_EQ(protectionClassOf(top), test.directories);
+    EXPECT_EQ(protectionClassOf(deep), test.directories);
+    EXPECT_EQ(protectionClassOf(top + "/d/d"), test.directories);
+    EXPECT_EQ(protectionClassOf(deep + "/file"), test.deepFile);
   }
 }
 

@@ -33,11 +33,13 @@ class GroupRefcountTest : public ::testing::Test {
   }
   static void TearDownTestSuite() { gTmp.reset(); }
 
+  static uint64_t registerWith(const std::string& program, plist::Dictionary entitlements,
+                               const plist::Dictionary& options = {}) {
+    plist::Dictionary info{{QRTCodeSigningEntitlementsKey, std::move(entitlements)}};
+    return mapping().processCodeSigningInfo(&info, program, &options);
+  }
   static uint64_t registerGroups(const std::string& program, const std::vector<std::string>& groups) {
-    plist::Dictionary info{
-        {QRTCodeSigningEntitlementsKey,
-         plist::Dictionary{{QRTApplicationGroupsEntitlement, plist::Array(groups.begin(), groups.end())}}}};
-    return mapping().processCodeSigningInfo(&info, program, nullptr);
+    return registerWith(program, {{QRTApplicationGroupsEntitlement, plist::Array(groups.begin(), groups.end())}});
   }
   static uint64_t drop(const std::string& program) {
     return mapping().processCodeSigningInfo(nullptr, program, nullptr);
@@ -58,7 +60,7 @@ class GroupRefcountTest : public ::testing::Test {
   }
 };
 
-TEST_F(GroupRefcountTest, ContainerGoesWithTheLastProgramNamingIt) {
+TEST_F(GroupRefcountTest, ContainerGoesWithTheLastProgramNamingItAndNoSooner) {
   std::mt19937 random(20261123);
   std::map<std::string, std::vector<std::string>> named;
   for (int p = 0; p < 50; ++p) {
@@ -97,9 +99,8 @@ TEST_F(GroupRefcountTest, ContainerGoesWithTheLastProgramNamingIt) {
     }
     ASSERT_TRUE(mapping().groupReferenceCountsMatchDatabase()) << "after dropping " << program;
   }
-}
 
-TEST_F(GroupRefcountTest, ReorderingOrRepeatingChangesNothing) {
+  // Reordering or repeating a registration, or reconciling, keeps the groups named.
   ASSERT_EQ(registerGroups("com.example.order", {"group.order.a", "group.order.b"}), 1u);
   ASSERT_EQ(paths("com.example.order").size(), 2u);
   const uint64_t before = mapping().generation();
@@ -112,9 +113,7 @@ TEST_F(GroupRefcountTest, ReorderingOrRepeatingChangesNothing) {
       QRTGroupTypeApplication, mapping().groupReferenceCounts(QRTGroupTypeApplication));
   EXPECT_TRUE(present("group.order.a"));
   EXPECT_TRUE(present("group.order.b"));
-}
 
-TEST_F(GroupRefcountTest, ReconcileRemovesOnlyUnnamedGroups) {
   uint64_t code = 1;
   ASSERT_TRUE(QRTClientConnection::sharedClientConnection().createOrLookupContainerForUser(
       {501, 7, std::string("group.nobody")}, QRTCreateMode::CreateIfMissing, QRTLocking::TakeLocks, &code));
@@ -128,30 +127,21 @@ TEST_F(GroupRefcountTest, ReconcileRemovesOnlyUnnamedGroups) {
 // After every kind of write the in-memory snapshot holds exactly the rows the
 // database does, child lists included.
 TEST_F(GroupRefcountTest, SnapshotFollowsEveryWrite) {
-  auto withParent = [](const std::string& parent) {
-    return plist::Dictionary{{QRTCodeSigningParentBundleIDKey, parent}};
-  };
-  auto registerWith = [](const std::string& program, plist::Dictionary entitlements, plist::Dictionary options) {
-    plist::Dictionary info{{QRTCodeSigningEntitlementsKey, std::move(entitlements)}};
-    return mapping().processCodeSigningInfo(&info, program, &options);
-  };
+  auto withParent = [](const std::string& id) { return plist::Dictionary{{QRTCodeSigningParentBundleIDKey, id}}; };
   QRTClientConnection& internal = QRTClientConnection::sharedClientConnection();
   const std::string bundle = "com.example.snap.bundle";
+  const std::vector<std::string> twoGroups{"group.snap.b", "group.snap.c"};
   const plist::Dictionary system{{QRTSystemContainerEntitlement, true},
-                                 {QRTSystemGroupsEntitlement, plist::Array{"systemgroup.snap"}}};
+                                 {QRTSystemGroupsEntitlement, plist::Array{"systemgroup.snap"}}},
+      dataClass{{QRTCodeSigningDataContainerClassKey, 4}}, placeholder{{QRTCodeSigningPlaceholderKey, true}},
+      callerRegistered{{"a", true}};
   const struct {
     const char* write;
     std::function<void()> run;
   } writes[] = {
       {"register", [&] { registerGroups("com.example.snap", {"group.snap.a"}); }},
-      {"update groups",
-       [&] {
-         registerGroups("com.example.snap", {"group.snap.b", "group.snap.c"});
-       }},
-      {"data class",
-       [&] {
-         registerWith("com.example.snap", {}, {{QRTCodeSigningDataContainerClassKey, 4}});
-       }},
+      {"update groups", [&] { registerGroups("com.example.snap", twoGroups); }},
+      {"data class", [&] { registerWith("com.example.snap", {}, dataClass); }},
       {"child", [&] { registerGroups("com.example.snap.child", {}); }},
       {"child under a parent", [&] { registerWith("com.example.snap.child", {}, withParent("com.example.snap")); }},
       {"child moved to another parent",
@@ -159,14 +149,9 @@ TEST_F(GroupRefcountTest, SnapshotFollowsEveryWrite) {
          registerGroups("com.example.snap.other", {"group.snap.a"});
          registerWith("com.example.snap.child", {}, withParent("com.example.snap.other"));
        }},
-      {"placeholder",
-       [&] {
-         registerWith("com.example.snap.ph", {}, {{QRTCodeSigningPlaceholderKey, true}});
-       }},
+      {"placeholder", [&] { registerWith("com.example.snap.ph", {}, placeholder); }},
       {"registered by the caller",
-       [&] {
-         mapping().processCallerRegisteredEntitlements(plist::Dictionary{{"a", true}}, "com.example.snap.caller");
-       }},
+       [&] { mapping().processCallerRegisteredEntitlements(callerRegistered, "com.example.snap.caller"); }},
       {"system container and groups", [&] { registerWith("com.example.snap.sys", system, {}); }},
       {"system container withdrawn", [&] { registerWith("com.example.snap.sys", {}, {}); }},
       {"invalidate with children",

@@ -34,7 +34,6 @@ class FakeServer {
   }
   ~FakeServer() { hangUp(); }
 
-  // The next request, which the client must have sent.
   Message next() {
     for (;;) {
       if (auto f = decoder_.next()) {
@@ -118,10 +117,6 @@ TEST(KitConnection, ClosingMidFlightReleasesEveryWaiter) {
 // ends the connection.
 TEST(KitConnection, BadRepliesAndFailedCallsFailOnlyWhatTheyMust) {
   FakeServer server;
-  auto expectAnswered = [&](std::optional<plist::Dictionary> reply, uint64_t n) {
-    ASSERT_TRUE(reply);
-    EXPECT_EQ(n, numberOf(*reply));
-  };
   auto first = server.client->send(numbered(1));
   auto second = server.client->send(numbered(2));
   Message m1 = server.next(), m2 = server.next();
@@ -133,7 +128,7 @@ TEST(KitConnection, BadRepliesAndFailedCallsFailOnlyWhatTheyMust) {
   server.write(garbage);
   server.echo(m2);
   EXPECT_FALSE(first.get());
-  expectAnswered(second.get(), 2);
+  EXPECT_EQ(numberOf(second.get().value_or(plist::Dictionary{})), 2u);
 
   // A timed-out call ignores its late reply; an oversized request fails alone.
   server.client->setReplyTimeout(std::chrono::milliseconds(1));
@@ -142,7 +137,7 @@ TEST(KitConnection, BadRepliesAndFailedCallsFailOnlyWhatTheyMust) {
   server.echo(server.next());
   EXPECT_FALSE(server.client->call({{"Blob", plist::Data(frame::kMaxLength, 0)}}));
   std::thread answer([&] { server.echo(server.next()); });
-  expectAnswered(server.client->call(numbered(4)), 4);
+  EXPECT_EQ(numberOf(server.client->call(numbered(4)).value_or(plist::Dictionary{})), 4u);
   answer.join();
   EXPECT_FALSE(server.client->closed());
 
@@ -211,7 +206,6 @@ TEST(KitRequest, ValuesAreEncodedAndReadTheWayTheDaemonDoes) {
   EXPECT_FALSE(reply.string(QRTReplyKeyPath) || reply.uuid(QRTReplyKeyUUID) || reply.boolean(QRTReplyKeyExisted));
   EXPECT_EQ(0u, reply.u64("Missing"));
   EXPECT_EQ((std::vector<std::string>{"a", "b"}), reply.strings(QRTReplyKeyIdsArray));
-  EXPECT_EQ(0u, qk::Reply({}).error());
 }
 
 }  // namespace

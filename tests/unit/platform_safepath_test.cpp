@@ -90,7 +90,7 @@ TEST_F(SafePathTest, HostileArrangementsAreRefusedWithTheirCode) {
   EXPECT_EQ(lstatOf(in("other")).st_uid, 502u) << "a refused directory keeps its owner";
 }
 
-TEST_F(SafePathTest, AtomicReplaceSwapsAPlantedLinkAndHardLinkWithoutWritingThrough) {
+TEST_F(SafePathTest, PlantedLinksAreSwappedNotWrittenThroughAndHeldDirectoriesStay) {
   link(marker_ + "/file", "meta");
   ASSERT_EQ(::link((marker_ + "/dir/inner").c_str(), in("hard").c_str()), 0);
   for (const char* rel : {"meta", "hard"}) {
@@ -100,9 +100,8 @@ TEST_F(SafePathTest, AtomicReplaceSwapsAPlantedLinkAndHardLinkWithoutWritingThro
     EXPECT_EQ(fileText(in(rel)), "new");
   }
   EXPECT_EQ(std::distance(fs::directory_iterator(user_), {}), 2) << "no temporary left behind";
-}
 
-TEST_F(SafePathTest, DirectorySwappedForALinkAfterResolution) {
+  // A directory swapped for a link after resolution.
   fs::create_directories(in("box"));
   SafeParent parent;
   ASSERT_EQ(safeOpenParent(in("box/f"), &parent), 0);
@@ -137,7 +136,7 @@ TEST_F(SafePathTest, CreationAcceptsOwnOrRootDirectoriesAndGivesThemToTheOwner) 
 // The sandbox mappings' links live under the device root too.
 using SandboxMappingsTest = SafePathTest;
 
-TEST_F(SandboxMappingsTest, BadIdentifiersAreRefused) {
+TEST_F(SandboxMappingsTest, BadIdentifiersAndADirectoryInTheWayFailCleanly) {
   for (const std::string& bad : {std::string(), std::string("."), std::string(".."), std::string("a/b"),
                                  std::string("/abs"), std::string("nul\0byte", 8)}) {
     EXPECT_EQ(sandboxSetStateItem(501, 1, bad, "/data/x"), EINVAL) << bad;
@@ -145,9 +144,6 @@ TEST_F(SandboxMappingsTest, BadIdentifiersAreRefused) {
     EXPECT_FALSE(sandboxStateItem(501, 1, bad));
   }
   EXPECT_FALSE(fs::exists(root_ + "/run/sandbox"));
-}
-
-TEST_F(SandboxMappingsTest, ADirectoryInTheWayFailsCleanly) {
   fs::create_directories(linkPath(501, 1, "com.example.app") + "/inner");
   EXPECT_NE(sandboxSetStateItem(501, 1, "com.example.app", "/data/one"), 0);
   EXPECT_NE(sandboxSetStateItem(501, 1, "com.example.app", nullptr), 0);

@@ -50,7 +50,6 @@ class DeviceRootTest : public ::testing::Test {
     logSetRotation(1, 0);
     setDeviceRoot("/");
   }
-  fs::path at(const std::string& devicePath) const { return hostPath(devicePath); }
 
   TempDir root_{"/tmp/qrt-platform"};
 };
@@ -78,7 +77,7 @@ class LogTest : public DeviceRootTest {
 
 // Only exactly these lines: the debug line written before the level was
 // lowered must not be among them.
-TEST_F(LogTest, LinesCarryTimeProgramPidLevelAndFunctionAndGoToStderrOnRequest) {
+TEST_F(LogTest, LinesCarryTheirPrefixGoToStderrOnRequestAndRotate) {
   ASSERT_TRUE(logOpen(logPath(), "com.norvane.quarterd", kLogNotice));
   EXPECT_TRUE(logEnabled(kLogNotice));
   EXPECT_FALSE(logEnabled(kLogDebug));
@@ -103,11 +102,9 @@ TEST_F(LogTest, LinesCarryTimeProgramPidLevelAndFunctionAndGoToStderrOnRequest) 
   EXPECT_TRUE(logEnabled(kLogDebug)) << "without a file every line goes to the system log";
   EXPECT_FALSE(logOpen(root_ / "missing/quarterd.log", "com.norvane.quarterd", kLogNotice));
   EXPECT_TRUE(logEnabled(kLogDebug));
-}
 
-// quarterd.log is newest, then .0, .1, ...; files beyond the count (even
-// stale ones left by a larger count) are deleted.
-TEST_F(LogTest, RotationShiftsOlderFilesUpAndDropsTheOldest) {
+  // quarterd.log is newest, then .0, .1, ...; files beyond the count (even
+  // stale ones left by a larger count) are deleted.
   for (uint32_t count : {1u, 3u}) {
     SCOPED_TRACE(count);
     const std::string stale[] = {logPath() + "." + std::to_string(count), logPath() + "." + std::to_string(count + 1)};
@@ -117,11 +114,11 @@ TEST_F(LogTest, RotationShiftsOlderFilesUpAndDropsTheOldest) {
     for (int i = 0; i < 40; ++i) logWrite(kLogNotice, "f", "line " + std::to_string(1000 + i));
     int newer = 2000;
     for (int i = -1; i < static_cast<int>(count); ++i) {
-      std::string content = fileText(i < 0 ? logPath() : logPath() + "." + std::to_string(i));
-      EXPECT_LE(content.size(), 300u) << i;
-      size_t at = content.find("line ");
+      const std::string file = fileText(i < 0 ? logPath() : logPath() + "." + std::to_string(i));
+      EXPECT_LE(file.size(), 300u) << i;
+      size_t at = file.find("line ");
       ASSERT_NE(at, std::string::npos) << i;
-      int first = std::stoi(content.substr(at + 5));
+      int first = std::stoi(file.substr(at + 5));
       EXPECT_LT(first, newer) << i;
       EXPECT_GT(first, 1000) << i << ": the oldest lines were deleted";
       newer = first;
@@ -133,12 +130,18 @@ TEST_F(LogTest, RotationShiftsOlderFilesUpAndDropsTheOldest) {
 
 // ---- user database and identities ----
 
-TEST_F(DeviceRootTest, UserDatabaseReadsTheRootsFilesOnEveryLookup) {
-  writeFile(at("/etc/passwd"),
+plist::Dictionary identityEntry(const std::string& executable, const std::string& signing, bool entitled) {
+  plist::Dictionary entry{{"Executable", executable}, {"SigningIdentifier", signing}};
+  if (entitled) entry["Entitlements"] = plist::Dictionary{{QRTEntitlementAllowed, true}};
+  return entry;
+}
+
+TEST_F(DeviceRootTest, UserDatabaseAndIdentityRegistryAreReadOnEveryLookup) {
+  writeFile(hostPath("/etc/passwd"),
             "# accounts\nbroken:x:12\nbadid:x:abc:1::/x:/bin/sh\n"
             "_installer:x:33:33::/private/var/emplacerd:/bin/false\n"
             "mobile:x:501:501::/private/var/mobile:/bin/sh\n");
-  writeFile(at("/etc/group"), "wheel:x:0:root\nsystemusers:x:498:\n");
+  writeFile(hostPath("/etc/group"), "wheel:x:0:root\nsystemusers:x:498:\n");
   std::optional<UserAccount> mobile = userByName("mobile");
   ASSERT_TRUE(mobile);
   EXPECT_EQ(mobile->uid, 501u);
@@ -149,25 +152,14 @@ TEST_F(DeviceRootTest, UserDatabaseReadsTheRootsFilesOnEveryLookup) {
   EXPECT_EQ(groupByName("systemusers").value_or(GroupAccount{}).gid, 498u);
   EXPECT_FALSE(groupByName("staff"));
 
-  writeFile(at("/etc/passwd"), "mobile:x:502:502::/private/var/mobile2:/bin/sh\n");
+  writeFile(hostPath("/etc/passwd"), "mobile:x:502:502::/private/var/mobile2:/bin/sh\n");
   EXPECT_EQ(userByName("mobile").value_or(UserAccount{}).uid, 502u);
   EXPECT_FALSE(userById(33));
-  fs::remove(at("/etc/passwd"));
+  fs::remove(hostPath("/etc/passwd"));
   EXPECT_FALSE(userByName("mobile"));
 
-  setDeviceRoot("/");  // the system's own database
-  EXPECT_EQ(userById(0).value_or(UserAccount{}).name, "root");
-  EXPECT_TRUE(groupByName("root"));
-}
-
-plist::Dictionary identityEntry(const std::string& executable, const std::string& signing, bool entitled) {
-  plist::Dictionary entry{{"Executable", executable}, {"SigningIdentifier", signing}};
-  if (entitled) entry["Entitlements"] = plist::Dictionary{{QRTEntitlementAllowed, true}};
-  return entry;
-}
-
-TEST_F(DeviceRootTest, IdentityRegistryLastSortedFileWinsAndChangesAreSeen) {
-  fs::path registry = at("/etc/quarterd/identities");
+  // The identity registry: the last file in sorted order wins.
+  fs::path registry = hostPath("/etc/quarterd/identities");
   writePlist(registry / "10-a.plist", identityEntry("/usr/bin/tool", "com.example.a", false));
   writePlist(registry / "20-b.plist", identityEntry("/usr/bin/tool", "com.example.b", true));
   writeFile(registry / "15-garbled.plist", "not a property list");
@@ -201,13 +193,16 @@ TEST_F(DeviceRootTest, IdentityRegistryLastSortedFileWinsAndChangesAreSeen) {
   EXPECT_EQ(identityForExecutable("/usr/bin/tool")->signingIdentifier, "com.example.b");
   fs::remove_all(registry);
   EXPECT_FALSE(identityForExecutable("/usr/bin/tool")->signingIdentifier);
+  setDeviceRoot("/");  // the system's own database
+  EXPECT_EQ(userById(0).value_or(UserAccount{}).name, "root");
+  EXPECT_TRUE(groupByName("root"));
 }
 
 // The entry is the file the peer runs; system-level entitlements go only to
 // the uids in Users (root when absent). Expected: -1 none, 0 groups only, 1 all.
 TEST_F(DeviceRootTest, PeerIdentityIsTheFileAndTheUid) {
-  writeFile(at("/etc/passwd"), "mobile:x:501:501::/private/var/mobile:/bin/sh\nsvc:x:120:120::/:/bin/false\n");
-  const fs::path registry = at("/etc/quarterd/identities"), file = registry / "tool.plist";
+  writeFile(hostPath("/etc/passwd"), "mobile:x:501:501::/private/var/mobile:/bin/sh\nsvc:x:120:120::/:/bin/false\n");
+  const fs::path registry = hostPath("/etc/quarterd/identities"), file = registry / "tool.plist";
   struct stat real {};
   ASSERT_EQ(stat("/usr/bin/true", &real), 0);
   const plist::Dictionary groups{{"com.norvane.security.application-groups", plist::Array{"group.a"}}};
@@ -274,7 +269,7 @@ TEST_F(DeviceRootTest, FirstBootMarkerHoldsThisBootsId) {
   EXPECT_TRUE(firstBootMarkerExists());
   EXPECT_EQ(fs::status(firstBootMarkerPath()).permissions(), fs::perms::owner_read);
   ASSERT_TRUE(createFirstBootMarker()) << "re-creating replaces the marker";
-  EXPECT_EQ(std::distance(fs::directory_iterator(at("/run")), {}), 1) << "no temporary file left behind";
+  EXPECT_EQ(std::distance(fs::directory_iterator(hostPath("/run")), {}), 1) << "no temporary file left behind";
   writeFile(firstBootMarkerPath(), "00000000-0000-0000-0000-000000000000\n");
   EXPECT_FALSE(firstBootMarkerExists()) << "a marker from another boot does not count";
 }

@@ -101,7 +101,7 @@ TEST_F(ContainerCacheTest, EntriesAgreeWithTheirMapAndAreNeverChangedInPlace) {
   EXPECT_TRUE(cache.removeContainerForUser(502, 4, id, false, &error));
 }
 
-TEST_F(ContainerCacheTest, SystemClassBuildPushesSandboxMappings) {
+TEST_F(ContainerCacheTest, SandboxMappingsFollowTheClassAndTheSystemClassBuild) {
   QRTURL live = writeContainer(499, 12, "com.example.daemon");
   writeContainer(499, 12, "com.example.transient", true);
   QRTErrorRef error;
@@ -116,9 +116,8 @@ TEST_F(ContainerCacheTest, SystemClassBuildPushesSandboxMappings) {
   EXPECT_EQ(platform::sandboxStateItem(0, 4, "com.example.daemon"), std::nullopt);
   EXPECT_TRUE(cache.addContainerMetadata(metadata, 499, live, false, true, &error));
   EXPECT_EQ(platform::sandboxStateItem(0, 4, "com.example.daemon"), live.path());
-}
 
-TEST_F(ContainerCacheTest, SandboxMappingItemTypeAndUserFollowTheClass) {
+  // The item type and the user follow the class.
   QRTURL url = QRTURL::fileURL("/somewhere/else", true);
   EXPECT_TRUE(cache.setSandboxContainerMappingForUser(501, "com.example.group", 7, url));
   EXPECT_EQ(platform::sandboxStateItem(501, 2, "com.example.group"), url.path());

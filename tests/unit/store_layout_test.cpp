@@ -58,13 +58,7 @@ void expectDirectory(const std::string& path, uint32_t owner) {
   EXPECT_EQ(st.st_gid, owner) << path;
 }
 
-int32_t protectionClassOf(const QRTURL& url) {
-  uint8_t b[4] = {};
-  if (getxattr(url.path().c_str(), "trusted.com.norvane.protection-class", b, sizeof b) != sizeof b) return 0;
-  return static_cast<int32_t>(b[0] | b[1] << 8 | b[2] << 16 | static_cast<uint32_t>(b[3]) << 24);
-}
-
-TEST(StoreLayoutGlobal, GettersCreateTheirDirectories) {
+TEST(StoreLayoutGlobal, GettersCreateTheirDirectoriesAgainOnceRemoved) {
   // Where they lie is checked end to end through the paths the daemon hands out.
   EXPECT_EQ(config().currentMobileUserId(), 501u);
   for (const QRTURL& url : {config().sharedContainersDirectory(), config().bundleDirectory(), config().logDirectory(),
@@ -73,17 +67,15 @@ TEST(StoreLayoutGlobal, GettersCreateTheirDirectories) {
                             config().pendingUpdatesDirectory()})
     expectDirectory(url.path(), 0);
   for (const QRTURL& url : {config().logDirectory(), config().cachesDirectory(), config().libraryDirectory()})
-    EXPECT_EQ(protectionClassOf(url), 4) << url.path();
-  EXPECT_EQ(protectionClassOf(config().stagingDirectory()), 0);
+    EXPECT_EQ(protectionClassOf(url.path()), 4) << url.path();
+  EXPECT_EQ(protectionClassOf(config().stagingDirectory().path()), 0);
 
   // Each of the three levels belongs to the installer.
   config().transientBundleDirectory();
   const std::string installer = host("/private/var/emplacerd");
   for (const char* level : {"/Library", "/Library/Caches", "/Library/Caches/com.norvane.quarterd"})
     expectDirectory(installer + level, 33);
-}
 
-TEST(StoreLayoutGlobal, RemovedDirectoriesComeBack) {
   QRTURL staging = config().stagingDirectory();
   fs::remove_all(staging.path());
   EXPECT_EQ(config().stagingDirectory(), staging);
@@ -95,7 +87,7 @@ TEST(StoreLayoutGlobal, RemovedDirectoriesComeBack) {
   expectDirectory(host("/private/var/mobile/Containers/Data/Application"), 501);
 }
 
-TEST(StoreLayoutClasses, ClassDirectoriesAndOwnersTransientOnesToo) {
+TEST(StoreLayoutClasses, ClassDirectoriesAndOwnersAndInvalidClasses) {
   for (uint64_t cls = 1; cls <= 13; ++cls) {
     const bool global = cls == 1 || cls == 3 || cls == 5 || cls == 8 || cls >= 12;
     const uint32_t user = !global ? 502 : cls >= 12 ? 499 : 33;
@@ -116,9 +108,8 @@ TEST(StoreLayoutClasses, ClassDirectoriesAndOwnersTransientOnesToo) {
     expectDirectory(url->path(), owner);
   }
   expectDirectory(host(userCaches + "/Temp"), 502);
-}
 
-TEST(StoreLayoutClasses, InvalidClassesGiveNothingAndGlobalBaseURLsAreNotCreated) {
+  // Invalid classes give nothing, and global base URLs are not created.
   auto mobile = config().getPerUserConfigurationForUserId(501);
   for (uint64_t cls : {uint64_t{0}, uint64_t{14}, UINT64_MAX}) {
     EXPECT_FALSE(config().globalContainerBaseURLWithContentClass(cls, true)) << cls;
@@ -135,7 +126,7 @@ TEST(StoreLayoutClasses, InvalidClassesGiveNothingAndGlobalBaseURLsAreNotCreated
   EXPECT_FALSE(fs::exists(url->path()));
 }
 
-TEST(StoreLayoutPerUser, HomesAndBackupPaths) {
+TEST(StoreLayoutPerUser, HomesAndBackupPathsAndUsersWithoutAccountOrHome) {
   auto mobile = config().getPerUserConfigurationForCurrentMobileUser();
   ASSERT_TRUE(mobile->systemGroupContainerBackupDirectory());
   EXPECT_FALSE(fs::exists(host("/private/var/mobile/Library/Backup"))) << "named, not made";
@@ -151,9 +142,8 @@ TEST(StoreLayoutPerUser, HomesAndBackupPaths) {
   EXPECT_FALSE(second->existsUserBaseDirectory());
   ASSERT_TRUE(second->userBaseDirectory());
   EXPECT_TRUE(second->existsUserBaseDirectory());
-}
 
-TEST(StoreLayoutPerUser, UserWithoutAccountOrHomeGivesNothingUntilAdded) {
+  // A user without an account or a home gets nothing until added.
   for (uint32_t uid : {777u, 505u}) {
     auto user = config().getPerUserConfigurationForUserId(uid);
     EXPECT_FALSE(user->userHomeDirectory() || user->existsUserBaseDirectory() || user->transientDirectory() ||

@@ -17,7 +17,6 @@ const char* const kUUID = "0A1B2C3D-4E5F-4071-8293-A4B5C6D7E8F9";
 
 class MetadataTest : public ::testing::Test {
  protected:
-  // A container directory root/<classPath>/<uuid>, created.
   QRTURL container(const std::string& classPath, const std::string& name = kUUID) {
     QRTURL url = QRTURL::fileURL(root_ / classPath + "/" + name, true);
     fs::create_directories(url.path());
@@ -34,7 +33,6 @@ class MetadataTest : public ::testing::Test {
             {"QRTMetadataPersona", 501}};
   }
 
-  // Reads and expects a failure with the code and the description.
   void expectFailure(const QRTURL& url, uint32_t forUser, int32_t code, const std::string& description) {
     QRTErrorRef error;
     EXPECT_EQ(QRTMetadata::readAndValidateMetadataAtUrl(url, forUser, true, &error), nullptr);
@@ -56,7 +54,7 @@ class MetadataTest : public ::testing::Test {
   TempDir root_{"/tmp/qrt-metadata"};
 };
 
-TEST_F(MetadataTest, WriteFailureIs34AndUnreadableFileIs12) {
+TEST_F(MetadataTest, WriteFailureIs34OverBudgetIs38AndUnreadableFileIs12) {
   QRTURL missing = QRTURL::fileURL(root_ / "missing/" + kUUID, true);
   QRTMetadata metadata(501, QRTUUID::random(), 2, "com.example.app", std::nullopt, missing, std::nullopt);
   QRTErrorRef error;
@@ -72,11 +70,9 @@ TEST_F(MetadataTest, WriteFailureIs34AndUnreadableFileIs12) {
     if (*content) std::ofstream(metadataFile(url).path()) << content;
     expectFailure(url, 501, 12, "Failed to read metadata at URL " + url.path());
   }
-}
 
-// What the reader would refuse is never written: over 1 MiB, over 100,000
-// objects (a shared value counts at every use) or over 32 levels.
-TEST_F(MetadataTest, InfoBeyondTheBudgetIsRefusedAndNotWritten) {
+  // What the reader would refuse is never written: over 1 MiB, over 100,000
+  // objects (a shared value counts at every use) or over 32 levels.
   QRTURL url = container("Data/Application");
   writeRaw(url, validDictionary());
   plist::Value deep = 1;
