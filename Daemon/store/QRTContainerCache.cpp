@@ -22,7 +22,14 @@ const char* suffix(bool transient) { return transient ? "(transient)" : ""; }
 
 bool validClass(uint64_t contentClass) { return contentClass >= 1 && contentClass <= 13; }
 
-std::string cacheKey(uint32_t userId, uint64_t contentClass) {
+// A class map's key: the user above, the class (1 to 13) below.
+uint64_t cacheKey(uint32_t userId, uint64_t contentClass) { return uint64_t{userId} << 32 | contentClass; }
+// A held class directory's key: a transient one has bit 16 set as well.
+uint64_t heldKey(uint32_t userId, uint64_t contentClass, bool transient) {
+  return cacheKey(userId, contentClass) | (transient ? 1u << 16 : 0u);
+}
+// The class map as the log names it.
+std::string cacheName(uint32_t userId, uint64_t contentClass) {
   return std::to_string(userId) + "-" + QRTContentClassPathName(contentClass);
 }
 
@@ -66,15 +73,14 @@ std::vector<uint32_t> QRTContainerCache::usersWithBuiltClassMaps() {
   std::set<uint32_t> users;
   std::lock_guard<std::mutex> hold(cacheLock);
   for (const auto* caches : {&liveContainerCache, &transientContainerCache})
-    for (const auto& [key, map] : *caches)
-      users.insert(static_cast<uint32_t>(std::stoul(key.substr(0, key.find('-')))));
+    for (const auto& [key, map] : *caches) users.insert(static_cast<uint32_t>(key >> 32));
   return {users.begin(), users.end()};
 }
 
 std::optional<QRTContainerCache::ClassMap> QRTContainerCache::buildClassMap(uint32_t userId, uint64_t contentClass,
                                                                             bool transient, bool populateSandboxCache,
                                                                             QRTErrorRef* error) {
-  QRTLog(kLogDebug, "Rebuilding container class cache: %@%@", cacheKey(userId, contentClass), suffix(transient));
+  QRTLog(kLogDebug, "Rebuilding container class cache: %@%@", cacheName(userId, contentClass), suffix(transient));
   std::optional<QRTURL> classDirectory =
       QRTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(userId, contentClass, transient);
   if (!classDirectory) {
@@ -94,8 +100,8 @@ std::optional<QRTContainerCache::ClassMap> QRTContainerCache::buildClassMap(uint
   const size_t limit = userId == 0 ? SIZE_MAX : QRTGlobalConfiguration::sharedInstance().maxContainersPerClass();
   for (const QRTURL& item : *items) {
     if (map.size() >= limit) {
-      QRTLog(kLogError, "Cache: %@%@: more than %llu containers; the rest are left out", cacheKey(userId, contentClass),
-             suffix(transient), static_cast<unsigned long long>(limit));
+      QRTLog(kLogError, "Cache: %@%@: more than %llu containers; the rest are left out",
+             cacheName(userId, contentClass), suffix(transient), static_cast<unsigned long long>(limit));
       break;
     }
     QRTErrorRef readError;
@@ -120,7 +126,7 @@ QRTContainerCache::ClassMap* QRTContainerCache::_getCacheForUserId(std::unique_l
                                  userId, static_cast<long>(contentClass)));
     return nullptr;
   }
-  const std::string key = cacheKey(userId, contentClass);
+  const uint64_t key = cacheKey(userId, contentClass);
   auto& caches = transient ? transientContainerCache : liveContainerCache;
   if (auto it = caches.find(key); it != caches.end()) return &it->second;
 
@@ -190,7 +196,7 @@ bool QRTContainerCache::checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_
 
 QRTContainerCache::HeldClassDirectoryRef QRTContainerCache::classDirectory(uint32_t userId, uint64_t contentClass,
                                                                            bool transient, bool reopen) {
-  const std::string key = cacheKey(userId, contentClass) + suffix(transient);
+  const uint64_t key = heldKey(userId, contentClass, transient);
   if (!reopen) {
     std::lock_guard<std::mutex> hold(cacheLock);
     if (auto found = heldClassDirectories.find(key); found != heldClassDirectories.end()) return found->second;
@@ -201,7 +207,7 @@ QRTContainerCache::HeldClassDirectoryRef QRTContainerCache::classDirectory(uint3
   auto held = std::make_shared<HeldClassDirectory>();
   held->path = url->path();
   if (int err = platform::Dir::open(held->path, &held->directory)) {
-    QRTLog(kLogError, "Cache: %@%@: cannot open the class directory %@: %s", cacheKey(userId, contentClass),
+    QRTLog(kLogError, "Cache: %@%@: cannot open the class directory %@: %s", cacheName(userId, contentClass),
            suffix(transient), held->path, strerror(err));
     return nullptr;
   }
@@ -476,7 +482,7 @@ QRTContainerCache::Stats QRTContainerCache::stats() {
   std::lock_guard<std::mutex> hold(cacheLock);
   for (const auto* caches : {&liveContainerCache, &transientContainerCache}) {
     for (const auto& [key, map] : *caches) {
-      stats.approximateBytes += sizeof(key) + key.capacity() + sizeof(ClassMap) + map.bucket_count() * sizeof(void*);
+      stats.approximateBytes += sizeof(key) + sizeof(ClassMap) + map.bucket_count() * sizeof(void*);
       for (const auto& [identifier, metadata] : map) {
         stats.approximateBytes += sizeof(ClassMap::value_type) + identifier.capacity() + 2 * sizeof(void*);
         if (!metadata) continue;

@@ -113,9 +113,10 @@ class QRTContainerCache {
   bool addEntry(const QRTMetadataRef& metadata, uint32_t forUser, const QRTURL& url, bool transient, bool updateSandbox,
                 bool releaseSlot, QRTErrorRef* error, QRTMetadataRef* stored);
 
-  std::unordered_map<std::string, ClassMap> liveContainerCache;
-  std::unordered_map<std::string, ClassMap> transientContainerCache;
-  std::unordered_map<std::string, HeldClassDirectoryRef> heldClassDirectories;
-  std::unordered_map<std::string, size_t> creationsInProgress;
+  // Keyed by user and class together (see cacheKey).
+  std::unordered_map<uint64_t, ClassMap> liveContainerCache;
+  std::unordered_map<uint64_t, ClassMap> transientContainerCache;
+  std::unordered_map<uint64_t, HeldClassDirectoryRef> heldClassDirectories;
+  std::unordered_map<uint64_t, size_t> creationsInProgress;
   std::mutex cacheLock;
 };
