@@ -12,12 +12,14 @@
 #include <climits>
 #include <cstring>
 #include <mutex>
+#include <optional>
 #include <shared_mutex>
 #include <unordered_map>
 #include <vector>
 
 #include "base/PlistCodec.h"
 #include "platform/DeviceRoot.h"
+#include "platform/Dir.h"
 #include "platform/HostProfile.h"
 #include "platform/FileIO.h"
 #include "platform/Log.h"
@@ -84,11 +86,10 @@ struct DirectoryStamp {
   }
 };
 
-DirectoryStamp stampOf(const std::string& path) {
+DirectoryStamp stampFrom(const std::string& path, int err, const struct stat& st) {
   DirectoryStamp stamp;
   stamp.path = path;
-  struct stat st;
-  if (safeStat(path, &st) != 0 || !S_ISDIR(st.st_mode)) return stamp;
+  if (err != 0 || !S_ISDIR(st.st_mode)) return stamp;
   stamp.present = true;
   stamp.device = st.st_dev;
   stamp.inode = st.st_ino;
@@ -96,6 +97,43 @@ DirectoryStamp stampOf(const std::string& path) {
   stamp.modified = st.st_mtim;
   stamp.changed = st.st_ctim;
   return stamp;
+}
+
+// From the root, no link followed at any level.
+DirectoryStamp stampOf(const std::string& path) {
+  struct stat st;
+  const int err = safeStat(path, &st);
+  return stampFrom(path, err, st);
+}
+
+// The registry's parent directory, held so that every request looks at the
+// registry beneath it (one component, not followed) rather than walking from
+// the root. It is held while its own change time stays put: renaming or
+// removing it changes that, and it is then opened afresh.
+struct HeldParent {
+  Dir directory;
+  std::string leaf;
+  timespec changed{};
+};
+
+std::optional<HeldParent> holdParent(const std::string& path) {
+  HeldParent held;
+  struct stat st;
+  if (Dir::openParent(path, &held.directory, &held.leaf) != 0 || fstat(held.directory.fd(), &st) != 0)
+    return std::nullopt;
+  held.changed = st.st_ctim;
+  return held;
+}
+
+// Nothing when the parent is no longer the one at its path.
+std::optional<DirectoryStamp> stampBeneath(const HeldParent& held, const std::string& path) {
+  struct stat st;
+  if (fstat(held.directory.fd(), &st) != 0 || st.st_nlink == 0 || st.st_ctim.tv_sec != held.changed.tv_sec ||
+      st.st_ctim.tv_nsec != held.changed.tv_nsec)
+    return std::nullopt;
+  const int err = held.directory.lstat(held.leaf, &st);
+  if (err != 0 && err != ENOENT) return std::nullopt;
+  return stampFrom(path, err, st);
 }
 
 // One registry file's entry: the whole identity, and the part that any
@@ -119,6 +157,7 @@ struct Registry {
   std::shared_mutex mutex;
   bool loaded = false;
   DirectoryStamp stamp;
+  std::optional<HeldParent> parent;  // opened afresh whenever the stamp is read from the root
   IdentityMap byExecutable;
   size_t refusedFiles = 0;  // registry files skipped at the last read
   // Kept from the last look; looked at again on a mismatch.
@@ -287,7 +326,7 @@ std::shared_ptr<const CodeIdentity> noIdentity() {
 // after bringing the registry up to date.
 std::optional<std::pair<Entry, std::optional<FileId>>> currentEntry(const std::string& executablePath) {
   Registry& reg = registry();
-  DirectoryStamp now = stampOf(hostPath("/etc/quarterd/identities"));
+  const std::string path = hostPath("/etc/quarterd/identities");
   auto find = [&]() -> std::optional<std::pair<Entry, std::optional<FileId>>> {
     auto found = reg.byExecutable.find(executablePath);
     if (found == reg.byExecutable.end()) return std::nullopt;
@@ -296,9 +335,14 @@ std::optional<std::pair<Entry, std::optional<FileId>>> currentEntry(const std::s
   };
   {
     std::shared_lock lock(reg.mutex);
-    if (reg.loaded && reg.stamp == now) return find();
+    if (reg.loaded) {
+      std::optional<DirectoryStamp> now = reg.parent ? stampBeneath(*reg.parent, path) : stampOf(path);
+      if (now && reg.stamp == *now) return find();
+    }
   }
   std::unique_lock lock(reg.mutex);
+  reg.parent = holdParent(path);
+  DirectoryStamp now = stampOf(path);
   if (!reg.loaded || !(reg.stamp == now)) {
     // The stamp was taken before reading, so a change made meanwhile shows
     // up as a new stamp on the next call.

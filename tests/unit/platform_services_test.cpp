@@ -191,6 +191,10 @@ TEST_F(DeviceRootTest, UserDatabaseAndIdentityRegistryAreReadOnEveryLookup) {
   EXPECT_EQ(identityForExecutable("/usr/bin/tool")->signingIdentifier, "com.example.c");
   fs::remove(registry / "50-c.plist");
   EXPECT_EQ(identityForExecutable("/usr/bin/tool")->signingIdentifier, "com.example.b");
+  // Its parent moved aside and made anew: the new registry is the one read.
+  fs::rename(hostPath("/etc/quarterd"), hostPath("/etc/quarterd.old"));
+  writePlist(registry / "10-a.plist", identityEntry("/usr/bin/tool", "com.example.a", false));
+  EXPECT_EQ(identityForExecutable("/usr/bin/tool")->signingIdentifier, "com.example.a");
   fs::remove_all(registry);
   EXPECT_FALSE(identityForExecutable("/usr/bin/tool")->signingIdentifier);
   setDeviceRoot("/");  // the system's own database
