@@ -1,5 +1,6 @@
 // The quarterctl binary against the real daemon: what it prints for people
-// and for scripts, and the exit status that scripts rely on.
+// and for scripts, and the exit status that scripts rely on; the tools'
+// --help against their man pages.
 #include <stdlib.h>
 #include <sys/wait.h>
 
@@ -424,6 +425,14 @@ TEST(QuarterctlDocs, HelpManPageAndCompletionNameTheSameCommandsAndOptions) {
   EXPECT_GE(help.size(), 30u);
   EXPECT_EQ(help, page);
   EXPECT_EQ(help, completion);
+}
+
+TEST(ManPages, AgreeWithHelpOnEveryOption) {
+  for (const auto& [binary, page] : {std::pair{QRT_DAEMON_PATH, "quarterd.8"}, {QRT_EXEC_PATH, "quarter-exec.1"}}) {
+    const std::set<std::string> help = optionsIn(output(std::string(binary) + " --help"));
+    EXPECT_GE(help.size(), 5u) << binary;
+    EXPECT_EQ(help, optionsIn(readFile(std::string(QRT_MAN_DIR) + "/" + page))) << page;
+  }
 }
 
 }  // namespace
