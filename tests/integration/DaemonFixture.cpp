@@ -270,11 +270,6 @@ std::unique_ptr<qk::Connection> DaemonFixture::connect() {
   return connection;
 }
 
-uint64_t DaemonFixture::replyError(const plist::Dictionary& req) {
-  auto connection = connect();
-  return connection ? codeOf(connection->call(req, std::chrono::seconds(30))) : 0;
-}
-
 std::optional<plist::Dictionary> DaemonFixture::call(uint64_t command, plist::Dictionary keys) {
   auto connection = qk::Connection::connect(qk::requestSocketPath(root));
   if (!connection) return std::nullopt;

@@ -47,9 +47,6 @@ class DaemonFixture : public ::testing::Test {
   void restartDaemon();
 
   std::unique_ptr<qk::Connection> connect();
-  // One request on a fresh connection; the reply's "ReplyError", or 0 when
-  // no reply came.
-  uint64_t replyError(const plist::Dictionary& request);
   // One request on a fresh connection; nothing when no reply came, which
   // tests that kill the daemon rely on.
   std::optional<plist::Dictionary> call(uint64_t command, plist::Dictionary keys = {});

@@ -119,7 +119,7 @@ TEST_F(ResourcesTest, ConnectionsPerUserAreCappedAndOtherUsersAreStillServed) {
   ASSERT_EQ(read(report[0], &open, sizeof open), static_cast<ssize_t>(sizeof open));
   EXPECT_EQ(open, kPerUserLimit);
   // Root is not limited, and is served while user 501 holds its connections.
-  EXPECT_EQ(replyError(request(QRTCommandCount)), kNotServed);
+  EXPECT_EQ(codeOf(call(QRTCommandCount)), kNotServed);
   (void)!write(release[1], "x", 1);
   EXPECT_EQ(waitFor(child, 30s), 0);
   for (int fd : {report[0], release[1]}) close(fd);
@@ -173,7 +173,7 @@ TEST_F(ResourcesTest, FloodOfLargestFramesStaysWithinTheBudget) {
   const long peak = statusKiB(daemon, "VmHWM");
   RecordProperty("PeakKiB", std::to_string(peak));
   if (!kSanitized) { EXPECT_LT(peak, before + kBudgetKiB + kAllowanceKiB) << "baseline " << before; }
-  EXPECT_EQ(replyError(request(QRTCommandCount)), kNotServed);
+  EXPECT_EQ(codeOf(call(QRTCommandCount)), kNotServed);
 }
 
 // User 501 starts five largest frames and sends no more of them: it holds
@@ -239,7 +239,7 @@ TEST_F(ResourcesTest, RunningOutOfDescriptorsDoesNotSpin) {
 
   for (int fd : fds) close(fd);
   ASSERT_EQ(prlimit(daemon, RLIMIT_NOFILE, &restored, nullptr), 0);
-  EXPECT_EQ(replyError(request(QRTCommandCount)), kNotServed);
+  EXPECT_EQ(codeOf(call(QRTCommandCount)), kNotServed);
 }
 
 TEST_F(ResourcesTest, SecondDaemonOnTheSameRootExitsAndLeavesTheFirstServing) {
@@ -255,7 +255,7 @@ TEST_F(ResourcesTest, SecondDaemonOnTheSameRootExitsAndLeavesTheFirstServing) {
   EXPECT_NE(WEXITSTATUS(status), 0);
   EXPECT_NE(WEXITSTATUS(status), 127);
   EXPECT_TRUE(exists(qk::requestSocketPath(root)));
-  EXPECT_EQ(replyError(request(QRTCommandCount)), kNotServed);
+  EXPECT_EQ(codeOf(call(QRTCommandCount)), kNotServed);
 }
 
 TEST_F(ResourcesTest, SigtermEndsInTimeWithAClientThatNeverReads) {
