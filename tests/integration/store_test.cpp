@@ -42,11 +42,6 @@ TEST_F(StoreTest, NewDataContainerIsCompleteOnDiskAndMapped) {
     EXPECT_EQ(ownerAndMode(made.path + sub), std::pair(501u, 0755u)) << sub;
 
   EXPECT_EQ(readLink(root + "/run/sandbox/mappings/501/1/com.example.app"), made.path);
-
-  Container again = make(501, "com.example.app", 2);
-  EXPECT_TRUE(again.existed);
-  EXPECT_EQ(again.path, made.path);
-  EXPECT_EQ(again.uuid, made.uuid);
 }
 
 TEST_F(StoreTest, TransientContainerIsReplacedOnEveryCall) {
