@@ -44,6 +44,11 @@ std::optional<uint64_t> u64At(const std::optional<plist::Dictionary>& reply, con
   return v && v->isInteger() ? std::optional<uint64_t>(v->integer().asUnsigned()) : std::nullopt;
 }
 
+std::string stringAt(const std::optional<plist::Dictionary>& reply, const char* key) {
+  auto v = at(reply, key);
+  return v && v->isString() ? v->string() : "";
+}
+
 plist::Dictionary byName(uint64_t user, uint64_t cls, const std::string& identifier) {
   return {{QRTKeyUserID, user}, {QRTKeyContainerClass, cls}, {QRTKeyIdentifier, identifier}};
 }
@@ -283,9 +288,8 @@ Container DaemonFixture::createOrLookup(uint64_t user, const std::string& identi
                               {QRTKeyIdentifier, identifier},
                               {QRTKeyCreateIfNecessary, create},
                               {QRTKeyTransient, transient}});
-  Container c{user, cls, codeOf(reply), "", "", {}, false};
-  if (auto v = at(reply, QRTReplyKeyIdentifier); v && v->isString()) c.identifier = v->string();
-  if (auto v = at(reply, QRTReplyKeyPath); v && v->isString()) c.path = v->string();
+  Container c{user, cls,  codeOf(reply), stringAt(reply, QRTReplyKeyIdentifier), stringAt(reply, QRTReplyKeyPath),
+              {},   false};
   if (auto v = at(reply, QRTReplyKeyExisted); v && v->isBoolean()) c.existed = v->boolean();
   if (auto v = at(reply, QRTReplyKeyUUID); v && v->isData())
     c.uuid = QRTUUID::fromBytes(v->data().data(), v->data().size()).value_or(QRTUUID());

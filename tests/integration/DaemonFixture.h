@@ -118,6 +118,7 @@ plist::Data uuidData(const QRTUUID& uuid);
 // Lenient readers: a missing or mistyped key fails the check that uses it.
 std::optional<plist::Value> at(const std::optional<plist::Dictionary>& reply, const char* key);
 std::optional<uint64_t> u64At(const std::optional<plist::Dictionary>& reply, const char* key);
+std::string stringAt(const std::optional<plist::Dictionary>& reply, const char* key);  // "" when there is none
 
 // Request keys naming a container, and the keys with more added (a key in
 // both takes its value from more) or with one erased.

@@ -47,9 +47,7 @@ class FullDiskTest : public InstallerFixture {
   }
 
   std::string infoValue(const Container& c) {
-    auto reply = call(QRTCommandInfoValueForKey, with(selector(c), {{QRTKeyKey, "k"}}));
-    auto value = at(reply, QRTReplyKeyInfoValue);
-    return value && value->isString() ? value->string() : "(none)";
+    return stringAt(call(QRTCommandInfoValueForKey, with(selector(c), {{QRTKeyKey, "k"}})), QRTReplyKeyInfoValue);
   }
 
   // Every metadata file under the store parses: none was truncated.

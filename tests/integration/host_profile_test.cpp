@@ -89,11 +89,6 @@ class HostProfile {
   std::string proc_;
 };
 
-std::optional<std::string> stringAt(const std::optional<plist::Dictionary>& reply, const char* key) {
-  auto v = at(reply, key);
-  return v && v->isString() ? std::optional<std::string>(v->string()) : std::nullopt;
-}
-
 TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
   char tmpl[] = "/tmp/quarterd-host.XXXXXX";
   ASSERT_NE(mkdtemp(tmpl), nullptr);
@@ -157,7 +152,7 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
     ASSERT_TRUE(reply);
     EXPECT_EQ(codeOf(reply) == 1, row.made) << codeOf(reply);
     if (!row.made) continue;
-    std::string path = stringAt(reply, QRTReplyKeyPath).value_or("");
+    const std::string path = stringAt(reply, QRTReplyKeyPath);
     ASSERT_EQ(path.rfind(row.pathPrefix, 0), 0u) << path;
     const std::string seen = path.starts_with("/var/") ? host.inside(path) : path;
     if (row.owner != UINT32_MAX) { EXPECT_EQ(ownerAndMode(seen).first, row.owner); }

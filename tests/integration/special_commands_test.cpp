@@ -12,11 +12,6 @@ constexpr const char* kAssets = QRTEntitlementUserManagedAssets;
 
 class SpecialCommandsTest : public DaemonFixture {};
 
-std::string replyPath(const std::optional<plist::Dictionary>& reply) {
-  auto v = at(reply, QRTReplyKeyPath);
-  return v && v->stringIf() ? *v->stringIf() : "";
-}
-
 TEST_F(SpecialCommandsTest, UserManagedAssetsStayInsideTheirDirectory) {
   setOwnIdentity("com.example.caller", plist::Dictionary{{kAssets, true}});
   Container app = make(501, "com.example.app", 2);
@@ -24,13 +19,13 @@ TEST_F(SpecialCommandsTest, UserManagedAssetsStayInsideTheirDirectory) {
   auto first =
       call(QRTCommandUserManagedAssetsPath, {{QRTKeyIdentifier, "com.example.app"}, {QRTKeyUserID, uint64_t{777}}});
   ASSERT_EQ(codeOf(first), 1u);
-  const std::string assets = replyPath(first);
+  const std::string assets = stringAt(first, QRTReplyKeyPath);
   EXPECT_EQ(parentOf(assets), app.path + "/Library");
   EXPECT_TRUE(baseName(assets).starts_with("com.norvane.UserManagedAssets."));
   EXPECT_EQ(ownerAndMode(assets), std::make_pair(501u, 0755u));
   auto relative =
       call(QRTCommandUserManagedAssetsPath, {{QRTKeyIdentifier, "com.example.app"}, {QRTKeyIsRelative, true}});
-  EXPECT_EQ(replyPath(relative), "Library/" + baseName(assets));
+  EXPECT_EQ(stringAt(relative, QRTReplyKeyPath), "Library/" + baseName(assets));
 
   // What the owner plants, as the owner.
   const std::string outside = root + "/outside";
@@ -116,7 +111,7 @@ TEST_F(SpecialCommandsTest, SharedContentRefusesDotsAndTheUnentitled) {
   EXPECT_FALSE(exists(root + "/b"));
   auto moved = call(QRTCommandStageSharedContent, keys);
   EXPECT_EQ(codeOf(moved), 1u);
-  EXPECT_EQ(replyPath(moved), container + "/b");
+  EXPECT_EQ(stringAt(moved, QRTReplyKeyPath), container + "/b");
   EXPECT_EQ(readFile(container + "/b"), "shared");
 }
 
