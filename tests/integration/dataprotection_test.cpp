@@ -15,7 +15,6 @@
 
 #include "DaemonFixture.h"
 #include "base/Frame.h"
-#include "base/PlistCodec.h"
 
 namespace fs = std::filesystem;
 
@@ -129,12 +128,6 @@ class DataProtectionTest : public InstallerFixture {
   static std::string retrying(const std::string& id, int32_t cls) {
     return "Retrying container protection update to " + std::to_string(cls) +
            " on next unlock for user: 501, id: " + id;
-  }
-
-  // Waits (up to 5 s) for the path to exist or not.
-  static bool waitFor(const std::string& path, bool present) {
-    for (int i = 0; i < 500 && exists(path) != present; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    return exists(path) == present;
   }
 };
 
@@ -260,9 +253,7 @@ TEST_F(DataProtectionTest, ApplicationIsHeldWhileTheChangeRunsAfterUnlock) {
     SCOPED_TRACE(refuse ? "assertions refused" : "assertions granted");
     const std::string id = refuse ? "com.example.refused" : "com.example.held";
     Container c = makeApp(id, 20);
-    plist::Dictionary props{{"RefuseTerminationAssertions", refuse}};
-    plist::Data bytes = plist::writeBinary(plist::Value(props));
-    writeFile(root + "/etc/device-properties.plist", std::string(bytes.begin(), bytes.end()));
+    writePlist(root + "/etc/device-properties.plist", {{"RefuseTerminationAssertions", refuse}});
 
     setLocked(true);
     auto reply = protectLater(protect(id, 1, true));
@@ -278,7 +269,9 @@ TEST_F(DataProtectionTest, ApplicationIsHeldWhileTheChangeRunsAfterUnlock) {
     EXPECT_EQ(exists(assertionFile(id)), !refuse);
     unlink((root + "/run/quarterd.pausepoint").c_str());
     EXPECT_EQ(codeOf(reply.get()), 1u);
-    EXPECT_TRUE(waitFor(assertionFile(id), false)) << "the assertion outlived the change";
+    for (int i = 0; i < 500 && exists(assertionFile(id)); ++i)
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    EXPECT_FALSE(exists(assertionFile(id))) << "the assertion outlived the change";
     EXPECT_EQ(userData(c).count(3), 0u);
     if (refuse) { EXPECT_TRUE(logContains("Failed to acquire termination assertion for " + id)); }
   }

@@ -310,8 +310,8 @@ TEST_F(MigrationTest, RebootClearsLeftoversAndInstallsBackup) {
   writeFile(backup + "/Shared/systemgroup.org.legacy.restored/shared.txt", "shared");
   reboot();
   startDaemon();
-  ASSERT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)),
-            1u);  // waits for the death-row pass that start-up queued
+  // Waits for the death-row pass that start-up queued.
+  ASSERT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)), 1u);
 
   EXPECT_TRUE(listDirectory(caches + "/Staging").empty());
   EXPECT_TRUE(listDirectory(caches + "/Temp").empty());
