@@ -1,6 +1,5 @@
 #include "DaemonFixture.h"
 
-#include <dirent.h>
 #include <grp.h>
 #include <limits.h>
 #include <signal.h>
@@ -110,6 +109,12 @@ int rawConnect(const std::string& path) {
 
 bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
 
+bool eventually(const std::function<bool()>& condition) {
+  for (int i = 0; i < 1000; ++i, std::this_thread::sleep_for(std::chrono::milliseconds(10)))
+    if (condition()) return true;
+  return false;
+}
+
 std::string baseName(const std::string& path) { return path.substr(path.rfind('/') + 1); }
 std::string parentOf(const std::string& path) { return path.substr(0, path.rfind('/')); }
 
@@ -153,13 +158,8 @@ bool exists(const std::string& path) {
 
 std::vector<std::string> listDirectory(const std::string& path) {
   std::vector<std::string> names;
-  if (DIR* dir = opendir(path.c_str())) {
-    while (dirent* entry = readdir(dir)) {
-      std::string name = entry->d_name;
-      if (name != "." && name != "..") names.push_back(name);
-    }
-    closedir(dir);
-  }
+  std::error_code ec;
+  for (const auto& entry : std::filesystem::directory_iterator(path, ec)) names.push_back(entry.path().filename());
   return names;
 }
 
@@ -171,9 +171,8 @@ std::optional<plist::Dictionary> readPlist(const std::string& path) {
 }
 
 std::string readLink(const std::string& path) {
-  char target[4096];
-  ssize_t n = readlink(path.c_str(), target, sizeof target);
-  return n > 0 ? std::string(target, static_cast<size_t>(n)) : std::string();
+  std::error_code ec;
+  return std::filesystem::read_symlink(path, ec).string();
 }
 
 void DaemonFixture::SetUp() {
@@ -223,12 +222,7 @@ void DaemonFixture::startDaemon() {
   std::string socketPath = qk::requestSocketPath(root);
   unlink(socketPath.c_str());
   launchDaemon();
-  for (int i = 0; i < 400; ++i) {
-    struct stat st;
-    if (stat(socketPath.c_str(), &st) == 0) return;
-    std::this_thread::sleep_for(std::chrono::milliseconds(25));
-  }
-  FAIL() << "daemon socket never appeared at " << socketPath;
+  ASSERT_TRUE(eventually([&] { return exists(socketPath); })) << "daemon socket never appeared at " << socketPath;
 }
 
 int DaemonFixture::stopDaemon() {
@@ -343,9 +337,5 @@ std::string DaemonFixture::logText() const {
 }
 
 bool DaemonFixture::logContains(const std::string& text) const {
-  for (int i = 0; i < 200; ++i) {
-    if (logText().find(text) != std::string::npos) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(25));
-  }
-  return false;
+  return eventually([&] { return contains(logText(), text); });
 }

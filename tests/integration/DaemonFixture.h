@@ -87,7 +87,7 @@ class DaemonFixture : public ::testing::Test {
   void reboot() { unlink((root + "/run/quarterd.fb_check").c_str()); }
 
   std::string logText() const;
-  // Waits (up to 5 s) until the log holds the text.
+  // Waits (up to 10 s) until the log holds the text.
   bool logContains(const std::string& text) const;
   // How often the log holds the text now.
   size_t logCount(const std::string& text) const;
@@ -150,6 +150,8 @@ std::string parentOf(const std::string& path);
 std::pair<uint32_t, uint32_t> ownerAndMode(const std::string& path);
 
 bool contains(const std::string& text, const std::string& part);
+// Polls the condition until it holds, for up to 10 s; whether it held.
+bool eventually(const std::function<bool()>& condition);
 // File helpers; a missing file reads as empty, a missing directory lists nothing.
 void writeFile(const std::string& path, const std::string& text);
 void writePlist(const std::string& path, const plist::Dictionary& dictionary);

@@ -11,7 +11,6 @@
 #include <future>
 #include <map>
 #include <string>
-#include <thread>
 
 #include "DaemonFixture.h"
 #include "base/Frame.h"
@@ -263,15 +262,11 @@ TEST_F(DataProtectionTest, ApplicationIsHeldWhileTheChangeRunsAfterUnlock) {
     writeFile(root + "/run/quarterd.pausepoint", "protection-walk\n");
     setLocked(false);
     // The pause comes on the run after the unlock, with the assertion held.
-    for (int i = 0; i < 500 && logCount(paused) == pausesBefore; ++i)
-      std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    EXPECT_GT(logCount(paused), pausesBefore);
+    EXPECT_TRUE(eventually([&] { return logCount(paused) > pausesBefore; }));
     EXPECT_EQ(exists(assertionFile(id)), !refuse);
     unlink((root + "/run/quarterd.pausepoint").c_str());
     EXPECT_EQ(codeOf(reply.get()), 1u);
-    for (int i = 0; i < 500 && exists(assertionFile(id)); ++i)
-      std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    EXPECT_FALSE(exists(assertionFile(id))) << "the assertion outlived the change";
+    EXPECT_TRUE(eventually([&] { return !exists(assertionFile(id)); })) << "the assertion outlived the change";
     EXPECT_EQ(userData(c).count(3), 0u);
     if (refuse) { EXPECT_TRUE(logContains("Failed to acquire termination assertion for " + id)); }
   }

@@ -206,8 +206,7 @@ TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
   ASSERT_TRUE(call(QRTCommandContainersForUser,
                    {{QRTKeyContainerClass, 2}, {QRTKeyUserID, 501}}));  // served once start-up is over
   EXPECT_TRUE(listDirectory(other + "/.staging").empty());
-  for (int i = 0; i < 100 && !listDirectory(other + "/.deathrow").empty(); ++i) usleep(20000);
-  EXPECT_TRUE(listDirectory(other + "/.deathrow").empty());
+  EXPECT_TRUE(eventually([&] { return listDirectory(other + "/.deathrow").empty(); }));
   // A creation is whole or absent; a deletion leaves the content on death row only.
   for (auto [point, command, code] :
        {std::tuple{"create-after-build", 0, 21u}, {"create-after-move", 0, 1u}, {"delete-after-stage", 10, 21u}}) {

@@ -85,7 +85,7 @@ TEST_F(ServiceTest, ServesUnderTheUnitsSystemCallFilterAndRemovesItsSocketsOnExi
     _exit(127);
   }
   const std::string request = qk::requestSocketPath(root), upcall = qk::upcallSocketPath(root);
-  for (int i = 0; i < 400 && !(exists(upcall) && exists(request)); ++i) usleep(25000);
+  ASSERT_TRUE(eventually([&] { return exists(upcall) && exists(request); }));
   setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
   make(501, "com.example.app", 2);
   EXPECT_EQ(codeOf(call(QRTCommandSystemContainerPath, {{QRTKeyIdentifier, "com.norvane.mapsd"}})), 1u);
