@@ -196,14 +196,10 @@ TEST_F(QuarterctlTest, StageWipeSystemPathAndAssets) {
 }
 
 TEST_F(QuarterctlTest, CodeSigningAndGroups) {
-  const plist::Data entitlements = plist::writeBinary(
-      plist::Dictionary{{"com.norvane.security.application-groups", plist::Array{"group.one", "group.two"}},
-                        {"com.norvane.security.system-groups", "systemgroup.com.example.shared"}});
-  writeFile(root + "/ents.plist", std::string(entitlements.begin(), entitlements.end()));
-  EXPECT_EQ(
-      run("codesign set --identifier com.example.app --entitlements " + root + "/ents.plist --data-class app-data")
-          .status,
-      0);
+  writePlist(root + "/ents.plist", {{"com.norvane.security.application-groups", plist::Array{"group.one", "group.two"}},
+                                    {"com.norvane.security.system-groups", "systemgroup.com.example.shared"}});
+  const std::string set = "codesign set --identifier com.example.app";
+  EXPECT_EQ(run(set + " --entitlements " + root + "/ents.plist --data-class app-data").status, 0);
   EXPECT_TRUE(contains(run("codesign get --identifier com.example.app").out, "group.two"));
   EXPECT_EQ(run("groups ids --identifier com.example.app").out, "GROUP\ngroup.one\ngroup.two\n");
   auto paths = rows(run("groups paths --identifier com.example.app").out);
@@ -215,10 +211,10 @@ TEST_F(QuarterctlTest, CodeSigningAndGroups) {
   EXPECT_EQ(rows(run("groups paths --system --identifier com.example.app").out)[0]["GROUP"],
             "systemgroup.com.example.shared");
 
-  EXPECT_EQ(run("codesign set --identifier com.example.app --remove").status, 0);
+  EXPECT_EQ(run(set + " --remove").status, 0);
   EXPECT_EQ(refusal("codesign get --identifier com.example.app"), "error 21 (no such container)");
   EXPECT_EQ(run("codesign invalidate-missing").status, 0);
-  EXPECT_EQ(run("codesign set --identifier com.example.app").status, 2) << "one of the three is required";
+  EXPECT_EQ(run(set).status, 2) << "one of the three is required";
 }
 
 TEST_F(QuarterctlTest, StatusMetricsAndTheLogLevelOfTheRunningDaemon) {
@@ -290,7 +286,6 @@ TEST_F(QuarterctlTest, VerifyReportsAndRepairsEveryPlantedFinding) {
   auto oldFile = [](std::string path) {
     return [path] { writeFile(path, "x"), output("touch -d 2000-01-01 " + path); };
   };
-  const plist::Data ents = plist::writeBinary(plist::Dictionary{{"com.norvane.security.application-groups", "g.one"}});
   struct {
     const char* kind;
     std::string subject;
@@ -334,7 +329,7 @@ TEST_F(QuarterctlTest, VerifyReportsAndRepairsEveryPlantedFinding) {
        kept(library + "PendingUpdates/u"), false},
       {"codesign-orphan", "com.example.nobundle",
        [&] {
-         writeFile(root + "/ents.plist", std::string(ents.begin(), ents.end()));
+         writePlist(root + "/ents.plist", {{"com.norvane.security.application-groups", "g.one"}});
          run("codesign set --identifier com.example.nobundle --entitlements " + root + "/ents.plist");
        },
        [] { return true; }, true},

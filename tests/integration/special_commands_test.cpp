@@ -122,9 +122,7 @@ TEST_F(SpecialCommandsTest, RetryTestOnlyOnInternalBuilds) {
   EXPECT_TRUE(logContains("People really shouldn't be calling this on non-internal installs!"));
   EXPECT_TRUE(listDirectory(appClassDir()).empty());
 
-  writeFile(root + "/etc/device-properties.plist",
-            "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
-            "<key>InternalBuild</key><true/></dict></plist>\n");
+  writePlist(root + "/etc/device-properties.plist", {{"InternalBuild", true}});
   // One crash: the daemon ends without a reply, then the next call cleans up.
   EXPECT_FALSE(call(QRTCommandRetryTest, keys));
   int status = -1;
