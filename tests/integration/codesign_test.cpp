@@ -117,19 +117,6 @@ TEST_F(CodesignTest, WithdrawnSystemContainerEntitlementTakesTheContainer) {
   EXPECT_EQ(codeOf(call(QRTCommandSystemContainerPath, {})), 55u);
 }
 
-TEST_F(CodesignTest, InvalidationSparesBundledAndSelfRegisteredPrograms) {
-  make(33, "com.example.bundled", 1);
-  ASSERT_EQ(registerProgram("com.example.bundled", {}), 1u);
-  ASSERT_EQ(registerProgram("com.example.orphan", {}), 1u);
-  ASSERT_EQ(registerProgram("com.example.self", {}, {{"RegByCaller", true}}), 1u);
-  EXPECT_EQ(codeOf(call(QRTCommandInvalidateCodeSigningInfoForAppsWithoutBundleContainer)), 1u);
-  EXPECT_TRUE(registered("com.example.bundled"));
-  EXPECT_TRUE(registered("com.example.self"));
-  EXPECT_FALSE(registered("com.example.orphan"));
-  ASSERT_EQ(registerProgram("com.example.orphan", {}), 1u);
-  EXPECT_TRUE(registered("com.example.orphan"));
-}
-
 TEST_F(CodesignTest, AcknowledgedRegistrationsSurviveAKill) {
   std::mutex lock;
   std::vector<std::string> acknowledged;
@@ -175,7 +162,7 @@ TEST_F(CodesignTest, DatabaseIsTheDaemonsAlone) {
   EXPECT_TRUE(rc == SQLITE_BUSY || rc == SQLITE_LOCKED) << rc;
 }
 
-TEST_F(CodesignTest, HostileRegistrationsAreRefusedOrIgnored) {
+TEST_F(CodesignTest, HostileRegistrationsAreRefusedOrIgnoredAndInvalidationSparesBundledAndSelfRegistered) {
   ASSERT_EQ(registerProgram("com.example.kept", {{kAppGroups, "group.kept"}}), 1u);
   struct Case {
     const char* what;
@@ -216,9 +203,19 @@ TEST_F(CodesignTest, HostileRegistrationsAreRefusedOrIgnored) {
   // Nothing refused touched the stored entry or its group.
   EXPECT_TRUE(registered("com.example.kept"));
   EXPECT_EQ(groupPaths(QRTCommandGroupContainerPaths, "com.example.kept").count("group.kept"), 1u);
-  // "RegByCaller" as a string is no caller registration: invalidation applies.
+
+  // Invalidation spares a program with a bundle and one registered by
+  // itself; "RegByCaller" as a string is no caller registration.
+  make(33, "com.example.bundled", 1);
+  ASSERT_EQ(registerProgram("com.example.bundled", {}), 1u);
+  ASSERT_EQ(registerProgram("com.example.self", {}, {{"RegByCaller", true}}), 1u);
   EXPECT_EQ(codeOf(call(QRTCommandInvalidateCodeSigningInfoForAppsWithoutBundleContainer)), 1u);
+  EXPECT_TRUE(registered("com.example.bundled"));
+  EXPECT_TRUE(registered("com.example.self"));
   EXPECT_FALSE(registered("com.example.typed"));
+  EXPECT_FALSE(registered("com.example.kept"));
+  ASSERT_EQ(registerProgram("com.example.kept", {}), 1u);
+  EXPECT_TRUE(registered("com.example.kept")) << "registering again makes it valid";
 }
 
 TEST_F(CodesignTest, TenThousandChildBundlesHitTheLimitAndGoWithTheirParent) {
