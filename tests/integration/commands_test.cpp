@@ -216,7 +216,7 @@ TEST_F(CommandTest, RegenerateDirectoryUUIDMovesTheContainerOnly) {
                {"no UUID", 9, without(selector(app), QRTKeyUUID), 11}});
 }
 
-TEST_F(CommandTest, DeleteStagesOnDeathRowUntilAPassRuns) {
+TEST_F(CommandTest, DeleteAndStageForDeleteMoveToDeathRowUntilAPassRuns) {
   settleDeathRow();
   Container app = make(501, "com.example.app", 2);
   writeFile(app.path + "/Documents/data.txt", "doomed");
@@ -236,10 +236,8 @@ TEST_F(CommandTest, DeleteStagesOnDeathRowUntilAPassRuns) {
   EXPECT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)), 1u);
   EXPECT_TRUE(listDirectory(deadDirectory()).empty());
   EXPECT_EQ(codeOf(call(QRTCommandDeleteContainer, keys)), 21u);
-}
 
-TEST_F(CommandTest, StageForDeleteTakesParallelArrays) {
-  settleDeathRow();
+  // Command 11 stages what its parallel arrays name.
   Container a = make(501, "com.example.a", 2), b = make(501, "com.example.b", 4);
   Container c = make(501, "com.example.c", 2), d = make(501, "com.example.d", 2);
   auto cIsLive = [&] { return createOrLookup(501, "com.example.c", 2, false).error == 1u; };
