@@ -63,12 +63,6 @@ class ReplaceTest : public InstallerFixture {
     return count;
   }
 
-  // Sends a request that must kill the daemon at the point, then starts it again unarmed.
-  void crashAndRestart(uint64_t command, const plist::Dictionary& keys, const std::string& point) {
-    expectKilledAt(point, command, keys);
-    startDaemon();
-  }
-
   // The identifier's permanent container is c, at its path.
   void expectLive(const std::string& id, const Container& c) {
     Container live = lookup(id);
@@ -213,7 +207,8 @@ TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
     SCOPED_TRACE(point);
     const std::string id = std::string("com.example.") + point;
     if (command == 10) make(id, false, id);
-    crashAndRestart(command, with(byName(501, 2, id), {{QRTKeyCreateIfNecessary, true}}), point);
+    expectKilledAt(point, command, with(byName(501, 2, id), {{QRTKeyCreateIfNecessary, true}}));
+    startDaemon();
     Container live = lookup(id);
     EXPECT_EQ(live.error, code);
     if (live.error == 1) { EXPECT_TRUE(exists(live.path + "/Library/Caches")) << live.path; }
@@ -231,7 +226,8 @@ TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
     const std::string id = std::string("com.example.") + point;
     Container old = make(id, false, id + "-old");
     Container fresh = make(id, true, id + "-new");
-    crashAndRestart(2, replaceKeys(&old, fresh), point);
+    expectKilledAt(point, QRTCommandReplaceContainer, replaceKeys(&old, fresh));
+    startDaemon();
     Container live = lookup(id);
     ASSERT_EQ(live.error, 1u);
     EXPECT_EQ(live.path, newInPlace ? movedIn(fresh) : old.path);
@@ -247,7 +243,8 @@ TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
     // memory and in its metadata file.
     const std::string wipeId = id + ".wipe";
     Container wiped = make(wipeId, false, wipeId + "-old");
-    crashAndRestart(12, byName(501, 2, wipeId), point);
+    expectKilledAt(point, QRTCommandDeleteDataContainerContent, byName(501, 2, wipeId));
+    startDaemon();
     expectLiveAcrossRestart(wipeId, wiped.path, wiped.uuid, newInPlace ? "" : wipeId + "-old", newInPlace);
     EXPECT_EQ(liveCopies(wipeId + "-old"), newInPlace ? 0 : 1);
   }

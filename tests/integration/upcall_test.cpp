@@ -78,7 +78,6 @@ TEST_F(UpcallTest, StartingProcessGetsItsContainers) {
     EXPECT_TRUE(exists(found.path + "/tmp"));
     EXPECT_TRUE(answer->groups.empty());
     EXPECT_FALSE(answer->systemContainer);
-    // Asked again, the same paths.
     EXPECT_EQ(k->call(c.request)->dataContainer, found.path);
   }
   // Groups and system containers the request names, in request order.
@@ -142,8 +141,7 @@ TEST_F(UpcallTest, MalformedFramesGetTheirCodes) {
     EXPECT_EQ(answer->replyId, c.frame.id + 100) << c.name;
     EXPECT_EQ(answer->returnCode, c.code) << c.name;
   }
-  // The connection survived all of them.
-  EXPECT_EQ(k->call(app("com.example.app"))->status, 1u);
+  EXPECT_EQ(k->call(app("com.example.app"))->status, 1u) << "the connection survived all of them";
 
   // Not this server's id, and a region over 1 MiB, close the connection.
   for (qk::UpcallFrame frame : {qk::UpcallFrame{.id = 42}, qk::UpcallFrame{.regionSize = (1u << 20) + 1}}) {
