@@ -290,6 +290,14 @@ Container DaemonFixture::createOrLookup(uint64_t user, const std::string& identi
   return c;
 }
 
+uint64_t DaemonFixture::registerProgram(const std::string& id, const plist::Dictionary& entitlements,
+                                        const plist::Dictionary& options) {
+  return codeOf(call(QRTCommandProcessCodeSigningInfo,
+                     {{QRTKeyIdentifier, id},
+                      {"CodeSigningInfo", plist::Dictionary{{"com.norvane.QuarterKit.Entitlements", entitlements}}},
+                      {"OptionsDictionary", options}}));
+}
+
 Container DaemonFixture::make(uint64_t user, const std::string& identifier, uint64_t cls, bool transient) {
   Container c = createOrLookup(user, identifier, cls, true, transient);
   EXPECT_EQ(c.error, 1u) << identifier;

@@ -56,6 +56,9 @@ class DaemonFixture : public ::testing::Test {
 
   // createOrLookup that expects a success.
   Container make(uint64_t user, const std::string& identifier, uint64_t cls, bool transient = false);
+  // Command 22, registering a program's entitlements as an installer does.
+  uint64_t registerProgram(const std::string& id, const plist::Dictionary& entitlements,
+                           const plist::Dictionary& options = {});
 
   std::string daemonCaches() const { return root + "/private/var/root/Library/Caches/com.norvane.quarterd"; }
   std::string deadDirectory() const { return daemonCaches() + "/Dead"; }

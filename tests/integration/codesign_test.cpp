@@ -21,11 +21,6 @@ plist::Dictionary info(plist::Dictionary entitlements) { return {{kEntitlementsK
 
 class CodesignTest : public InstallerFixture {
  protected:
-  uint64_t registerProgram(const std::string& id, plist::Dictionary entitlements, plist::Dictionary options = {}) {
-    return codeOf(call(QRTCommandProcessCodeSigningInfo, {{QRTKeyIdentifier, id},
-                                                          {"CodeSigningInfo", info(std::move(entitlements))},
-                                                          {"OptionsDictionary", std::move(options)}}));
-  }
   bool registered(const std::string& id) {
     return codeOf(call(QRTCommandCodeSigningInfoForIdentifier, {{QRTKeyIdentifier, id}})) == 1;
   }

@@ -42,12 +42,7 @@ TEST_F(UpcallTest, StartingProcessGetsItsContainers) {
   personaOnly.personaId = 0;
   // The installer's registration says the program's data container is a plug-in's.
   setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
-  EXPECT_EQ(
-      codeOf(call(QRTCommandProcessCodeSigningInfo,
-                  {{QRTKeyIdentifier, "com.example.mapped"},
-                   {"CodeSigningInfo", plist::Dictionary{{"com.norvane.QuarterKit.Entitlements", plist::Dictionary{}}}},
-                   {"OptionsDictionary", plist::Dictionary{{"com.norvane.QuarterKit.DataContainerClass", 4}}}})),
-      1u);
+  EXPECT_EQ(registerProgram("com.example.mapped", {}, {{"com.norvane.QuarterKit.DataContainerClass", 4}}), 1u);
   const Case cases[] = {
       {"application", app("com.example.app"), "com.example.app", 2},
       {"container id wins", both, "com.example.container", 2},
