@@ -7,14 +7,12 @@
 #include <signal.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
 #include <climits>
-#include <fstream>
 #include <future>
 #include <sstream>
 #include <thread>
@@ -50,12 +48,9 @@ bool closedByPeer(int fd) {
 }
 
 long statusKiB(pid_t pid, const std::string& field) {
-  std::ifstream in("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(in, line)) {
-    if (line.rfind(field + ":", 0) == 0) return std::stol(line.substr(field.size() + 1));
-  }
-  return -1;
+  const std::string status = readFile("/proc/" + std::to_string(pid) + "/status");
+  const size_t at = status.find("\n" + field + ":");
+  return at == std::string::npos ? -1 : std::stol(status.substr(at + field.size() + 2));
 }
 
 // User plus system CPU time in seconds.
