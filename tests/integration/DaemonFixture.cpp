@@ -225,10 +225,10 @@ void DaemonFixture::startDaemon() {
   ASSERT_TRUE(eventually([&] { return exists(socketPath); })) << "daemon socket never appeared at " << socketPath;
 }
 
-int DaemonFixture::stopDaemon() {
+int DaemonFixture::stopDaemon(int signal) {
   int status = -1;
   if (daemon <= 0) return status;  // kill(-1) would reach every process
-  kill(daemon, SIGTERM);
+  kill(daemon, signal);
   waitpid(daemon, &status, 0);
   daemon = -1;
   return status;
@@ -253,13 +253,6 @@ void DaemonFixture::expectKilledAt(const std::string& point, std::optional<uint6
   EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL) << point << ": status " << status;
   daemon = -1;
   unlink((root + "/run/quarterd.crashpoint").c_str());
-}
-
-void DaemonFixture::killDaemon() {
-  if (daemon <= 0) return;
-  kill(daemon, SIGKILL);
-  waitpid(daemon, nullptr, 0);
-  daemon = -1;
 }
 
 std::unique_ptr<qk::Connection> DaemonFixture::connect() {

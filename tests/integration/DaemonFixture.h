@@ -2,6 +2,7 @@
 // SIGTERM, checking that it exits 0.
 #pragma once
 
+#include <signal.h>
 #include <sys/types.h>
 #include <unistd.h>
 
@@ -32,6 +33,12 @@ struct Container {
   bool existed = false;
 };
 
+// A program's exit status (below 0 when it did not exit normally) and what it printed.
+struct ProgramRun {
+  int status = -1;
+  std::string out, err;
+};
+
 class DaemonFixture : public ::testing::Test {
  protected:
   void SetUp() override;
@@ -39,9 +46,9 @@ class DaemonFixture : public ::testing::Test {
 
   // Starts the daemon and waits for its socket.
   void startDaemon();
-  // SIGTERM and the exit status (as waitpid reports it).
-  int stopDaemon();
-  void killDaemon();
+  // The signal (SIGTERM unless given), then the exit status as waitpid reports it.
+  int stopDaemon(int signal = SIGTERM);
+  void killDaemon() { stopDaemon(SIGKILL); }
 
   // SIGTERM (expecting exit 0), then start again.
   void restartDaemon();

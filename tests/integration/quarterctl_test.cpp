@@ -19,12 +19,6 @@
 
 namespace {
 
-// The exit status (-1 when it did not exit normally) and what was printed.
-struct CtlRun {
-  int status = -1;
-  std::string out, err;
-};
-
 // The rows of a table, cut at the columns of its header line.
 std::vector<std::map<std::string, std::string>> rows(const std::string& out) {
   std::istringstream in(out);
@@ -59,15 +53,15 @@ class QuarterctlTest : public DaemonFixture {
   }
 
   // Runs the binary with --root and the arguments, as a shell splits them.
-  CtlRun run(const std::string& args) { return shell(ctl + " --root " + root + " " + args); }
+  ProgramRun run(const std::string& args) { return shell(ctl + " --root " + root + " " + args); }
   // The daemon's refusal: exit 1, nothing on standard output, the code named on standard error
   // (what follows "quarterctl: "; the whole text when it is not so).
   std::string refusal(const std::string& args, bool withRoot = true) {
-    CtlRun r = withRoot ? run(args) : shell(args);
+    ProgramRun r = withRoot ? run(args) : shell(args);
     const bool plain = r.status == 1 && r.out.empty() && r.err.starts_with("quarterctl: ") && r.err.ends_with("\n");
     return plain ? r.err.substr(12, r.err.size() - 13) : "status " + std::to_string(r.status) + ": " + r.out + r.err;
   }
-  CtlRun shell(const std::string& command) {
+  ProgramRun shell(const std::string& command) {
     const std::string out = root + "/ctl.out", err = root + "/ctl.err";
     int status = system((command + " >" + out + " 2>" + err).c_str());
     return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, readFile(out), readFile(err)};
@@ -166,11 +160,11 @@ TEST_F(QuarterctlTest, ExitStatusTellsDaemonErrorsFromUsageErrors) {
        "is quarterd running on this device root? start it with: quarterd --root"},
   };
   for (const auto& [args, err] : usage) {
-    CtlRun r = run(args);
+    ProgramRun r = run(args);
     EXPECT_EQ(r.status, 2) << args;
     EXPECT_TRUE(contains(r.err, err)) << args << ": " << r.err;
   }
-  CtlRun down = shell(ctl + " --socket " + root + "/nowhere deathrow");
+  ProgramRun down = shell(ctl + " --socket " + root + "/nowhere deathrow");
   EXPECT_TRUE(contains(down.err, "\nquarterctl: is quarterd running? try: systemctl status quarterd\n")) << down.err;
 }
 
@@ -185,12 +179,12 @@ TEST_F(QuarterctlTest, StageWipeSystemPathAndAssets) {
   EXPECT_FALSE(exists(path + "/Documents/file"));
   EXPECT_EQ(run("wipe --addon --identifier com.example.keep").status, 1);
 
-  CtlRun sys = run("system-path --identifier com.example.daemon");
+  ProgramRun sys = run("system-path --identifier com.example.daemon");
   EXPECT_EQ(sys.status, 0) << sys.err;
   EXPECT_TRUE(std::filesystem::is_directory(sys.out.substr(0, sys.out.size() - 1))) << sys.out;
 
   ASSERT_EQ(run("create --class 2 --identifier com.example.assets").status, 0);
-  CtlRun assets = run("assets-path --identifier com.example.assets --relative");
+  ProgramRun assets = run("assets-path --identifier com.example.assets --relative");
   EXPECT_TRUE(assets.out.starts_with("Library/com.norvane.UserManagedAssets.")) << assets.err;
   EXPECT_EQ(run("assets-delete --identifier com.example.assets --source ../x").status, 1);
 }
@@ -262,7 +256,7 @@ TEST_F(QuarterctlTest, VerifyReportsAndRepairsEveryPlantedFinding) {
                   moved = make(501, "com.example.moved", 2), owned = make(501, "com.example.owned", 2),
                   addon = make(501, "com.example.addon", 4), twin = make(501, "com.example.twin", 2);
   auto verify = [&](const std::string& args) {
-    CtlRun r = run("--json verify " + args);
+    ProgramRun r = run("--json verify " + args);
     EXPECT_EQ(r.status, 0) << r.err;
     return nlohmann::json::parse(r.out.empty() ? "{}" : r.out);
   };
