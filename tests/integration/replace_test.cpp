@@ -63,11 +63,15 @@ class ReplaceTest : public InstallerFixture {
     return count;
   }
 
-  // The identifier's permanent container is c, at its path.
-  void expectLive(const std::string& id, const Container& c) {
-    Container live = lookup(id);
-    EXPECT_EQ(live.path, c.path);
-    EXPECT_EQ(live.uuid, c.uuid);
+  // A replace that did not happen: old is still its identifier's container,
+  // both contents (marked marker-old and marker-new) where they were.
+  void expectUnchanged(const Container& old, const Container& fresh, const std::string& marker) {
+    Container live = lookup(old.identifier);
+    EXPECT_EQ(live.path, old.path);
+    EXPECT_EQ(live.uuid, old.uuid);
+    EXPECT_EQ(markerAt(old.path), marker + "-old");
+    EXPECT_EQ(markerAt(fresh.path), marker + "-new");
+    expectNothingInFlight();
   }
 
   void expectNothingInFlight() {
@@ -135,10 +139,7 @@ TEST_F(ReplaceTest, RefusalsChangeNothing) {
     SCOPED_TRACE(refusal.name);
     EXPECT_EQ(codeOf(call(QRTCommandReplaceContainer, changed(replaceKeys(&old, fresh), refusal.key, refusal.value))),
               refusal.code);
-    EXPECT_EQ(markerAt(old.path), "keep-old");
-    EXPECT_EQ(markerAt(fresh.path), "keep-new");
-    expectLive("com.example.keep", old);
-    expectNothingInFlight();
+    expectUnchanged(old, fresh, "keep");
   }
 }
 
@@ -155,10 +156,7 @@ TEST_F(ReplaceTest, FailedMoveOfNewContainerPutsOldOneBack) {
   const uint64_t code = codeOf(call(QRTCommandReplaceContainer, replaceKeys(&old, fresh)));
   ASSERT_EQ(system(("chattr -i " + fresh.path).c_str()), 0);
   EXPECT_EQ(code, 15u);
-  expectLive("com.example.back", old);
-  EXPECT_EQ(markerAt(old.path), "back-old");
-  EXPECT_EQ(markerAt(fresh.path), "back-new");
-  expectNothingInFlight();
+  expectUnchanged(old, fresh, "back");
 
   EXPECT_EQ(codeOf(call(QRTCommandReplaceContainer, replaceKeys(&old, fresh))), 1u);
   EXPECT_EQ(markerAt(lookup("com.example.back").path), "back-new");
