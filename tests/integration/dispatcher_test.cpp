@@ -6,6 +6,7 @@
 #include <atomic>
 #include <future>
 #include <map>
+#include <set>
 #include <thread>
 #include <vector>
 
@@ -17,13 +18,10 @@ namespace {
 
 constexpr uint64_t kNotServed = 49;
 constexpr uint64_t kNotEntitled = 55;
-const char* kAllowed = QRTEntitlementAllowed;
 
-bool isNoneCommand(uint64_t c) {
-  return c == QRTCommandCreateOrLookupContainer || c == QRTCommandGroupContainerPaths ||
-         c == QRTCommandSystemContainerPath || c == QRTCommandSystemGroupContainerPaths ||
-         c == QRTCommandSystemGroupContainerPath;
-}
+const std::set<uint64_t> kOpenCommands{QRTCommandCreateOrLookupContainer, QRTCommandGroupContainerPaths,
+                                       QRTCommandSystemContainerPath, QRTCommandSystemGroupContainerPaths,
+                                       QRTCommandSystemGroupContainerPath};
 
 using DispatcherTest = DaemonFixture;
 
@@ -40,7 +38,7 @@ TEST_F(DispatcherTest, CommandsOutsideTheTableAnswer49AndNoCommandIsCommandZero)
 // the administrative ones too.
 TEST_F(DispatcherTest, EntitlementsOpenTheCommandTable) {
   for (bool allowed : {false, true}) {
-    if (allowed) setOwnIdentity("com.example.installer", {{kAllowed, true}});
+    if (allowed) setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
     std::vector<uint64_t> commands{QRTCommandStatus, QRTCommandMetrics, QRTCommandSetLogLevel};
     for (uint64_t command = 0; command < QRTCommandCount; ++command) commands.push_back(command);
     for (uint64_t command : commands) {
@@ -50,7 +48,7 @@ TEST_F(DispatcherTest, EntitlementsOpenTheCommandTable) {
         keys = {{QRTKeyGroupIdentifier, "systemgroup.com.norvane.policysets"}};
       uint64_t code = codeOf(call(command, keys));
       EXPECT_NE(code, 0u) << command;
-      EXPECT_EQ(code == kNotEntitled, !allowed && !isNoneCommand(command)) << command << ": " << code;
+      EXPECT_EQ(code == kNotEntitled, !allowed && !kOpenCommands.contains(command)) << command << ": " << code;
     }
   }
 }

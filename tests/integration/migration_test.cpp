@@ -160,8 +160,6 @@ class MigrationTest : public InstallerFixture {
   }
 };
 
-// ---- code-signing imports, whole and interrupted at each step ----
-
 class DataMigrationTest : public MigrationTest, public ::testing::WithParamInterface<const char*> {};
 
 TEST_P(DataMigrationTest, ImportsEveryOlderStoreOnce) {
@@ -230,8 +228,6 @@ TEST_F(MigrationTest, MappingFileWhoseEveryEntryFailsStays) {
   EXPECT_TRUE(exists(file));
 }
 
-// ---- build upgrade ----
-
 using BuildUpgradeTest = DataMigrationTest;
 
 TEST_P(BuildUpgradeTest, RunsOncePerNewBuild) {
@@ -282,8 +278,6 @@ INSTANTIATE_TEST_SUITE_P(CrashPoints, BuildUpgradeTest,
                          ::testing::Values("", "migrator-build-upgrade-bundles-moved",
                                            "startup-build-upgrade-migrated"),
                          crashPointName);
-
-// ---- first start after a reboot ----
 
 TEST_F(MigrationTest, RebootClearsLeftoversAndInstallsBackup) {
   make(501, "org.legacy.keep", 2);

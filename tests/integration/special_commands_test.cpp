@@ -8,12 +8,10 @@
 
 namespace {
 
-constexpr const char* kAssets = QRTEntitlementUserManagedAssets;
-
 class SpecialCommandsTest : public DaemonFixture {};
 
 TEST_F(SpecialCommandsTest, UserManagedAssetsStayInsideTheirDirectory) {
-  setOwnIdentity("com.example.caller", plist::Dictionary{{kAssets, true}});
+  setOwnIdentity("com.example.caller", plist::Dictionary{{QRTEntitlementUserManagedAssets, true}});
   Container app = make(501, "com.example.app", 2);
   // "UserID" is ignored: the mobile user's container is meant.
   auto first =

@@ -110,8 +110,8 @@ TEST_F(UpcallTest, MalformedFramesGetTheirCodes) {
   const std::vector<uint8_t> good = qk::packUpcallRequest(app("com.example.app"));
   std::vector<uint8_t> unknownItem = {2, 0, 9, 0, 2, 0, 0, 0, 'x', 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0};
   std::vector<uint8_t> cut(good.begin(), good.end() - 8);  // no end marker
+  // Three bytes, none of them NUL.
   std::vector<uint8_t> noNul = {2, 0, 0, 0, 3, 0, 0, 0, 'a', 'b', 'c', 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0};
-  noNul[10] = 'c';  // three bytes, none of them NUL
   struct Case {
     const char* name;
     qk::UpcallFrame frame;
