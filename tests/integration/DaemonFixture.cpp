@@ -1,6 +1,5 @@
 #include "DaemonFixture.h"
 
-#include <dirent.h>
 #include <grp.h>
 #include <limits.h>
 #include <signal.h>
@@ -42,6 +41,11 @@ std::optional<plist::Value> at(const std::optional<plist::Dictionary>& reply, co
 std::optional<uint64_t> u64At(const std::optional<plist::Dictionary>& reply, const char* key) {
   auto v = at(reply, key);
   return v && v->isInteger() ? std::optional<uint64_t>(v->integer().asUnsigned()) : std::nullopt;
+}
+
+std::string stringAt(const std::optional<plist::Dictionary>& reply, const char* key) {
+  auto v = at(reply, key);
+  return v && v->isString() ? v->string() : "";
 }
 
 plist::Dictionary byName(uint64_t user, uint64_t cls, const std::string& identifier) {
@@ -105,6 +109,12 @@ int rawConnect(const std::string& path) {
 
 bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
 
+bool eventually(const std::function<bool()>& condition) {
+  for (int i = 0; i < 1000; ++i, std::this_thread::sleep_for(std::chrono::milliseconds(10)))
+    if (condition()) return true;
+  return false;
+}
+
 std::string baseName(const std::string& path) { return path.substr(path.rfind('/') + 1); }
 std::string parentOf(const std::string& path) { return path.substr(0, path.rfind('/')); }
 
@@ -148,13 +158,8 @@ bool exists(const std::string& path) {
 
 std::vector<std::string> listDirectory(const std::string& path) {
   std::vector<std::string> names;
-  if (DIR* dir = opendir(path.c_str())) {
-    while (dirent* entry = readdir(dir)) {
-      std::string name = entry->d_name;
-      if (name != "." && name != "..") names.push_back(name);
-    }
-    closedir(dir);
-  }
+  std::error_code ec;
+  for (const auto& entry : std::filesystem::directory_iterator(path, ec)) names.push_back(entry.path().filename());
   return names;
 }
 
@@ -166,9 +171,8 @@ std::optional<plist::Dictionary> readPlist(const std::string& path) {
 }
 
 std::string readLink(const std::string& path) {
-  char target[4096];
-  ssize_t n = readlink(path.c_str(), target, sizeof target);
-  return n > 0 ? std::string(target, static_cast<size_t>(n)) : std::string();
+  std::error_code ec;
+  return std::filesystem::read_symlink(path, ec).string();
 }
 
 void DaemonFixture::SetUp() {
@@ -218,18 +222,13 @@ void DaemonFixture::startDaemon() {
   std::string socketPath = qk::requestSocketPath(root);
   unlink(socketPath.c_str());
   launchDaemon();
-  for (int i = 0; i < 400; ++i) {
-    struct stat st;
-    if (stat(socketPath.c_str(), &st) == 0) return;
-    std::this_thread::sleep_for(std::chrono::milliseconds(25));
-  }
-  FAIL() << "daemon socket never appeared at " << socketPath;
+  ASSERT_TRUE(eventually([&] { return exists(socketPath); })) << "daemon socket never appeared at " << socketPath;
 }
 
-int DaemonFixture::stopDaemon() {
+int DaemonFixture::stopDaemon(int signal) {
   int status = -1;
   if (daemon <= 0) return status;  // kill(-1) would reach every process
-  kill(daemon, SIGTERM);
+  kill(daemon, signal);
   waitpid(daemon, &status, 0);
   daemon = -1;
   return status;
@@ -256,23 +255,11 @@ void DaemonFixture::expectKilledAt(const std::string& point, std::optional<uint6
   unlink((root + "/run/quarterd.crashpoint").c_str());
 }
 
-void DaemonFixture::killDaemon() {
-  if (daemon <= 0) return;
-  kill(daemon, SIGKILL);
-  waitpid(daemon, nullptr, 0);
-  daemon = -1;
-}
-
 std::unique_ptr<qk::Connection> DaemonFixture::connect() {
   std::string error;
   auto connection = qk::Connection::connect(qk::requestSocketPath(root), &error);
   EXPECT_TRUE(connection) << error;
   return connection;
-}
-
-uint64_t DaemonFixture::replyError(const plist::Dictionary& req) {
-  auto connection = connect();
-  return connection ? codeOf(connection->call(req, std::chrono::seconds(30))) : 0;
 }
 
 std::optional<plist::Dictionary> DaemonFixture::call(uint64_t command, plist::Dictionary keys) {
@@ -288,13 +275,20 @@ Container DaemonFixture::createOrLookup(uint64_t user, const std::string& identi
                               {QRTKeyIdentifier, identifier},
                               {QRTKeyCreateIfNecessary, create},
                               {QRTKeyTransient, transient}});
-  Container c{user, cls, codeOf(reply), "", "", {}, false};
-  if (auto v = at(reply, QRTReplyKeyIdentifier); v && v->isString()) c.identifier = v->string();
-  if (auto v = at(reply, QRTReplyKeyPath); v && v->isString()) c.path = v->string();
+  Container c{user, cls,  codeOf(reply), stringAt(reply, QRTReplyKeyIdentifier), stringAt(reply, QRTReplyKeyPath),
+              {},   false};
   if (auto v = at(reply, QRTReplyKeyExisted); v && v->isBoolean()) c.existed = v->boolean();
   if (auto v = at(reply, QRTReplyKeyUUID); v && v->isData())
     c.uuid = QRTUUID::fromBytes(v->data().data(), v->data().size()).value_or(QRTUUID());
   return c;
+}
+
+uint64_t DaemonFixture::registerProgram(const std::string& id, const plist::Dictionary& entitlements,
+                                        const plist::Dictionary& options) {
+  return codeOf(call(QRTCommandProcessCodeSigningInfo,
+                     {{QRTKeyIdentifier, id},
+                      {"CodeSigningInfo", plist::Dictionary{{"com.norvane.QuarterKit.Entitlements", entitlements}}},
+                      {"OptionsDictionary", options}}));
 }
 
 Container DaemonFixture::make(uint64_t user, const std::string& identifier, uint64_t cls, bool transient) {
@@ -344,9 +338,5 @@ std::string DaemonFixture::logText() const {
 }
 
 bool DaemonFixture::logContains(const std::string& text) const {
-  for (int i = 0; i < 200; ++i) {
-    if (logText().find(text) != std::string::npos) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(25));
-  }
-  return false;
+  return eventually([&] { return contains(logText(), text); });
 }

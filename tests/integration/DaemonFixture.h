@@ -2,6 +2,7 @@
 // SIGTERM, checking that it exits 0.
 #pragma once
 
+#include <signal.h>
 #include <sys/types.h>
 #include <unistd.h>
 
@@ -32,6 +33,12 @@ struct Container {
   bool existed = false;
 };
 
+// A program's exit status (below 0 when it did not exit normally) and what it printed.
+struct ProgramRun {
+  int status = -1;
+  std::string out, err;
+};
+
 class DaemonFixture : public ::testing::Test {
  protected:
   void SetUp() override;
@@ -39,17 +46,14 @@ class DaemonFixture : public ::testing::Test {
 
   // Starts the daemon and waits for its socket.
   void startDaemon();
-  // SIGTERM and the exit status (as waitpid reports it).
-  int stopDaemon();
-  void killDaemon();
+  // The signal (SIGTERM unless given), then the exit status as waitpid reports it.
+  int stopDaemon(int signal = SIGTERM);
+  void killDaemon() { stopDaemon(SIGKILL); }
 
   // SIGTERM (expecting exit 0), then start again.
   void restartDaemon();
 
   std::unique_ptr<qk::Connection> connect();
-  // One request on a fresh connection; the reply's "ReplyError", or 0 when
-  // no reply came.
-  uint64_t replyError(const plist::Dictionary& request);
   // One request on a fresh connection; nothing when no reply came, which
   // tests that kill the daemon rely on.
   std::optional<plist::Dictionary> call(uint64_t command, plist::Dictionary keys = {});
@@ -59,6 +63,9 @@ class DaemonFixture : public ::testing::Test {
 
   // createOrLookup that expects a success.
   Container make(uint64_t user, const std::string& identifier, uint64_t cls, bool transient = false);
+  // Command 22, registering a program's entitlements as an installer does.
+  uint64_t registerProgram(const std::string& id, const plist::Dictionary& entitlements,
+                           const plist::Dictionary& options = {});
 
   std::string daemonCaches() const { return root + "/private/var/root/Library/Caches/com.norvane.quarterd"; }
   std::string deadDirectory() const { return daemonCaches() + "/Dead"; }
@@ -90,7 +97,7 @@ class DaemonFixture : public ::testing::Test {
   void reboot() { unlink((root + "/run/quarterd.fb_check").c_str()); }
 
   std::string logText() const;
-  // Waits (up to 5 s) until the log holds the text.
+  // Waits (up to 10 s) until the log holds the text.
   bool logContains(const std::string& text) const;
   // How often the log holds the text now.
   size_t logCount(const std::string& text) const;
@@ -121,6 +128,7 @@ plist::Data uuidData(const QRTUUID& uuid);
 // Lenient readers: a missing or mistyped key fails the check that uses it.
 std::optional<plist::Value> at(const std::optional<plist::Dictionary>& reply, const char* key);
 std::optional<uint64_t> u64At(const std::optional<plist::Dictionary>& reply, const char* key);
+std::string stringAt(const std::optional<plist::Dictionary>& reply, const char* key);  // "" when there is none
 
 // Request keys naming a container, and the keys with more added (a key in
 // both takes its value from more) or with one erased.
@@ -152,6 +160,8 @@ std::string parentOf(const std::string& path);
 std::pair<uint32_t, uint32_t> ownerAndMode(const std::string& path);
 
 bool contains(const std::string& text, const std::string& part);
+// Polls the condition until it holds, for up to 10 s; whether it held.
+bool eventually(const std::function<bool()>& condition);
 // File helpers; a missing file reads as empty, a missing directory lists nothing.
 void writeFile(const std::string& path, const std::string& text);
 void writePlist(const std::string& path, const plist::Dictionary& dictionary);

@@ -21,14 +21,6 @@ plist::Dictionary info(plist::Dictionary entitlements) { return {{kEntitlementsK
 
 class CodesignTest : public InstallerFixture {
  protected:
-  uint64_t registerProgram(const std::string& id, plist::Dictionary entitlements, plist::Dictionary options = {}) {
-    return codeOf(call(QRTCommandProcessCodeSigningInfo, {{QRTKeyIdentifier, id},
-                                                          {"CodeSigningInfo", info(std::move(entitlements))},
-                                                          {"OptionsDictionary", std::move(options)}}));
-  }
-  uint64_t unregister(const std::string& id) {
-    return codeOf(call(QRTCommandProcessCodeSigningInfo, {{QRTKeyIdentifier, id}}));
-  }
   bool registered(const std::string& id) {
     return codeOf(call(QRTCommandCodeSigningInfoForIdentifier, {{QRTKeyIdentifier, id}})) == 1;
   }
@@ -84,7 +76,7 @@ TEST_F(CodesignTest, GroupsAreMadeOnDemandSharedAndDroppedWithTheirLastProgram) 
   EXPECT_FALSE(exists(app["group.g2"]));
   EXPECT_TRUE(logContains("Last reference to group container group.g2 for 501 is going away; removing it."));
 
-  ASSERT_EQ(unregister("com.example.b"), 1u);
+  ASSERT_EQ(codeOf(call(QRTCommandProcessCodeSigningInfo, {{QRTKeyIdentifier, "com.example.b"}})), 1u);
   EXPECT_EQ(lookup(501, "group.g1", 7), 21u);
   EXPECT_FALSE(registered("com.example.b"));
 }
@@ -95,12 +87,8 @@ TEST_F(CodesignTest, SystemGroupRefusalsAndOwnEntitlements) {
   auto own = groupPaths(QRTCommandGroupContainerPaths, "com.example.self");
   ASSERT_EQ(own.count("group.self"), 1u);
   EXPECT_TRUE(exists(own["group.self"]));
-  EXPECT_EQ(codeOf(call(QRTCommandSystemGroupContainerPath,
-                        {{QRTKeyGroupIdentifier, "systemgroup.com.norvane.sharedpclogging"}})),
-            55u);
-  EXPECT_EQ(
-      codeOf(call(QRTCommandSystemGroupContainerPath, {{QRTKeyGroupIdentifier, "systemgroup.com.example.notmine"}})),
-      55u);
+  for (const char* group : {"systemgroup.com.norvane.sharedpclogging", "systemgroup.com.example.notmine"})
+    EXPECT_EQ(codeOf(call(QRTCommandSystemGroupContainerPath, {{QRTKeyGroupIdentifier, group}})), 55u) << group;
   EXPECT_TRUE(
       logContains("com.example.self is not entitled for system group identifier: "
                   "systemgroup.com.example.notmine."));
@@ -112,7 +100,7 @@ TEST_F(CodesignTest, WithdrawnSystemContainerEntitlementTakesTheContainer) {
   setOwnIdentity("com.example.sys", {{kSystemContainer, true}});
   auto reply = call(QRTCommandSystemContainerPath, {});
   ASSERT_EQ(codeOf(reply), 1u);
-  const std::string path = plist::describe(*at(reply, QRTReplyKeyPath));
+  const std::string path = stringAt(reply, QRTReplyKeyPath);
   EXPECT_TRUE(exists(path));
   beInstaller();
   ASSERT_EQ(registerProgram("com.example.sys", {{kSystemContainer, false}}), 1u);
@@ -122,20 +110,6 @@ TEST_F(CodesignTest, WithdrawnSystemContainerEntitlementTakesTheContainer) {
       logContains("Deleting system container for ID: com.example.sys because it is no longer in the entitlements"));
   setOwnIdentity("com.example.sys", {{kSystemContainer, true}});
   EXPECT_EQ(codeOf(call(QRTCommandSystemContainerPath, {})), 55u);
-}
-
-TEST_F(CodesignTest, InvalidationSparesBundledAndSelfRegisteredPrograms) {
-  make(33, "com.example.bundled", 1);
-  ASSERT_EQ(registerProgram("com.example.bundled", {}), 1u);
-  ASSERT_EQ(registerProgram("com.example.orphan", {}), 1u);
-  ASSERT_EQ(registerProgram("com.example.self", {}, {{"RegByCaller", true}}), 1u);
-  EXPECT_EQ(codeOf(call(QRTCommandInvalidateCodeSigningInfoForAppsWithoutBundleContainer)), 1u);
-  EXPECT_TRUE(registered("com.example.bundled"));
-  EXPECT_TRUE(registered("com.example.self"));
-  EXPECT_EQ(codeOf(call(QRTCommandCodeSigningInfoForIdentifier, {{QRTKeyIdentifier, "com.example.orphan"}})), 21u);
-  // Registering again makes it valid.
-  ASSERT_EQ(registerProgram("com.example.orphan", {}), 1u);
-  EXPECT_TRUE(registered("com.example.orphan"));
 }
 
 TEST_F(CodesignTest, AcknowledgedRegistrationsSurviveAKill) {
@@ -183,7 +157,7 @@ TEST_F(CodesignTest, DatabaseIsTheDaemonsAlone) {
   EXPECT_TRUE(rc == SQLITE_BUSY || rc == SQLITE_LOCKED) << rc;
 }
 
-TEST_F(CodesignTest, HostileRegistrationsAreRefusedOrIgnored) {
+TEST_F(CodesignTest, HostileRegistrationsAreRefusedOrIgnoredAndInvalidationSparesBundledAndSelfRegistered) {
   ASSERT_EQ(registerProgram("com.example.kept", {{kAppGroups, "group.kept"}}), 1u);
   struct Case {
     const char* what;
@@ -224,9 +198,19 @@ TEST_F(CodesignTest, HostileRegistrationsAreRefusedOrIgnored) {
   // Nothing refused touched the stored entry or its group.
   EXPECT_TRUE(registered("com.example.kept"));
   EXPECT_EQ(groupPaths(QRTCommandGroupContainerPaths, "com.example.kept").count("group.kept"), 1u);
-  // "RegByCaller" as a string is no caller registration: invalidation applies.
+
+  // Invalidation spares a program with a bundle and one registered by
+  // itself; "RegByCaller" as a string is no caller registration.
+  make(33, "com.example.bundled", 1);
+  ASSERT_EQ(registerProgram("com.example.bundled", {}), 1u);
+  ASSERT_EQ(registerProgram("com.example.self", {}, {{"RegByCaller", true}}), 1u);
   EXPECT_EQ(codeOf(call(QRTCommandInvalidateCodeSigningInfoForAppsWithoutBundleContainer)), 1u);
+  EXPECT_TRUE(registered("com.example.bundled"));
+  EXPECT_TRUE(registered("com.example.self"));
   EXPECT_FALSE(registered("com.example.typed"));
+  EXPECT_FALSE(registered("com.example.kept"));
+  ASSERT_EQ(registerProgram("com.example.kept", {}), 1u);
+  EXPECT_TRUE(registered("com.example.kept")) << "registering again makes it valid";
 }
 
 TEST_F(CodesignTest, TenThousandChildBundlesHitTheLimitAndGoWithTheirParent) {
@@ -256,9 +240,7 @@ TEST_F(CodesignTest, TenThousandChildBundlesHitTheLimitAndGoWithTheirParent) {
   EXPECT_EQ(codes[38], 10000 - 1024);
   EXPECT_TRUE(logContains("Parent com.example.parent already has 1024 child bundles; not adding"));
   // Deleting the parent's bundle takes the parent's and its children's information.
-  EXPECT_EQ(codeOf(call(QRTCommandDeleteContainer,
-                        {{QRTKeyUserID, 33}, {QRTKeyContainerClass, 1}, {QRTKeyIdentifier, "com.example.parent"}})),
-            1u);
+  EXPECT_EQ(codeOf(call(QRTCommandDeleteContainer, byName(33, 1, "com.example.parent"))), 1u);
   EXPECT_FALSE(registered("com.example.parent"));
   ASSERT_FALSE(accepted.empty());
   EXPECT_FALSE(registered(accepted));

@@ -175,8 +175,7 @@ TEST_F(ConcurrencyTest, PassDuringAHandOverLeavesNothingBehind) {
   writeFile(root + "/run/quarterd.pausepoint", "deathrow-hand-over\n");
   Container second;
   std::thread recreate([&] { second = createOrLookup(501, "com.example.handover", 2, true, true); });
-  for (int i = 0; i < 500 && listDirectory(deadDirectory()).empty(); ++i)
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+  eventually([&] { return !listDirectory(deadDirectory()).empty(); });
   EXPECT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)), 1u);
   recreate.join();
   unlink((root + "/run/quarterd.pausepoint").c_str());

@@ -11,11 +11,9 @@
 #include <future>
 #include <map>
 #include <string>
-#include <thread>
 
 #include "DaemonFixture.h"
 #include "base/Frame.h"
-#include "base/PlistCodec.h"
 
 namespace fs = std::filesystem;
 
@@ -130,15 +128,10 @@ class DataProtectionTest : public InstallerFixture {
     return "Retrying container protection update to " + std::to_string(cls) +
            " on next unlock for user: 501, id: " + id;
   }
-
-  // Waits (up to 5 s) for the path to exist or not.
-  static bool waitFor(const std::string& path, bool present) {
-    for (int i = 0; i < 500 && exists(path) != present; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    return exists(path) == present;
-  }
 };
 
-TEST_F(DataProtectionTest, ChangeReachesEveryUserDataItemAndNothingElse) {
+// Refusals, and a change to the class the container has, touch nothing.
+TEST_F(DataProtectionTest, EveryRequestGetsOneReplyAndAChangeReachesEveryUserDataItemOnly) {
   Container c = makeApp("com.example.thousand", 1000);
   // Outside the user data items, and outside the container through planted links.
   writeFile(c.path + "/SystemData.txt", "x");
@@ -149,27 +142,9 @@ TEST_F(DataProtectionTest, ChangeReachesEveryUserDataItemAndNothingElse) {
   setClassOf(outside + "/secret", 4);
   fs::create_symlink(outside + "/secret", c.path + "/Documents/d0/link");
   fs::create_symlink(outside, c.path + "/Purchases");
-
   const int items = userData(c)[3];
   ASSERT_GT(items, 1000);
-  EXPECT_EQ(codeOfOnlyReply(qk::requestSocketPath(root), request(kSetDataProtection, protect(c.identifier, 1, false))),
-            1u);
-  EXPECT_EQ(userData(c), (std::map<int32_t, int>{{1, items}}));
-  EXPECT_EQ(classOf(c.path + "/SystemData.txt"), 3);
-  EXPECT_EQ(classOf(outside + "/secret"), 4) << "a link was followed";
-  EXPECT_EQ(classOf(outside), 0) << "a link was followed";
-  EXPECT_EQ(recordedClass(c), 1u);
-  EXPECT_TRUE(listDirectory(pendingDir()).empty());
 
-  // Towards a higher class only directories change; files keep theirs.
-  EXPECT_EQ(codeOf(call(kSetDataProtection, protect(c.identifier, 3, false))), 1u);
-  EXPECT_EQ(classOf(c.path + "/Documents/d0"), 3);
-  EXPECT_EQ(classOf(c.path + "/Documents/d0/f0"), 1);
-  EXPECT_EQ(recordedClass(c), 3u);
-}
-
-TEST_F(DataProtectionTest, EveryRequestGetsOneReply) {
-  Container c = makeApp("com.example.checked", 4);
   const struct {
     const char* what;
     plist::Dictionary keys;
@@ -188,8 +163,23 @@ TEST_F(DataProtectionTest, EveryRequestGetsOneReply) {
     SCOPED_TRACE(test.what);
     EXPECT_EQ(codeOfOnlyReply(qk::requestSocketPath(root), request(kSetDataProtection, test.keys)), test.code);
   }
-  EXPECT_EQ(userData(c), (std::map<int32_t, int>{{3, userData(c)[3]}})) << "a refused request changed something";
+  EXPECT_EQ(userData(c), (std::map<int32_t, int>{{3, items}})) << "a refused request changed something";
   EXPECT_TRUE(listDirectory(pendingDir()).empty());
+
+  EXPECT_EQ(codeOfOnlyReply(qk::requestSocketPath(root), request(kSetDataProtection, protect(c.identifier, 1, false))),
+            1u);
+  EXPECT_EQ(userData(c), (std::map<int32_t, int>{{1, items}}));
+  EXPECT_EQ(classOf(c.path + "/SystemData.txt"), 3);
+  EXPECT_EQ(classOf(outside + "/secret"), 4) << "a link was followed";
+  EXPECT_EQ(classOf(outside), 0) << "a link was followed";
+  EXPECT_EQ(recordedClass(c), 1u);
+  EXPECT_TRUE(listDirectory(pendingDir()).empty());
+
+  // Towards a higher class only directories change; files keep theirs.
+  EXPECT_EQ(codeOf(call(kSetDataProtection, protect(c.identifier, 3, false))), 1u);
+  EXPECT_EQ(classOf(c.path + "/Documents/d0"), 3);
+  EXPECT_EQ(classOf(c.path + "/Documents/d0/f0"), 1);
+  EXPECT_EQ(recordedClass(c), 3u);
 }
 
 TEST_F(DataProtectionTest, LockedDeviceHoldsOrRefusesTheChange) {
@@ -260,9 +250,7 @@ TEST_F(DataProtectionTest, ApplicationIsHeldWhileTheChangeRunsAfterUnlock) {
     SCOPED_TRACE(refuse ? "assertions refused" : "assertions granted");
     const std::string id = refuse ? "com.example.refused" : "com.example.held";
     Container c = makeApp(id, 20);
-    plist::Dictionary props{{"RefuseTerminationAssertions", refuse}};
-    plist::Data bytes = plist::writeBinary(plist::Value(props));
-    writeFile(root + "/etc/device-properties.plist", std::string(bytes.begin(), bytes.end()));
+    writePlist(root + "/etc/device-properties.plist", {{"RefuseTerminationAssertions", refuse}});
 
     setLocked(true);
     auto reply = protectLater(protect(id, 1, true));
@@ -272,13 +260,11 @@ TEST_F(DataProtectionTest, ApplicationIsHeldWhileTheChangeRunsAfterUnlock) {
     writeFile(root + "/run/quarterd.pausepoint", "protection-walk\n");
     setLocked(false);
     // The pause comes on the run after the unlock, with the assertion held.
-    for (int i = 0; i < 500 && logCount(paused) == pausesBefore; ++i)
-      std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    EXPECT_GT(logCount(paused), pausesBefore);
+    EXPECT_TRUE(eventually([&] { return logCount(paused) > pausesBefore; }));
     EXPECT_EQ(exists(assertionFile(id)), !refuse);
     unlink((root + "/run/quarterd.pausepoint").c_str());
     EXPECT_EQ(codeOf(reply.get()), 1u);
-    EXPECT_TRUE(waitFor(assertionFile(id), false)) << "the assertion outlived the change";
+    EXPECT_TRUE(eventually([&] { return !exists(assertionFile(id)); })) << "the assertion outlived the change";
     EXPECT_EQ(userData(c).count(3), 0u);
     if (refuse) { EXPECT_TRUE(logContains("Failed to acquire termination assertion for " + id)); }
   }

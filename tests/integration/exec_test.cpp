@@ -16,11 +16,6 @@
 
 namespace {
 
-struct Launched {
-  int status = -1;
-  std::string out, err;
-};
-
 class ExecTest : public DaemonFixture {
  protected:
   void SetUp() override {
@@ -53,8 +48,8 @@ class ExecTest : public DaemonFixture {
   // The launcher with the arguments (behind a wrapper command), as root or
   // (uid given) as that user, on a terminal of its own, with an inherited
   // descriptor 99 and variables that must not reach the program.
-  Launched launch(const std::vector<std::string>& args, uid_t asUser = 0, std::vector<std::string> command = {},
-                  const std::string& input = "/dev/null") {
+  ProgramRun launch(const std::vector<std::string>& args, uid_t asUser = 0, std::vector<std::string> command = {},
+                    const std::string& input = "/dev/null") {
     const std::string out = root + "/exec.out", err = root + "/exec.err";
     // The terminal's master stays here: its last close would hang the program up.
     int pty = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
@@ -141,7 +136,7 @@ TEST_F(ExecTest, ProgramReachesItsContainersAndNothingElse) {
   }
   args.insert(args.end(),
               {entitled, "--root", root, "create", "--class", "2", "--user", "502", "--identifier", "stolen"});
-  Launched run = launch(args, 0, {}, QRT_EXEC_PRELOAD_PATH);
+  ProgramRun run = launch(args, 0, {}, QRT_EXEC_PRELOAD_PATH);
   ASSERT_EQ(run.status, 0) << run.err;
   EXPECT_EQ(run.out, expected);
   EXPECT_EQ(ownerAndMode(data + "/Documents/note").first, 501u) << "the program runs as the user";
@@ -185,7 +180,7 @@ TEST_F(ExecTest, RefusesWithClearMessages) {
       {with({"--no-network"}, {"n:1"}), 0, "", 0, "EACCES\n"},
   };
   for (const Case& c : cases) {
-    Launched launched = launch(c.args, c.user, c.command);
+    ProgramRun launched = launch(c.args, c.user, c.command);
     EXPECT_EQ(launched.status, c.status) << c.message << ": " << launched.err;
     EXPECT_TRUE(contains(launched.err, c.message.empty() ? "" : "quarter-exec: " + c.message)) << launched.err;
     EXPECT_EQ(launched.out, c.out) << c.message;

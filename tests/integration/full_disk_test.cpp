@@ -36,20 +36,12 @@ class FullDiskTest : public InstallerFixture {
     close(fd);
   }
 
-  uint64_t registerProgram(const std::string& id, const std::string& group) {
-    return codeOf(call(
-        QRTCommandProcessCodeSigningInfo,
-        {{QRTKeyIdentifier, id},
-         {"CodeSigningInfo",
-          plist::Dictionary{
-              {"Entitlements", plist::Dictionary{{"com.norvane.security.application-groups", plist::Array{group}}}}}},
-         {"OptionsDictionary", plist::Dictionary{}}}));
+  uint64_t registerGroup(const std::string& group) {
+    return registerProgram("com.example.kept", {{"com.norvane.security.application-groups", plist::Array{group}}});
   }
 
   std::string infoValue(const Container& c) {
-    auto reply = call(QRTCommandInfoValueForKey, with(selector(c), {{QRTKeyKey, "k"}}));
-    auto value = at(reply, QRTReplyKeyInfoValue);
-    return value && value->isString() ? value->string() : "(none)";
+    return stringAt(call(QRTCommandInfoValueForKey, with(selector(c), {{QRTKeyKey, "k"}})), QRTReplyKeyInfoValue);
   }
 
   // Every metadata file under the store parses: none was truncated.
@@ -70,7 +62,7 @@ TEST_F(FullDiskTest, EveryChangeFailsCleanlyAndWorksAgainOnceSpaceIsFreed) {
   Container wiped = make(501, "com.example.wiped", 2), addon = make(501, "com.example.addon", 4);
   ASSERT_EQ(codeOf(call(QRTCommandSetInfoValue, with(selector(kept), {{QRTKeyKey, "k"}, {QRTKeyValue, "before"}}))),
             1u);
-  ASSERT_EQ(registerProgram("com.example.kept", "group.com.example.before"), 1u);
+  ASSERT_EQ(registerGroup("group.com.example.before"), 1u);
   writeFile(kept.path + "/Documents/file", "content");
   const std::vector<std::string> containersBefore = listDirectory(appClassDir());
 
@@ -105,7 +97,7 @@ TEST_F(FullDiskTest, EveryChangeFailsCleanlyAndWorksAgainOnceSpaceIsFreed) {
     SCOPED_TRACE(change.what);
     const size_t logBefore = logText().size();
     const uint64_t code = change.command == QRTCommandProcessCodeSigningInfo
-                              ? registerProgram("com.example.kept", "group.com.example." + big.substr(0, 4000))
+                              ? registerGroup("group.com.example." + big.substr(0, 4000))
                               : codeOf(call(change.command, change.keys));
     ASSERT_NE(code, 0u) << "no answer";
     if (code != 1) { EXPECT_GT(logText().size(), logBefore) << "an error without a log line"; }
@@ -130,7 +122,7 @@ TEST_F(FullDiskTest, EveryChangeFailsCleanlyAndWorksAgainOnceSpaceIsFreed) {
   EXPECT_EQ(make(501, "com.example.new", 2).error, 1u);
   EXPECT_EQ(codeOf(call(QRTCommandSetInfoValue, with(selector(kept), {{QRTKeyKey, "k"}, {QRTKeyValue, "after"}}))), 1u);
   EXPECT_EQ(infoValue(kept), "after");
-  EXPECT_EQ(registerProgram("com.example.kept", "group.com.example.after"), 1u);
+  EXPECT_EQ(registerGroup("group.com.example.after"), 1u);
   EXPECT_EQ(codeOf(call(QRTCommandDeleteDataContainerContent, byName(wiped))), 1u);
   expectMetadataReadable();
 }

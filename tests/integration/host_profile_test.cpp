@@ -13,7 +13,6 @@
 
 #include <chrono>
 #include <filesystem>
-#include <thread>
 
 #include "DaemonFixture.h"
 #include "base/PlistCodec.h"
@@ -47,13 +46,6 @@ class HostProfile {
   }
   // A path as the daemon sees it.
   std::string inside(const std::string& path) const { return proc_ + "/root" + path; }
-  bool waitForSocket() const {
-    for (int i = 0; i < 400; ++i) {
-      if (exists(inside("/run/quarterd/request.sock"))) return true;
-      std::this_thread::sleep_for(std::chrono::milliseconds(25));
-    }
-    return false;
-  }
   // One request from a process of uid.
   std::optional<plist::Dictionary> call(uid_t uid, const plist::Dictionary& message) const {
     int out[2];
@@ -89,11 +81,6 @@ class HostProfile {
   std::string proc_;
 };
 
-std::optional<std::string> stringAt(const std::optional<plist::Dictionary>& reply, const char* key) {
-  auto v = at(reply, key);
-  return v && v->isString() ? std::optional<std::string>(v->string()) : std::nullopt;
-}
-
 TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
   char tmpl[] = "/tmp/quarterd-host.XXXXXX";
   ASSERT_NE(mkdtemp(tmpl), nullptr);
@@ -125,7 +112,7 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
   writePlist(dir + "/etc/quarterd/identities/installer.plist", identity);
 
   HostProfile host(dir);
-  ASSERT_TRUE(host.waitForSocket());
+  ASSERT_TRUE(eventually([&] { return exists(host.inside("/run/quarterd/request.sock")); }));
   const std::string store = "/var/lib/quarterd/containers/";
   const std::string aliceData = dir + "/home/alice/.local/share/quarterd/Containers/";
   const std::string bobData = dir + "/home/bob/.local/share/quarterd/Containers/";
@@ -157,7 +144,7 @@ TEST(HostProfileTest, PathsAndOwnersAreTheHostsRepliesAndMetadataTheProtocols) {
     ASSERT_TRUE(reply);
     EXPECT_EQ(codeOf(reply) == 1, row.made) << codeOf(reply);
     if (!row.made) continue;
-    std::string path = stringAt(reply, QRTReplyKeyPath).value_or("");
+    const std::string path = stringAt(reply, QRTReplyKeyPath);
     ASSERT_EQ(path.rfind(row.pathPrefix, 0), 0u) << path;
     const std::string seen = path.starts_with("/var/") ? host.inside(path) : path;
     if (row.owner != UINT32_MAX) { EXPECT_EQ(ownerAndMode(seen).first, row.owner); }

@@ -160,8 +160,6 @@ class MigrationTest : public InstallerFixture {
   }
 };
 
-// ---- code-signing imports, whole and interrupted at each step ----
-
 class DataMigrationTest : public MigrationTest, public ::testing::WithParamInterface<const char*> {};
 
 TEST_P(DataMigrationTest, ImportsEveryOlderStoreOnce) {
@@ -230,8 +228,6 @@ TEST_F(MigrationTest, MappingFileWhoseEveryEntryFailsStays) {
   EXPECT_TRUE(exists(file));
 }
 
-// ---- build upgrade ----
-
 using BuildUpgradeTest = DataMigrationTest;
 
 TEST_P(BuildUpgradeTest, RunsOncePerNewBuild) {
@@ -283,8 +279,6 @@ INSTANTIATE_TEST_SUITE_P(CrashPoints, BuildUpgradeTest,
                                            "startup-build-upgrade-migrated"),
                          crashPointName);
 
-// ---- first start after a reboot ----
-
 TEST_F(MigrationTest, RebootClearsLeftoversAndInstallsBackup) {
   make(501, "org.legacy.keep", 2);
   make(501, "org.legacy.temp", 2, true);
@@ -310,8 +304,8 @@ TEST_F(MigrationTest, RebootClearsLeftoversAndInstallsBackup) {
   writeFile(backup + "/Shared/systemgroup.org.legacy.restored/shared.txt", "shared");
   reboot();
   startDaemon();
-  ASSERT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)),
-            1u);  // waits for the death-row pass that start-up queued
+  // Waits for the death-row pass that start-up queued.
+  ASSERT_EQ(codeOf(call(QRTCommandDeleteContainersOnDeathRow)), 1u);
 
   EXPECT_TRUE(listDirectory(caches + "/Staging").empty());
   EXPECT_TRUE(listDirectory(caches + "/Temp").empty());

@@ -1,5 +1,6 @@
 // The quarterctl binary against the real daemon: what it prints for people
-// and for scripts, and the exit status that scripts rely on.
+// and for scripts, and the exit status that scripts rely on; the tools'
+// --help against their man pages.
 #include <stdlib.h>
 #include <sys/wait.h>
 
@@ -17,12 +18,6 @@
 #include "base/PlistCodec.h"
 
 namespace {
-
-// The exit status (-1 when it did not exit normally) and what was printed.
-struct CtlRun {
-  int status = -1;
-  std::string out, err;
-};
 
 // The rows of a table, cut at the columns of its header line.
 std::vector<std::map<std::string, std::string>> rows(const std::string& out) {
@@ -58,15 +53,15 @@ class QuarterctlTest : public DaemonFixture {
   }
 
   // Runs the binary with --root and the arguments, as a shell splits them.
-  CtlRun run(const std::string& args) { return shell(ctl + " --root " + root + " " + args); }
+  ProgramRun run(const std::string& args) { return shell(ctl + " --root " + root + " " + args); }
   // The daemon's refusal: exit 1, nothing on standard output, the code named on standard error
   // (what follows "quarterctl: "; the whole text when it is not so).
   std::string refusal(const std::string& args, bool withRoot = true) {
-    CtlRun r = withRoot ? run(args) : shell(args);
+    ProgramRun r = withRoot ? run(args) : shell(args);
     const bool plain = r.status == 1 && r.out.empty() && r.err.starts_with("quarterctl: ") && r.err.ends_with("\n");
     return plain ? r.err.substr(12, r.err.size() - 13) : "status " + std::to_string(r.status) + ": " + r.out + r.err;
   }
-  CtlRun shell(const std::string& command) {
+  ProgramRun shell(const std::string& command) {
     const std::string out = root + "/ctl.out", err = root + "/ctl.err";
     int status = system((command + " >" + out + " 2>" + err).c_str());
     return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, readFile(out), readFile(err)};
@@ -165,11 +160,11 @@ TEST_F(QuarterctlTest, ExitStatusTellsDaemonErrorsFromUsageErrors) {
        "is quarterd running on this device root? start it with: quarterd --root"},
   };
   for (const auto& [args, err] : usage) {
-    CtlRun r = run(args);
+    ProgramRun r = run(args);
     EXPECT_EQ(r.status, 2) << args;
     EXPECT_TRUE(contains(r.err, err)) << args << ": " << r.err;
   }
-  CtlRun down = shell(ctl + " --socket " + root + "/nowhere deathrow");
+  ProgramRun down = shell(ctl + " --socket " + root + "/nowhere deathrow");
   EXPECT_TRUE(contains(down.err, "\nquarterctl: is quarterd running? try: systemctl status quarterd\n")) << down.err;
 }
 
@@ -184,25 +179,21 @@ TEST_F(QuarterctlTest, StageWipeSystemPathAndAssets) {
   EXPECT_FALSE(exists(path + "/Documents/file"));
   EXPECT_EQ(run("wipe --addon --identifier com.example.keep").status, 1);
 
-  CtlRun sys = run("system-path --identifier com.example.daemon");
+  ProgramRun sys = run("system-path --identifier com.example.daemon");
   EXPECT_EQ(sys.status, 0) << sys.err;
   EXPECT_TRUE(std::filesystem::is_directory(sys.out.substr(0, sys.out.size() - 1))) << sys.out;
 
   ASSERT_EQ(run("create --class 2 --identifier com.example.assets").status, 0);
-  CtlRun assets = run("assets-path --identifier com.example.assets --relative");
+  ProgramRun assets = run("assets-path --identifier com.example.assets --relative");
   EXPECT_TRUE(assets.out.starts_with("Library/com.norvane.UserManagedAssets.")) << assets.err;
   EXPECT_EQ(run("assets-delete --identifier com.example.assets --source ../x").status, 1);
 }
 
 TEST_F(QuarterctlTest, CodeSigningAndGroups) {
-  const plist::Data entitlements = plist::writeBinary(
-      plist::Dictionary{{"com.norvane.security.application-groups", plist::Array{"group.one", "group.two"}},
-                        {"com.norvane.security.system-groups", "systemgroup.com.example.shared"}});
-  writeFile(root + "/ents.plist", std::string(entitlements.begin(), entitlements.end()));
-  EXPECT_EQ(
-      run("codesign set --identifier com.example.app --entitlements " + root + "/ents.plist --data-class app-data")
-          .status,
-      0);
+  writePlist(root + "/ents.plist", {{"com.norvane.security.application-groups", plist::Array{"group.one", "group.two"}},
+                                    {"com.norvane.security.system-groups", "systemgroup.com.example.shared"}});
+  const std::string set = "codesign set --identifier com.example.app";
+  EXPECT_EQ(run(set + " --entitlements " + root + "/ents.plist --data-class app-data").status, 0);
   EXPECT_TRUE(contains(run("codesign get --identifier com.example.app").out, "group.two"));
   EXPECT_EQ(run("groups ids --identifier com.example.app").out, "GROUP\ngroup.one\ngroup.two\n");
   auto paths = rows(run("groups paths --identifier com.example.app").out);
@@ -214,10 +205,10 @@ TEST_F(QuarterctlTest, CodeSigningAndGroups) {
   EXPECT_EQ(rows(run("groups paths --system --identifier com.example.app").out)[0]["GROUP"],
             "systemgroup.com.example.shared");
 
-  EXPECT_EQ(run("codesign set --identifier com.example.app --remove").status, 0);
+  EXPECT_EQ(run(set + " --remove").status, 0);
   EXPECT_EQ(refusal("codesign get --identifier com.example.app"), "error 21 (no such container)");
   EXPECT_EQ(run("codesign invalidate-missing").status, 0);
-  EXPECT_EQ(run("codesign set --identifier com.example.app").status, 2) << "one of the three is required";
+  EXPECT_EQ(run(set).status, 2) << "one of the three is required";
 }
 
 TEST_F(QuarterctlTest, StatusMetricsAndTheLogLevelOfTheRunningDaemon) {
@@ -265,7 +256,7 @@ TEST_F(QuarterctlTest, VerifyReportsAndRepairsEveryPlantedFinding) {
                   moved = make(501, "com.example.moved", 2), owned = make(501, "com.example.owned", 2),
                   addon = make(501, "com.example.addon", 4), twin = make(501, "com.example.twin", 2);
   auto verify = [&](const std::string& args) {
-    CtlRun r = run("--json verify " + args);
+    ProgramRun r = run("--json verify " + args);
     EXPECT_EQ(r.status, 0) << r.err;
     return nlohmann::json::parse(r.out.empty() ? "{}" : r.out);
   };
@@ -289,7 +280,6 @@ TEST_F(QuarterctlTest, VerifyReportsAndRepairsEveryPlantedFinding) {
   auto oldFile = [](std::string path) {
     return [path] { writeFile(path, "x"), output("touch -d 2000-01-01 " + path); };
   };
-  const plist::Data ents = plist::writeBinary(plist::Dictionary{{"com.norvane.security.application-groups", "g.one"}});
   struct {
     const char* kind;
     std::string subject;
@@ -333,7 +323,7 @@ TEST_F(QuarterctlTest, VerifyReportsAndRepairsEveryPlantedFinding) {
        kept(library + "PendingUpdates/u"), false},
       {"codesign-orphan", "com.example.nobundle",
        [&] {
-         writeFile(root + "/ents.plist", std::string(ents.begin(), ents.end()));
+         writePlist(root + "/ents.plist", {{"com.norvane.security.application-groups", "g.one"}});
          run("codesign set --identifier com.example.nobundle --entitlements " + root + "/ents.plist");
        },
        [] { return true; }, true},
@@ -424,6 +414,14 @@ TEST(QuarterctlDocs, HelpManPageAndCompletionNameTheSameCommandsAndOptions) {
   EXPECT_GE(help.size(), 30u);
   EXPECT_EQ(help, page);
   EXPECT_EQ(help, completion);
+}
+
+TEST(ManPages, AgreeWithHelpOnEveryOption) {
+  for (const auto& [binary, page] : {std::pair{QRT_DAEMON_PATH, "quarterd.8"}, {QRT_EXEC_PATH, "quarter-exec.1"}}) {
+    const std::set<std::string> help = optionsIn(output(std::string(binary) + " --help"));
+    EXPECT_GE(help.size(), 5u) << binary;
+    EXPECT_EQ(help, optionsIn(readFile(std::string(QRT_MAN_DIR) + "/" + page))) << page;
+  }
 }
 
 }  // namespace

@@ -63,17 +63,15 @@ class ReplaceTest : public InstallerFixture {
     return count;
   }
 
-  // Sends a request that must kill the daemon at the point, then starts it again unarmed.
-  void crashAndRestart(uint64_t command, const plist::Dictionary& keys, const std::string& point) {
-    expectKilledAt(point, command, keys);
-    startDaemon();
-  }
-
-  // The identifier's permanent container is c, at its path.
-  void expectLive(const std::string& id, const Container& c) {
-    Container live = lookup(id);
-    EXPECT_EQ(live.path, c.path);
-    EXPECT_EQ(live.uuid, c.uuid);
+  // A replace that did not happen: old is still its identifier's container,
+  // both contents (marked marker-old and marker-new) where they were.
+  void expectUnchanged(const Container& old, const Container& fresh, const std::string& marker) {
+    Container live = lookup(old.identifier);
+    EXPECT_EQ(live.path, old.path);
+    EXPECT_EQ(live.uuid, old.uuid);
+    EXPECT_EQ(markerAt(old.path), marker + "-old");
+    EXPECT_EQ(markerAt(fresh.path), marker + "-new");
+    expectNothingInFlight();
   }
 
   void expectNothingInFlight() {
@@ -141,10 +139,7 @@ TEST_F(ReplaceTest, RefusalsChangeNothing) {
     SCOPED_TRACE(refusal.name);
     EXPECT_EQ(codeOf(call(QRTCommandReplaceContainer, changed(replaceKeys(&old, fresh), refusal.key, refusal.value))),
               refusal.code);
-    EXPECT_EQ(markerAt(old.path), "keep-old");
-    EXPECT_EQ(markerAt(fresh.path), "keep-new");
-    expectLive("com.example.keep", old);
-    expectNothingInFlight();
+    expectUnchanged(old, fresh, "keep");
   }
 }
 
@@ -161,10 +156,7 @@ TEST_F(ReplaceTest, FailedMoveOfNewContainerPutsOldOneBack) {
   const uint64_t code = codeOf(call(QRTCommandReplaceContainer, replaceKeys(&old, fresh)));
   ASSERT_EQ(system(("chattr -i " + fresh.path).c_str()), 0);
   EXPECT_EQ(code, 15u);
-  expectLive("com.example.back", old);
-  EXPECT_EQ(markerAt(old.path), "back-old");
-  EXPECT_EQ(markerAt(fresh.path), "back-new");
-  expectNothingInFlight();
+  expectUnchanged(old, fresh, "back");
 
   EXPECT_EQ(codeOf(call(QRTCommandReplaceContainer, replaceKeys(&old, fresh))), 1u);
   EXPECT_EQ(markerAt(lookup("com.example.back").path), "back-new");
@@ -206,15 +198,15 @@ TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
   ASSERT_TRUE(call(QRTCommandContainersForUser,
                    {{QRTKeyContainerClass, 2}, {QRTKeyUserID, 501}}));  // served once start-up is over
   EXPECT_TRUE(listDirectory(other + "/.staging").empty());
-  for (int i = 0; i < 100 && !listDirectory(other + "/.deathrow").empty(); ++i) usleep(20000);
-  EXPECT_TRUE(listDirectory(other + "/.deathrow").empty());
+  EXPECT_TRUE(eventually([&] { return listDirectory(other + "/.deathrow").empty(); }));
   // A creation is whole or absent; a deletion leaves the content on death row only.
   for (auto [point, command, code] :
        {std::tuple{"create-after-build", 0, 21u}, {"create-after-move", 0, 1u}, {"delete-after-stage", 10, 21u}}) {
     SCOPED_TRACE(point);
     const std::string id = std::string("com.example.") + point;
     if (command == 10) make(id, false, id);
-    crashAndRestart(command, with(byName(501, 2, id), {{QRTKeyCreateIfNecessary, true}}), point);
+    expectKilledAt(point, command, with(byName(501, 2, id), {{QRTKeyCreateIfNecessary, true}}));
+    startDaemon();
     Container live = lookup(id);
     EXPECT_EQ(live.error, code);
     if (live.error == 1) { EXPECT_TRUE(exists(live.path + "/Library/Caches")) << live.path; }
@@ -232,7 +224,8 @@ TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
     const std::string id = std::string("com.example.") + point;
     Container old = make(id, false, id + "-old");
     Container fresh = make(id, true, id + "-new");
-    crashAndRestart(2, replaceKeys(&old, fresh), point);
+    expectKilledAt(point, QRTCommandReplaceContainer, replaceKeys(&old, fresh));
+    startDaemon();
     Container live = lookup(id);
     ASSERT_EQ(live.error, 1u);
     EXPECT_EQ(live.path, newInPlace ? movedIn(fresh) : old.path);
@@ -248,7 +241,8 @@ TEST_P(ReplaceCrashTest, KilledCreateDeleteReplaceOrWipeLosesNothing) {
     // memory and in its metadata file.
     const std::string wipeId = id + ".wipe";
     Container wiped = make(wipeId, false, wipeId + "-old");
-    crashAndRestart(12, byName(501, 2, wipeId), point);
+    expectKilledAt(point, QRTCommandDeleteDataContainerContent, byName(501, 2, wipeId));
+    startDaemon();
     expectLiveAcrossRestart(wipeId, wiped.path, wiped.uuid, newInPlace ? "" : wipeId + "-old", newInPlace);
     EXPECT_EQ(liveCopies(wipeId + "-old"), newInPlace ? 0 : 1);
   }

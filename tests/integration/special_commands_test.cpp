@@ -8,29 +8,22 @@
 
 namespace {
 
-constexpr const char* kAssets = QRTEntitlementUserManagedAssets;
-
 class SpecialCommandsTest : public DaemonFixture {};
 
-std::string replyPath(const std::optional<plist::Dictionary>& reply) {
-  auto v = at(reply, QRTReplyKeyPath);
-  return v && v->stringIf() ? *v->stringIf() : "";
-}
-
 TEST_F(SpecialCommandsTest, UserManagedAssetsStayInsideTheirDirectory) {
-  setOwnIdentity("com.example.caller", plist::Dictionary{{kAssets, true}});
+  setOwnIdentity("com.example.caller", plist::Dictionary{{QRTEntitlementUserManagedAssets, true}});
   Container app = make(501, "com.example.app", 2);
   // "UserID" is ignored: the mobile user's container is meant.
   auto first =
       call(QRTCommandUserManagedAssetsPath, {{QRTKeyIdentifier, "com.example.app"}, {QRTKeyUserID, uint64_t{777}}});
   ASSERT_EQ(codeOf(first), 1u);
-  const std::string assets = replyPath(first);
+  const std::string assets = stringAt(first, QRTReplyKeyPath);
   EXPECT_EQ(parentOf(assets), app.path + "/Library");
   EXPECT_TRUE(baseName(assets).starts_with("com.norvane.UserManagedAssets."));
   EXPECT_EQ(ownerAndMode(assets), std::make_pair(501u, 0755u));
   auto relative =
       call(QRTCommandUserManagedAssetsPath, {{QRTKeyIdentifier, "com.example.app"}, {QRTKeyIsRelative, true}});
-  EXPECT_EQ(replyPath(relative), "Library/" + baseName(assets));
+  EXPECT_EQ(stringAt(relative, QRTReplyKeyPath), "Library/" + baseName(assets));
 
   // What the owner plants, as the owner.
   const std::string outside = root + "/outside";
@@ -116,7 +109,7 @@ TEST_F(SpecialCommandsTest, SharedContentRefusesDotsAndTheUnentitled) {
   EXPECT_FALSE(exists(root + "/b"));
   auto moved = call(QRTCommandStageSharedContent, keys);
   EXPECT_EQ(codeOf(moved), 1u);
-  EXPECT_EQ(replyPath(moved), container + "/b");
+  EXPECT_EQ(stringAt(moved, QRTReplyKeyPath), container + "/b");
   EXPECT_EQ(readFile(container + "/b"), "shared");
 }
 
@@ -127,9 +120,7 @@ TEST_F(SpecialCommandsTest, RetryTestOnlyOnInternalBuilds) {
   EXPECT_TRUE(logContains("People really shouldn't be calling this on non-internal installs!"));
   EXPECT_TRUE(listDirectory(appClassDir()).empty());
 
-  writeFile(root + "/etc/device-properties.plist",
-            "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
-            "<key>InternalBuild</key><true/></dict></plist>\n");
+  writePlist(root + "/etc/device-properties.plist", {{"InternalBuild", true}});
   // One crash: the daemon ends without a reply, then the next call cleans up.
   EXPECT_FALSE(call(QRTCommandRetryTest, keys));
   int status = -1;

@@ -42,12 +42,7 @@ TEST_F(UpcallTest, StartingProcessGetsItsContainers) {
   personaOnly.personaId = 0;
   // The installer's registration says the program's data container is a plug-in's.
   setOwnIdentity("com.example.installer", {{QRTEntitlementAllowed, true}});
-  EXPECT_EQ(
-      codeOf(call(QRTCommandProcessCodeSigningInfo,
-                  {{QRTKeyIdentifier, "com.example.mapped"},
-                   {"CodeSigningInfo", plist::Dictionary{{"com.norvane.QuarterKit.Entitlements", plist::Dictionary{}}}},
-                   {"OptionsDictionary", plist::Dictionary{{"com.norvane.QuarterKit.DataContainerClass", 4}}}})),
-      1u);
+  EXPECT_EQ(registerProgram("com.example.mapped", {}, {{"com.norvane.QuarterKit.DataContainerClass", 4}}), 1u);
   const Case cases[] = {
       {"application", app("com.example.app"), "com.example.app", 2},
       {"container id wins", both, "com.example.container", 2},
@@ -78,7 +73,6 @@ TEST_F(UpcallTest, StartingProcessGetsItsContainers) {
     EXPECT_TRUE(exists(found.path + "/tmp"));
     EXPECT_TRUE(answer->groups.empty());
     EXPECT_FALSE(answer->systemContainer);
-    // Asked again, the same paths.
     EXPECT_EQ(k->call(c.request)->dataContainer, found.path);
   }
   // Groups and system containers the request names, in request order.
@@ -116,8 +110,8 @@ TEST_F(UpcallTest, MalformedFramesGetTheirCodes) {
   const std::vector<uint8_t> good = qk::packUpcallRequest(app("com.example.app"));
   std::vector<uint8_t> unknownItem = {2, 0, 9, 0, 2, 0, 0, 0, 'x', 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0};
   std::vector<uint8_t> cut(good.begin(), good.end() - 8);  // no end marker
+  // Three bytes, none of them NUL.
   std::vector<uint8_t> noNul = {2, 0, 0, 0, 3, 0, 0, 0, 'a', 'b', 'c', 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0};
-  noNul[10] = 'c';  // three bytes, none of them NUL
   struct Case {
     const char* name;
     qk::UpcallFrame frame;
@@ -142,8 +136,7 @@ TEST_F(UpcallTest, MalformedFramesGetTheirCodes) {
     EXPECT_EQ(answer->replyId, c.frame.id + 100) << c.name;
     EXPECT_EQ(answer->returnCode, c.code) << c.name;
   }
-  // The connection survived all of them.
-  EXPECT_EQ(k->call(app("com.example.app"))->status, 1u);
+  EXPECT_EQ(k->call(app("com.example.app"))->status, 1u) << "the connection survived all of them";
 
   // Not this server's id, and a region over 1 MiB, close the connection.
   for (qk::UpcallFrame frame : {qk::UpcallFrame{.id = 42}, qk::UpcallFrame{.regionSize = (1u << 20) + 1}}) {
