@@ -5,6 +5,7 @@
 #include <cerrno>
 #include <cstdint>
 #include <cstring>
+#include <ctime>
 #include <set>
 
 #include "Daemon/store/QRTContentClass.h"
@@ -31,6 +32,12 @@ uint64_t heldKey(uint32_t userId, uint64_t contentClass, bool transient) {
 // The class map as the log names it.
 std::string cacheName(uint32_t userId, uint64_t contentClass) {
   return std::to_string(userId) + "-" + QRTContentClassPathName(contentClass);
+}
+
+// A change time more than a second behind now: any change from now on
+// stamps a later one, whatever the file system's time granularity.
+bool settled(const struct timespec& changed, const struct timespec& now) {
+  return (now.tv_sec - changed.tv_sec) * 1000000000LL + (now.tv_nsec - changed.tv_nsec) > 1000000000LL;
 }
 
 // Error 47 for a class outside 1 to 13 or a missing identifier.
@@ -159,14 +166,14 @@ QRTContainerCache::ClassMap* QRTContainerCache::lockedClassMap(std::unique_lock<
 }
 
 bool QRTContainerCache::checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_t userId, uint64_t contentClass,
-                                         bool transient, QRTErrorRef* error) {
+                                         bool transient, bool learn, QRTErrorRef* error) {
   const char* className = QRTContentClassPathName(contentClass);
   if (metadata->url().empty()) {
     QRTSetError(error, QRT_ERROR(QRTErrorCacheInvalidInput, nullptr, true, "Cache: %@%@: nil URL from %@", className,
                                  suffix(transient), metadata));
     return false;
   }
-  if (!metadataMissing(metadata, userId, contentClass, transient)) return true;
+  if (!metadataMissing(metadata, userId, contentClass, transient, learn)) return true;
   QRTURL file = metadata->url().URLByAppendingPathComponent(QRTMetadataFileName);
   QRTSetError(
       error, QRT_ERROR(QRTErrorCacheInconsistent, nullptr, true,
@@ -185,6 +192,7 @@ bool QRTContainerCache::checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_
         removed = true;
       }
     }
+    forgetSeen(userId, contentClass, transient, metadata->url());
   }
   if (removed && !transient &&
       !setSandboxContainerMappingForUser(userId, metadata->identifier(), contentClass, std::nullopt)) {
@@ -216,19 +224,42 @@ QRTContainerCache::HeldClassDirectoryRef QRTContainerCache::classDirectory(uint3
 }
 
 bool QRTContainerCache::metadataMissing(const QRTMetadataRef& metadata, uint32_t userId, uint64_t contentClass,
-                                        bool transient) {
+                                        bool transient, bool learn) {
   const std::string& path = metadata->url().path();
   const size_t slash = path.rfind('/');
   const std::string_view parent = std::string_view(path).substr(0, slash == 0 ? 1 : slash);
-  const std::string name = path.substr(slash + 1) + "/" + QRTMetadataFileName;
+  const std::string leaf = path.substr(slash + 1);
   // A miss or a path that differs may come from a stale held directory: it
   // is opened afresh once, and a miss is confirmed from the device root.
   for (bool reopen : {false, true}) {
     HeldClassDirectoryRef held = classDirectory(userId, contentClass, transient, reopen);
     if (!held) break;
     if (held->path != parent) continue;
-    const int err = held->directory.exists(name);
-    if (err == 0) return false;
+    std::optional<SeenDirectory> seen;
+    {
+      std::lock_guard<std::mutex> hold(cacheLock);
+      if (auto found = held->seen.find(leaf); found != held->seen.end()) seen = found->second;
+    }
+    // The clock is read before the look, so that any later change to the
+    // directory stamps it with a later change time.
+    struct timespec now {};
+    struct stat st {};
+    bool looked = false;
+    if (seen || learn) {
+      clock_gettime(CLOCK_REALTIME, &now);
+      looked = !leaf.empty() && held->directory.lstat(leaf, &st) == 0 && S_ISDIR(st.st_mode);
+      if (looked && seen && seen->device == st.st_dev && seen->inode == st.st_ino &&
+          seen->changed.tv_sec == st.st_ctim.tv_sec && seen->changed.tv_nsec == st.st_ctim.tv_nsec)
+        return false;
+    }
+    const int err = held->directory.exists(leaf + "/" + QRTMetadataFileName);
+    if (err == 0) {
+      if (looked && settled(st.st_ctim, now)) {
+        std::lock_guard<std::mutex> hold(cacheLock);
+        held->seen[leaf] = {st.st_dev, st.st_ino, st.st_ctim};
+      }
+      return false;
+    }
     if (err != ENOENT) {
       QRTLog(kLogError, "Failed to determine if %@/%s exists: %s", path, QRTMetadataFileName, strerror(err));
       return false;
@@ -236,6 +267,13 @@ bool QRTContainerCache::metadataMissing(const QRTMetadataRef& metadata, uint32_t
   }
   return QRTFileManager::defaultManager().itemDoesNotExistAtURL(
       metadata->url().URLByAppendingPathComponent(QRTMetadataFileName));
+}
+
+void QRTContainerCache::forgetSeen(uint32_t userId, uint64_t contentClass, bool transient, const QRTURL& url) {
+  auto held = heldClassDirectories.find(heldKey(userId, contentClass, transient));
+  if (held == heldClassDirectories.end()) return;
+  const std::string& path = url.path();
+  held->second->seen.erase(path.substr(path.rfind('/') + 1));
 }
 
 QRTMetadataRef QRTContainerCache::containerForUser(const QRTContainerKey& key, QRTErrorRef* error) {
@@ -258,7 +296,7 @@ QRTMetadataRef QRTContainerCache::containerForUser(const QRTContainerKey& key, Q
       }
       found = it->second;
     }
-    if (!checkEntryOnDisk(found, userId, contentClass, transient, error)) return nullptr;
+    if (!checkEntryOnDisk(found, userId, contentClass, transient, true, error)) return nullptr;
     QRTLog(kLogDebug, "Cache: %@%@: Found Identifier: %@", QRTContentClassPathName(contentClass), suffix(transient),
            platform::logIdentifier(identifier));
     return found;
@@ -315,7 +353,7 @@ std::optional<std::vector<QRTMetadataRef>> QRTContainerCache::allContainersForUs
     live.reserve(snapshot.size());
     for (QRTMetadataRef& metadata : snapshot) {
       QRTErrorRef entryError;
-      if (!checkEntryOnDisk(metadata, userId, contentClass, transient, &entryError)) continue;
+      if (!checkEntryOnDisk(metadata, userId, contentClass, transient, false, &entryError)) continue;
       QRTLog(kLogDebug, "Cache: %@%@: ALL Found Identifier: %@", QRTContentClassPathName(contentClass),
              suffix(transient), platform::logIdentifier(metadata->identifier()));
       live.push_back(std::move(metadata));
@@ -418,7 +456,10 @@ bool QRTContainerCache::removeContainerForUser(uint32_t userId, uint64_t content
       std::unique_lock<std::mutex> hold(cacheLock);
       ClassMap* map = lockedClassMap(hold, __func__, userId, contentClass, transient, true, error);
       if (!map) return false;
-      map->erase(*identifier);
+      if (auto entry = map->find(*identifier); entry != map->end()) {
+        if (entry->second) forgetSeen(userId, contentClass, transient, entry->second->url());
+        map->erase(entry);
+      }
     }
     if (!transient && !setSandboxContainerMappingForUser(userId, *identifier, contentClass, std::nullopt)) {
       QRTLog(kLogError, "Failed to remove container mapping of %@, %llu", platform::logIdentifier(identifier),

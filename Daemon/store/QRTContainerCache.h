@@ -90,25 +90,46 @@ class QRTContainerCache {
                            uint64_t contentClass, bool transient, bool populateSandboxCache, QRTErrorRef* error);
   // The metadata file is gone: forget the container, unless its entry has
   // been replaced meanwhile. False with error 44 (or 47 when the entry has no
-  // usable URL).
+  // usable URL). learn as for metadataMissing.
   bool checkEntryOnDisk(const QRTMetadataRef& metadata, uint32_t userId, uint64_t contentClass, bool transient,
-                        QRTErrorRef* error);
+                        bool learn, QRTErrorRef* error);
 
   // The class directory held open with its host path, so that a container's
   // metadata file is checked with two components resolved beneath it rather
   // than its whole path from the device root.
+  //
+  // seen keeps, per container directory name, the directory as it was when
+  // its metadata file was last found: while the name still gives the same
+  // inode with the same change time, no entry in it has been added, removed
+  // or renamed since, so the file is still there. Only a change time at
+  // least a second older than the look that found the file is kept, so that
+  // a change within the file system's time granularity cannot go unseen.
+  // Guarded by cacheLock; dropped with the held directory.
+  struct SeenDirectory {
+    dev_t device;
+    ino_t inode;
+    struct timespec changed;
+  };
   struct HeldClassDirectory {
     platform::Dir directory;
     std::string path;
+    mutable std::unordered_map<std::string, SeenDirectory> seen;
   };
   using HeldClassDirectoryRef = std::shared_ptr<const HeldClassDirectory>;
   // The held directory (opened when missing or when reopen is set), or null
   // when it cannot be opened. Takes cacheLock.
   HeldClassDirectoryRef classDirectory(uint32_t userId, uint64_t contentClass, bool transient, bool reopen);
-  // Whether the container's metadata file is missing: ENOENT beneath the held
-  // class directory, confirmed from the device root (the held directory may
-  // have been replaced, and is then opened afresh).
-  bool metadataMissing(const QRTMetadataRef& metadata, uint32_t userId, uint64_t contentClass, bool transient);
+  // Whether the container's metadata file is missing: its directory unchanged
+  // since the file was seen (one look at one name beneath the held class
+  // directory), else ENOENT beneath the held class directory, confirmed from
+  // the device root (the held directory may have been replaced, and is then
+  // opened afresh). Only with learn is a directory not yet in seen looked at
+  // to be kept there: look-ups, which repeat at every program start, learn;
+  // a listing, which looks at each container once, does not.
+  bool metadataMissing(const QRTMetadataRef& metadata, uint32_t userId, uint64_t contentClass, bool transient,
+                       bool learn);
+  // Drops what seen holds for the container directory at url. With cacheLock held.
+  void forgetSeen(uint32_t userId, uint64_t contentClass, bool transient, const QRTURL& url);
   // addContainerMetadata, also giving back a creation's slot when releaseSlot.
   bool addEntry(const QRTMetadataRef& metadata, uint32_t forUser, const QRTURL& url, bool transient, bool updateSandbox,
                 bool releaseSlot, QRTErrorRef* error, QRTMetadataRef* stored);

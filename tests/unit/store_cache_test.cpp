@@ -80,6 +80,33 @@ TEST_F(ContainerCacheTest, UUIDMatchIsExactAndListingsDropVanishedContainers) {
   EXPECT_EQ((*all)[0]->identifier(), "com.example.kept");
 }
 
+// A look-up trusts a container directory it has seen with its metadata file
+// only while the directory is the same one, unchanged since; the stamp is
+// kept once the change time is more than a second old.
+TEST_F(ContainerCacheTest, ALookUpSeesEveryChangeToAContainerItHasSeen) {
+  const std::vector<std::pair<std::string, std::string>> changes = {
+      {"removed", "rm {}/" + std::string(QRTMetadataFileName)},
+      // The directory's modification time put back: its change time moves all the same.
+      {"removed.and.touched", "rm {}/" + std::string(QRTMetadataFileName) + " && touch -d @0 {}"},
+      {"swapped", "mv {} {}.aside && mkdir {}"},
+  };
+  std::vector<QRTURL> urls;
+  QRTErrorRef error;
+  for (const auto& [name, command] : changes) urls.push_back(writeContainer(502, 6, "com.example." + name));
+  for (const auto& [name, command] : changes)
+    EXPECT_TRUE(cache.containerForUser({502, 6, "com.example." + name}, &error));
+  usleep(1100 * 1000);
+  for (const auto& [name, command] : changes)
+    for (int look = 0; look < 2; ++look) EXPECT_TRUE(cache.containerForUser({502, 6, "com.example." + name}, &error));
+  for (size_t row = 0; row < changes.size(); ++row) {
+    std::string shell = changes[row].second;
+    for (size_t at; (at = shell.find("{}")) != std::string::npos;) shell.replace(at, 2, urls[row].path());
+    ASSERT_EQ(system(shell.c_str()), 0) << shell;
+    EXPECT_FALSE(cache.containerForUser({502, 6, "com.example." + changes[row].first}, &error)) << changes[row].first;
+    EXPECT_EQ(error->code(), 44) << changes[row].first;
+  }
+}
+
 // Entries are shared snapshots: each says which map it is in, and adding one
 // under another place or flag stores a copy and leaves the given one alone.
 TEST_F(ContainerCacheTest, EntriesAgreeWithTheirMapAndAreNeverChangedInPlace) {
