@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <set>
+#include <utility>
 
 #include "Daemon/codesign/QRTSQLiteDB.h"
 #include "Daemon/groups/QRTGroupManager.h"
@@ -104,13 +105,30 @@ QRTCodeSigningMapping* QRTCodeSigningMapping::sharedInstance() {
 
 QRTCodeSigningMapping::QRTCodeSigningMapping(std::unique_ptr<QRTSQLiteDB> db) : codeSigningMappingDB(std::move(db)) {
   // Before the queue exists: nothing else can reach the database yet. The
-  // import's writes read themselves back into the snapshot.
-  _onQueue_loadSnapshot();
+  // import's writes are read back once the snapshot is in.
+  readingFirstSnapshot_ = true;
   _migrateFromMappingFileToDBIfNecessary();
   codeSignQueue = platform::makeSerialQueue("com.norvane.QuarterKit.EntitlementQueue");
+  // Ten thousand programs take tens of milliseconds to read: the request
+  // that made the mapping goes on meanwhile. Under the lock: the install
+  // that ends the read joins it.
+  std::lock_guard<std::mutex> hold(firstSnapshotReaderLock_);
+  firstSnapshotReader_ = std::thread([this] {
+    std::optional<QRTCodeSigningMappingSnapshot::Entries> entries = _readWholeSnapshot();
+    codeSignQueue->async(
+        [this, entries = std::move(entries)]() mutable { _onQueue_installSnapshot(std::move(entries)); });
+  });
 }
 
-QRTCodeSigningMapping::~QRTCodeSigningMapping() = default;
+QRTCodeSigningMapping::~QRTCodeSigningMapping() { _waitForFirstSnapshot(); }
+
+void QRTCodeSigningMapping::_waitForFirstSnapshot() {
+  {
+    std::lock_guard<std::mutex> hold(firstSnapshotReaderLock_);
+    if (firstSnapshotReader_.joinable()) firstSnapshotReader_.join();
+  }
+  codeSignQueue->sync([] {});  // the install the reader left on the queue
+}
 
 // ---- public operations ----
 
@@ -316,24 +334,44 @@ bool QRTCodeSigningMapping::groupReferenceCountsMatchDatabase() {
 
 // ---- the snapshot ----
 
-void QRTCodeSigningMapping::_onQueue_loadSnapshot() {
+std::optional<QRTCodeSigningMappingSnapshot::Entries> QRTCodeSigningMapping::_readWholeSnapshot() {
   QRTCodeSigningMappingSnapshot::Entries entries;
   QRTErrorRef error = codeSigningMappingDB->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
       [&](const std::string& identifier, QRTCodeSigningEntry&& entry) {
         entries.emplace(identifier, std::make_shared<const QRTCodeSigningEntry>(std::move(entry)));
       });
-  if (error) {
-    // A row left out would answer "none": look-ups go to the database instead.
-    QRTLog(kLogError, "Cannot read the code signing database whole; look-ups read it row by row: %@", error);
+  if (!error) return entries;
+  // A row left out would answer "none": look-ups go to the database instead.
+  QRTLog(kLogError, "Cannot read the code signing database whole; look-ups read it row by row: %@", error);
+  return std::nullopt;
+}
+
+void QRTCodeSigningMapping::_onQueue_loadSnapshot() {
+  if (std::optional<QRTCodeSigningMappingSnapshot::Entries> entries = _readWholeSnapshot())
+    snapshot_.replaceAll(std::move(*entries));
+  else
     snapshot_.invalidate();
-    return;
+}
+
+void QRTCodeSigningMapping::_onQueue_installSnapshot(std::optional<QRTCodeSigningMappingSnapshot::Entries> entries) {
+  {
+    // The reader has nothing left to do but return.
+    std::lock_guard<std::mutex> hold(firstSnapshotReaderLock_);
+    if (firstSnapshotReader_.joinable()) firstSnapshotReader_.join();
   }
-  snapshot_.replaceAll(std::move(entries));
+  readingFirstSnapshot_ = false;
+  if (entries) snapshot_.replaceAll(std::move(*entries));
+  // The rows written while it was read may be older there than in the
+  // database (and a failed read is made again here).
+  _onQueue_readBack(std::exchange(writtenWhileReading_, {}), std::exchange(childrenWrittenWhileReading_, {}));
 }
 
 void QRTCodeSigningMapping::_onQueue_readBack(std::vector<std::string> identifiers,
                                               const std::vector<std::string>& children) {
-  if (!snapshot_.loaded()) {
+  if (readingFirstSnapshot_) {
+    writtenWhileReading_.insert(writtenWhileReading_.end(), identifiers.begin(), identifiers.end());
+    childrenWrittenWhileReading_.insert(childrenWrittenWhileReading_.end(), children.begin(), children.end());
+  } else if (!snapshot_.loaded()) {
     _onQueue_loadSnapshot();
   } else {
     // A child row names one parent: writing it under another takes it from the first.
@@ -360,6 +398,7 @@ QRTCodeSigningMappingSnapshot::Lookup QRTCodeSigningMapping::_snapshotEntry(
 }
 
 bool QRTCodeSigningMapping::snapshotMatchesDatabase() {
+  _waitForFirstSnapshot();
   return onQueue([&] {
     std::optional<QRTCodeSigningMappingSnapshot::Entries> held = snapshot_.copy();
     if (!held) return false;

@@ -12,8 +12,10 @@
 #include <functional>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "base/PlistValue.h"
@@ -140,7 +142,13 @@ class QRTCodeSigningMapping : public QRTGroupNames {
   // after a write (with the programs listing any child these name). A row
   // that cannot be read back sets the snapshot aside until it is read whole.
   void _onQueue_loadSnapshot();
+  std::optional<QRTCodeSigningMappingSnapshot::Entries> _readWholeSnapshot();
   void _onQueue_readBack(std::vector<std::string> identifiers, const std::vector<std::string>& children);
+  // The first whole read runs on a thread of its own, beside the request
+  // that made the mapping: until it is in, look-ups ask the database, and
+  // the rows written meanwhile wait to be read back over it.
+  void _onQueue_installSnapshot(std::optional<QRTCodeSigningMappingSnapshot::Entries> entries);
+  void _waitForFirstSnapshot();
   // The entry from the snapshot; Unknown when only the queue can tell.
   QRTCodeSigningMappingSnapshot::Lookup _snapshotEntry(const std::string& identifier,
                                                        QRTCodeSigningMappingSnapshot::EntryRef* entry) const;
@@ -184,6 +192,10 @@ class QRTCodeSigningMapping : public QRTGroupNames {
   std::shared_ptr<platform::Queue> codeSignQueue;
   std::unique_ptr<QRTSQLiteDB> codeSigningMappingDB;
   QRTCodeSigningMappingSnapshot snapshot_;
+  std::thread firstSnapshotReader_;
+  std::mutex firstSnapshotReaderLock_;                                          // for joining it
+  bool readingFirstSnapshot_ = false;                                           // the constructor, then the queue only
+  std::vector<std::string> writtenWhileReading_, childrenWrittenWhileReading_;  // likewise
   std::atomic<uint64_t> generation_{0};
   std::optional<QRTGroupReferenceCounts> groupCounts_[2];  // by group type; on the queue only
 };

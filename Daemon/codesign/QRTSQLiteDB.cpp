@@ -2,6 +2,7 @@
 
 #include <sqlite3.h>
 
+#include <mutex>
 #include <unordered_map>
 #include <utility>
 
@@ -61,8 +62,8 @@ constexpr const char* kSelectChildren =
 }  // namespace
 
 // The connection's statements, each prepared once (persistent) and reset
-// after every use. A statement already in use (a nested call) gets a copy of
-// its own for that call.
+// after every use. A statement already in use (a nested call, or the
+// snapshot's read on its own thread) gets a copy of its own for that call.
 class QRTSQLiteDBStatementCache {
  public:
   QRTSQLiteDBStatementCache(sqlite3* db, const QRTURL& url) : db(db), url(url) {}
@@ -87,6 +88,8 @@ class QRTSQLiteDBStatementCache {
   };
   // Keyed by the text's address: every statement is one of the constants above.
   std::unordered_map<const char*, Slot> slots;
+  // Guards slots: the connection itself is serialized by SQLite.
+  std::mutex lock;
 };
 
 namespace {
@@ -96,6 +99,7 @@ namespace {
 class Statement {
  public:
   Statement(QRTSQLiteDBStatementCache& cache, const char* sql) : cache_(cache) {
+    std::lock_guard<std::mutex> hold(cache.lock);
     QRTSQLiteDBStatementCache::Slot& slot = cache.slots[sql];
     if (slot.statement && !slot.inUse) {
       slot_ = &slot;
@@ -119,6 +123,7 @@ class Statement {
     }
     sqlite3_reset(stmt_);
     sqlite3_clear_bindings(stmt_);
+    std::lock_guard<std::mutex> hold(cache_.lock);
     slot_->inUse = false;
   }
   Statement(const Statement&) = delete;
@@ -301,7 +306,8 @@ sqlite3* QRTSQLiteDB::openDBWithURL(const QRTURL& url) {
   sqlite3* db = nullptr;
   // The library directory is root's; NOFOLLOW keeps a planted link from
   // taking the file elsewhere all the same.
-  const int flags = SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOFOLLOW;
+  // Serialized: the snapshot is read on a thread of its own beside the queue.
+  const int flags = SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOFOLLOW | SQLITE_OPEN_FULLMUTEX;
   if (sqlite3_open_v2(url.fileSystemRepresentation(), &db, flags, nullptr) != SQLITE_OK) {
     QRTLog(kLogError, "opening %@ failed: %s", url, db ? sqlite3_errmsg(db) : "out of memory");
     sqlite3_close(db);
