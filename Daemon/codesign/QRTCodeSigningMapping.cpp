@@ -4,6 +4,7 @@
 #include <set>
 #include <utility>
 
+#include "Daemon/QRTCrashPoint.h"
 #include "Daemon/codesign/QRTSQLiteDB.h"
 #include "Daemon/groups/QRTGroupManager.h"
 #include "Daemon/store/QRTClientConnection.h"
@@ -115,6 +116,7 @@ QRTCodeSigningMapping::QRTCodeSigningMapping(std::unique_ptr<QRTSQLiteDB> db) : 
   std::lock_guard<std::mutex> hold(firstSnapshotReaderLock_);
   firstSnapshotReader_ = std::thread([this] {
     std::optional<QRTCodeSigningMappingSnapshot::Entries> entries = _readWholeSnapshot();
+    QRT_PAUSE_POINT("first-snapshot-read");
     codeSignQueue->async(
         [this, entries = std::move(entries)]() mutable { _onQueue_installSnapshot(std::move(entries)); });
   });

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <fstream>
 #include <functional>
 #include <map>
 #include <optional>
@@ -29,6 +30,9 @@ class GroupRefcountTest : public ::testing::Test {
     std::string script = std::string(QRT_TEST_SOURCE_DIR) + "/../scripts/make-device-root";
     ASSERT_EQ(system((script + " " + root).c_str()), 0);
     platform::setDeviceRoot(root);
+    // The mapping's first whole read waits a second before it is put in: the
+    // first tests' writes land meanwhile and must be read back over it.
+    std::ofstream(root + "/run/quarterd.pausepoint") << "first-snapshot-read";
     ASSERT_NE(QRTCodeSigningMapping::sharedInstance(), nullptr);
   }
   static void TearDownTestSuite() { gTmp.reset(); }
