@@ -11,6 +11,8 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <map>
 #include <set>
 #include <utility>
 
@@ -20,6 +22,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 #include <optional>
 #include <string>
 #include <vector>
@@ -246,6 +249,73 @@ std::vector<std::pair<FileId, std::string>> registeredFiles() {
   return files;
 }
 
+// What a look at every entry of a program directory found (1,400 in
+// /usr/bin): every file may run, with the files and the links that lead out
+// of it. Kept for the next launches with the directory's inode and change
+// time, which moves whenever an entry is added, removed or renamed; a verdict
+// whose stamp differs is taken afresh. A file's owner or mode changed in
+// place, which only root can do here, shows at the directory's next change
+// or after a reboot.
+struct ProgramDirectory {
+  dev_t device = 0;
+  ino_t inode = 0;
+  struct timespec changed = {};
+  std::set<FileId> files;
+  std::vector<std::string> elsewhere;
+};
+using ProgramDirectories = std::map<std::string, ProgramDirectory>;
+
+constexpr const char* kKeptDirectoriesFile = "/run/device/program-directories";
+constexpr const char* kKeptDirectoriesHeader = "quarter-exec program directories 1\n";
+
+// The kept verdicts; none when the file is missing, malformed or not root's
+// own and closed to everyone else.
+ProgramDirectories readKeptDirectories() {
+  ProgramDirectories kept;
+  platform::UniqueFd fd;
+  struct stat st;
+  std::string text;
+  if (platform::safeOpen(platform::hostPath(kKeptDirectoriesFile), O_RDONLY, &fd) || fstat(fd.get(), &st) != 0 ||
+      !S_ISREG(st.st_mode) || st.st_uid != 0 || (st.st_mode & 022) || platform::readOpened(fd.get(), &text, 8u << 20) ||
+      text.compare(0, strlen(kKeptDirectoriesHeader), kKeptDirectoriesHeader) != 0)
+    return kept;
+  ProgramDirectory* current = nullptr;
+  for (size_t at = strlen(kKeptDirectoriesHeader), end; at < text.size(); at = end + 1) {
+    end = text.find('\n', at);
+    if (end == std::string::npos) return {};
+    const std::string line = text.substr(at, end - at);
+    char path[PATH_MAX];
+    unsigned long long device, inode;
+    long long seconds, nanoseconds;
+    if (sscanf(line.c_str(), "directory %llu %llu %lld %lld %4095s", &device, &inode, &seconds, &nanoseconds, path) ==
+        5) {
+      current = &kept[path];
+      *current = {static_cast<dev_t>(device), static_cast<ino_t>(inode), {seconds, nanoseconds}, {}, {}};
+    } else if (current && sscanf(line.c_str(), "file %llu %llu", &device, &inode) == 2) {
+      current->files.insert({static_cast<dev_t>(device), static_cast<ino_t>(inode)});
+    } else if (current && line.compare(0, 5, "link ") == 0) {
+      current->elsewhere.push_back(line.substr(5));
+    } else {
+      return {};
+    }
+  }
+  return kept;
+}
+
+void writeKeptDirectories(const ProgramDirectories& kept) {
+  std::string text = kKeptDirectoriesHeader;
+  for (const auto& [path, dir] : kept) {
+    text += "directory " + std::to_string(dir.device) + " " + std::to_string(dir.inode) + " " +
+            std::to_string(dir.changed.tv_sec) + " " + std::to_string(dir.changed.tv_nsec) + " " + path + "\n";
+    for (const auto& [device, inode] : dir.files)
+      text += "file " + std::to_string(device) + " " + std::to_string(inode) + "\n";
+    for (const std::string& link : dir.elsewhere) text += "link " + link + "\n";
+  }
+  platform::SafeParent parent;
+  if (platform::safeOpenParent(platform::hostPath(kKeptDirectoriesFile), &parent) == 0)
+    platform::replaceFileAt(parent.fd.get(), parent.name, text.data(), text.size(), 0644);
+}
+
 class Ruleset {
  public:
   // abi 0: Landlock is absent and nothing is enforced.
@@ -319,21 +389,47 @@ class Ruleset {
   // Execution of each root-owned program file in the directory that no one
   // else can write, but for the registered ones other than the program
   // itself: run by the confined program (with a library of its own
-  // preloaded), they would lend it their identity.
-  int allowPrograms(const char* path, const std::set<FileId>& excluded, std::set<FileId>* seen) {
+  // preloaded), they would lend it their identity. A directory whose every
+  // file qualifies takes one rule, and one for each file a link names
+  // elsewhere. Its verdict is kept (ProgramDirectory) once its change time
+  // lies more than a second before since, when the launch began: any change
+  // made after the look then stamps it with another, whatever the file
+  // system's time granularity.
+  int allowPrograms(const char* path, const std::set<FileId>& excluded, std::set<FileId>* seen,
+                    ProgramDirectories* kept, bool* keptChanged, const struct timespec& since) {
     struct stat dir;
     // /bin is /usr/bin on a merged /usr: one walk.
     if (abi_ <= 0 || stat(path, &dir) != 0 || !seen->insert({dir.st_dev, dir.st_ino}).second) return 0;
-    auto allowed = [&](const struct stat& st) {
-      return S_ISREG(st.st_mode) && (st.st_mode & 0111) && st.st_uid == 0 && !(st.st_mode & 022) &&
-             !excluded.count({st.st_dev, st.st_ino});
+    auto program = [](const struct stat& st) {
+      return S_ISREG(st.st_mode) && (st.st_mode & 0111) && st.st_uid == 0 && !(st.st_mode & 022);
     };
-    std::vector<std::string> elsewhere;
-    if (dir.st_uid == 0 && !(dir.st_mode & 022) && onlyAllowedFiles(path, allowed, &elsewhere)) {
-      // Every file would be allowed on its own, and only root adds more: one
-      // rule for the directory, and one for each file a link names elsewhere.
+    auto allowed = [&](const struct stat& st) { return program(st) && !excluded.count({st.st_dev, st.st_ino}); };
+    ProgramDirectory looked;
+    const ProgramDirectory* whole = nullptr;
+    if (dir.st_uid == 0 && !(dir.st_mode & 022)) {
+      auto found = kept->find(path);
+      if (found != kept->end() && found->second.device == dir.st_dev && found->second.inode == dir.st_ino &&
+          found->second.changed.tv_sec == dir.st_ctim.tv_sec && found->second.changed.tv_nsec == dir.st_ctim.tv_nsec) {
+        whole = &found->second;
+      } else {
+        if (found != kept->end()) kept->erase(found), *keptChanged = true;
+        looked = {dir.st_dev, dir.st_ino, dir.st_ctim, {}, {}};
+        if (onlyAllowedFiles(path, program, &looked.files, &looked.elsewhere)) whole = &looked;
+        const bool settled =
+            (since.tv_sec - dir.st_ctim.tv_sec) * 1000000000LL + since.tv_nsec - dir.st_ctim.tv_nsec > 1000000000LL;
+        // A link name that holds a line break cannot be written down.
+        if (whole && settled &&
+            std::none_of(looked.elsewhere.begin(), looked.elsewhere.end(),
+                         [](const std::string& n) { return n.find('\n') != std::string::npos; })) {
+          (*kept)[path] = looked;
+          *keptChanged = true;
+        }
+      }
+    }
+    if (whole &&
+        std::none_of(excluded.begin(), excluded.end(), [&](const FileId& id) { return whole->files.count(id); })) {
       if (int err = allowSystemPath(path, kExecute | kReadFile)) return err;
-      for (const std::string& link : elsewhere) {
+      for (const std::string& link : whole->elsewhere) {
         const int fd = open((std::string(path) + "/" + link).c_str(), O_PATH | O_CLOEXEC);
         struct stat st;
         const int err = fd >= 0 && fstat(fd, &st) == 0 && allowed(st) ? allow(fd, kExecute | kReadFile, false) : 0;
@@ -366,15 +462,15 @@ class Ruleset {
 
  private:
   // Whether every entry of the directory is a link or a file that
-  // allowed(st) accepts (no hidden names), with the names of the links that
-  // lead to none of those files.
+  // allowed(st) accepts (no hidden names), with those files and the names of
+  // the links that lead to none of them.
   template <typename Allowed>
-  static bool onlyAllowedFiles(const char* path, Allowed allowed, std::vector<std::string>* elsewhere) {
+  static bool onlyAllowedFiles(const char* path, Allowed allowed, std::set<FileId>* files,
+                               std::vector<std::string>* elsewhere) {
     int dirFd = open(path, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
     if (dirFd < 0) return false;
     DIR* listing = fdopendir(dirFd);
     if (!listing) return close(dirFd), false;
-    std::set<FileId> files;
     std::vector<std::string> links;
     bool only = true;
     while (dirent* entry = readdir(listing)) {
@@ -386,14 +482,14 @@ class Ruleset {
       } else if (S_ISLNK(st.st_mode)) {
         links.push_back(name);
       } else if ((only = allowed(st))) {
-        files.insert({st.st_dev, st.st_ino});
+        files->insert({st.st_dev, st.st_ino});
       }
       if (!only) break;
     }
     for (const std::string& name : links) {
       struct stat st;
       if (only && platform::statSystemPathAt(dirFd, name.c_str(), &st, true) == 0 &&
-          !files.count({st.st_dev, st.st_ino}))
+          !files->count({st.st_dev, st.st_ino}))
         elsewhere->push_back(name);
     }
     closedir(listing);
@@ -466,6 +562,8 @@ std::vector<std::string> libraryDirectories() {
 }
 
 int run(const Options& options) {
+  struct timespec launched;
+  clock_gettime(CLOCK_REALTIME, &launched);
   if (geteuid() != 0)
     return fail(kExitFailure, "must be run as root: it asks quarterd for the containers, then drops to the user");
   char root[PATH_MAX] = "/";
@@ -559,9 +657,12 @@ int run(const Options& options) {
     if (int err = rules.allowSystemPath(dir, kReadRights))
       return fail(kExitFailure, std::string("cannot open up ") + dir + ": " + strerror(err));
   std::set<FileId> seen;
+  ProgramDirectories kept = readKeptDirectories();
+  bool keptChanged = false;
   for (const char* dir : kProgramDirectories)
-    if (int err = rules.allowPrograms(dir, otherPrograms, &seen))
+    if (int err = rules.allowPrograms(dir, otherPrograms, &seen, &kept, &keptChanged, launched))
       return fail(kExitFailure, std::string("cannot open up ") + dir + ": " + strerror(err));
+  if (keptChanged) writeKeptDirectories(kept);
   for (const std::string& dir : libraryDirectories())
     if (int err = rules.allowLoaders(dir.c_str(), &seen))
       return fail(kExitFailure, "cannot open up " + dir + ": " + strerror(err));

@@ -141,6 +141,14 @@ TEST_F(ExecTest, ProgramReachesItsContainersAndNothingElse) {
   EXPECT_EQ(run.out, expected);
   EXPECT_EQ(ownerAndMode(data + "/Documents/note").first, 501u) << "the program runs as the user";
   EXPECT_EQ(readFile(group + "/Library/note"), "probe\n");
+
+  // The next launch takes the program directories' verdicts from the first;
+  // a program registered since in one of them is refused all the same.
+  setIdentity("env", "/usr/bin/env", "com.example.env", {});
+  run = launch({"--root", root, "--user", "501", "--identifier", "com.example.a", "--", probe,
+                "x:" + data + "/Library/l.so", "/usr/bin/env"},
+               0, {}, QRT_EXEC_PRELOAD_PATH);
+  EXPECT_EQ(run.out, "exec EACCES\nfailed\n") << run.err;
 }
 
 TEST_F(ExecTest, RefusesWithClearMessages) {
