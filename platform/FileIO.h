@@ -83,6 +83,29 @@ int statSystemPathAt(int dirfd, const char* name, struct stat* st, bool followLi
 int chownOpened(int fd, uid_t uid, gid_t gid);
 int chmodOpened(int fd, mode_t mode);
 
+// A directory as its change time tells it apart: adding, removing or
+// renaming an entry moves the change time, as does any change to the
+// directory's own attributes, and no user can set it back; another directory
+// at the name has another inode.
+struct ChangeStamp {
+  dev_t device = 0;
+  ino_t inode = 0;
+  struct timespec changed = {};
+
+  static ChangeStamp of(const struct stat& st) { return {st.st_dev, st.st_ino, st.st_ctim}; }
+  bool operator==(const ChangeStamp& o) const {
+    return device == o.device && inode == o.inode && changed.tv_sec == o.changed.tv_sec &&
+           changed.tv_nsec == o.changed.tv_nsec;
+  }
+  // Whether the change time lies more than a second before now (a clock
+  // reading taken before the directory was looked at): any change from then
+  // on stamps it with another, whatever the file system's time granularity,
+  // so the stamp may stand for what the look found.
+  bool settledBefore(const struct timespec& now) const {
+    return (now.tv_sec - changed.tv_sec) * 1000000000LL + (now.tv_nsec - changed.tv_nsec) > 1000000000LL;
+  }
+};
+
 // An item pinned by an O_PATH descriptor and checked with fstat: whatever
 // happens to its name afterwards, changes reach this inode and no other.
 // Special files are never opened for reading; links are never followed.

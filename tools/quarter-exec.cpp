@@ -251,15 +251,12 @@ std::vector<std::pair<FileId, std::string>> registeredFiles() {
 
 // What a look at every entry of a program directory found (1,400 in
 // /usr/bin): every file may run, with the files and the links that lead out
-// of it. Kept for the next launches with the directory's inode and change
-// time, which moves whenever an entry is added, removed or renamed; a verdict
+// of it. Kept for the next launches with the directory's stamp; a verdict
 // whose stamp differs is taken afresh. A file's owner or mode changed in
 // place, which only root can do here, shows at the directory's next change
 // or after a reboot.
 struct ProgramDirectory {
-  dev_t device = 0;
-  ino_t inode = 0;
-  struct timespec changed = {};
+  platform::ChangeStamp stamp;
   std::set<FileId> files;
   std::vector<std::string> elsewhere;
 };
@@ -290,7 +287,7 @@ ProgramDirectories readKeptDirectories() {
     if (sscanf(line.c_str(), "directory %llu %llu %lld %lld %4095s", &device, &inode, &seconds, &nanoseconds, path) ==
         5) {
       current = &kept[path];
-      *current = {static_cast<dev_t>(device), static_cast<ino_t>(inode), {seconds, nanoseconds}, {}, {}};
+      *current = {{static_cast<dev_t>(device), static_cast<ino_t>(inode), {seconds, nanoseconds}}, {}, {}};
     } else if (current && sscanf(line.c_str(), "file %llu %llu", &device, &inode) == 2) {
       current->files.insert({static_cast<dev_t>(device), static_cast<ino_t>(inode)});
     } else if (current && line.compare(0, 5, "link ") == 0) {
@@ -305,8 +302,9 @@ ProgramDirectories readKeptDirectories() {
 void writeKeptDirectories(const ProgramDirectories& kept) {
   std::string text = kKeptDirectoriesHeader;
   for (const auto& [path, dir] : kept) {
-    text += "directory " + std::to_string(dir.device) + " " + std::to_string(dir.inode) + " " +
-            std::to_string(dir.changed.tv_sec) + " " + std::to_string(dir.changed.tv_nsec) + " " + path + "\n";
+    text += "directory " + std::to_string(dir.stamp.device) + " " + std::to_string(dir.stamp.inode) + " " +
+            std::to_string(dir.stamp.changed.tv_sec) + " " + std::to_string(dir.stamp.changed.tv_nsec) + " " + path +
+            "\n";
     for (const auto& [device, inode] : dir.files)
       text += "file " + std::to_string(device) + " " + std::to_string(inode) + "\n";
     for (const std::string& link : dir.elsewhere) text += "link " + link + "\n";
@@ -391,10 +389,8 @@ class Ruleset {
   // itself: run by the confined program (with a library of its own
   // preloaded), they would lend it their identity. A directory whose every
   // file qualifies takes one rule, and one for each file a link names
-  // elsewhere. Its verdict is kept (ProgramDirectory) once its change time
-  // lies more than a second before since, when the launch began: any change
-  // made after the look then stamps it with another, whatever the file
-  // system's time granularity.
+  // elsewhere. Its verdict is kept (ProgramDirectory) once the directory's
+  // stamp has settled before since, when the launch began.
   int allowPrograms(const char* path, const std::set<FileId>& excluded, std::set<FileId>* seen,
                     ProgramDirectories* kept, bool* keptChanged, const struct timespec& since) {
     struct stat dir;
@@ -407,18 +403,16 @@ class Ruleset {
     ProgramDirectory looked;
     const ProgramDirectory* whole = nullptr;
     if (dir.st_uid == 0 && !(dir.st_mode & 022)) {
+      const platform::ChangeStamp stamp = platform::ChangeStamp::of(dir);
       auto found = kept->find(path);
-      if (found != kept->end() && found->second.device == dir.st_dev && found->second.inode == dir.st_ino &&
-          found->second.changed.tv_sec == dir.st_ctim.tv_sec && found->second.changed.tv_nsec == dir.st_ctim.tv_nsec) {
+      if (found != kept->end() && found->second.stamp == stamp) {
         whole = &found->second;
       } else {
         if (found != kept->end()) kept->erase(found), *keptChanged = true;
-        looked = {dir.st_dev, dir.st_ino, dir.st_ctim, {}, {}};
+        looked = {stamp, {}, {}};
         if (onlyAllowedFiles(path, program, &looked.files, &looked.elsewhere)) whole = &looked;
-        const bool settled =
-            (since.tv_sec - dir.st_ctim.tv_sec) * 1000000000LL + since.tv_nsec - dir.st_ctim.tv_nsec > 1000000000LL;
         // A link name that holds a line break cannot be written down.
-        if (whole && settled &&
+        if (whole && stamp.settledBefore(since) &&
             std::none_of(looked.elsewhere.begin(), looked.elsewhere.end(),
                          [](const std::string& n) { return n.find('\n') != std::string::npos; })) {
           (*kept)[path] = looked;

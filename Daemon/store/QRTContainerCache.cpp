@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <cstring>
 #include <ctime>
+#include <optional>
 #include <set>
 
 #include "Daemon/store/QRTContentClass.h"
@@ -32,12 +33,6 @@ uint64_t heldKey(uint32_t userId, uint64_t contentClass, bool transient) {
 // The class map as the log names it.
 std::string cacheName(uint32_t userId, uint64_t contentClass) {
   return std::to_string(userId) + "-" + QRTContentClassPathName(contentClass);
-}
-
-// A change time more than a second behind now: any change from now on
-// stamps a later one, whatever the file system's time granularity.
-bool settled(const struct timespec& changed, const struct timespec& now) {
-  return (now.tv_sec - changed.tv_sec) * 1000000000LL + (now.tv_nsec - changed.tv_nsec) > 1000000000LL;
 }
 
 // Error 47 for a class outside 1 to 13 or a missing identifier.
@@ -235,28 +230,25 @@ bool QRTContainerCache::metadataMissing(const QRTMetadataRef& metadata, uint32_t
     HeldClassDirectoryRef held = classDirectory(userId, contentClass, transient, reopen);
     if (!held) break;
     if (held->path != parent) continue;
-    std::optional<SeenDirectory> seen;
+    std::optional<platform::ChangeStamp> seen;
     {
       std::lock_guard<std::mutex> hold(cacheLock);
       if (auto found = held->seen.find(leaf); found != held->seen.end()) seen = found->second;
     }
-    // The clock is read before the look, so that any later change to the
-    // directory stamps it with a later change time.
     struct timespec now {};
     struct stat st {};
-    bool looked = false;
+    std::optional<platform::ChangeStamp> looked;
     if (seen || learn) {
       clock_gettime(CLOCK_REALTIME, &now);
-      looked = !leaf.empty() && held->directory.lstat(leaf, &st) == 0 && S_ISDIR(st.st_mode);
-      if (looked && seen && seen->device == st.st_dev && seen->inode == st.st_ino &&
-          seen->changed.tv_sec == st.st_ctim.tv_sec && seen->changed.tv_nsec == st.st_ctim.tv_nsec)
-        return false;
+      if (!leaf.empty() && held->directory.lstat(leaf, &st) == 0 && S_ISDIR(st.st_mode))
+        looked = platform::ChangeStamp::of(st);
+      if (looked && looked == seen) return false;
     }
     const int err = held->directory.exists(leaf + "/" + QRTMetadataFileName);
     if (err == 0) {
-      if (looked && settled(st.st_ctim, now)) {
+      if (looked && looked->settledBefore(now)) {
         std::lock_guard<std::mutex> hold(cacheLock);
-        held->seen[leaf] = {st.st_dev, st.st_ino, st.st_ctim};
+        held->seen[leaf] = *looked;
       }
       return false;
     }

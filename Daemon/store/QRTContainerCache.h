@@ -98,22 +98,14 @@ class QRTContainerCache {
   // metadata file is checked with two components resolved beneath it rather
   // than its whole path from the device root.
   //
-  // seen keeps, per container directory name, the directory as it was when
-  // its metadata file was last found: while the name still gives the same
-  // inode with the same change time, no entry in it has been added, removed
-  // or renamed since, so the file is still there. Only a change time at
-  // least a second older than the look that found the file is kept, so that
-  // a change within the file system's time granularity cannot go unseen.
+  // seen keeps, per container directory name, the directory's stamp as it
+  // was when its metadata file was last found: while the name still gives
+  // the same stamp, the file is still there. Only a settled stamp is kept.
   // Guarded by cacheLock; dropped with the held directory.
-  struct SeenDirectory {
-    dev_t device;
-    ino_t inode;
-    struct timespec changed;
-  };
   struct HeldClassDirectory {
     platform::Dir directory;
     std::string path;
-    mutable std::unordered_map<std::string, SeenDirectory> seen;
+    mutable std::unordered_map<std::string, platform::ChangeStamp> seen;
   };
   using HeldClassDirectoryRef = std::shared_ptr<const HeldClassDirectory>;
   // The held directory (opened when missing or when reopen is set), or null
